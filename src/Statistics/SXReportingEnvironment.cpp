@@ -1,0 +1,26 @@
+#include "SXReportingEnvironment.h"
+
+SXLogScope SXReportingLogScope(std::string_view shortName, std::string category) {
+  SXLogScope scope;
+  scope.enabled = true;
+  scope.code = SXLogScopeCode(shortName);
+  scope.shortName = std::string(shortName);
+  scope.subsystem = "com.vendra.sonex";
+  scope.category = std::move(category);
+  scope.options = 31;
+  return scope;
+}
+
+void SXReportingEnvironment::registerSessionLogScopeOnce() {
+  std::call_once(sessionScopeOnce_, [this] {
+    sessionScope_ = log().registerScope(SXReportingLogScope("sxrr", "reporting_session_verbose"));
+  });
+}
+
+bool SXReportingEnvironment::isInternalBuild() {
+  std::call_once(internalBuildOnce_, [this] {
+    auto answer = platform_.device ? platform_.device->property("InternalBuild") : std::nullopt;
+    internalBuild_ = answer && answer->is_boolean() && answer->get<bool>();
+  });
+  return internalBuild_;
+}

@@ -1,0 +1,60 @@
+// The platform together with the state this service keeps once per process: the log scope
+// handles, the server queue and the internal-build flag. One environment per service; tests
+// make a fresh one per case, so "once per process" means once per environment.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+
+#include "platform/Platform.h"
+
+class SXReportingEnvironment {
+ public:
+  explicit SXReportingEnvironment(SXPlatform platform) : platform_(std::move(platform)) {}
+  SXReportingEnvironment(const SXReportingEnvironment&) = delete;
+  SXReportingEnvironment& operator=(const SXReportingEnvironment&) = delete;
+
+  const SXPlatform& platform() const { return platform_; }
+  SXLogFacility& log() const { return *platform_.log; }
+  SXTracer& tracer() const { return *platform_.tracer; }
+
+  // The service scope "sxrs"; set by the service delegate's init (nullptr before it).
+  const SXLogScope* serviceLogScope() const { return serviceScope_.load().get(); }
+  void setServiceLogScope(std::shared_ptr<const SXLogScope> scope) { serviceScope_ = std::move(scope); }
+
+  // The session scope "sxrr", registered by the first session created.
+  const SXLogScope* sessionLogScope() const { return sessionScope_.load().get(); }
+  void registerSessionLogScopeOnce();
+
+  // The driver scope "sxrd"; set at every creation of a driver utility.
+  const SXLogScope* driverLogScope() const { return driverScope_.load().get(); }
+  void setDriverLogScope(std::shared_ptr<const SXLogScope> scope) { driverScope_ = std::move(scope); }
+
+  // The serial server queue "com.vendra.sonex.reporting.server"; set by the delegate's init,
+  // before any client connects.
+  const std::shared_ptr<SXWorkQueue>& serverQueue() const { return serverQueue_; }
+  void setServerQueue(std::shared_ptr<SXWorkQueue> queue) { serverQueue_ = std::move(queue); }
+
+  // The defaults notification token.
+  int defaultsNotifyToken() const { return defaultsToken_.load(); }
+  void setDefaultsNotifyToken(int token) { defaultsToken_.store(token); }
+
+  // Whether the device runs an internal build; asked once, on first use.
+  bool isInternalBuild();
+
+ private:
+  SXPlatform platform_;
+  // Scope handles are read from any thread; a handle, once stored, lives as long as this.
+  std::atomic<std::shared_ptr<const SXLogScope>> serviceScope_;
+  std::atomic<std::shared_ptr<const SXLogScope>> sessionScope_;
+  std::atomic<std::shared_ptr<const SXLogScope>> driverScope_;
+  std::once_flag sessionScopeOnce_;
+  std::shared_ptr<SXWorkQueue> serverQueue_;
+  std::atomic<int> defaultsToken_{-1};
+  std::once_flag internalBuildOnce_;
+  bool internalBuild_ = false;  // written once under internalBuildOnce_
+};
+
+// The scope every subsystem registers: subsystem "com.vendra.sonex", option value 31.
+SXLogScope SXReportingLogScope(std::string_view shortName, std::string category);

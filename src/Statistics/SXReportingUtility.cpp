@@ -1,0 +1,101 @@
+#include "SXReportingUtility.h"
+
+#include <array>
+#include <chrono>
+#include <map>
+
+#include "SXReportingEnvironment.h"
+
+namespace {
+
+const std::array<std::string, 12> kServiceTypeNames = {
+    "generic",         "vokira",           "telephony",        "haptics",
+    "alarms",          "standalone",       "soundautoconfig",  "longformaudio",
+    "nonlongformaudio", "audiodeviceusage", "alerts",           "test"};
+
+const std::array<std::string, 12> kCategoryNames = {
+    "Undefined", "Generic",  "Record", "Playback",    "PlaybackAndRecord", "Setup",
+    "ClientRequest", "RouteChange", "Error", "KestrelStats", "Performance", "Volume"};
+
+const std::array<std::string, 6> kTypeNames = {"Generic", "Start", "Stop",
+                                               "Setup",   "Error", "IssueDetector"};
+
+const char* componentName(uint32_t upperMask) {
+  switch (upperMask) {
+    case 0x08000000: return "Session";
+    case 0x10000000: return "DSP";
+    case 0x20000000: return "HAL";
+    case 0x40000000: return "Routing";
+    case 0x80000000: return "Kitbench";
+    default: return "";
+  }
+}
+
+// Names of codes outside the table, made on first use and kept so callers can hold references.
+const std::string& outOfTableServiceTypeName(SXReportingServiceType serviceType) {
+  static std::mutex mutex;
+  static std::map<SXReportingServiceType, std::string> names;
+  std::lock_guard lock(mutex);
+  auto [it, inserted] = names.try_emplace(serviceType);
+  if (inserted) it->second = "servicetype" + std::to_string(serviceType);
+  return it->second;
+}
+
+}  // namespace
+
+const std::string& SXReportingUtilityServiceTypeName(SXReportingServiceType serviceType) {
+  static const std::string kUnknown = "unknown";
+  if (serviceType < kServiceTypeNames.size()) return kServiceTypeNames[serviceType];
+  if (serviceType == kSXReportingServiceTypeUnknown) return kUnknown;
+  return outOfTableServiceTypeName(serviceType);
+}
+
+std::string SXReportingUtilityCategoryName(SXReportingCategory category) {
+  std::string name;
+  if (category >= 0x10000 && category != 0xFFFFFFFF) {
+    name += componentName(category & 0xFFFF0000u);
+    name += '_';
+  }
+  uint32_t proper = category & 0xFFFF;
+  name += proper < kCategoryNames.size() ? kCategoryNames[proper] : kCategoryNames[0];
+  return name;
+}
+
+const std::string& SXReportingUtilityTypeName(SXReportingMessageType type) {
+  static const std::string kUnknown = "Unknown";
+  static const std::string kUndefined = "Undefined";
+  if (type < kTypeNames.size()) return kTypeNames[type];
+  return type == 0xFFFF ? kUnknown : kUndefined;
+}
+
+SXValue SXReportingUtilityHostApplicationName(const SXValue* configuration) {
+  if (configuration && configuration->is_object()) {
+    auto it = configuration->find("HostApplicationDisplayID");
+    if (it != configuration->end()) return *it;
+  }
+  return "Unknown";
+}
+
+bool SXReportingUtilityIsInternalBuild(SXReportingEnvironment& environment) {
+  return environment.isInternalBuild();
+}
+
+bool SXReportingUtilityWait(SXReportingCondition& condition, bool& done,
+                            const std::string& waitingMessage, const std::string& failureMessage,
+                            SXLogFacility& log, const SXLogScope* scope, double timeoutSeconds) {
+  std::unique_lock lock(condition.mutex);
+  if (done) return true;
+  auto timeout = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+      std::chrono::duration<double>(timeoutSeconds));
+  for (;;) {
+    SXLOG(log, scope, SXLogLevel::kDefault, "%@", waitingMessage);
+    // One pass ends at its deadline or at the first wake-up, whichever comes first.
+    if (condition.condition.wait_until(lock, std::chrono::steady_clock::now() + timeout) ==
+        std::cv_status::timeout) {
+      SXLOG(log, scope, SXLogLevel::kError, "%@", failureMessage);
+      return false;
+    }
+    SXLOG(log, scope, SXLogLevel::kDefault, "continuing");
+    if (done) return true;
+  }
+}

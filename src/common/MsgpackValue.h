@@ -1,0 +1,24 @@
+// Conversion between MessagePack objects and the value model.
+#pragma once
+
+#include <msgpack.hpp>
+#include <stdexcept>
+
+#include "sxreporting/types.h"
+
+// Thrown when a MessagePack object has no place in the value model (a dictionary key that is
+// not a string) or nests deeper than allowed.
+class SXValueConversionError : public std::runtime_error {
+ public:
+  using std::runtime_error::runtime_error;
+};
+
+// Converts a decoded object. Dictionaries need string keys; binary and ext become binary
+// values (ext keeps its type as subtype); float32 widens to double.
+SXValue SXValueFromMsgpack(const msgpack::object& object, int maxDepth = 32);
+
+// Packs a value. Binary values pack as bin (or ext when they carry a subtype).
+template <typename Stream>
+void SXPackValue(msgpack::packer<Stream>& packer, const SXValue& value);
+
+extern template void SXPackValue(msgpack::packer<msgpack::sbuffer>&, const SXValue&);

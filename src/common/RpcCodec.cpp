@@ -1,0 +1,109 @@
+#include "common/RpcCodec.h"
+
+#include "common/MsgpackValue.h"
+
+namespace {
+// The request itself and its params array sit above the payload.
+constexpr int kEnvelopeDepth = 2;
+}  // namespace
+
+RpcStreamDecoder::RpcStreamDecoder(RpcLimits limits)
+    : limits_(limits),
+      unpacker_(nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE,
+                msgpack::unpack_limit(limits.maxContainerEntries, limits.maxContainerEntries,
+                                      limits.maxMessageBytes, limits.maxMessageBytes,
+                                      limits.maxMessageBytes,
+                                      static_cast<size_t>(limits.maxPayloadDepth + kEnvelopeDepth))) {}
+
+char* RpcStreamDecoder::prepare(size_t size) {
+  unpacker_.reserve_buffer(size);
+  return unpacker_.buffer();
+}
+
+void RpcStreamDecoder::commit(size_t size) { unpacker_.buffer_consumed(size); }
+
+RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
+  if (!error_.empty()) return Status::kBroken;
+  try {
+    if (unpacker_.execute()) {
+      if (unpacker_.parsed_size() > limits_.maxMessageBytes) {
+        error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
+        return Status::kBroken;
+      }
+      msgpack::object_handle handle(unpacker_.data(), msgpack::unique_ptr<msgpack::zone>(unpacker_.release_zone()));
+      unpacker_.reset();
+      message = SXValueFromMsgpack(handle.get(), limits_.maxPayloadDepth + kEnvelopeDepth);
+      return Status::kMessage;
+    }
+    if (unpacker_.parsed_size() + unpacker_.nonparsed_size() > limits_.maxMessageBytes) {
+      error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
+      return Status::kBroken;
+    }
+    return Status::kNeedMore;
+  } catch (const msgpack::depth_size_overflow&) {
+    error_ = "message nested deeper than " + std::to_string(limits_.maxPayloadDepth) + " levels";
+  } catch (const msgpack::size_overflow&) {
+    error_ = "message holds a container or string larger than allowed";
+  } catch (const std::exception& e) {
+    error_ = std::string("malformed MessagePack: ") + e.what();
+  }
+  return Status::kBroken;
+}
+
+std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
+                                          std::optional<uint32_t>& msgid) {
+  msgid.reset();
+  if (!message.is_array() || message.size() != 4 || !message[0].is_number_unsigned() ||
+      message[0].get<uint64_t>() != 0) {
+    why = "not a MessagePack-RPC request [0, msgid, method, params]";
+    return std::nullopt;
+  }
+  if (!message[1].is_number_unsigned() || message[1].get<uint64_t>() > UINT32_MAX) {
+    why = "msgid is not an unsigned 32-bit integer";
+    return std::nullopt;
+  }
+  msgid = static_cast<uint32_t>(message[1].get<uint64_t>());
+  if (!message[2].is_string()) {
+    why = "method is not a string";
+    return std::nullopt;
+  }
+  if (!message[3].is_array()) {
+    why = "params is not an array";
+    return std::nullopt;
+  }
+  return RpcRequest{*msgid, message[2].get<std::string>(), message[3]};
+}
+
+std::optional<RpcResponse> RpcParseResponse(const SXValue& message) {
+  if (!message.is_array() || message.size() != 4 || !message[0].is_number_unsigned() ||
+      message[0].get<uint64_t>() != 1 || !message[1].is_number_unsigned() ||
+      message[1].get<uint64_t>() > UINT32_MAX) {
+    return std::nullopt;
+  }
+  return RpcResponse{static_cast<uint32_t>(message[1].get<uint64_t>()), message[2], message[3]};
+}
+
+void RpcEncodeRequest(msgpack::sbuffer& out, uint32_t msgid, std::string_view method,
+                      const SXValue& params) {
+  msgpack::packer<msgpack::sbuffer> p(out);
+  p.pack_array(4);
+  p.pack_uint32(0);
+  p.pack_uint32(msgid);
+  p.pack_str(static_cast<uint32_t>(method.size()));
+  p.pack_str_body(method.data(), static_cast<uint32_t>(method.size()));
+  if (params.is_array()) {
+    SXPackValue(p, params);
+  } else {
+    p.pack_array(0);
+  }
+}
+
+void RpcEncodeResponse(msgpack::sbuffer& out, uint32_t msgid, const SXValue& error,
+                       const SXValue& result) {
+  msgpack::packer<msgpack::sbuffer> p(out);
+  p.pack_array(4);
+  p.pack_uint32(1);
+  p.pack_uint32(msgid);
+  SXPackValue(p, error);
+  SXPackValue(p, result);
+}

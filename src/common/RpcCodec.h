@@ -1,0 +1,63 @@
+// MessagePack-RPC framing, free of I/O: a stream decoder that turns bytes into messages, and
+// encoders for requests and responses.
+//
+//   request  [0, msgid, method, params]
+//   response [1, msgid, error, result]
+#pragma once
+
+#include <msgpack.hpp>
+#include <optional>
+#include <string>
+
+#include "sxreporting/types.h"
+
+struct RpcLimits {
+  size_t maxMessageBytes = 1 << 20;  // one message, all of its bytes
+  int maxPayloadDepth = 32;          // nesting inside the params of a request
+  size_t maxContainerEntries = 1 << 16;
+};
+
+// Decodes a byte stream into whole messages. Not thread-safe; one per connection.
+class RpcStreamDecoder {
+ public:
+  enum class Status { kMessage, kNeedMore, kBroken };
+
+  explicit RpcStreamDecoder(RpcLimits limits = {});
+
+  // Space for at least `size` more bytes; write into it and then call `commit`.
+  char* prepare(size_t size);
+  void commit(size_t size);
+
+  // The next whole message. kBroken (with `error()`) when the bytes are not MessagePack, a
+  // message is larger than allowed, or it nests too deeply; the stream cannot go on then.
+  Status next(SXValue& message);
+  const std::string& error() const { return error_; }
+
+ private:
+  RpcLimits limits_;
+  msgpack::v1::unpacker unpacker_;  // v1: lets us see a whole message's size before reset
+  std::string error_;
+};
+
+struct RpcRequest {
+  uint32_t msgid = 0;
+  std::string method;
+  SXValue params;  // always an array
+};
+
+struct RpcResponse {
+  uint32_t msgid = 0;
+  SXValue error;  // null when the call succeeded
+  SXValue result;
+};
+
+// Reads a decoded message as a request. On failure returns nothing and says why in `why`;
+// `msgid` is set whenever the message carried a usable one, so the caller can still answer.
+std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
+                                          std::optional<uint32_t>& msgid);
+std::optional<RpcResponse> RpcParseResponse(const SXValue& message);
+
+void RpcEncodeRequest(msgpack::sbuffer& out, uint32_t msgid, std::string_view method,
+                      const SXValue& params);
+void RpcEncodeResponse(msgpack::sbuffer& out, uint32_t msgid, const SXValue& error,
+                       const SXValue& result);

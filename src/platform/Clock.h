@@ -1,0 +1,22 @@
+// Wall-clock time and sleeping. May be called from any thread.
+#pragma once
+
+#include <chrono>
+
+using SXDate = std::chrono::system_clock::time_point;
+
+class SXClock {
+ public:
+  virtual ~SXClock() = default;
+  virtual SXDate now() const = 0;
+};
+
+class SXSystemClock final : public SXClock {
+ public:
+  SXDate now() const override { return std::chrono::system_clock::now(); }
+};
+
+// Seconds between two dates, as a floating value (b - a).
+inline double SXSecondsBetween(SXDate a, SXDate b) {
+  return std::chrono::duration<double>(b - a).count();
+}

@@ -1,0 +1,27 @@
+// File-system operations of the summary files. May be called from any thread.
+#pragma once
+
+#include <optional>
+#include <string>
+
+class SXFileSystem {
+ public:
+  virtual ~SXFileSystem() = default;
+  // Creates `path` with its missing parents and `mode`. An existing directory is no failure.
+  // On failure returns the failure's description.
+  virtual std::optional<std::string> createDirectory(const std::string& path, unsigned mode) = 0;
+  // Writes `contents` so that a reader sees either no file or the whole file, replacing a file
+  // of the same name. On failure returns the failure's description.
+  virtual std::optional<std::string> writeFileAtomically(const std::string& path,
+                                                         const std::string& contents) = 0;
+};
+
+class SXPosixFileSystem final : public SXFileSystem {
+ public:
+  std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override;
+  std::optional<std::string> writeFileAtomically(const std::string& path,
+                                                 const std::string& contents) override;
+};
+
+// "<context>: <strerror(errno)>", the one place errno becomes text.
+std::string SXPosixError(const std::string& context, int errnum);

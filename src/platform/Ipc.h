@@ -1,0 +1,59 @@
+// IPC listener and connections.
+//
+// A listener accepts client connections and asks its delegate whether to take each one. A
+// connection carries requests (a method name and an array of params) to its exported object on
+// the connection's own thread, and carries replies back from any thread. When the peer closes
+// cleanly the connection is invalidated; a reset, a read error or a malformed stream first
+// interrupts and then invalidates it. Each handler runs at most once, on the connection's
+// thread.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "sxreporting/types.h"
+
+// Sends the reply of one request: `error` null and `result` the value, or `error` a string
+// saying what was wrong with the request. Call it at most once, from any thread; dropping it
+// sends nothing.
+using SXIpcReplyFn = std::function<void(const SXValue& error, const SXValue& result)>;
+
+class SXIpcExportedObject {
+ public:
+  virtual ~SXIpcExportedObject() = default;
+  // Called on the connection's thread for each request, in arrival order.
+  virtual void handleRequest(std::string_view method, const SXValue& params,
+                             SXIpcReplyFn reply) = 0;
+};
+
+class SXIpcConnection {
+ public:
+  virtual ~SXIpcConnection() = default;
+  virtual int32_t processIdentifier() const = 0;
+  virtual std::string description() const = 0;
+  // Set before `resume`. The connection holds the object strongly until it is invalidated.
+  virtual void setExportedObject(std::shared_ptr<SXIpcExportedObject> object) = 0;
+  virtual void setInterruptionHandler(std::function<void()> handler) = 0;
+  virtual void setInvalidationHandler(std::function<void()> handler) = 0;
+  // Starts delivering requests.
+  virtual void resume() = 0;
+};
+
+class SXIpcListenerDelegate {
+ public:
+  virtual ~SXIpcListenerDelegate() = default;
+  // Called on the listener's thread for each new connection, before it is resumed. Returning
+  // false closes it.
+  virtual bool shouldAcceptNewConnection(const std::shared_ptr<SXIpcConnection>& connection) = 0;
+};
+
+class SXIpcListener {
+ public:
+  virtual ~SXIpcListener() = default;
+  virtual void setDelegate(std::shared_ptr<SXIpcListenerDelegate> delegate) = 0;
+  // Serves connections; returns only when the service ends.
+  virtual void resume() = 0;
+};

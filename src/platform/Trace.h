@@ -1,0 +1,16 @@
+// Kernel trace points: a 32-bit code with four zero arguments.
+// Production fires the USDT probe sxreporting:trace(code). May be called from any thread.
+#pragma once
+
+#include <cstdint>
+
+class SXTracer {
+ public:
+  virtual ~SXTracer() = default;
+  virtual void trace(uint32_t code) = 0;
+};
+
+class SXUsdtTracer final : public SXTracer {
+ public:
+  void trace(uint32_t code) override;
+};

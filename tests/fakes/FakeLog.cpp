@@ -1,0 +1,64 @@
+#include "fakes/FakeLog.h"
+
+std::shared_ptr<const SXLogScope> FakeLog::registerScope(const SXLogScope& scope) {
+  std::lock_guard lock(mutex_);
+  registrations_.push_back(scope);
+  return std::make_shared<const SXLogScope>(scope);
+}
+
+bool FakeLog::isEnabled(const SXLogScope* scope, int level) const {
+  std::lock_guard lock(mutex_);
+  return scope && level <= kSXLogVerboseLevel && verbose_.count(scope->shortName);
+}
+
+void FakeLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view line) {
+  std::string text(line);
+  // The prefix is "file:line:function: "; the function may itself hold ": " (none of ours do).
+  size_t first = text.find(':');
+  size_t second = first == std::string::npos ? first : text.find(':', first + 1);
+  size_t third = second == std::string::npos ? second : text.find(": ", second + 1);
+  std::string message = third == std::string::npos ? text : text.substr(third + 2);
+  std::lock_guard lock(mutex_);
+  lines_.push_back({scope ? scope->shortName : "", level, std::move(text), std::move(message)});
+}
+
+std::vector<FakeLog::Line> FakeLog::lines() const {
+  std::lock_guard lock(mutex_);
+  return lines_;
+}
+
+std::vector<std::string> FakeLog::messages() const {
+  std::lock_guard lock(mutex_);
+  std::vector<std::string> out;
+  for (const auto& l : lines_) out.push_back(l.message);
+  return out;
+}
+
+std::vector<SXLogScope> FakeLog::registrations() const {
+  std::lock_guard lock(mutex_);
+  return registrations_;
+}
+
+size_t FakeLog::count(const std::string& message) const {
+  std::lock_guard lock(mutex_);
+  size_t n = 0;
+  for (const auto& l : lines_) n += l.message == message;
+  return n;
+}
+
+bool FakeLog::contains(const std::string& fragment) const {
+  std::lock_guard lock(mutex_);
+  for (const auto& l : lines_) {
+    if (l.message.find(fragment) != std::string::npos) return true;
+  }
+  return false;
+}
+
+void FakeLog::setVerbose(const std::string& scope, bool on) {
+  std::lock_guard lock(mutex_);
+  if (on) {
+    verbose_.insert(scope);
+  } else {
+    verbose_.erase(scope);
+  }
+}

@@ -1,0 +1,41 @@
+// Records every line written, with its level and scope. Scopes named in `verboseScopes` are
+// enabled at the verbose level.
+#pragma once
+
+#include <mutex>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "platform/Log.h"
+
+class FakeLog final : public SXLogFacility {
+ public:
+  struct Line {
+    std::string scope;  // short name; "" for the default log
+    SXLogLevel level;
+    std::string text;     // the whole line, prefix included
+    std::string message;  // the part after "file:line:function: "
+  };
+
+  explicit FakeLog(std::set<std::string> verboseScopes = {}) : verbose_(std::move(verboseScopes)) {}
+
+  std::shared_ptr<const SXLogScope> registerScope(const SXLogScope& scope) override;
+  bool isEnabled(const SXLogScope* scope, int level) const override;
+  void write(const SXLogScope* scope, SXLogLevel level, std::string_view line) override;
+
+  std::vector<Line> lines() const;
+  std::vector<std::string> messages() const;
+  std::vector<SXLogScope> registrations() const;
+  // Number of lines whose message equals `message`.
+  size_t count(const std::string& message) const;
+  // Whether some line's message contains `fragment`.
+  bool contains(const std::string& fragment) const;
+  void setVerbose(const std::string& scope, bool on);
+
+ private:
+  mutable std::mutex mutex_;
+  std::set<std::string> verbose_;
+  std::vector<Line> lines_;
+  std::vector<SXLogScope> registrations_;
+};
