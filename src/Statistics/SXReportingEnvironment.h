@@ -43,6 +43,11 @@ class SXReportingEnvironment {
   // Whether the device runs an internal build; asked once, on first use.
   bool isInternalBuild();
 
+  // How long one pass of a session start waits for the server-reporting backends. Tests
+  // shorten it; the service keeps 9 seconds.
+  double backendWaitSeconds() const { return backendWaitSeconds_.load(); }
+  void setBackendWaitSeconds(double seconds) { backendWaitSeconds_.store(seconds); }
+
  private:
   SXPlatform platform_;
   // Scope handles are read from any thread; a handle, once stored, lives as long as this.
@@ -54,6 +59,7 @@ class SXReportingEnvironment {
   std::atomic<int> defaultsToken_{-1};
   std::once_flag internalBuildOnce_;
   bool internalBuild_ = false;  // written once under internalBuildOnce_
+  std::atomic<double> backendWaitSeconds_{9.0};
 };
 
 // The scope every subsystem registers: subsystem "com.vendra.sonex", option value 31.

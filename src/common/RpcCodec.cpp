@@ -53,12 +53,13 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
 std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
                                           std::optional<uint32_t>& msgid) {
   msgid.reset();
-  if (!message.is_array() || message.size() != 4 || !message[0].is_number_unsigned() ||
-      message[0].get<uint64_t>() != 0) {
+  if (!message.is_array() || message.size() != 4 || !message[0].is_number_integer() ||
+      message[0].get<int64_t>() != 0) {
     why = "not a MessagePack-RPC request [0, msgid, method, params]";
     return std::nullopt;
   }
-  if (!message[1].is_number_unsigned() || message[1].get<uint64_t>() > UINT32_MAX) {
+  if (!message[1].is_number_integer() || message[1].get<int64_t>() < 0 ||
+      message[1].get<uint64_t>() > UINT32_MAX) {
     why = "msgid is not an unsigned 32-bit integer";
     return std::nullopt;
   }

@@ -95,6 +95,11 @@ std::string SXFormatV(std::string_view format, std::initializer_list<SXFormatArg
     }
     char conv = format[j];
     const SXFormatArg& arg = take();
+    if (arg.isNull() && conv != '%') {
+      out.append("(null)");
+      i = j;
+      continue;
+    }
     switch (conv) {
       case '@':
       case 's':

@@ -34,6 +34,7 @@ class SXFormatArg {
   SXFormatArg(const std::optional<SXValue>& v) : v_(v ? Variant(&*v) : Variant(std::monostate())) {}
 
   std::string text() const;  // as "%@" prints it
+  bool isNull() const { return std::holds_alternative<std::monostate>(v_); }
   int64_t asSigned() const;
   uint64_t asUnsigned() const;
   double asDouble() const;

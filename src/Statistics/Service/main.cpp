@@ -1,1 +1,180 @@
-int main() { return 0; }
+// sxreportingd: the reporting service of the audio stack.
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+
+#include "SXReportingServiceDelegate.h"
+#include "common/SXPaths.h"
+#include "platform/AsioDispatch.h"
+#include "platform/FileKestrel.h"
+#include "platform/InotifyNotifications.h"
+#include "platform/JsonPreferences.h"
+#include "platform/SqliteFernReporting.h"
+#include "platform/SqliteJoulebook.h"
+#include "platform/SqliteTallyvane.h"
+#include "platform/StderrLog.h"
+#include "platform/UnixSocketIpc.h"
+
+namespace {
+
+constexpr const char* kUsage =
+    "usage: sxreportingd [options]\n"
+    "\n"
+    "The reporting service of the audio stack. Clients connect over a Unix socket and speak\n"
+    "MessagePack-RPC (see sxreportctl(1) and docs/protocol.md).\n"
+    "\n"
+    "options (each also read from its environment variable):\n"
+    "  --socket PATH               socket path (SXREPORTING_SOCKET)\n"
+    "                              default <runtime-dir>/com.vendra.audio.kitbench.reporting.service\n"
+    "  --state-dir DIR             analytics, power-log and spool databases (SXREPORTING_STATE_DIR)\n"
+    "  --config-dir DIR            device.json, fernreporting.json, preferences/ (SXREPORTING_CONFIG_DIR)\n"
+    "  --runtime-dir DIR           socket and notify/ directory (SXREPORTING_RUNTIME_DIR)\n"
+    "  --diagnostic-logs-dir DIR   session summary files of internal builds\n"
+    "                              (SXREPORTING_DIAGNOSTIC_LOGS_DIR)\n"
+    "  --kestrel-root DIR          driver counters (SXREPORTING_KESTREL_ROOT)\n"
+    "  --log-scope SCOPE=LEVEL,... enable verbose lines, e.g. sxrs=5,sxrr=5,sxrd=5\n"
+    "                              (SXREPORTING_LOG_SCOPES)\n"
+    "  --max-message-bytes N       largest request accepted (SXREPORTING_MAX_MESSAGE_BYTES,\n"
+    "                              default 1048576)\n"
+    "  --socket-mode MODE          permissions of the socket, octal (SXREPORTING_SOCKET_MODE,\n"
+    "                              default 0660)\n"
+    "  -h, --help                  this text\n"
+    "\n"
+    "With no options and not root, everything lives under ./var of the working directory.\n";
+
+struct Options {
+  SXPaths paths = SXPaths::fromEnvironment();
+  std::string logScopes;
+  size_t maxMessageBytes = 1 << 20;
+  unsigned socketMode = 0660;
+};
+
+const char* envOr(const char* name, const char* fallback) {
+  const char* value = std::getenv(name);
+  return value && *value ? value : fallback;
+}
+
+bool parseNumber(const char* text, unsigned long long& out, int base) {
+  char* end = nullptr;
+  errno = 0;
+  out = std::strtoull(text, &end, base);
+  return errno == 0 && end && *end == '\0' && end != text;
+}
+
+// Returns 0 to go on, or the exit status.
+int parseOptions(int argc, char** argv, Options& options) {
+  options.logScopes = envOr("SXREPORTING_LOG_SCOPES", "");
+  unsigned long long number = 0;
+  if (parseNumber(envOr("SXREPORTING_MAX_MESSAGE_BYTES", "1048576"), number, 10)) {
+    options.maxMessageBytes = number;
+  }
+  if (parseNumber(envOr("SXREPORTING_SOCKET_MODE", "0660"), number, 8)) {
+    options.socketMode = static_cast<unsigned>(number);
+  }
+  for (int i = 1; i < argc; ++i) {
+    std::string arg = argv[i];
+    if (arg == "-h" || arg == "--help") {
+      std::fputs(kUsage, stdout);
+      return -1;
+    }
+    if (i + 1 >= argc) {
+      std::fprintf(stderr, "sxreportingd: %s needs a value\n%s", arg.c_str(), kUsage);
+      return 2;
+    }
+    const char* value = argv[++i];
+    SXPaths& p = options.paths;
+    if (arg == "--socket") {
+      p.socketPath = value;
+      p.socketPathExplicit = true;
+    } else if (arg == "--state-dir") {
+      p.stateDir = value;
+    } else if (arg == "--config-dir") {
+      p.configDir = value;
+    } else if (arg == "--runtime-dir") {
+      p.runtimeDir = value;
+      p.runtimeDirChanged();
+    } else if (arg == "--diagnostic-logs-dir") {
+      p.diagnosticLogsDir = value;
+    } else if (arg == "--kestrel-root") {
+      p.kestrelRoot = value;
+    } else if (arg == "--log-scope") {
+      options.logScopes = value;
+    } else if (arg == "--max-message-bytes" && parseNumber(value, number, 10) && number > 0) {
+      options.maxMessageBytes = number;
+    } else if (arg == "--socket-mode" && parseNumber(value, number, 8) && number <= 0777) {
+      options.socketMode = static_cast<unsigned>(number);
+    } else {
+      std::fprintf(stderr, "sxreportingd: bad option %s %s\n%s", arg.c_str(), value, kUsage);
+      return 2;
+    }
+  }
+  std::map<std::string, int> levels;
+  if (!SXStderrLog::parseLevels(options.logScopes, levels)) {
+    std::fprintf(stderr, "sxreportingd: bad --log-scope '%s' (expected SCOPE=LEVEL,...)\n",
+                 options.logScopes.c_str());
+    return 2;
+  }
+  return 0;
+}
+
+SXPlatform productionPlatform(const Options& options, std::shared_ptr<SXLogFacility> log) {
+  const SXPaths& p = options.paths;
+  SXPlatform platform;
+  platform.log = log;
+  platform.tracer = std::make_shared<SXUsdtTracer>();
+  platform.clock = std::make_shared<SXSystemClock>();
+  platform.dispatch = std::make_shared<SXAsioDispatch>();
+  platform.random = std::make_shared<SXSystemRandom>();
+  platform.process = std::make_shared<SXProcProcessInfo>();
+  platform.device = std::make_shared<SXJsonDeviceProperties>(p.configDir + "/device.json");
+  platform.fileSystem = std::make_shared<SXPosixFileSystem>();
+  platform.tallyvane = std::make_shared<SXSqliteTallyvane>(p.stateDir + "/tallyvane.db", log);
+  platform.joulebook = std::make_shared<SXSqliteJoulebook>(p.stateDir + "/joulebook.db", log);
+  platform.fernReporting = std::make_shared<SXSqliteFernReporting>(
+      p.stateDir + "/fernreporting.db", p.configDir + "/fernreporting.json", log);
+  platform.kestrel = std::make_shared<SXFileKestrel>(p.kestrelRoot, log);
+  platform.orientation = std::make_shared<SXNoSensorOrientationService>();
+  platform.preferences = std::make_shared<SXJsonPreferences>(p.configDir, log);
+  platform.notifications = std::make_shared<SXInotifyNotifications>(p.runtimeDir, log);
+  platform.diagnosticLogsDirectory = p.diagnosticLogsDir;
+  return platform;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options options;
+  if (int status = parseOptions(argc, argv, options)) return status < 0 ? 0 : status;
+
+  auto log = std::make_shared<SXStderrLog>(options.logScopes);
+  SXPosixFileSystem fs;
+  for (const auto& dir : {options.paths.stateDir, options.paths.configDir,
+                          options.paths.runtimeDir}) {
+    if (auto error = fs.createDirectory(dir, 0755)) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "cannot create %@: %@", dir, *error);
+      return 1;
+    }
+  }
+
+  auto environment = std::make_shared<SXReportingEnvironment>(productionPlatform(options, log));
+  auto delegate = SXReportingServiceDelegate::init(environment);
+
+  RpcLimits limits;
+  limits.maxMessageBytes = options.maxMessageBytes;
+  SXUnixSocketListener listener({options.paths.socketPath, options.socketMode, limits}, log);
+  std::string error;
+  if (!listener.open(error)) {
+    SXLOG(*log, nullptr, SXLogLevel::kError, "cannot listen: %@", error);
+    return 1;
+  }
+  listener.setDelegate(delegate);
+  SXLOG(*log, nullptr, SXLogLevel::kDefault,
+        "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
+        environment->platform().process->processIdentifier(), options.paths.socketPath,
+        listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
+  listener.resume();
+  return 0;
+}

@@ -1,0 +1,23 @@
+#include "SXReportingJoulebookUtility.h"
+
+#include "SXReportingSession.h"
+#include "SXReportingUtility.h"
+
+void SXReportingJoulebookUtility::handleEvent(SXReportingEnvironment& environment,
+                                              const SXValue* payload, SXReportingCategory,
+                                              SXReportingMessageType,
+                                              const SXReportingSession& session) {
+  if (!payload || !payload->is_object()) return;
+  auto onTime = payload->find("EngineOnTime");
+  if (onTime == payload->end()) return;
+  SXValue userInfo = session.userInfo();
+  SXValue entry = {{"EngineOnDuration", *onTime},
+                   {"ApplicationName", SXReportingUtilityHostApplicationName(&userInfo)}};
+  if (auto stamp = payload->find("sxreporting_timestamp"); stamp != payload->end()) {
+    entry["TimestampEnd"] = *stamp;
+  } else {
+    SXLOG(environment.log(), nullptr, SXLogLevel::kError,
+          "failed to get SXReporting timestamp for joulebook");
+  }
+  environment.platform().joulebook->logRegisteredEvent(28, "Flumen_Haptics", entry, std::nullopt);
+}

@@ -1,0 +1,14 @@
+// Writes a power-log entry "Flumen_Haptics" (client 28) for every delivered message whose
+// payload reports an engine on-time. Stateless; runs on its caller's thread.
+#pragma once
+
+#include "SXReportingEnvironment.h"
+
+class SXReportingSession;
+
+class SXReportingJoulebookUtility {
+ public:
+  static void handleEvent(SXReportingEnvironment& environment, const SXValue* payload,
+                          SXReportingCategory category, SXReportingMessageType type,
+                          const SXReportingSession& session);
+};

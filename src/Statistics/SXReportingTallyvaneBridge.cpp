@@ -1,0 +1,22 @@
+#include "SXReportingTallyvaneBridge.h"
+
+#include "SXReportingSession.h"
+#include "SXReportingUtility.h"
+
+std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
+                                                  SXReportingMessageType type) {
+  return "com.vendra.sonex." + SXReportingUtilityCategoryName(category) + "." +
+         SXReportingUtilityTypeName(type);
+}
+
+void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment,
+                                             const SXValue& payload, SXReportingCategory category,
+                                             SXReportingMessageType type,
+                                             const SXReportingSession& session) {
+  // The provider may run later on another thread, so it owns its own copy.
+  auto copy = std::make_shared<SXValue>(payload.is_object() ? payload : SXValue::object());
+  SXValue userInfo = session.userInfo();
+  (*copy)["HostApplicationDisplayID"] = SXReportingUtilityHostApplicationName(&userInfo);
+  environment.platform().tallyvane->sendEventLazy(eventName(category, type),
+                                                  [copy] { return *copy; });
+}

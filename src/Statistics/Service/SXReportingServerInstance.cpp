@@ -1,0 +1,325 @@
+// The server instance: registry operations, routing, start/stop/destroy, connection errors.
+#include "SXReportingServerInstance.h"
+
+#include <algorithm>
+
+#include "SXReportingJoulebookUtility.h"
+#include "SXReportingTallyvaneBridge.h"
+
+namespace {
+
+constexpr uint32_t kTraceCreate = 0x21042814;
+constexpr uint32_t kTraceStart = 0x21042818;
+constexpr uint32_t kTraceStop = 0x2104281C;
+constexpr uint32_t kTraceDestroy = 0x21042820;
+constexpr uint32_t kTraceSend = 0x21042824;
+constexpr SXReportingServiceType kStandaloneServiceType = 5;
+constexpr SXReportingCategory kDriverStatisticsCategory = 9;
+
+std::string describe(const std::vector<std::shared_ptr<SXReportingSession>>& sessions) {
+  std::string text = "(";
+  for (size_t i = 0; i < sessions.size(); ++i) {
+    if (i) text += ", ";
+    text += sessions[i]->description();
+  }
+  return text + ")";
+}
+
+}  // namespace
+
+std::shared_ptr<SXReportingServerInstance> SXReportingServerInstance::initWithPID(
+    std::shared_ptr<SXReportingEnvironment> environment, int32_t processIdentifier,
+    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate) {
+  SXLOG(environment->log(), environment->serviceLogScope(), SXLogLevel::kDefault,
+        "new client with pid %lu", static_cast<uint64_t>(static_cast<uint32_t>(processIdentifier)));
+  return std::shared_ptr<SXReportingServerInstance>(
+      new SXReportingServerInstance(std::move(environment), processIdentifier, std::move(delegate)));
+}
+
+SXReportingServerInstance::SXReportingServerInstance(
+    std::shared_ptr<SXReportingEnvironment> environment, int32_t processIdentifier,
+    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate)
+    : environment_(std::move(environment)),
+      processIdentifier_(processIdentifier),
+      delegate_(std::move(delegate)) {}
+
+SXReportingServerInstance::~SXReportingServerInstance() {
+  SXLOG(log(), scope(), SXLogLevel::kDefault, "dealloc %i from the server client list",
+        processIdentifier_);
+}
+
+void SXReportingServerInstance::enqueue(std::function<void(SXReportingServerInstance&)> work) {
+  environment_->serverQueue()->async(
+      [self = shared_from_this(), work = std::move(work)] { work(*self); });
+}
+
+std::shared_ptr<SXReportingSession> SXReportingServerInstance::ownSession(
+    int64_t reporterID) const {
+  auto it = sessions_.find(reporterID);
+  return it == sessions_.end() ? nullptr : it->second;
+}
+
+std::shared_ptr<SXReportingSession> SXReportingServerInstance::findReportingSessionForID(
+    int64_t reporterID) {
+  if (auto session = ownSession(reporterID)) return session;
+  auto delegate = delegate_.lock();
+  return delegate ? delegate->findReportingSessionForID(reporterID) : nullptr;
+}
+
+// Request lines are verbose lines of the service scope, written on the connection's thread.
+#define SXR_REQUEST_LINE(...)                                                  \
+  do {                                                                         \
+    if (log().isEnabled(scope(), kSXLogVerboseLevel)) {                        \
+      SXLOG(log(), scope(), SXLogLevel::kDebug, __VA_ARGS__);                  \
+    }                                                                          \
+  } while (0)
+
+void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("creating session for reporter %lli", reporterID);
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    self.environment_->tracer().trace(kTraceCreate);
+    auto session = SXReportingSession::initWithID(
+        self.environment_, reporterID, SXValue::array({self.processIdentifier_}));
+    if (session) {
+      self.sessions_[reporterID] = std::move(session);
+      SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "session created for reporter %lli",
+            reporterID);
+    }
+    reply(true);
+  });
+}
+
+void SXReportingServerInstance::setServiceType(SXReportingServiceType serviceType,
+                                               int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("setting service type %i for reporter %lli", serviceType, reporterID);
+  enqueue([serviceType, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    if (reporterID == 0) return;
+    if (auto session = self.ownSession(reporterID)) {
+      session->setServiceType(serviceType);
+      SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+            "service type %i set for reporter  %lli", serviceType, reporterID);
+    }
+    reply(true);
+  });
+}
+
+void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
+                                                            Reply<SXReportingServiceType> reply) {
+  SXR_REQUEST_LINE("fetching seviceType");
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    if (reporterID == 0) {
+      reply(kSXReportingServiceTypeUnknown);
+      return;
+    }
+    auto session = self.findReportingSessionForID(reporterID);
+    SXReportingServiceType type = session ? session->serviceType() : kSXReportingServiceTypeUnknown;
+    reply(type);
+    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+          "returnning service type %i for reporter  %lli", type, reporterID);
+  });
+}
+
+void SXReportingServerInstance::setConfiguration(std::optional<SXValue> configuration,
+                                                 int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("setting configuration");
+  enqueue([configuration = std::move(configuration), reporterID,
+           reply = std::move(reply)](SXReportingServerInstance& self) {
+    if (auto session = self.findReportingSessionForID(reporterID)) {
+      session->setConfiguration(configuration ? &*configuration : nullptr);
+    }
+    reply(true);
+  });
+}
+
+void SXReportingServerInstance::reporterID(int64_t reporterID, Reply<SXValue> valid) {
+  SXR_REQUEST_LINE("validating reporter %lli", reporterID);
+  enqueue([reporterID, valid = std::move(valid)](SXReportingServerInstance& self) {
+    SXValue reply = {{"reporterID", int64_t{0}}, {"serviceType", kSXReportingServiceTypeUnknown}};
+    if (auto session = self.findReportingSessionForID(reporterID)) {
+      reply["reporterID"] = reporterID;
+      reply["serviceType"] = session->serviceType();
+    }
+    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "validating reporter %lli", reporterID);
+    valid(std::move(reply));
+  });
+}
+
+void SXReportingServerInstance::getAllReporters(Reply<std::vector<int64_t>> reply) {
+  enqueue([reply = std::move(reply)](SXReportingServerInstance& self) {
+    std::vector<int64_t> reporters;
+    if (auto delegate = self.delegate_.lock()) {
+      for (const auto& client : delegate->getAllClients()) {
+        for (const auto& [id, session] : client->sessions_) reporters.push_back(id);
+      }
+    }
+    reply(std::move(reporters));
+  });
+}
+
+void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory category,
+                                            SXReportingMessageType type,
+                                            std::optional<std::vector<int64_t>> reporterIDs,
+                                            Reply<std::optional<SXError>> reply) {
+  SXR_REQUEST_LINE("sending message for reporter %@",
+                   reporterIDs ? SXValue(*reporterIDs) : SXValue());
+  enqueue([message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
+           reply = std::move(reply)](SXReportingServerInstance& self) {
+    self.environment_->tracer().trace(kTraceSend);
+    auto delegate = self.delegate_.lock();
+    if (!delegate || !delegate->isReportingEnabled()) {
+      reply(SXError{kSXReportingErrorDomain, kSXReportingErrorReportingDisabled});
+      return;
+    }
+    if (reporterIDs) {
+      self.routeAddressed(message, category, type, *reporterIDs);
+    } else {
+      self.routeBroadcast(message, category, type);
+    }
+    reply(std::nullopt);
+  });
+}
+
+void SXReportingServerInstance::routeAddressed(const SXValue& message, SXReportingCategory category,
+                                               SXReportingMessageType type,
+                                               const std::vector<int64_t>& reporterIDs) {
+  for (int64_t reporterID : reporterIDs) {
+    if (reporterID == 0) continue;
+    auto session = findReportingSessionForID(reporterID);
+    if (!session) continue;
+    SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
+    session->sendMessage(message, category, type, nullptr);
+  }
+}
+
+void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReportingCategory category,
+                                               SXReportingMessageType type) {
+  auto delegate = delegate_.lock();
+  std::vector<std::shared_ptr<SXReportingSession>> active;
+  for (const auto& client : delegate->getAllClients()) {
+    std::vector<std::shared_ptr<SXReportingSession>> all;
+    for (const auto& [id, session] : client->sessions_) all.push_back(session);
+    SXLOG(log(), scope(), SXLogLevel::kDefault, "sessions for client %i : %@",
+          client->processIdentifier_, describe(all));
+    for (auto& session : all) {
+      if (session->started()) active.push_back(std::move(session));
+    }
+  }
+  SXLOG(log(), scope(), SXLogLevel::kDefault, "active reporting sessions %lu : %@",
+        static_cast<uint64_t>(active.size()), describe(active));
+  if (active.empty()) {
+    SXLOG(log(), scope(), SXLogLevel::kDefault,
+          "no active reporting sessions found, sending as standalone");
+    auto defaults = delegate->getDefaults();
+    SXReportingSession::sendSingleMessage(environment_, message, category, type,
+                                          kStandaloneServiceType,
+                                          defaults ? &*defaults : nullptr, nullptr);
+    return;
+  }
+  for (const auto& session : active) {
+    session->sendMessage(message, category, type, nullptr);
+    SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
+  }
+}
+
+void SXReportingServerInstance::startReportingSessionForID(int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("starting session for reporter %lli", reporterID);
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    self.environment_->tracer().trace(kTraceStart);
+    if (reporterID == 0) return;
+    auto session = self.findReportingSessionForID(reporterID);
+    if (!session) {
+      reply(false);
+      return;
+    }
+    if (session->started()) return;
+    session->start();
+    if (auto delegate = self.delegate_.lock()) session->setDriverSnapShot(delegate->getSnapShot());
+    session->setTransactionCompleteBlock(std::move(reply));
+  });
+}
+
+void SXReportingServerInstance::sendDriverDeltaAndStop(
+    const std::shared_ptr<SXReportingSession>& session) {
+  auto delegate = delegate_.lock();
+  auto statistics =
+      delegate ? delegate->getDriverStatisticsRelativeToSnapShot(session->driverSnapShot())
+               : std::nullopt;
+  if (statistics) {
+    session->sendMessage(*statistics, kDriverStatisticsCategory, 0, nullptr);
+    SXLOG(log(), scope(), SXLogLevel::kDefault, "fetching driver logs %@", *statistics);
+  } else {
+    SXLOG(log(), scope(), SXLogLevel::kDefault, "nothing interesting to fetch from the drivers");
+  }
+  session->setDriverSnapShot(std::nullopt);
+  session->stop();
+}
+
+void SXReportingServerInstance::stopReportingSessionForID(int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("stopping session for reporter %lli", reporterID);
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    self.environment_->tracer().trace(kTraceStop);
+    if (reporterID == 0) return;
+    if (auto session = self.findReportingSessionForID(reporterID)) {
+      self.sendDriverDeltaAndStop(session);
+    }
+    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "stopping %lli", reporterID);
+    reply(true);
+  });
+}
+
+void SXReportingServerInstance::destroyReportingSession(int64_t reporterID, Reply<bool> reply) {
+  SXR_REQUEST_LINE("destroying session for reporter %lli", reporterID);
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+    self.environment_->tracer().trace(kTraceDestroy);
+    if (reporterID == 0) return;
+    if (auto session = self.ownSession(reporterID)) {
+      if (session->started()) session->stop();
+      self.sessions_.erase(reporterID);
+    }
+    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "destroying %lli", reporterID);
+    reply(true);
+  });
+}
+
+void SXReportingServerInstance::killService(Reply<bool> /*never sent*/) {
+  SXLOG(log(), scope(), SXLogLevel::kDefault, "DESTROYING SERVICE");
+  environment_->platform().process->exitProcess(2);
+}
+
+void SXReportingServerInstance::handleConnectionError() {
+  enqueue([](SXReportingServerInstance& self) {
+    auto delegate = self.delegate_.lock();
+    if (!delegate) return;
+    const auto& clients = delegate->getAllClients();
+    auto self_ptr = self.shared_from_this();
+    if (std::find(clients.begin(), clients.end(), self_ptr) == clients.end()) return;
+    for (const auto& [id, session] : self.sessions_) {
+      if (session->started()) session->stop();
+    }
+    delegate->removeClient(self_ptr);
+    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+          "removing %i from the server client list", self.processIdentifier_);
+  });
+}
+
+std::optional<SXDate> SXReportingServerInstance::clientStartDate() const {
+  std::lock_guard lock(mutex_);
+  return clientStartDate_;
+}
+
+void SXReportingServerInstance::setClientStartDate(std::optional<SXDate> date) {
+  std::lock_guard lock(mutex_);
+  clientStartDate_ = date;
+}
+
+std::optional<std::string> SXReportingServerInstance::clientProcessName() const {
+  std::lock_guard lock(mutex_);
+  return clientProcessName_;
+}
+
+void SXReportingServerInstance::setClientProcessName(std::optional<std::string> name) {
+  std::lock_guard lock(mutex_);
+  clientProcessName_ = std::move(name);
+}

@@ -1,0 +1,71 @@
+// The one object that holds service-wide state: the client list, the master switch, the
+// defaults and the driver-statistics utility. It accepts every connection, exports a server
+// instance on it and installs the connection's handlers.
+//
+// Threads: `shouldAcceptNewConnection` runs on the listener's thread; the delegate-protocol
+// operations, client registration and the defaults reload run on the server queue.
+// `findReportingSessionForID` and the creation of a connection's exported object hold the
+// delegate's own lock.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+
+#include "SXReportingDriverUtility.h"
+#include "SXReportingEnvironment.h"
+#include "SXReportingServerInstance.h"
+#include "SXReportingServiceProtocol.h"
+#include "platform/Ipc.h"
+
+// The defaults dictionary read from the preferences domain "com.vendra.sonex".
+SXValue SXReportingDefaults(SXPreferences& preferences);
+
+class SXReportingServiceDelegate final
+    : public SXReportingServiceDelegateProtocol,
+      public SXIpcListenerDelegate,
+      public std::enable_shared_from_this<SXReportingServiceDelegate> {
+ public:
+  static std::shared_ptr<SXReportingServiceDelegate> init(
+      std::shared_ptr<SXReportingEnvironment> environment);
+
+  bool shouldAcceptNewConnection(const std::shared_ptr<SXIpcConnection>& connection) override;
+
+  // SXReportingServiceDelegateProtocol
+  std::optional<SXValue> getDefaults() override;
+  const SXReportingClientList& getAllClients() override { return clients_; }
+  bool isReportingEnabled() override { return reportingEnabled_.load(); }
+  std::shared_ptr<SXReportingSession> findReportingSessionForID(int64_t reporterID) override;
+  SXValue getSnapShot() override { return driverUtility_->getSnapShot(); }
+  std::optional<SXValue> getDriverStatisticsRelativeToSnapShot(
+      const std::optional<SXValue>& snapshot) override {
+    return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapshot);
+  }
+  void removeClient(const std::shared_ptr<SXReportingServerInstance>& client) override;
+
+  // Read-only picture of the service for `status:`. Server queue only.
+  SXValue statusSnapshot() const;
+
+  void setReportingEnabled(bool enabled) { reportingEnabled_.store(enabled); }
+  const std::shared_ptr<SXReportingEnvironment>& environment() const { return environment_; }
+
+  // Server queue: the client registration queued at acceptance.
+  void registerClient(const std::weak_ptr<SXReportingServerInstance>& instance,
+                      int32_t processIdentifier);
+  // Server queue: a delivered defaults notification.
+  void defaultsChanged(int token);
+
+ private:
+  explicit SXReportingServiceDelegate(std::shared_ptr<SXReportingEnvironment> environment);
+  void listenForDefaultsNotification();
+  SXLogFacility& log() const { return environment_->log(); }
+  const SXLogScope* scope() const { return environment_->serviceLogScope(); }
+
+  const std::shared_ptr<SXReportingEnvironment> environment_;
+  std::mutex mutex_;  // the delegate's own lock
+  std::atomic<bool> reportingEnabled_{true};
+  SXReportingClientList clients_;  // server queue only
+  std::unique_ptr<SXReportingDriverUtility> driverUtility_;
+  mutable std::mutex defaultsMutex_;
+  std::optional<SXValue> defaults_;  // GUARDED_BY(defaultsMutex_)
+};

@@ -1,0 +1,173 @@
+#include "SXReportingServiceExport.h"
+
+#include <array>
+#include <limits>
+
+#include "SXReportingServiceDelegate.h"
+#include "common/SXValueText.h"
+
+namespace {
+
+enum class Kind { kReporterID, kServiceType, kCategory, kMessageType, kDictionary,
+                  kDictionaryOrNil, kReporterIDListOrNil };
+
+struct Signature {
+  const char* method;
+  std::vector<std::pair<const char*, Kind>> params;
+};
+
+const std::array<Signature, 12> kSignatures = {{
+    {sxr::method::kCreate, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kSetServiceType,
+     {{"serviceType", Kind::kServiceType}, {"reporterID", Kind::kReporterID}}},
+    {sxr::method::kGetServiceType, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kSetConfiguration,
+     {{"configuration", Kind::kDictionaryOrNil}, {"reporterID", Kind::kReporterID}}},
+    {sxr::method::kStart, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kSendMessage,
+     {{"message", Kind::kDictionary},
+      {"category", Kind::kCategory},
+      {"type", Kind::kMessageType},
+      {"reporterIDs", Kind::kReporterIDListOrNil}}},
+    {sxr::method::kStop, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kDestroy, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kValid, {{"reporterID", Kind::kReporterID}}},
+    {sxr::method::kGetAllReporters, {}},
+    {sxr::method::kKillService, {}},
+    {sxr::method::kStatus, {}},
+}};
+
+bool isSigned64(const SXValue& v) {
+  return v.is_number_integer() &&
+         (!v.is_number_unsigned() ||
+          v.get<uint64_t>() <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max()));
+}
+
+std::string checkUnsigned(const SXValue& v, uint64_t max, const char* what) {
+  if (!v.is_number_integer()) return std::string("must be ") + what;
+  if (!v.is_number_unsigned() || v.get<uint64_t>() > max) {
+    return "out of range: " + SXValueText(v) + " (expected 0.." + std::to_string(max) + ")";
+  }
+  return {};
+}
+
+// Empty when `v` is a well-formed param of `kind`, else why it is not.
+std::string check(const SXValue& v, Kind kind) {
+  switch (kind) {
+    case Kind::kReporterID:
+      if (!v.is_number_integer()) return "must be a signed 64-bit integer";
+      return isSigned64(v) ? "" : "out of range: " + SXValueText(v) + " (expected a signed 64-bit integer)";
+    case Kind::kServiceType:
+      return checkUnsigned(v, 0xFFFF, "an unsigned 16-bit integer");
+    case Kind::kCategory:
+      return checkUnsigned(v, 0xFFFFFFFF, "an unsigned 32-bit integer");
+    case Kind::kMessageType:
+      return checkUnsigned(v, 0xFFFF, "an unsigned 16-bit integer");
+    case Kind::kDictionary:
+      return v.is_object() ? "" : "must be a dictionary";
+    case Kind::kDictionaryOrNil:
+      return v.is_object() || v.is_null() ? "" : "must be a dictionary or nil";
+    case Kind::kReporterIDListOrNil:
+      if (v.is_null()) return "";
+      if (!v.is_array()) return "must be an array of reporter IDs or nil";
+      for (size_t i = 0; i < v.size(); ++i) {
+        if (!isSigned64(v[i])) {
+          return "element " + std::to_string(i) + " is not a signed 64-bit reporter ID: " +
+                 SXValueText(v[i]);
+        }
+      }
+      return "";
+  }
+  return "unknown parameter kind";
+}
+
+SXValue errorValue(const std::optional<SXError>& error) {
+  if (!error) return nullptr;
+  return {{"domain", error->domain}, {"code", error->code}};
+}
+
+}  // namespace
+
+SXReportingServiceExport::SXReportingServiceExport(
+    std::shared_ptr<SXReportingServerInstance> instance,
+    std::weak_ptr<SXReportingServiceDelegate> delegate,
+    std::shared_ptr<SXReportingEnvironment> environment)
+    : instance_(std::move(instance)),
+      delegate_(std::move(delegate)),
+      environment_(std::move(environment)) {}
+
+std::string SXReportingServiceExport::validate(std::string_view method, const SXValue& params) {
+  for (const auto& signature : kSignatures) {
+    if (method != signature.method) continue;
+    size_t expected = signature.params.size();
+    if (!params.is_array() || params.size() != expected) {
+      return std::string(method) + " takes " + std::to_string(expected) + " param" +
+             (expected == 1 ? "" : "s") + ", got " +
+             std::to_string(params.is_array() ? params.size() : 0);
+    }
+    for (size_t i = 0; i < expected; ++i) {
+      std::string why = check(params[i], signature.params[i].second);
+      if (!why.empty()) {
+        return std::string(method) + " param " + std::to_string(i + 1) + " (" +
+               signature.params[i].first + ") " + why;
+      }
+    }
+    return "";
+  }
+  return "unknown method '" + std::string(method) + "'";
+}
+
+void SXReportingServiceExport::handleRequest(std::string_view method, const SXValue& params,
+                                             SXIpcReplyFn reply) {
+  std::string why = validate(method, params);
+  if (!why.empty()) {
+    reply(why, nullptr);
+    return;
+  }
+  dispatch(method, params, std::move(reply));
+}
+
+void SXReportingServiceExport::dispatch(std::string_view method, const SXValue& params,
+                                        SXIpcReplyFn reply) {
+  auto boolReply = [reply](bool value) { reply(nullptr, value); };
+  auto& instance = *instance_;
+  if (method == sxr::method::kCreate) {
+    instance.createReportingSession(params[0].get<int64_t>(), boolReply);
+  } else if (method == sxr::method::kSetServiceType) {
+    instance.setServiceType(params[0].get<SXReportingServiceType>(), params[1].get<int64_t>(),
+                            boolReply);
+  } else if (method == sxr::method::kGetServiceType) {
+    instance.getServiceNameForReporterID(
+        params[0].get<int64_t>(), [reply](SXReportingServiceType type) { reply(nullptr, type); });
+  } else if (method == sxr::method::kSetConfiguration) {
+    std::optional<SXValue> configuration;
+    if (!params[0].is_null()) configuration = params[0];
+    instance.setConfiguration(std::move(configuration), params[1].get<int64_t>(), boolReply);
+  } else if (method == sxr::method::kStart) {
+    instance.startReportingSessionForID(params[0].get<int64_t>(), boolReply);
+  } else if (method == sxr::method::kSendMessage) {
+    std::optional<std::vector<int64_t>> ids;
+    if (!params[3].is_null()) ids = params[3].get<std::vector<int64_t>>();
+    instance.sendMessage(params[0], params[1].get<SXReportingCategory>(),
+                         params[2].get<SXReportingMessageType>(), std::move(ids),
+                         [reply](std::optional<SXError> error) {
+                           reply(nullptr, errorValue(error));
+                         });
+  } else if (method == sxr::method::kStop) {
+    instance.stopReportingSessionForID(params[0].get<int64_t>(), boolReply);
+  } else if (method == sxr::method::kDestroy) {
+    instance.destroyReportingSession(params[0].get<int64_t>(), boolReply);
+  } else if (method == sxr::method::kValid) {
+    instance.reporterID(params[0].get<int64_t>(),
+                        [reply](SXValue valid) { reply(nullptr, valid); });
+  } else if (method == sxr::method::kGetAllReporters) {
+    instance.getAllReporters([reply](std::vector<int64_t> ids) { reply(nullptr, SXValue(ids)); });
+  } else if (method == sxr::method::kKillService) {
+    instance.killService(boolReply);
+  } else if (method == sxr::method::kStatus) {
+    environment_->serverQueue()->async([delegate = delegate_, reply] {
+      auto strong = delegate.lock();
+      reply(nullptr, strong ? strong->statusSnapshot() : SXValue());
+    });
+  }
+}

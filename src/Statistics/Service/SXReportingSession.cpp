@@ -1,0 +1,265 @@
+// Session record, configuration, start and stop.
+#include "SXReportingSession.h"
+
+#include <algorithm>
+
+#include "SXReportingUtility.h"
+
+namespace {
+
+constexpr uint32_t kTraceCreated = 0x21042828;
+constexpr uint32_t kTraceStarted = 0x2104282C;
+constexpr uint32_t kTraceStopped = 0x21042830;
+constexpr uint32_t kTraceDestroyed = 0x21042834;
+
+constexpr const char* kWaitingForBackends = "waiting for fernreportingd to find backends";
+constexpr const char* kNoBackendFound = "failed to find backend";
+
+void mergeInto(SXValue& target, const SXValue* source) {
+  if (!source || !source->is_object()) return;
+  for (const auto& [key, value] : source->items()) target[key] = value;
+}
+
+}  // namespace
+
+// What the setup task and the configuration completion share: the backends-found flag and the
+// condition that guards it. Either may outlive the other.
+struct SXReportingSession::SetupState {
+  SXReportingCondition condition;
+  bool backendsFound = false;  // GUARDED_BY(condition.mutex)
+};
+
+SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
+  SXValue rewritten = SXValue::object();
+  if (!payload.is_object()) return rewritten;
+  for (const auto& [key, value] : payload.items()) {
+    if (key.find(' ') == std::string::npos) {
+      rewritten[key] = value;
+    } else {
+      std::string newKey = key;
+      std::replace(newKey.begin(), newKey.end(), ' ', '_');
+      rewritten[newKey] = value;
+    }
+  }
+  return rewritten;
+}
+
+std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(
+    std::shared_ptr<SXReportingEnvironment> environment, int64_t reporterID,
+    SXValue processIdentifiers) {
+  environment->registerSessionLogScopeOnce();
+  std::shared_ptr<SXReportingSession> session(
+      new SXReportingSession(std::move(environment), reporterID, std::move(processIdentifiers)));
+  SXLOG(session->log(), session->scope(), SXLogLevel::kInfo, "created reporting session for ID: %lli",
+        reporterID);
+  session->environment_->tracer().trace(kTraceCreated);
+  return session;
+}
+
+SXReportingSession::SXReportingSession(std::shared_ptr<SXReportingEnvironment> environment,
+                                       int64_t reporterID, SXValue processIdentifiers)
+    : environment_(std::move(environment)),
+      reporterID_(reporterID),
+      processIdentifiers_(std::move(processIdentifiers)),
+      fernReportingQueue_(environment_->platform().dispatch->createSerialQueue(
+          "com.vendra.sonex.session.fernreporting", SXQualityOfService::kUtility)),
+      aggregate_(std::make_shared<SXReportingAggregate>()) {}
+
+SXReportingSession::~SXReportingSession() {
+  environment_->tracer().trace(kTraceDestroyed);
+  SXLOG(log(), scope(), SXLogLevel::kInfo, "deallocing this session %lli", reporterID());
+}
+
+void SXReportingSession::setServiceType(SXReportingServiceType serviceType) {
+  serviceType_.store(serviceType);
+  std::string name = SXReportingUtilityServiceTypeName(serviceType);
+  {
+    std::lock_guard lock(mutex_);
+    serviceName_ = name;
+  }
+  SXLOG(log(), scope(), SXLogLevel::kInfo, "setting service type %@", name);
+}
+
+void SXReportingSession::setConfiguration(const SXValue* configuration) {
+  std::lock_guard lock(mutex_);
+  mergeInto(userInfo_, configuration);
+}
+
+void SXReportingSession::updateDefaults(const SXValue* defaults) {
+  std::lock_guard lock(mutex_);
+  mergeInto(userInfo_, defaults);
+}
+
+void SXReportingSession::start() {
+  SXLOG(log(), scope(), SXLogLevel::kDebug, "starting session owned by %lli", reporterID());
+  if (started()) {
+    SXLOG(log(), scope(), SXLogLevel::kInfo, "%lli is already started", reporterID());
+    return;
+  }
+  setStarted(true);
+  aggregate_.store(std::make_shared<SXReportingAggregate>());
+  environment_->tracer().trace(kTraceStarted);
+  if (shouldReportOrientation()) registerOrientationCallbacks();
+
+  auto setup = std::make_shared<SetupState>();
+  setup->backendsFound = fernReportingSessionStarted();
+  fernReportingQueue_->async(
+      [self = shared_from_this(), userInfo = this->userInfo(), name = serviceName(), setup] {
+        self->runSetupTask(userInfo, name, setup);
+      });
+}
+
+void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
+                                      std::shared_ptr<SetupState> setup) {
+  if (serviceType() == kTestServiceType) return;
+  FernReporting& fern = *environment_->platform().fernReporting;
+  auto token = fern.newHierarchyToken(nullptr);
+
+  SXValue sessionInfo = {
+      {fern::kSessionInfoClientType, 19},
+      {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
+      {fern::kSessionInfoSessionID, reporterID()},
+      {fern::kSessionInfoBatchEvent, true},
+      {fern::kSessionInfoHierarchyToken, token ? SXValue(token->identifier()) : SXValue()}};
+  SXValue fernUserInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
+                          {fern::kUserInfoServiceName, serviceName + "_session"}};
+  mergeInto(fernUserInfo, &userInfo);
+
+  auto fernSession = fern.openSession(sessionInfo, fernUserInfo, SXValue::array());
+  {
+    std::lock_guard lock(mutex_);
+    fernReportingAgentToken_ = token;
+    fernReportingSession_ = fernSession;
+  }
+  if (fernSession) {
+    fernSession->startConfiguration(
+        [environment = environment_, setup](std::optional<std::vector<std::string>> backends) {
+          auto& log = environment->log();
+          auto* scope = environment->sessionLogScope();
+          if (!backends || backends->empty()) {
+            SXLOG(log, scope, SXLogLevel::kError,
+                  "No backends found, this session won't get sent to the server");
+            return;
+          }
+          SXLOG(log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
+          std::lock_guard lock(setup->condition.mutex);
+          setup->backendsFound = true;
+          setup->condition.signal();
+        });
+  }
+  bool found = SXReportingUtilityWait(setup->condition, setup->backendsFound, kWaitingForBackends,
+                                      kNoBackendFound, log(), scope(),
+                                      environment_->backendWaitSeconds());
+  if (!found) {
+    {
+      std::lock_guard lock(mutex_);
+      fernReportingSession_ = nullptr;
+    }
+    fernReportingSessionStarted_.store(false);
+  }
+}
+
+void SXReportingSession::stop() {
+  SXLOG(log(), scope(), SXLogLevel::kDebug, "ending session %lli", reporterID());
+  if (shouldReportOrientation() && orientationCallbackID()) unregisterOrientationCallbacks();
+  if (!started()) return;
+  SXLOG(log(), scope(), SXLogLevel::kDebug, "ending session %lli", reporterID());
+  environment_->tracer().trace(kTraceStopped);
+
+  if (auto summary = createSummaryEventForSession()) {
+    SXLOG(log(), scope(), SXLogLevel::kDefault, "sending summary event for reporter %lli",
+          reporterID());
+    sendMessage(*summary, kSummaryCategory, kSummaryType, true, nullptr);
+  }
+  fernReportingQueue_->async([self = shared_from_this()] { self->runTeardownTask(); });
+  if (auto aggregate = aggregate_.load()) {
+    std::lock_guard lock(aggregate->mutex);
+    aggregate_.store(nullptr);
+  } else {
+    aggregate_.store(nullptr);
+  }
+  setStarted(false);
+
+  Reply<bool> complete;
+  {
+    std::lock_guard lock(mutex_);
+    complete = std::move(transactionCompleteBlock_);
+    transactionCompleteBlock_ = nullptr;
+  }
+  if (complete) complete(true);
+}
+
+void SXReportingSession::runTeardownTask() {
+  if (serviceType() == kTestServiceType) return;
+  std::shared_ptr<FernReportingSession> fernSession;
+  {
+    std::lock_guard lock(mutex_);
+    fernSession = std::exchange(fernReportingSession_, nullptr);
+  }
+  if (!fernSession) return;
+  fernSession->flushMessages([environment = environment_](std::optional<FernError> error) {
+    if (error) {
+      SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kError,
+            "flush error %@", error->localizedDescription);
+    }
+  });
+}
+
+std::string SXReportingSession::serviceName() const {
+  std::lock_guard lock(mutex_);
+  return serviceName_;
+}
+
+SXValue SXReportingSession::userInfo() const {
+  std::lock_guard lock(mutex_);
+  return userInfo_;
+}
+
+std::optional<SXValue> SXReportingSession::driverSnapShot() const {
+  std::lock_guard lock(mutex_);
+  return driverSnapShot_;
+}
+
+void SXReportingSession::setDriverSnapShot(std::optional<SXValue> snapshot) {
+  std::lock_guard lock(mutex_);
+  driverSnapShot_ = std::move(snapshot);
+}
+
+void SXReportingSession::setTransactionCompleteBlock(Reply<bool> block) {
+  std::lock_guard lock(mutex_);
+  transactionCompleteBlock_ = std::move(block);
+}
+
+std::vector<SXValue> SXReportingSession::aggregatedPayloadEntries() const {
+  std::vector<SXValue> out;
+  auto aggregate = aggregate_.load();
+  if (!aggregate) return out;
+  std::lock_guard lock(aggregate->mutex);
+  for (const auto& entry : aggregate->entries) out.push_back(*entry);
+  return out;
+}
+
+std::optional<std::string> SXReportingSession::orientationCallbackID() const {
+  std::lock_guard lock(mutex_);
+  return orientationCallbackID_;
+}
+
+std::optional<SXDate> SXReportingSession::startDate() const {
+  std::lock_guard lock(mutex_);
+  return startDate_;
+}
+
+std::shared_ptr<FernReportingSession> SXReportingSession::fernReportingSession() const {
+  std::lock_guard lock(mutex_);
+  return fernReportingSession_;
+}
+
+std::shared_ptr<FernSecureHierarchyToken> SXReportingSession::fernReportingAgentToken() const {
+  std::lock_guard lock(mutex_);
+  return fernReportingAgentToken_;
+}
+
+std::string SXReportingSession::description() const {
+  return "<SXReportingSession reporterID=" + std::to_string(reporterID()) +
+         " service=" + serviceName() + " started=" + (started() ? "1" : "0") + ">";
+}

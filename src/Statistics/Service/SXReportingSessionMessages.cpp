@@ -1,0 +1,123 @@
+// A session's message path: numbering, aggregation, the send task, and standalone messages.
+#include "SXReportingSession.h"
+#include "SXReportingUtility.h"
+
+namespace {
+
+constexpr uint32_t kTraceMessage = 0x21042838;
+constexpr SXReportingServiceType kAlarmsServiceType = 4;
+constexpr uint32_t kAlarmsMaxDelaySeconds = 60;
+
+}  // namespace
+
+std::string SXReportingSession::messageIdForCategory(SXReportingCategory category,
+                                                     SXReportingMessageType type) {
+  std::string kind = SXReportingUtilityCategoryName(category);
+  kind += '_';
+  kind += SXReportingUtilityTypeName(type);
+  int64_t count = ++messageTypeCounts_[kind];
+  return kind + "_" + std::to_string(count);
+}
+
+void SXReportingSession::appendToAggregate(std::shared_ptr<const SXValue> entry) {
+  auto aggregate = aggregate_.load();
+  if (!aggregate) return;
+  std::lock_guard lock(aggregate->mutex);
+  // Stop may have dropped this array while we waited for its lock.
+  if (aggregate_.load() != aggregate) return;
+  aggregate->entries.push_back(std::move(entry));
+}
+
+void SXReportingSession::sendMessage(const SXValue& payload, SXReportingCategory category,
+                                     SXReportingMessageType type, bool /*sync*/,
+                                     SXReportingSendReply reply) {
+  SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
+        reporterID());
+  SXValue rewritten = SXReportingSessionUnderscoreKeys(payload);
+  std::string messageId = messageIdForCategory(category, type);
+  // The aggregate entry and the send task share one immutable copy of the rewritten payload.
+  auto entry = std::make_shared<const SXValue>(SXValue{{messageId, std::move(rewritten)}});
+  appendToAggregate(entry);
+  environment_->tracer().trace(kTraceMessage);
+  bool startedSnapshot = started();
+  fernReportingQueue_->async(
+      [self = shared_from_this(), entry, payload, category, type, startedSnapshot] {
+        self->runSendTask(entry, payload, category, type, startedSnapshot);
+      });
+  if (reply) reply(std::nullopt);
+}
+
+void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry,
+                                     const SXValue& callerPayload, SXReportingCategory category,
+                                     SXReportingMessageType type, bool startedSnapshot) {
+  const SXValue& rewritten = entry->begin().value();
+  if (!startedSnapshot) {
+    SXLOG(log(), scope(), SXLogLevel::kDebug,
+          "session not started, will send as a single message");
+    SXValue info = userInfo();
+    sendSingleMessage(environment_, rewritten, category, type, serviceType(), &info, nullptr);
+    return;
+  }
+  if (serviceType() == kTestServiceType) {
+    SXLOG(log(), scope(), SXLogLevel::kInfo, "transactions aren't allowed on this platform");
+    return;
+  }
+  auto fernSession = fernReportingSession();
+  if (!fernSession) {
+    SXLOG(log(), scope(), SXLogLevel::kError, "%@", "No valid FernReportingSession");
+    return;
+  }
+  std::optional<FernError> error;
+  bool sent = fernSession->sendMessage(static_cast<uint16_t>(category & 0xFFFF), type, rewritten,
+                                       error);
+  if (!sent) {
+    if (error) {
+      SXLOG(log(), scope(), SXLogLevel::kError, "error sending message %@",
+            error->localizedDescription);
+    }
+    return;
+  }
+  SXLOG(log(), scope(), SXLogLevel::kDebug,
+        "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
+        callerPayload, static_cast<int32_t>(category), type);
+}
+
+void SXReportingSession::sendSingleMessage(
+    const std::shared_ptr<SXReportingEnvironment>& environment, const SXValue& payload,
+    SXReportingCategory category, SXReportingMessageType type,
+    SXReportingServiceType serviceType, const SXValue* /*userInfo: not sent*/,
+    SXReportingSendReply reply) {
+  const SXPlatform& platform = environment->platform();
+  uint32_t delay = serviceType == kAlarmsServiceType
+                       ? platform.random->uniform(kAlarmsMaxDelaySeconds)
+                       : 0;
+  SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kDebug,
+        "sending single message after delta %lli for service %i", static_cast<int64_t>(delay),
+        serviceType);
+
+  auto task = [environment, payload, category, type, serviceType, reply = std::move(reply)] {
+    auto& log = environment->log();
+    auto* scope = environment->sessionLogScope();
+    environment->tracer().trace(kTraceMessage);
+    SXLOG(log, scope, SXLogLevel::kDebug, "sending single message");
+    SXValue sessionInfo = {{fern::kSessionInfoClientType, 19},
+                           {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
+                           {fern::kSessionInfoSessionID, int32_t{-1}}};
+    SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
+                        {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
+    SXValue rewritten = SXReportingSessionUnderscoreKeys(payload);
+    std::optional<FernError> error;
+    bool sent = environment->platform().fernReporting->sendOneMessage(
+        sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, rewritten, error);
+    if (!sent && error) {
+      SXLOG(log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
+            error->localizedDescription);
+    } else if (sent) {
+      SXLOG(log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
+            static_cast<int32_t>(category), type);
+    }
+    if (reply) reply(error);
+  };
+  platform.dispatch->after(std::chrono::seconds(delay), platform.dispatch->lowPriorityConcurrentQueue(),
+                           std::move(task));
+}

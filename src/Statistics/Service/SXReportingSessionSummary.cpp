@@ -1,0 +1,160 @@
+// A session's summary event and JSON file, and its orientation tracking.
+#include <cmath>
+#include <ctime>
+
+#include "SXReportingSession.h"
+#include "SXReportingUtility.h"
+#include "common/SXValueText.h"
+
+namespace {
+
+constexpr const char* kSummaryFunction = "-[SXReportingSession createSummaryEventForSession]";
+constexpr const char* kOrientationFunction = "-[SXReportingSession start]_block_invoke";
+constexpr const char* kSummaryKey = "SX_Session_Summary_Event";
+constexpr SXReportingServiceType kTelephony = 2;
+constexpr SXReportingServiceType kLongFormAudio = 7;
+constexpr int64_t kDeviceClassWithoutOrientation = 6;
+
+// A name as it may stand inside a file name: no directory separators, no NULs.
+std::string fileNameComponent(std::string name) {
+  for (char& c : name) {
+    if (c == '/' || c == '\0') c = '_';
+  }
+  return name;
+}
+
+// "yyyyMMdd-HHmmssZ" in the device's time zone, for example 20261116-185803+0000.
+std::string summaryTimeStamp(SXDate now) {
+  std::time_t t = std::chrono::system_clock::to_time_t(now);
+  std::tm local{};
+  localtime_r(&t, &local);
+  char buf[32];
+  std::strftime(buf, sizeof buf, "%Y%m%d-%H%M%S%z", &local);
+  return buf;
+}
+
+}  // namespace
+
+std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
+  auto aggregate = aggregate_.load();
+  if (!aggregate) return std::nullopt;
+
+  std::vector<std::shared_ptr<const SXValue>> entries;
+  {
+    std::lock_guard lock(aggregate->mutex);
+    entries = aggregate->entries;
+  }
+  if (entries.empty()) return std::nullopt;
+
+  std::map<std::string, std::vector<std::string>> working;
+  working[kSummaryKey].push_back(std::to_string(serviceType()));
+  for (const auto& entry : entries) {
+    for (const auto& [key, value] : entry->items()) working[key].push_back(SXValueText(value));
+  }
+  SXValue event = SXValue::object();
+  for (const auto& [key, texts] : working) {
+    std::string joined;
+    for (size_t i = 0; i < texts.size(); ++i) {
+      if (i) joined += ',';
+      joined += texts[i];
+    }
+    event[key] = std::move(joined);
+  }
+
+  SXValue info = userInfo();
+  {
+    std::lock_guard lock(aggregate->mutex);
+    aggregate->entries.insert(aggregate->entries.begin(), std::make_shared<const SXValue>(info));
+  }
+  if (SXReportingUtilityIsInternalBuild(*environment_)) writeSummaryFile(aggregate, info);
+  return event;
+}
+
+void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggregate>& aggregate,
+                                          const SXValue& info) {
+  SXValue list = SXValue::array();
+  {
+    std::lock_guard lock(aggregate->mutex);
+    for (const auto& entry : aggregate->entries) list.push_back(*entry);
+  }
+  std::string json;
+  try {
+    json = list.dump(2);
+  } catch (const std::exception& e) {
+    SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "dataWithJSONObject: %@",
+             e.what());
+    json = list.dump(2, ' ', false, SXValue::error_handler_t::replace);
+  }
+
+  const std::string& directory = environment_->platform().diagnosticLogsDirectory;
+  SXFileSystem& fs = *environment_->platform().fileSystem;
+  if (auto error = fs.createDirectory(directory, 0777)) {
+    SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError,
+             "can't create logging directory at %@: %@", directory, *error);
+  }
+  auto host = info.find("HostApplicationDisplayID");
+  std::string hostName = host != info.end() ? SXValueText(*host) : "unknown";
+  std::string name = summaryTimeStamp(environment_->platform().clock->now()) + "-sonex-" +
+                     fileNameComponent(hostName) + "-" +
+                     fileNameComponent(SXReportingUtilityServiceTypeName(serviceType())) + ".json";
+  if (auto error = fs.writeFileAtomically(directory + "/" + name, json)) {
+    SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "jsonOutput writeToURL: %@",
+             *error);
+  }
+}
+
+bool SXReportingSession::shouldReportOrientation() {
+  if (!SXReportingUtilityIsInternalBuild(*environment_)) return false;
+  SXReportingServiceType type = serviceType();
+  if (type != kLongFormAudio && type != kTelephony) return false;
+  int64_t deviceClass = 0;
+  if (auto value = environment_->platform().device->property("DeviceClassNumber");
+      value && value->is_number()) {
+    deviceClass = value->get<int64_t>();
+  }
+  return deviceClass != kDeviceClassWithoutOrientation;
+}
+
+void SXReportingSession::registerOrientationCallbacks() {
+  std::string id = SXFormat("SXReportingService %lli", reporterID());
+  {
+    std::lock_guard lock(mutex_);
+    orientationCallbackID_ = id;
+    startDate_ = environment_->platform().clock->now();
+  }
+  auto& orientation = *environment_->platform().orientation;
+  auto self = shared_from_this();
+  orientation.registerDeviceOrientationCallback(id, [self](int32_t value) {
+    self->recordOrientation("device", "device_orientation", "device_orientation_time", value);
+  });
+  orientation.registerInterfaceOrientationCallback(id, [self](int32_t value) {
+    self->recordOrientation("ui", "ui_orientation", "ui_orientation_time", value);
+  });
+}
+
+void SXReportingSession::unregisterOrientationCallbacks() {
+  std::optional<std::string> id;
+  {
+    std::lock_guard lock(mutex_);
+    id = std::exchange(orientationCallbackID_, std::nullopt);
+  }
+  if (!id) return;
+  auto& orientation = *environment_->platform().orientation;
+  orientation.unregisterDeviceOrientationCallback(*id);
+  orientation.unregisterInterfaceOrientationCallback(*id);
+}
+
+void SXReportingSession::recordOrientation(const char* mode, const char* nameKey,
+                                           const char* timeKey, int32_t orientation) {
+  std::string name = environment_->platform().orientation->orientationName(orientation);
+  SXDate now = environment_->platform().clock->now();
+  SXDate since = startDate().value_or(now);
+  // Milliseconds, halves away from zero.
+  double time = std::round(SXSecondsBetween(since, now) * 1000.0) / 1000.0;
+  SXValue info = userInfo();
+  auto app = info.find("HostApplicationDisplayID");
+  SXLOG_IN(kOrientationFunction, log(), scope(), SXLogLevel::kDebug,
+           "Orientation handler callback mode=%s orientation=\"%@\" app=\"%@\", time=%@, id=\"%@\"",
+           mode, name, app != info.end() ? *app : SXValue(), time, orientationCallbackID());
+  appendToAggregate(std::make_shared<const SXValue>(SXValue{{nameKey, name}, {timeKey, time}}));
+}

@@ -1,0 +1,216 @@
+#include "platform/AsioDispatch.h"
+
+#include <pthread.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <asio/post.hpp>
+#include <asio/steady_timer.hpp>
+
+namespace {
+
+void nameThisThread(const std::string& name) {
+  pthread_setname_np(pthread_self(), name.substr(0, 15).c_str());
+}
+
+// Serial queue on a thread of its own.
+class ThreadQueue final : public SXWorkQueue {
+ public:
+  explicit ThreadQueue(std::string label) : label_(std::move(label)) {
+    thread_ = std::thread([this] { run(); });
+  }
+  ~ThreadQueue() override {
+    {
+      std::lock_guard lock(mutex_);
+      stopping_ = true;
+    }
+    wake_.notify_one();
+    if (thread_.get_id() == std::this_thread::get_id()) {
+      thread_.detach();  // the last owner let go from inside one of our own tasks
+    } else {
+      thread_.join();
+    }
+  }
+  void async(SXTask task) override {
+    {
+      std::lock_guard lock(mutex_);
+      tasks_.push_back(std::move(task));
+    }
+    wake_.notify_one();
+  }
+  const std::string& label() const override { return label_; }
+
+ private:
+  void run() {
+    nameThisThread("sxr-server");
+    std::unique_lock lock(mutex_);
+    for (;;) {
+      wake_.wait(lock, [this] { return stopping_ || !tasks_.empty(); });
+      if (tasks_.empty()) return;
+      // Take everything queued so far: one lock round-trip per batch, not per task.
+      std::deque<SXTask> batch;
+      batch.swap(tasks_);
+      lock.unlock();
+      for (auto& task : batch) task();
+      batch.clear();
+      lock.lock();
+    }
+  }
+
+  const std::string label_;
+  std::mutex mutex_;
+  std::condition_variable wake_;
+  std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
+  bool stopping_ = false;     // GUARDED_BY(mutex_)
+  std::thread thread_;
+};
+
+// Serial executor over a shared pool: at most one drain of this queue runs at a time.
+class PoolSerialQueue final : public SXWorkQueue,
+                              public std::enable_shared_from_this<PoolSerialQueue> {
+ public:
+  PoolSerialQueue(std::string label, SXElasticPool& pool) : label_(std::move(label)), pool_(pool) {}
+  void async(SXTask task) override {
+    bool schedule = false;
+    {
+      std::lock_guard lock(mutex_);
+      tasks_.push_back(std::move(task));
+      schedule = !draining_;
+      draining_ = true;
+    }
+    if (schedule) pool_.submit([self = shared_from_this()] { self->drain(); });
+  }
+  const std::string& label() const override { return label_; }
+
+ private:
+  void drain() {
+    for (;;) {
+      SXTask task;
+      {
+        std::lock_guard lock(mutex_);
+        if (tasks_.empty()) {
+          draining_ = false;
+          return;
+        }
+        task = std::move(tasks_.front());
+        tasks_.pop_front();
+      }
+      task();
+    }
+  }
+
+  const std::string label_;
+  SXElasticPool& pool_;
+  std::mutex mutex_;
+  std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
+  bool draining_ = false;     // GUARDED_BY(mutex_)
+};
+
+class PoolConcurrentQueue final : public SXWorkQueue {
+ public:
+  PoolConcurrentQueue(std::string label, std::shared_ptr<SXElasticPool> pool)
+      : label_(std::move(label)), pool_(std::move(pool)) {}
+  void async(SXTask task) override { pool_->submit(std::move(task)); }
+  const std::string& label() const override { return label_; }
+
+ private:
+  const std::string label_;
+  std::shared_ptr<SXElasticPool> pool_;
+};
+
+}  // namespace
+
+SXElasticPool::SXElasticPool(std::string threadName, int niceness, size_t maxThreads)
+    : threadName_(std::move(threadName)), niceness_(niceness), maxThreads_(maxThreads) {}
+
+SXElasticPool::~SXElasticPool() {
+  std::vector<std::thread> threads;
+  {
+    std::lock_guard lock(mutex_);
+    stopping_ = true;
+    threads.swap(threads_);
+  }
+  wake_.notify_all();
+  for (auto& t : threads) {
+    if (t.get_id() == std::this_thread::get_id()) {
+      t.detach();
+    } else {
+      t.join();
+    }
+  }
+}
+
+void SXElasticPool::submit(SXTask task) {
+  std::lock_guard lock(mutex_);
+  if (stopping_) return;
+  tasks_.push_back(std::move(task));
+  if (idle_ >= tasks_.size()) {
+    wake_.notify_one();
+  } else if (threads_.size() < maxThreads_) {
+    threads_.emplace_back([this] { work(); });
+  }
+}
+
+void SXElasticPool::work() {
+  nameThisThread(threadName_);
+  if (niceness_ != 0) {
+    ::setpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)), niceness_);
+  }
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    ++idle_;
+    wake_.wait(lock, [this] { return stopping_ || !tasks_.empty(); });
+    --idle_;
+    if (tasks_.empty()) return;  // stopping, and nothing left to run
+    SXTask task = std::move(tasks_.front());
+    tasks_.pop_front();
+    lock.unlock();
+    task();
+    task = nullptr;  // release what the task captured before we sleep again
+    lock.lock();
+  }
+}
+
+SXAsioDispatch::SXAsioDispatch()
+    : utilityPool_("sxr-utility", 0, 256),
+      lowPriorityPool_(std::make_shared<SXElasticPool>("sxr-lowprio", 10, 2)),
+      timersWork_(asio::make_work_guard(timers_)) {
+  lowPriorityQueue_ =
+      std::make_shared<PoolConcurrentQueue>("com.vendra.sonex.lowpriority", lowPriorityPool_);
+  timerThread_ = std::thread([this] {
+    nameThisThread("sxr-timer");
+    timers_.run();
+  });
+}
+
+SXAsioDispatch::~SXAsioDispatch() {
+  timersWork_.reset();
+  timers_.stop();
+  timerThread_.join();
+}
+
+std::shared_ptr<SXWorkQueue> SXAsioDispatch::createSerialQueue(std::string label,
+                                                               SXQualityOfService qos) {
+  if (qos == SXQualityOfService::kUserInteractive) {
+    return std::make_shared<ThreadQueue>(std::move(label));
+  }
+  return std::make_shared<PoolSerialQueue>(std::move(label), utilityPool_);
+}
+
+std::shared_ptr<SXWorkQueue> SXAsioDispatch::lowPriorityConcurrentQueue() {
+  return lowPriorityQueue_;
+}
+
+void SXAsioDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQueue> queue,
+                           SXTask task) {
+  if (delay <= std::chrono::nanoseconds::zero()) {
+    queue->async(std::move(task));
+    return;
+  }
+  auto timer = std::make_shared<asio::steady_timer>(timers_, delay);
+  timer->async_wait([timer, queue = std::move(queue), task = std::move(task)](
+                        const std::error_code& ec) mutable {
+    if (!ec) queue->async(std::move(task));
+  });
+}

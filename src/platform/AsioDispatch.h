@@ -1,0 +1,62 @@
+// Production work queues.
+//
+// The server queue (user-interactive) is one thread of its own. Utility queues are serial
+// executors over a shared pool that adds a thread whenever a task waits and no worker is idle,
+// so a task blocked for seconds on one queue never holds up another. The low-priority
+// concurrent queue is a small pool whose threads run at nice 10. Delays are Asio timers on a
+// timer thread. Destruction stops every thread after the tasks already queued have run.
+#pragma once
+
+#include <asio/executor_work_guard.hpp>
+#include <asio/io_context.hpp>
+#include <condition_variable>
+#include <deque>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "platform/Dispatch.h"
+
+// A pool of threads that grows up to `maxThreads` while all of its workers are busy.
+class SXElasticPool {
+ public:
+  SXElasticPool(std::string threadName, int niceness, size_t maxThreads);
+  ~SXElasticPool();
+  SXElasticPool(const SXElasticPool&) = delete;
+  SXElasticPool& operator=(const SXElasticPool&) = delete;
+
+  void submit(SXTask task);
+
+ private:
+  void work();
+
+  const std::string threadName_;
+  const int niceness_;
+  const size_t maxThreads_;
+  std::mutex mutex_;
+  std::condition_variable wake_;
+  std::deque<SXTask> tasks_;          // GUARDED_BY(mutex_)
+  std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
+  size_t idle_ = 0;                   // GUARDED_BY(mutex_)
+  bool stopping_ = false;             // GUARDED_BY(mutex_)
+};
+
+class SXAsioDispatch final : public SXDispatch {
+ public:
+  SXAsioDispatch();
+  ~SXAsioDispatch() override;
+
+  std::shared_ptr<SXWorkQueue> createSerialQueue(std::string label,
+                                                 SXQualityOfService qos) override;
+  std::shared_ptr<SXWorkQueue> lowPriorityConcurrentQueue() override;
+  void after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQueue> queue,
+             SXTask task) override;
+
+ private:
+  SXElasticPool utilityPool_;
+  std::shared_ptr<SXWorkQueue> lowPriorityQueue_;
+  std::shared_ptr<SXElasticPool> lowPriorityPool_;
+  asio::io_context timers_;
+  asio::executor_work_guard<asio::io_context::executor_type> timersWork_;
+  std::thread timerThread_;
+};

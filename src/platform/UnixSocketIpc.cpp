@@ -1,0 +1,255 @@
+#include "platform/UnixSocketIpc.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <asio/post.hpp>
+#include <asio/write.hpp>
+#include <cstdlib>
+
+#include "platform/FileSystem.h"
+
+// One client connection. Lives while the I/O thread has an operation pending on it.
+class SXUnixSocketConnection final : public SXIpcConnection,
+                                     public std::enable_shared_from_this<SXUnixSocketConnection> {
+ public:
+  SXUnixSocketConnection(asio::local::stream_protocol::socket socket, RpcLimits limits,
+                         SXUnixSocketListener& listener, std::shared_ptr<SXLogFacility> log)
+      : socket_(std::move(socket)), decoder_(limits), listener_(listener), log_(std::move(log)) {
+    struct ucred cred{};
+    socklen_t len = sizeof cred;
+    if (::getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &cred, &len) == 0) {
+      pid_ = cred.pid;
+    }
+    fd_ = socket_.native_handle();
+  }
+
+  int32_t processIdentifier() const override { return pid_; }
+  std::string description() const override {
+    return "<connection pid=" + std::to_string(pid_) + " fd=" + std::to_string(fd_) + ">";
+  }
+  void setExportedObject(std::shared_ptr<SXIpcExportedObject> object) override {
+    exported_ = std::move(object);
+  }
+  void setInterruptionHandler(std::function<void()> handler) override {
+    interruption_ = std::move(handler);
+  }
+  void setInvalidationHandler(std::function<void()> handler) override {
+    invalidation_ = std::move(handler);
+  }
+  void resume() override { read(); }
+
+  // Any thread.
+  void send(uint32_t msgid, const SXValue& error, const SXValue& result) {
+    msgpack::sbuffer encoded;
+    RpcEncodeResponse(encoded, msgid, error, result);
+    bool startWriting = false;
+    {
+      std::lock_guard lock(outMutex_);
+      if (closed_) return;
+      outPending_.append(encoded.data(), encoded.size());
+      startWriting = !writing_;
+      writing_ = true;
+    }
+    if (startWriting) {
+      asio::post(socket_.get_executor(), [self = shared_from_this()] { self->write(); });
+    }
+  }
+
+  // I/O thread: ends the connection; `interrupted` when it ended badly.
+  void end(bool interrupted) {
+    if (ended_) return;
+    ended_ = true;
+    {
+      std::lock_guard lock(outMutex_);
+      closed_ = true;
+    }
+    std::error_code ignored;
+    socket_.shutdown(asio::socket_base::shutdown_both, ignored);
+    socket_.close(ignored);
+    if (interrupted && interruption_) std::exchange(interruption_, nullptr)();
+    if (invalidation_) std::exchange(invalidation_, nullptr)();
+    exported_.reset();
+    listener_.connectionClosed(shared_from_this());
+  }
+
+ private:
+  void read() {
+    char* buffer = decoder_.prepare(kReadSize);
+    socket_.async_read_some(
+        asio::buffer(buffer, kReadSize),
+        [self = shared_from_this()](const std::error_code& ec, size_t n) {
+          if (ec) {
+            self->end(ec != asio::error::eof);
+            return;
+          }
+          self->decoder_.commit(n);
+          if (self->dispatchMessages()) self->read();
+        });
+  }
+
+  // Hands every whole message to the exported object. Returns false when the stream broke.
+  bool dispatchMessages() {
+    SXValue message;
+    for (;;) {
+      if (ended_) return false;
+      switch (decoder_.next(message)) {
+        case RpcStreamDecoder::Status::kNeedMore:
+          return true;
+        case RpcStreamDecoder::Status::kBroken:
+          SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(),
+                decoder_.error());
+          end(true);
+          return false;
+        case RpcStreamDecoder::Status::kMessage:
+          if (!dispatch(message)) {
+            end(true);
+            return false;
+          }
+          break;
+      }
+    }
+  }
+
+  bool dispatch(const SXValue& message) {
+    std::string why;
+    std::optional<uint32_t> msgid;
+    auto request = RpcParseRequest(message, why, msgid);
+    if (!request) {
+      if (!msgid) {
+        SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(), why);
+        return false;
+      }
+      send(*msgid, why, nullptr);
+      return true;
+    }
+    if (!exported_) {
+      send(request->msgid, "no object is exported on this connection", nullptr);
+      return true;
+    }
+    std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
+    uint32_t id = request->msgid;
+    exported_->handleRequest(request->method, request->params,
+                             [weak, id](const SXValue& error, const SXValue& result) {
+                               if (auto self = weak.lock()) self->send(id, error, result);
+                             });
+    return true;
+  }
+
+  void write() {
+    {
+      std::lock_guard lock(outMutex_);
+      if (closed_ || outPending_.empty()) {
+        writing_ = false;
+        return;
+      }
+      outFlight_.swap(outPending_);
+    }
+    asio::async_write(socket_, asio::buffer(outFlight_),
+                      [self = shared_from_this()](const std::error_code& ec, size_t) {
+                        self->outFlight_.clear();
+                        if (ec) {
+                          self->end(true);
+                          return;
+                        }
+                        self->write();
+                      });
+  }
+
+  static constexpr size_t kReadSize = 64 * 1024;
+
+  asio::local::stream_protocol::socket socket_;
+  RpcStreamDecoder decoder_;  // I/O thread only
+  SXUnixSocketListener& listener_;
+  std::shared_ptr<SXLogFacility> log_;
+  int32_t pid_ = 0;
+  int fd_ = -1;
+  std::shared_ptr<SXIpcExportedObject> exported_;  // I/O thread only
+  std::function<void()> interruption_;             // I/O thread only
+  std::function<void()> invalidation_;             // I/O thread only
+  bool ended_ = false;                             // I/O thread only
+  std::mutex outMutex_;
+  std::string outPending_;  // GUARDED_BY(outMutex_)
+  bool writing_ = false;    // GUARDED_BY(outMutex_)
+  bool closed_ = false;     // GUARDED_BY(outMutex_)
+  std::string outFlight_;   // I/O thread only, while a write is in flight
+};
+
+SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLogFacility> log)
+    : options_(std::move(options)), log_(std::move(log)), acceptor_(io_) {}
+
+SXUnixSocketListener::~SXUnixSocketListener() = default;
+
+bool SXUnixSocketListener::open(std::string& error) {
+  std::error_code ec;
+  const char* listenPid = std::getenv("LISTEN_PID");
+  const char* listenFds = std::getenv("LISTEN_FDS");
+  if (listenPid && listenFds && std::atoi(listenPid) == ::getpid() && std::atoi(listenFds) >= 1) {
+    acceptor_.assign(asio::local::stream_protocol(), 3, ec);
+    if (ec) {
+      error = "cannot adopt the socket passed as fd 3: " + ec.message();
+      return false;
+    }
+    activated_ = true;
+    ::unsetenv("LISTEN_PID");
+    ::unsetenv("LISTEN_FDS");
+    return true;
+  }
+  ::unlink(options_.socketPath.c_str());  // a stale socket of an earlier run
+  asio::local::stream_protocol::endpoint endpoint(options_.socketPath);
+  acceptor_.open(endpoint.protocol(), ec);
+  if (!ec) acceptor_.bind(endpoint, ec);
+  if (!ec) acceptor_.listen(asio::socket_base::max_listen_connections, ec);
+  if (ec) {
+    error = options_.socketPath + ": " + ec.message();
+    return false;
+  }
+  if (::chmod(options_.socketPath.c_str(), static_cast<mode_t>(options_.socketMode)) != 0) {
+    error = SXPosixError(options_.socketPath, errno);
+    return false;
+  }
+  return true;
+}
+
+void SXUnixSocketListener::setDelegate(std::shared_ptr<SXIpcListenerDelegate> delegate) {
+  delegate_ = std::move(delegate);
+}
+
+void SXUnixSocketListener::resume() {
+  accept();
+  io_.run();
+}
+
+void SXUnixSocketListener::stop() {
+  asio::post(io_, [this] {
+    std::error_code ignored;
+    acceptor_.close(ignored);
+    auto live = connections_;
+    for (const auto& connection : live) connection->end(false);
+    io_.stop();
+  });
+}
+
+void SXUnixSocketListener::connectionClosed(
+    const std::shared_ptr<SXUnixSocketConnection>& connection) {
+  connections_.erase(connection);
+}
+
+void SXUnixSocketListener::accept() {
+  acceptor_.async_accept([this](const std::error_code& ec,
+                                asio::local::stream_protocol::socket socket) {
+    if (ec == asio::error::operation_aborted || !acceptor_.is_open()) return;
+    if (!ec) {
+      auto connection =
+          std::make_shared<SXUnixSocketConnection>(std::move(socket), options_.limits, *this, log_);
+      connections_.insert(connection);
+      if (!delegate_ || !delegate_->shouldAcceptNewConnection(connection)) {
+        connection->end(false);
+      }
+    } else if (ec == asio::error::no_descriptors || ec == asio::error::no_buffer_space) {
+      SXLOG(*log_, nullptr, SXLogLevel::kError, "accept: %@", ec.message());
+    }
+    accept();
+  });
+}

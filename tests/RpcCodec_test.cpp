@@ -1,0 +1,120 @@
+#include "common/RpcCodec.h"
+
+#include <gtest/gtest.h>
+
+#include "common/MsgpackValue.h"
+#include "common/SXFormat.h"
+#include "common/SXValueText.h"
+
+namespace {
+
+std::string encodeRequest(uint32_t id, const std::string& method, const SXValue& params) {
+  msgpack::sbuffer buffer;
+  RpcEncodeRequest(buffer, id, method, params);
+  return std::string(buffer.data(), buffer.size());
+}
+
+void feed(RpcStreamDecoder& decoder, const std::string& bytes) {
+  char* dst = decoder.prepare(bytes.size());
+  std::memcpy(dst, bytes.data(), bytes.size());
+  decoder.commit(bytes.size());
+}
+
+SXValue nested(int depth) {
+  SXValue v = 1;
+  for (int i = 0; i < depth; ++i) v = SXValue{{"k", v}};
+  return v;
+}
+
+}  // namespace
+
+TEST(RpcStreamDecoder, MessagesSurviveAnyChunkBoundary) {
+  SXValue params = {SXValue{{"a b", 1.5}, {"bin", SXValue::binary({1, 2, 3})}}, 3, 1, nullptr};
+  std::string bytes = encodeRequest(7, "m", params) + encodeRequest(8, "n", SXValue::array());
+  for (size_t chunk = 1; chunk <= bytes.size(); ++chunk) {
+    RpcStreamDecoder decoder;
+    std::vector<SXValue> got;
+    for (size_t off = 0; off < bytes.size(); off += chunk) {
+      feed(decoder, bytes.substr(off, chunk));
+      SXValue message;
+      while (decoder.next(message) == RpcStreamDecoder::Status::kMessage) got.push_back(message);
+    }
+    ASSERT_EQ(got.size(), 2u) << "chunk " << chunk;
+    std::string why;
+    std::optional<uint32_t> id;
+    auto request = RpcParseRequest(got[0], why, id);
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->msgid, 7u);
+    EXPECT_EQ(request->params, params);
+  }
+}
+
+TEST(RpcStreamDecoder, BreaksOnGarbageOversizeAndDeepNesting) {
+  RpcStreamDecoder garbage;
+  feed(garbage, std::string("\xc1\xc1\xc1", 3));  // 0xc1 is never used by MessagePack
+  SXValue message;
+  EXPECT_EQ(garbage.next(message), RpcStreamDecoder::Status::kBroken);
+
+  RpcLimits limits;
+  limits.maxMessageBytes = 1024;
+  RpcStreamDecoder big(limits);
+  feed(big, encodeRequest(1, "m", SXValue::array({std::string(2000, 'x')})).substr(0, 1500));
+  EXPECT_EQ(big.next(message), RpcStreamDecoder::Status::kBroken);
+
+  RpcStreamDecoder ok;
+  feed(ok, encodeRequest(1, "m", SXValue::array({nested(32)})));
+  EXPECT_EQ(ok.next(message), RpcStreamDecoder::Status::kMessage);
+  RpcStreamDecoder deep;
+  feed(deep, encodeRequest(1, "m", SXValue::array({nested(33)})));
+  EXPECT_EQ(deep.next(message), RpcStreamDecoder::Status::kBroken);
+}
+
+TEST(RpcStreamDecoder, HugeDeclaredContainerIsRefusedNotAllocated) {
+  RpcStreamDecoder decoder;
+  feed(decoder, std::string("\x94\x00\x01\xa1m\xdd\xff\xff\xff\xff", 10));  // array32 of 4G
+  SXValue message;
+  EXPECT_EQ(decoder.next(message), RpcStreamDecoder::Status::kBroken);
+}
+
+TEST(RpcParseRequest, SaysWhatIsWrong) {
+  std::string why;
+  std::optional<uint32_t> id;
+  EXPECT_FALSE(RpcParseRequest(SXValue{1, 2}, why, id));
+  EXPECT_FALSE(id);
+  EXPECT_FALSE(RpcParseRequest(SXValue{0, 5, 3, SXValue::array()}, why, id));
+  EXPECT_EQ(id, 5u);
+  EXPECT_EQ(why, "method is not a string");
+  EXPECT_FALSE(RpcParseRequest(SXValue{0, 5, "m", 1}, why, id));
+  EXPECT_EQ(why, "params is not an array");
+}
+
+TEST(MsgpackValue, NonStringKeysAreRefused) {
+  msgpack::sbuffer buffer;
+  msgpack::packer<msgpack::sbuffer> p(buffer);
+  p.pack_map(1);
+  p.pack_int(1);
+  p.pack_int(2);
+  auto handle = msgpack::unpack(buffer.data(), buffer.size());
+  EXPECT_THROW(SXValueFromMsgpack(handle.get()), SXValueConversionError);
+}
+
+TEST(SXValueText, EveryKind) {
+  EXPECT_EQ(SXValueText(SXValue("a b")), "a b");
+  EXPECT_EQ(SXValueText(SXValue(-3)), "-3");
+  EXPECT_EQ(SXValueText(SXValue(1.235)), "1.235");
+  EXPECT_EQ(SXValueText(SXValue(12.0)), "12");
+  EXPECT_EQ(SXValueText(SXValue(true)), "1");
+  EXPECT_EQ(SXValueText(SXValue()), "(null)");
+  EXPECT_EQ(SXValueText(SXValue{{"b", 1}, {"a", "x"}}), R"({"a":"x","b":1})");
+  EXPECT_EQ(SXValueText(SXValue("\xff")), "\xff");
+  EXPECT_NO_THROW(SXValueText(SXValue{{"k", "\xff"}}));
+}
+
+TEST(SXFormat, PrintfConversionsAndValues) {
+  EXPECT_EQ(SXFormat("%lli|%i|%lu|%d", int64_t{-5}, uint16_t{65535}, uint64_t{7}, -1),
+            "-5|65535|7|-1");
+  EXPECT_EQ(SXFormat("%@ %@ %@", std::string("s"), SXValue{1, 2}, nullptr), "s [1,2] (null)");
+  EXPECT_EQ(SXFormat("time=%@ max=%f", 1.5, 5.0), "time=1.5 max=5.000000");
+  EXPECT_EQ(SXFormat("100%% %s", "done"), "100% done");
+  EXPECT_EQ(SXFormat("%i : %i", static_cast<int32_t>(0xFFFFFFFFu)), "-1 : (null)");
+}

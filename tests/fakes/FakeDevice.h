@@ -1,0 +1,98 @@
+// Doubles of the small platform facilities: device properties, process information, the file
+// system and the orientation service.
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <set>
+#include <vector>
+
+#include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
+#include "platform/Orientation.h"
+#include "platform/ProcessInfo.h"
+
+class FakeDeviceProperties final : public SXDeviceProperties {
+ public:
+  explicit FakeDeviceProperties(SXValue properties = SXValue::object())
+      : properties_(std::move(properties)) {}
+  std::optional<SXValue> property(const std::string& key) const override {
+    std::lock_guard lock(mutex_);
+    queries_[key]++;
+    auto it = properties_.find(key);
+    if (it == properties_.end()) return std::nullopt;
+    return *it;
+  }
+  int queries(const std::string& key) const {
+    std::lock_guard lock(mutex_);
+    return queries_[key];
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  SXValue properties_;
+  mutable std::map<std::string, int> queries_;
+};
+
+class FakeProcessInfo final : public SXProcessInfo {
+ public:
+  int32_t processIdentifier() const override { return 4242; }
+  std::string processName() const override { return "sxreportingd"; }
+  std::optional<std::string> commandName(int32_t pid) const override {
+    auto it = names.find(pid);
+    if (pid < 1 || it == names.end()) return std::nullopt;
+    return it->second;
+  }
+  void exitProcess(int status) override { exitStatus = status; }
+
+  std::map<int32_t, std::string> names;
+  std::optional<int> exitStatus;
+};
+
+// Files in memory; `failDirectories` / `failWrites` make the operations fail.
+class FakeFileSystem final : public SXFileSystem {
+ public:
+  std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override {
+    std::lock_guard lock(mutex_);
+    if (failDirectories) return "mkdir " + path + ": Permission denied";
+    directories[path] = mode;
+    return std::nullopt;
+  }
+  std::optional<std::string> writeFileAtomically(const std::string& path,
+                                                 const std::string& contents) override {
+    std::lock_guard lock(mutex_);
+    if (failWrites) return "open " + path + ": Permission denied";
+    files[path] = contents;
+    return std::nullopt;
+  }
+
+  std::mutex mutex_;
+  bool failDirectories = false;
+  bool failWrites = false;
+  std::map<std::string, unsigned> directories;
+  std::map<std::string, std::string> files;
+};
+
+// Holds registrations; a test fires callbacks from any thread.
+class FakeOrientationService final : public SXOrientationService {
+ public:
+  void registerDeviceOrientationCallback(const std::string& id, SXOrientationCallback cb) override;
+  void registerInterfaceOrientationCallback(const std::string& id,
+                                            SXOrientationCallback cb) override;
+  void unregisterDeviceOrientationCallback(const std::string& id) override;
+  void unregisterInterfaceOrientationCallback(const std::string& id) override;
+  std::string orientationName(int32_t orientation) const override {
+    return "orientation" + std::to_string(orientation);
+  }
+
+  // Calls the registered callback, if any; returns whether one was registered.
+  bool fireDevice(const std::string& id, int32_t orientation);
+  bool fireInterface(const std::string& id, int32_t orientation);
+  std::vector<std::string> calls() const;  // "registerDevice <id>", ...
+
+ private:
+  mutable std::mutex mutex_;
+  std::map<std::string, SXOrientationCallback> device_;     // GUARDED_BY(mutex_)
+  std::map<std::string, SXOrientationCallback> interface_;  // GUARDED_BY(mutex_)
+  std::vector<std::string> calls_;                          // GUARDED_BY(mutex_)
+};
