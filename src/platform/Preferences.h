@@ -19,8 +19,9 @@ class SXPreferences {
                                               const std::optional<SXValue>& value) = 0;
 };
 
-// A stored value read as a string: strings as they are, numbers in decimal, booleans as
-// "1"/"0"; nothing for other kinds.
+// A stored value read as a string: strings as they are, numbers in decimal (floating values in
+// the shortest form that reads back exactly); nothing for booleans, null, arrays and
+// dictionaries.
 std::optional<std::string> SXPreferencesValueAsString(const SXValue& value);
 // A stored value read as a boolean: booleans; numbers (non-zero is true); the strings
 // "YES"/"true"/"1" and "NO"/"false"/"0" in any case. Anything else reads as false.

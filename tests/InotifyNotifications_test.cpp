@@ -1,0 +1,240 @@
+#include "platform/InotifyNotifications.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <thread>
+#include <vector>
+
+#include "fakes/FakeDispatch.h"
+#include "fakes/FakeLog.h"
+#include "fakes/FakeNotifications.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+namespace {
+
+constexpr const char* kName = "com.vendra.sonex.reporting";
+constexpr auto kDeadline = 30s;
+
+// Handlers that record each delivery: which registration, which token, on which queue.
+class Deliveries {
+ public:
+  struct Delivery {
+    std::string tag;
+    int token;
+    bool onQueue;
+  };
+
+  SXNotifyHandler handler(std::shared_ptr<FakeWorkQueue> queue, std::string tag) {
+    return [this, queue, tag](int token) {
+      std::lock_guard lock(mutex_);
+      delivered_.push_back({tag, token, queue->isCurrent()});
+      changed_.notify_all();
+    };
+  }
+  bool waitFor(size_t count) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, kDeadline, [&] { return delivered_.size() >= count; });
+  }
+  std::vector<Delivery> all() const {
+    std::lock_guard lock(mutex_);
+    return delivered_;
+  }
+  size_t count() const { return all().size(); }
+
+ private:
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<Delivery> delivered_;  // guarded by mutex_
+};
+
+class InotifyNotificationsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/sxnotify-XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern), nullptr);
+    runtimeDir_ = pattern;
+  }
+  void TearDown() override { fs::remove_all(runtimeDir_); }
+
+  std::unique_ptr<SXInotifyNotifications> open() {
+    return std::make_unique<SXInotifyNotifications>(runtimeDir_, log_);
+  }
+  int subscribe(SXNotifications& notify, const std::string& name,
+                const std::shared_ptr<FakeWorkQueue>& queue, const std::string& tag) {
+    int token = 0;
+    EXPECT_EQ(notify.registerDispatch(name, token, queue, deliveries_.handler(queue, tag)), 0);
+    return token;
+  }
+  std::string notifyFile(const std::string& name) const {
+    return runtimeDir_ + "/notify/" + name;
+  }
+
+  std::string runtimeDir_;
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+  Deliveries deliveries_;  // outlives the queues below, which run its handlers
+  std::shared_ptr<FakeWorkQueue> queue1_ = std::make_shared<FakeWorkQueue>("q1");
+  std::shared_ptr<FakeWorkQueue> queue2_ = std::make_shared<FakeWorkQueue>("q2");
+};
+
+TEST_F(InotifyNotificationsTest, PostReachesEachRegistrationOfTheNameOnItsQueue) {
+  auto notify = open();
+  int token1 = subscribe(*notify, kName, queue1_, "first");
+  int token2 = subscribe(*notify, kName, queue2_, "second");
+  int other = subscribe(*notify, "other", queue1_, "other");
+  EXPECT_EQ(std::set<int>({token1, token2, other}).size(), 3u);
+
+  // Events are read in order, so once `kName` is delivered the earlier post has been seen.
+  EXPECT_EQ(notify->post("nobody.listens"), 0);
+  EXPECT_EQ(notify->post(kName), 0);
+  ASSERT_TRUE(deliveries_.waitFor(2));
+  ASSERT_TRUE(queue1_->drain());
+  ASSERT_TRUE(queue2_->drain());
+
+  auto all = deliveries_.all();
+  ASSERT_EQ(all.size(), 2u);
+  for (const auto& delivery : all) {
+    EXPECT_TRUE(delivery.onQueue) << delivery.tag;
+    EXPECT_EQ(delivery.token, delivery.tag == "first" ? token1 : token2) << delivery.tag;
+  }
+  EXPECT_NE(all[0].tag, all[1].tag);
+}
+
+TEST_F(InotifyNotificationsTest, OtherWaysOfChangingTheFileCountAsPosts) {
+  auto notify = open();
+  subscribe(*notify, kName, queue1_, "name");
+  std::ofstream(notifyFile(kName)) << "written by a shell";  // IN_CLOSE_WRITE
+  ASSERT_TRUE(deliveries_.waitFor(1));
+  ASSERT_EQ(::utimensat(AT_FDCWD, notifyFile(kName).c_str(), nullptr, 0), 0);  // IN_ATTRIB
+  ASSERT_TRUE(deliveries_.waitFor(2));
+  std::ofstream(runtimeDir_ + "/staged") << "";
+  fs::rename(runtimeDir_ + "/staged", notifyFile(kName));  // IN_MOVED_TO
+  ASSERT_TRUE(deliveries_.waitFor(3));
+}
+
+TEST_F(InotifyNotificationsTest, PostsReachRegistrationsOfOtherInstances) {
+  // Two instances watch the directory the way two processes would.
+  auto daemon = open();
+  auto tool = open();
+  subscribe(*daemon, kName, queue1_, "daemon");
+  subscribe(*tool, kName, queue2_, "tool");
+  EXPECT_EQ(tool->post(kName), 0);
+  ASSERT_TRUE(deliveries_.waitFor(2));
+  EXPECT_EQ(daemon->post(kName), 0);
+  ASSERT_TRUE(deliveries_.waitFor(4));
+  std::multiset<std::string> tags;
+  for (const auto& delivery : deliveries_.all()) tags.insert(delivery.tag);
+  EXPECT_EQ(tags, std::multiset<std::string>({"daemon", "daemon", "tool", "tool"}));
+}
+
+TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArguments) {
+  auto notify = open();
+  int token = -7;
+  for (std::string name : {std::string(""), std::string("."), std::string(".."),
+                           std::string("a/b"), std::string("/"), std::string("a\0b", 3),
+                           std::string(300, 'x')}) {
+    EXPECT_NE(notify->post(name), 0) << name;
+    EXPECT_NE(notify->registerDispatch(name, token, queue1_, [](int) {}), 0) << name;
+  }
+  EXPECT_NE(notify->registerDispatch(kName, token, nullptr, [](int) {}), 0);
+  EXPECT_NE(notify->registerDispatch(kName, token, queue1_, nullptr), 0);
+  EXPECT_EQ(token, -7);
+  EXPECT_FALSE(fs::exists(runtimeDir_ + "/b"));
+}
+
+TEST_F(InotifyNotificationsTest, FailedSetUpIsReportedNotThrown) {
+  std::ofstream(runtimeDir_ + "/file") << "";
+  SXInotifyNotifications notify(runtimeDir_ + "/file", log_);
+  int token = 0;
+  EXPECT_NE(notify.registerDispatch(kName, token, queue1_, [](int) {}), 0);
+  EXPECT_NE(notify.post(kName), 0);
+  EXPECT_FALSE(log_->lines().empty());
+}
+
+TEST_F(InotifyNotificationsTest, DestructionWithEventsPendingIsClean) {
+  // Hold the queue so deliveries pile up behind a task, then destroy the adapter while the
+  // kernel still has unread events for it.
+  std::promise<void> release;
+  queue1_->async([wait = release.get_future().share()] { wait.wait(); });
+  auto poster = open();
+  {
+    auto notify = open();
+    subscribe(*notify, kName, queue1_, "pending");
+    for (int i = 0; i < 50; ++i) ASSERT_EQ(poster->post(kName), 0);
+  }
+  release.set_value();
+  ASSERT_TRUE(queue1_->drain());
+  size_t delivered = deliveries_.count();
+  // Nothing is queued once the adapter is gone.
+  ASSERT_EQ(poster->post(kName), 0);
+  subscribe(*poster, "sentinel", queue1_, "sentinel");
+  ASSERT_EQ(poster->post("sentinel"), 0);
+  ASSERT_TRUE(deliveries_.waitFor(delivered + 1));
+  ASSERT_TRUE(queue1_->drain());
+  EXPECT_EQ(deliveries_.count(), delivered + 1);
+}
+
+TEST_F(InotifyNotificationsTest, RemovedDirectoryIsWatchedAgain) {
+  auto notify = open();
+  subscribe(*notify, kName, queue1_, "name");
+  ASSERT_EQ(notify->post(kName), 0);
+  ASSERT_TRUE(deliveries_.waitFor(1));
+  fs::remove_all(runtimeDir_ + "/notify");
+  // A post may land before the watcher recreates its watch; keep posting until one arrives.
+  auto deadline = std::chrono::steady_clock::now() + kDeadline;
+  while (deliveries_.count() < 2 && std::chrono::steady_clock::now() < deadline) {
+    ASSERT_EQ(notify->post(kName), 0);
+    std::this_thread::sleep_for(20ms);
+  }
+  EXPECT_GE(deliveries_.count(), 2u);
+  EXPECT_TRUE(log_->contains("watched again"));
+}
+
+TEST_F(InotifyNotificationsTest, ThrowingHandlerIsLoggedAndDeliveryGoesOn) {
+  auto notify = open();
+  int token = 0;
+  ASSERT_EQ(notify->registerDispatch("boom", token, queue1_,
+                                     [](int) { throw std::runtime_error("handler failed"); }),
+            0);
+  subscribe(*notify, kName, queue1_, "after");
+  ASSERT_EQ(notify->post("boom"), 0);
+  auto deadline = std::chrono::steady_clock::now() + kDeadline;
+  while (!log_->contains("threw") && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_TRUE(log_->contains("threw"));
+  ASSERT_EQ(notify->post(kName), 0);
+  EXPECT_TRUE(deliveries_.waitFor(1));
+}
+
+TEST_F(InotifyNotificationsTest, FakeDeliversLikeTheAdapter) {
+  FakeNotifications notify;
+  int token = subscribe(notify, kName, queue1_, "fake");
+  EXPECT_EQ(notify.post("nobody.listens"), 0);
+  EXPECT_EQ(notify.post(kName), 0);
+  ASSERT_TRUE(deliveries_.waitFor(1));
+  ASSERT_TRUE(queue1_->drain());
+  auto all = deliveries_.all();
+  ASSERT_EQ(all.size(), 1u);
+  EXPECT_EQ(all[0].token, token);
+  EXPECT_TRUE(all[0].onQueue);
+  EXPECT_NE(notify.post("a/b"), 0);
+  notify.failRegistrations(5);
+  int ignored = 0;
+  EXPECT_EQ(notify.registerDispatch(kName, ignored, queue1_, [](int) {}), 5);
+  EXPECT_EQ(notify.registrationCount(kName), 1u);
+}
+
+}  // namespace

@@ -1,0 +1,229 @@
+#include "platform/JsonPreferences.h"
+
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "fakes/FakeLog.h"
+#include "fakes/FakePreferences.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr const char* kDomain = "com.vendra.sonex";
+
+class JsonPreferencesTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/sxprefs-XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern), nullptr);
+    root_ = pattern;
+    configDir_ = root_ + "/config";  // absent until the first write
+  }
+  void TearDown() override { fs::remove_all(root_); }
+
+  std::unique_ptr<SXJsonPreferences> open() {
+    return std::make_unique<SXJsonPreferences>(configDir_, log_);
+  }
+  std::string domainFile(const std::string& domain = kDomain) const {
+    return configDir_ + "/preferences/" + domain + ".json";
+  }
+  void writeFile(const std::string& path, const std::string& text) {
+    fs::create_directories(fs::path(path).parent_path());
+    std::ofstream(path) << text;
+  }
+  size_t errorLines() const {
+    size_t n = 0;
+    for (const auto& line : log_->lines()) n += line.level == SXLogLevel::kError;
+    return n;
+  }
+
+  std::string root_;
+  std::string configDir_;
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+};
+
+TEST(PreferencesValueTest, ReadsAsString) {
+  EXPECT_EQ(SXPreferencesValueAsString("iPod"), "iPod");
+  EXPECT_EQ(SXPreferencesValueAsString(""), "");
+  EXPECT_EQ(SXPreferencesValueAsString(-42), "-42");
+  EXPECT_EQ(SXPreferencesValueAsString(18446744073709551615u), "18446744073709551615");
+  EXPECT_EQ(SXPreferencesValueAsString(0.1), "0.1");
+  // Only text and numbers name something; a switch or a structure does not.
+  EXPECT_EQ(SXPreferencesValueAsString(true), std::nullopt);
+  EXPECT_EQ(SXPreferencesValueAsString(false), std::nullopt);
+  EXPECT_EQ(SXPreferencesValueAsString(nullptr), std::nullopt);
+  EXPECT_EQ(SXPreferencesValueAsString(SXValue::array({"a"})), std::nullopt);
+  EXPECT_EQ(SXPreferencesValueAsString(SXValue::object()), std::nullopt);
+}
+
+TEST(PreferencesValueTest, ReadsAsBool) {
+  for (SXValue yes : {SXValue(true), SXValue(1), SXValue(-1), SXValue(7u), SXValue(0.5),
+                      SXValue("YES"), SXValue("yes"), SXValue("True"), SXValue("TRUE"),
+                      SXValue("1")}) {
+    EXPECT_TRUE(SXPreferencesValueAsBool(yes)) << yes.dump();
+  }
+  for (SXValue no : {SXValue(false), SXValue(0), SXValue(0u), SXValue(0.0), SXValue("NO"),
+                     SXValue("false"), SXValue("0"), SXValue("Y"), SXValue(" YES"),
+                     SXValue("yess"), SXValue("2"), SXValue(""), SXValue(nullptr),
+                     SXValue::array({true}), SXValue::object({{"a", true}})}) {
+    EXPECT_FALSE(SXPreferencesValueAsBool(no)) << no.dump();
+  }
+  EXPECT_FALSE(SXPreferencesValueAsBool(std::string("YES\0", 4)));
+}
+
+TEST_F(JsonPreferencesTest, WritesCreateDirectoriesAndReadBack) {
+  auto prefs = open();
+  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), std::nullopt);
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue::object());
+  EXPECT_FALSE(fs::exists(configDir_));  // reading creates nothing
+
+  ASSERT_EQ(prefs->setValue(kDomain, "device_name", SXValue("Kitchen")), std::nullopt);
+  ASSERT_EQ(prefs->setValue(kDomain, "disable_reporting", SXValue(true)), std::nullopt);
+  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), SXValue("Kitchen"));
+  EXPECT_EQ(prefs->copyDomain(kDomain),
+            SXValue({{"device_name", "Kitchen"}, {"disable_reporting", true}}));
+  EXPECT_EQ(SXValue::parse(std::ifstream(domainFile())),
+            SXValue({{"device_name", "Kitchen"}, {"disable_reporting", true}}));
+
+  ASSERT_EQ(prefs->setValue(kDomain, "device_name", std::nullopt), std::nullopt);
+  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), std::nullopt);
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"disable_reporting", true}}));
+
+  // Removing from a domain that has no file leaves no file behind.
+  ASSERT_EQ(prefs->setValue("other", "key", std::nullopt), std::nullopt);
+  EXPECT_FALSE(fs::exists(domainFile("other")));
+  EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST_F(JsonPreferencesTest, ReadsChangesOfOtherProcessesAtOnce) {
+  auto prefs = open();
+  ASSERT_EQ(prefs->setValue(kDomain, "disable_reporting", SXValue(false)), std::nullopt);
+  writeFile(domainFile(), R"({"disable_reporting": "YES", "device_name": 12})");
+  EXPECT_EQ(prefs->copyValue(kDomain, "disable_reporting"), SXValue("YES"));
+  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), SXValue(12));
+  fs::remove(domainFile());
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue::object());
+}
+
+TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {
+  auto prefs = open();
+  for (const char* text : {"not json", "[1, 2]", "\"text\"", "", "{\"a\": 1"}) {
+    writeFile(domainFile(), text);
+    size_t before = errorLines();
+    EXPECT_EQ(prefs->copyDomain(kDomain), SXValue::object()) << text;
+    EXPECT_EQ(errorLines(), before + 1) << text;
+    EXPECT_EQ(prefs->copyValue(kDomain, "a"), std::nullopt) << text;
+    EXPECT_EQ(errorLines(), before + 2) << text;
+  }
+  for (const auto& line : log_->lines()) EXPECT_EQ(line.scope, "");  // the default log
+
+  // A write replaces the broken file with a well-formed one.
+  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(2)), std::nullopt);
+  size_t before = errorLines();
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", 2}}));
+  EXPECT_EQ(errorLines(), before);
+}
+
+TEST_F(JsonPreferencesTest, RefusesDomainsThatAreNotFileNames) {
+  auto prefs = open();
+  writeFile(configDir_ + "/secret.json", R"({"a": 1})");
+  for (std::string domain : {std::string(""), std::string("."), std::string(".."),
+                             std::string("../secret"), std::string("a/b"), std::string("/etc"),
+                             std::string("a\0b", 3)}) {
+    EXPECT_NE(prefs->setValue(domain, "a", SXValue(2)), std::nullopt) << domain;
+    EXPECT_EQ(prefs->copyValue(domain, "a"), std::nullopt) << domain;
+    EXPECT_EQ(prefs->copyDomain(domain), SXValue::object()) << domain;
+  }
+  EXPECT_EQ(SXValue::parse(std::ifstream(configDir_ + "/secret.json")), SXValue({{"a", 1}}));
+  EXPECT_FALSE(fs::exists(configDir_ + "/preferences/a"));
+}
+
+TEST_F(JsonPreferencesTest, FailedWriteLeavesFileAsItWas) {
+  auto prefs = open();
+  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(1)), std::nullopt);
+  EXPECT_NE(prefs->setValue(kDomain, "b", SXValue("\xff\xfe")), std::nullopt);
+  EXPECT_NE(prefs->setValue(kDomain, "b", SXValue(SXValue::value_t::discarded)), std::nullopt);
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", 1}}));
+
+  // An unwritable place for the store is an error, not a crash.
+  writeFile(root_ + "/file", "");
+  SXJsonPreferences blocked(root_ + "/file", log_);
+  EXPECT_NE(blocked.setValue(kDomain, "a", SXValue(1)), std::nullopt);
+}
+
+TEST_F(JsonPreferencesTest, ReplacingAKeyKeepsTheOthersAndLeavesNoTemporaries) {
+  auto prefs = open();
+  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(1)), std::nullopt);
+  ASSERT_EQ(prefs->setValue(kDomain, "b", SXValue::object({{"nested", {1, 2}}})), std::nullopt);
+  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue("one")), std::nullopt);
+  EXPECT_EQ(prefs->copyDomain(kDomain),
+            SXValue({{"a", "one"}, {"b", {{"nested", {1, 2}}}}}));
+  for (const auto& entry : fs::directory_iterator(configDir_ + "/preferences")) {
+    std::string name = entry.path().filename();
+    EXPECT_TRUE(name == std::string(kDomain) + ".json" ||
+                name == std::string(kDomain) + ".json.lock")
+        << name;
+  }
+}
+
+// Each writer adds keys of its own; a writer that read the file before another's rename and
+// wrote after it would drop the other's keys.
+void WriteKeys(SXPreferences& prefs, const std::string& prefix, int count) {
+  for (int i = 0; i < count; ++i) {
+    if (prefs.setValue(kDomain, prefix + std::to_string(i), SXValue(i))) return;
+  }
+}
+
+TEST_F(JsonPreferencesTest, ConcurrentWritersKeepEachOthersKeys) {
+  constexpr int kKeys = 40;
+  std::vector<pid_t> children;
+  for (const char* prefix : {"p", "q"}) {
+    pid_t pid = ::fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      SXJsonPreferences child(configDir_, std::make_shared<FakeLog>());
+      WriteKeys(child, prefix, kKeys);
+      ::_exit(0);
+    }
+    children.push_back(pid);
+  }
+  auto prefs = open();
+  std::vector<std::thread> threads;
+  for (const char* prefix : {"t", "u"}) {
+    threads.emplace_back([&, prefix] { WriteKeys(*prefs, prefix, kKeys); });
+  }
+  for (auto& thread : threads) thread.join();
+  for (pid_t pid : children) {
+    int status = 0;
+    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  SXValue domain = prefs->copyDomain(kDomain);
+  EXPECT_EQ(domain.size(), size_t(4 * kKeys));
+  for (const char* prefix : {"p", "q", "t", "u"}) {
+    for (int i = 0; i < kKeys; ++i) EXPECT_EQ(domain[prefix + std::to_string(i)], i);
+  }
+  EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST(FakePreferencesTest, BehavesLikeTheStore) {
+  FakePreferences prefs;
+  EXPECT_EQ(prefs.setValue(kDomain, "a", SXValue(1)), std::nullopt);
+  EXPECT_EQ(prefs.copyValue(kDomain, "a"), SXValue(1));
+  EXPECT_EQ(prefs.setValue(kDomain, "a", std::nullopt), std::nullopt);
+  EXPECT_EQ(prefs.copyDomain(kDomain), SXValue::object());
+  EXPECT_NE(prefs.setValue("a/b", "a", SXValue(1)), std::nullopt);
+  prefs.failWrites("disk full");
+  EXPECT_EQ(prefs.setValue(kDomain, "a", SXValue(1)), "disk full");
+  EXPECT_EQ(prefs.reads(), 2u);
+}
+
+}  // namespace

@@ -1,0 +1,50 @@
+#include "fakes/FakeNotifications.h"
+
+#include <cerrno>
+
+#include "platform/InotifyNotifications.h"
+
+int FakeNotifications::registerDispatch(const std::string& name, int& token,
+                                        std::shared_ptr<SXWorkQueue> queue,
+                                        SXNotifyHandler handler) {
+  if (int status = SXInotifyNotifications::checkName(name)) return status;
+  if (!queue || !handler) return EINVAL;
+  std::lock_guard lock(mutex_);
+  if (registerStatus_ != 0) return registerStatus_;
+  token = nextToken_++;
+  registrations_.emplace(name, Registration{token, std::move(queue), std::move(handler)});
+  return 0;
+}
+
+int FakeNotifications::post(const std::string& name) {
+  if (int status = SXInotifyNotifications::checkName(name)) return status;
+  std::vector<Registration> due;
+  {
+    std::lock_guard lock(mutex_);
+    posts_.push_back(name);
+    auto [first, last] = registrations_.equal_range(name);
+    for (auto it = first; it != last; ++it) due.push_back(it->second);
+  }
+  for (Registration& registration : due) {
+    registration.queue->async(
+        [handler = std::move(registration.handler), token = registration.token] {
+          handler(token);
+        });
+  }
+  return 0;
+}
+
+void FakeNotifications::failRegistrations(int status) {
+  std::lock_guard lock(mutex_);
+  registerStatus_ = status;
+}
+
+size_t FakeNotifications::registrationCount(const std::string& name) const {
+  std::lock_guard lock(mutex_);
+  return registrations_.count(name);
+}
+
+std::vector<std::string> FakeNotifications::posts() const {
+  std::lock_guard lock(mutex_);
+  return posts_;
+}

@@ -1,0 +1,37 @@
+// In-process named notifications: `post` hands each registration of the name its token on the
+// registration's queue at once. Names are checked as the production adapter checks them;
+// registrations fail with a chosen status on request.
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/Notify.h"
+
+class FakeNotifications final : public SXNotifications {
+ public:
+  int registerDispatch(const std::string& name, int& token, std::shared_ptr<SXWorkQueue> queue,
+                       SXNotifyHandler handler) override;
+  int post(const std::string& name) override;
+
+  // Every later registration fails with `status` (0: registrations succeed again).
+  void failRegistrations(int status);
+  size_t registrationCount(const std::string& name) const;
+  // The names posted successfully, in order.
+  std::vector<std::string> posts() const;
+
+ private:
+  struct Registration {
+    int token;
+    std::shared_ptr<SXWorkQueue> queue;
+    SXNotifyHandler handler;
+  };
+
+  mutable std::mutex mutex_;
+  std::multimap<std::string, Registration> registrations_;  // guarded by mutex_
+  std::vector<std::string> posts_;                          // guarded by mutex_
+  int registerStatus_ = 0;                                  // guarded by mutex_
+  int nextToken_ = 1;                                       // guarded by mutex_
+};
