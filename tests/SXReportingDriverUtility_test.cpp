@@ -40,7 +40,8 @@ class DriverUtilityTest : public ::testing::Test {
 
   std::vector<std::string> descriptions() {
     std::vector<std::string> out;
-    for (const auto& s : utility().ioChannelSubscriptions()) out.push_back(s->driver()->description());
+    for (const auto& s : utility().ioChannelSubscriptions())
+      out.push_back(s->driver()->description());
     return out;
   }
 
@@ -125,22 +126,22 @@ TEST_F(DriverUtilityTest, SnapshotIsKeyedByDriverDescription) {
 
   std::vector<std::string> keys;
   for (const auto& [key, value] : snapshot.items()) keys.push_back(key);
-  EXPECT_THAT(keys, ElementsAre("(null)-MCA", "Haptics-Stats", "Speaker-(null)",
-                                "VendraAE2MCA-(null)"));
-  EXPECT_THAT(linesIn(kSnapShotPrefix),
-              ElementsAre("info|sampling driver VendraAE2MCA-(null)",
-                          "info|sampling driver Speaker-(null)", "info|sampling driver (null)-MCA",
-                          "info|sampling driver Haptics-Stats"));
+  EXPECT_THAT(keys,
+              ElementsAre("(null)-MCA", "Haptics-Stats", "Speaker-(null)", "VendraAE2MCA-(null)"));
+  EXPECT_THAT(
+      linesIn(kSnapShotPrefix),
+      ElementsAre("info|sampling driver VendraAE2MCA-(null)", "info|sampling driver Speaker-(null)",
+                  "info|sampling driver (null)-MCA", "info|sampling driver Haptics-Stats"));
 }
 
 TEST_F(DriverUtilityTest, ReportsOnlyCountersThatRose) {
   publishAllGroups();
   std::optional<SXValue> snapshot = utility().getSnapShot();
   kestrel_->setValue("VendraAE2MCA", std::nullopt, "Underruns", 5);
-  kestrel_->setValue("Speaker", std::nullopt, "Temp", 39);           // went down
-  kestrel_->setValue("Speaker", std::nullopt, std::nullopt, 12);     // unnamed channel
+  kestrel_->setValue("Speaker", std::nullopt, "Temp", 39);        // went down
+  kestrel_->setValue("Speaker", std::nullopt, std::nullopt, 12);  // unnamed channel
   kestrel_->setValue("Haptics", "Stats", "Clips", 8);
-  kestrel_->setValue("Haptics", "Other", "Ignored", 500);            // not subscribed
+  kestrel_->setValue("Haptics", "Other", "Ignored", 500);  // not subscribed
   // Codec/MCA/Overruns unchanged.
 
   auto statistics = utility().getDriverStatisticsRelativeToSnapShot(snapshot);
@@ -159,8 +160,7 @@ TEST_F(DriverUtilityTest, ReportsOnlyCountersThatRose) {
   // Against the same snapshot once more, nothing has moved since the last change: the same.
   EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(snapshot), statistics);
   // Against a fresh snapshot nothing rose: none rather than an empty dictionary.
-  EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(utility().getSnapShot()),
-            std::nullopt);
+  EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(utility().getSnapShot()), std::nullopt);
 }
 
 TEST_F(DriverUtilityTest, WithoutSnapshotReportsAbsoluteValuesOfAtLeastOne) {

@@ -13,9 +13,8 @@ std::optional<SXValue> createSamples(Kestrel& kestrel,
                                      const SXReportingIOChannelSubscription& subscription,
                                      std::optional<KestrelError>& error) {
   std::shared_ptr<KestrelSubscription> handle = subscription.subscription();
-  return kestrel.createSamples(handle.get(),
-                               subscription.subscribedChannels().value_or(SXValue::object()),
-                               error);
+  return kestrel.createSamples(
+      handle.get(), subscription.subscribedChannels().value_or(SXValue::object()), error);
 }
 
 // Adds every counter of `samples` that is at least 1 to `result`, named

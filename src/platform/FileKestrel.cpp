@@ -39,8 +39,8 @@ SXValue nameValue(std::string_view treeName) {
 }
 
 SXValue channelEntry(std::string_view group, std::string_view subgroup, std::string_view name) {
-  return {{"group", nameValue(group)}, {"subgroup", nameValue(subgroup)},
-          {"name", nameValue(name)}};
+  return {
+      {"group", nameValue(group)}, {"subgroup", nameValue(subgroup)}, {"name", nameValue(name)}};
 }
 
 // Splits "<group>/<subgroup>/<channel>"; nothing unless it names a file inside the tree.
@@ -50,9 +50,8 @@ std::optional<std::array<std::string_view, 3>> splitKey(std::string_view key) {
   if (second == std::string_view::npos || key.find('/', second + 1) != std::string_view::npos) {
     return std::nullopt;
   }
-  std::array<std::string_view, 3> parts = {key.substr(0, first),
-                                           key.substr(first + 1, second - first - 1),
-                                           key.substr(second + 1)};
+  std::array<std::string_view, 3> parts = {
+      key.substr(0, first), key.substr(first + 1, second - first - 1), key.substr(second + 1)};
   for (auto part : parts) {
     if (!isTreeName(part)) return std::nullopt;
   }
@@ -87,6 +86,14 @@ std::optional<std::vector<std::string>> listEntries(const fs::path& dir, EntryKi
   }
   if (ec) setError(error, ec.value());
   return names;
+}
+
+// `wanted` alone when the caller names it, otherwise every visible directory in `parent`.
+std::vector<std::string> directoriesNamed(const std::optional<std::string>& wanted,
+                                          const fs::path& parent,
+                                          std::optional<KestrelError>& error) {
+  if (wanted) return {*wanted};
+  return listEntries(parent, EntryKind::kDirectory, error).value_or(std::vector<std::string>{});
 }
 
 std::optional<int64_t> parseCounter(std::string_view text) {
@@ -148,17 +155,10 @@ std::optional<SXValue> SXFileKestrel::copyChannelsInGroup(
     return std::nullopt;
   }
   const fs::path root(root_);
-  std::vector<std::string> groups = group ? std::vector<std::string>{*group}
-                                          : listEntries(root, EntryKind::kDirectory, error)
-                                                .value_or(std::vector<std::string>{});
   // A matching subgroup directory, even an empty one, makes a (possibly empty) dictionary.
   std::optional<SXValue> channels;
-  for (const auto& g : groups) {
-    std::vector<std::string> subgroups =
-        subgroup ? std::vector<std::string>{*subgroup}
-                 : listEntries(root / g, EntryKind::kDirectory, error)
-                       .value_or(std::vector<std::string>{});
-    for (const auto& s : subgroups) {
+  for (const auto& g : directoriesNamed(group, root, error)) {
+    for (const auto& s : directoriesNamed(subgroup, root / g, error)) {
       auto files = listEntries(root / g / s, EntryKind::kFile, error);
       if (!files) continue;
       if (!channels) channels = SXValue::object();
@@ -254,7 +254,7 @@ std::optional<int64_t> SXFileKestrel::readCounter(const std::string& key) const 
     }
     return std::nullopt;
   }
-  struct stat st{};
+  struct stat st {};
   if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "kestrel channel %s is not a regular file", path);
     return std::nullopt;
@@ -270,8 +270,8 @@ std::optional<int64_t> SXFileKestrel::readCounter(const std::string& key) const 
                    ? parseCounter(std::string_view(buffer).substr(0, length))
                    : std::nullopt;
   if (!value) {
-    SXLOG(*log_, nullptr, SXLogLevel::kError,
-          "kestrel channel %s does not hold a decimal integer", path);
+    SXLOG(*log_, nullptr, SXLogLevel::kError, "kestrel channel %s does not hold a decimal integer",
+          path);
   }
   return value;
 }

@@ -124,8 +124,8 @@ std::optional<SXValue> FakeKestrel::copyChannelsInGroup(const Name& group, const
   for (const auto& [id, value] : values_) {
     const auto& [g, s, n] = id;
     if (!matches(group, g) || !matches(subgroup, s)) continue;
-    channels[channelKey(g, s, n)] = {{"group", toValue(g)}, {"subgroup", toValue(s)},
-                                     {"name", toValue(n)}};
+    channels[channelKey(g, s, n)] = {
+        {"group", toValue(g)}, {"subgroup", toValue(s)}, {"name", toValue(n)}};
   }
   return SXValue{{"query", queryValue(group, subgroup)}, {"channels", std::move(channels)}};
 }
@@ -135,8 +135,8 @@ int64_t FakeKestrel::getChannelCount(const SXValue& channels) {
   return list ? static_cast<int64_t>(list->size()) : 0;
 }
 
-std::shared_ptr<KestrelSubscription> FakeKestrel::createSubscription(
-    const SXValue& channels, SXValue& subscribedChannels) {
+std::shared_ptr<KestrelSubscription> FakeKestrel::createSubscription(const SXValue& channels,
+                                                                     SXValue& subscribedChannels) {
   subscribedChannels = channels;
   std::lock_guard lock(mutex_);
   if (nullSubscriptions_ || !channels.is_object()) return nullptr;
@@ -161,8 +161,8 @@ std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* sub
   }
   SXValue samples = SXValue::object();
   for (const auto& [key, channel] : channels->items()) {
-    auto id = ChannelId{field(channel, "group"), field(channel, "subgroup"),
-                        field(channel, "name")};
+    auto id =
+        ChannelId{field(channel, "group"), field(channel, "subgroup"), field(channel, "name")};
     auto value = values_.find(id);
     if (value == values_.end()) continue;  // removed since the subscription
     samples[key] = {{"name", toValue(std::get<2>(id))}, {"value", value->second}};
@@ -170,8 +170,7 @@ std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* sub
   return SXValue{{"query", fake->query}, {"channels", std::move(samples)}};
 }
 
-std::optional<SXValue> FakeKestrel::createSamplesDelta(const SXValue* earlier,
-                                                       const SXValue& later,
+std::optional<SXValue> FakeKestrel::createSamplesDelta(const SXValue* earlier, const SXValue& later,
                                                        std::optional<KestrelError>& error) {
   std::lock_guard lock(mutex_);
   ++deltaCalls_;

@@ -47,8 +47,7 @@ class FakeKestrel final : public Kestrel {
   int samplingCalls() const;
   int deltaCalls() const;
 
-  std::optional<SXValue> copyChannelsInGroup(const Name& group, const Name& subgroup,
-                                             int options,
+  std::optional<SXValue> copyChannelsInGroup(const Name& group, const Name& subgroup, int options,
                                              std::optional<KestrelError>& error) override;
   int64_t getChannelCount(const SXValue& channels) override;
   std::shared_ptr<KestrelSubscription> createSubscription(const SXValue& channels,
@@ -70,12 +69,12 @@ class FakeKestrel final : public Kestrel {
   };
 
   mutable std::mutex mutex_;
-  std::set<Query> groups_;                          // guarded by mutex_
-  std::map<ChannelId, int64_t> values_;             // guarded by mutex_
-  std::map<Query, QueryFault> queryFaults_;         // guarded by mutex_
+  std::set<Query> groups_;                                  // guarded by mutex_
+  std::map<ChannelId, int64_t> values_;                     // guarded by mutex_
+  std::map<Query, QueryFault> queryFaults_;                 // guarded by mutex_
   std::map<Query, std::optional<int64_t>> samplingFaults_;  // guarded by mutex_
-  std::map<Query, int64_t> deltaFaults_;            // guarded by mutex_
-  bool nullSubscriptions_ = false;                  // guarded by mutex_
-  int samplingCalls_ = 0;                           // guarded by mutex_
-  int deltaCalls_ = 0;                              // guarded by mutex_
+  std::map<Query, int64_t> deltaFaults_;                    // guarded by mutex_
+  bool nullSubscriptions_ = false;                          // guarded by mutex_
+  int samplingCalls_ = 0;                                   // guarded by mutex_
+  int deltaCalls_ = 0;                                      // guarded by mutex_
 };
