@@ -1,0 +1,246 @@
+#include "platform/FileKestrel.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+#include "SXReportingDriverUtility.h"
+#include "fakes/FakeLog.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using ::testing::ElementsAre;
+
+class FileKestrelTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = (fs::temp_directory_path() / "kestrel-XXXXXX").string();
+    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
+    dir_ = pattern;
+    root_ = dir_ / "kestrel";
+    kestrel_ = std::make_unique<SXFileKestrel>(root_.string(), log_);
+  }
+  void TearDown() override {
+    std::error_code ec;
+    fs::remove_all(dir_, ec);
+  }
+
+  void publish(const std::string& relative, const std::string& contents) {
+    fs::create_directories((root_ / relative).parent_path());
+    std::ofstream(root_ / relative) << contents;
+  }
+
+  // The usual tree: each driver group, a group the drivers must not match, hidden entries.
+  void publishTree() {
+    publish("VendraAE2MCA/-/underruns", "3\n");
+    publish("Speaker/-/temp", "  40 ");
+    publish("Speaker/-/-", "2");
+    publish("Codec/MCA/overruns", "1");
+    publish("Amp/MCA/clips", "+4");
+    publish("Haptics/Stats/clips", "7");
+    publish("Haptics/Other/ignored", "100");
+    publish("Speaker/-/.temp.swp", "junk");
+    publish(".staging/MCA/x", "1");
+  }
+
+  std::vector<std::string> keys(const std::optional<SXValue>& value) {
+    std::vector<std::string> out;
+    if (value) {
+      for (const auto& [key, entry] : value->items()) out.push_back(key);
+    }
+    return out;
+  }
+
+  std::optional<SXValue> channels(const std::optional<std::string>& group,
+                                  const std::optional<std::string>& subgroup) {
+    error_.reset();
+    return kestrel_->copyChannelsInGroup(group, subgroup, 0, error_);
+  }
+
+  SXValue sample(const std::optional<std::string>& group,
+                 const std::optional<std::string>& subgroup) {
+    auto found = channels(group, subgroup);
+    EXPECT_TRUE(found);
+    SXValue subscribed;
+    subscription_ = kestrel_->createSubscription(found.value_or(SXValue()), subscribed);
+    subscribed_ = subscribed;
+    return resample();
+  }
+
+  SXValue resample() {
+    std::optional<KestrelError> error;
+    auto samples = kestrel_->createSamples(subscription_.get(), subscribed_, error);
+    EXPECT_FALSE(error);
+    return samples.value_or(SXValue());
+  }
+
+  std::map<std::string, int64_t> counters(const SXValue& samples) {
+    std::map<std::string, int64_t> out;
+    kestrel_->iterate(samples, [&](const KestrelChannelSample& s) {
+      out[s.channelName.value_or("<none>")] = s.value;
+      return 0;
+    });
+    return out;
+  }
+
+  fs::path dir_;
+  fs::path root_;
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+  std::unique_ptr<SXFileKestrel> kestrel_;
+  std::optional<KestrelError> error_;
+  std::shared_ptr<KestrelSubscription> subscription_;
+  SXValue subscribed_;
+};
+
+TEST_F(FileKestrelTest, QueriesMatchGroupAndSubgroupDirectories) {
+  publishTree();
+  fs::create_directories(root_ / "Empty" / "-");
+
+  auto speaker = channels("Speaker", std::nullopt);
+  EXPECT_THAT(keys(speaker), ElementsAre("Speaker/-/-", "Speaker/-/temp"));
+  EXPECT_EQ((*speaker)["Speaker/-/-"],
+            (SXValue{{"group", "Speaker"}, {"subgroup", nullptr}, {"name", nullptr}}));
+  EXPECT_THAT(keys(channels(std::nullopt, "MCA")),
+              ElementsAre("Amp/MCA/clips", "Codec/MCA/overruns"));
+  EXPECT_THAT(keys(channels("Haptics", "Stats")), ElementsAre("Haptics/Stats/clips"));
+  EXPECT_EQ(kestrel_->getChannelCount(*channels(std::nullopt, std::nullopt)), 7);
+  EXPECT_FALSE(error_);
+
+  // A group that exists without channels is an empty dictionary; one that does not, nothing.
+  auto empty = channels("Empty", std::nullopt);
+  ASSERT_TRUE(empty);
+  EXPECT_EQ(kestrel_->getChannelCount(*empty), 0);
+  EXPECT_EQ(channels("Missing", std::nullopt), std::nullopt);
+  EXPECT_EQ(channels(std::nullopt, "Missing"), std::nullopt);
+  EXPECT_FALSE(error_);
+
+  for (const char* bad : {"..", "a/b", "-", ""}) {
+    EXPECT_EQ(channels(bad, std::nullopt), std::nullopt) << bad;
+    ASSERT_TRUE(error_) << bad;
+    EXPECT_EQ(error_->code, EINVAL);
+  }
+}
+
+TEST_F(FileKestrelTest, MissingRootMeansNoChannels) {
+  EXPECT_EQ(channels(std::nullopt, std::nullopt), std::nullopt);
+  EXPECT_EQ(channels("Speaker", std::nullopt), std::nullopt);
+  EXPECT_FALSE(error_);
+}
+
+TEST_F(FileKestrelTest, SamplingReadsFilesAnewAndSkipsBadCounters) {
+  publishTree();
+  publish("Speaker/-/garbage", "12abc");
+  publish("Speaker/-/empty", "");
+  publish("Speaker/-/gone", "5");
+  publish("Speaker/-/huge", "99999999999999999999");
+  SXValue first = sample("Speaker", std::nullopt);
+  EXPECT_EQ(counters(first),
+            (std::map<std::string, int64_t>{{"<none>", 2}, {"gone", 5}, {"temp", 40}}));
+  EXPECT_EQ(first["Speaker/-/temp"]["value"], 40);
+  for (const char* bad : {"garbage", "empty", "huge"}) {
+    std::string path = (root_ / "Speaker" / "-" / bad).string();
+    EXPECT_EQ(log_->count("kestrel channel " + path + " does not hold a decimal integer"), 1u)
+        << bad;
+  }
+
+  publish("Speaker/-/temp", "45");
+  publish("Speaker/-/garbage", "-3");
+  fs::remove(root_ / "Speaker" / "-" / "gone");
+  size_t errorsBefore = log_->lines().size();
+  SXValue second = resample();
+  EXPECT_EQ(counters(second),
+            (std::map<std::string, int64_t>{{"<none>", 2}, {"garbage", -3}, {"temp", 45}}));
+  EXPECT_EQ(log_->lines().size(), errorsBefore + 2);  // "empty" and "huge" again, "gone" quiet
+
+  std::optional<KestrelError> error;
+  auto delta = kestrel_->createSamplesDelta(&first, second, error);
+  EXPECT_FALSE(error);
+  ASSERT_TRUE(delta);
+  EXPECT_EQ(counters(*delta), (std::map<std::string, int64_t>{{"<none>", 0}, {"temp", 5}}));
+}
+
+TEST_F(FileKestrelTest, BadArgumentsSetAnError) {
+  publishTree();
+  std::optional<KestrelError> error;
+  EXPECT_EQ(kestrel_->createSamples(nullptr, SXValue::object(), error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EINVAL);
+
+  SXValue samples = sample("Haptics", "Stats");
+  error.reset();
+  EXPECT_EQ(kestrel_->createSamplesDelta(nullptr, samples, error), std::nullopt);
+  EXPECT_TRUE(error);
+  error.reset();
+  SXValue notSamples = "text";
+  EXPECT_EQ(kestrel_->createSamplesDelta(&notSamples, samples, error), std::nullopt);
+  EXPECT_TRUE(error);
+
+  // Subscribed channels that point outside the tree are never read.
+  SXValue escaping = {{"../../etc/passwd", SXValue::object()}, {"a/b", SXValue::object()}};
+  SXValue subscribed;
+  auto handle = kestrel_->createSubscription(escaping, subscribed);
+  EXPECT_EQ(subscribed, SXValue::object());
+  error.reset();
+  EXPECT_EQ(kestrel_->createSamples(handle.get(), escaping, error), SXValue::object());
+  EXPECT_EQ(kestrel_->createSubscription("not channels", subscribed), nullptr);
+
+  // A FIFO where a counter was must neither block sampling nor count.
+  fs::remove(root_ / "Haptics" / "Stats" / "clips");
+  ASSERT_EQ(::mkfifo((root_ / "Haptics" / "Stats" / "clips").c_str(), 0600), 0);
+  EXPECT_EQ(resample(), SXValue::object());
+  EXPECT_TRUE(log_->contains("Haptics/Stats/clips is not a regular file"));
+
+  int calls = 0;
+  kestrel_->iterate(samples, [&](const KestrelChannelSample&) { return ++calls; });
+  kestrel_->iterate(SXValue(42), [&](const KestrelChannelSample&) { return ++calls; });
+  EXPECT_EQ(calls, 1);
+}
+
+TEST_F(FileKestrelTest, DriverUtilityEndToEnd) {
+  publishTree();
+  SXPlatform platform;
+  platform.log = log_;
+  platform.kestrel = std::make_shared<SXFileKestrel>(root_.string(), log_);
+  SXReportingEnvironment environment(std::move(platform));
+  SXReportingDriverUtility utility(environment);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
+
+  SXValue snapshot = utility.getSnapShot();
+  EXPECT_EQ(snapshot.size(), 4u);
+  publish("VendraAE2MCA/-/underruns", "10");
+  publish("Speaker/-/-", "3");
+  publish("Amp/MCA/clips", "1");  // went down
+  publish("Haptics/Stats/clips", "8");
+  publish("Haptics/Stats/new", "50");  // appeared after subscribing: not covered
+
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot),
+            (SXValue{{"VendraAE2MCA_underruns", 7}, {"Speaker_", 1}, {"Haptics_Stats_clips", 1}}));
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(std::nullopt),
+            (SXValue{{"VendraAE2MCA_underruns", 10},
+                     {"Speaker_temp", 40},
+                     {"Speaker_", 3},
+                     {"MCA_clips", 1},
+                     {"MCA_overruns", 1},
+                     {"Haptics_Stats_clips", 8}}));
+}
+
+TEST_F(FileKestrelTest, DriverUtilityWithoutTreeSubscribesNothing) {
+  SXPlatform platform;
+  platform.log = log_;
+  platform.kestrel = std::make_shared<SXFileKestrel>(root_.string(), log_);
+  SXReportingEnvironment environment(std::move(platform));
+  SXReportingDriverUtility utility(environment);
+  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
+  EXPECT_EQ(utility.getSnapShot(), SXValue::object());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(SXValue::object()), std::nullopt);
+  EXPECT_THAT(log_->messages(), ElementsAre("creating kestrelstats driver utility"));
+}
+
+}  // namespace
