@@ -1,0 +1,194 @@
+#include "platform/SqliteBatchWriter.h"
+
+#include <pthread.h>
+
+#include <condition_variable>
+#include <deque>
+#include <exception>
+#include <mutex>
+
+#include "platform/DiscardLog.h"
+
+struct SXSqliteBatchWriter::Core {
+  Core(Options o, std::shared_ptr<SXLogFacility> l)
+      : options(std::move(o)), log(SXLogOrDiscard(std::move(l))) {}
+
+  void run();
+  // REQUIRES: writer thread (or the constructor, before the thread starts).
+  bool ensureOpen(std::string& error);
+  void writeBatch(std::vector<RowProducer>& batch);
+  std::optional<std::string> commit(const std::vector<SXSqliteRow>& rows);
+  std::vector<SXSqliteRow> produceRows(std::vector<RowProducer>& batch);
+
+  const Options options;
+  const std::shared_ptr<SXLogFacility> log;
+
+  std::mutex mutex;
+  std::condition_variable wake;      // rows queued or stopping; guarded by `mutex`
+  std::condition_variable progress;  // `done` advanced; guarded by `mutex`
+  std::deque<RowProducer> queue;     // guarded by `mutex`
+  uint64_t enqueued = 0;             // guarded by `mutex`: rows ever accepted
+  uint64_t done = 0;                 // guarded by `mutex`: rows committed or dropped
+  uint64_t refused = 0;              // guarded by `mutex`: refused since the queue filled
+  bool full = false;                 // guarded by `mutex`
+  bool stopping = false;             // guarded by `mutex`
+
+  // Writer thread only. The statement is declared after the connection it belongs to, so it
+  // is finalized first.
+  std::unique_ptr<SXSqliteConnection> db;
+  SXSqliteStatement insert;
+};
+
+bool SXSqliteBatchWriter::Core::ensureOpen(std::string& error) {
+  if (db) return true;
+  auto connection = SXSqliteConnection::open(options.path, SXSqliteConnection::Mode::kReadWrite,
+                                             options.busyTimeout, options.schema, error);
+  if (!connection) return false;
+  SXSqliteStatement statement;
+  if (auto failed = connection->prepare(options.insertSql, statement)) {
+    error = options.path + ": " + *failed;
+    return false;
+  }
+  db = std::move(connection);
+  insert = std::move(statement);
+  return true;
+}
+
+std::vector<SXSqliteRow> SXSqliteBatchWriter::Core::produceRows(std::vector<RowProducer>& batch) {
+  std::vector<SXSqliteRow> rows;
+  rows.reserve(batch.size());
+  for (auto& producer : batch) {
+    try {
+      rows.push_back(producer());
+    } catch (const std::exception& e) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "%s: could not build one of the %s: %s",
+            options.path, options.rowNoun, e.what());
+    } catch (...) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "%s: could not build one of the %s", options.path,
+            options.rowNoun);
+    }
+  }
+  return rows;
+}
+
+std::optional<std::string> SXSqliteBatchWriter::Core::commit(const std::vector<SXSqliteRow>& rows) {
+  if (auto error = db->exec("BEGIN IMMEDIATE")) return error;
+  for (const auto& row : rows) {
+    if (auto error = insert.run(row)) {
+      db->exec("ROLLBACK");
+      return error;
+    }
+  }
+  if (auto error = db->exec("COMMIT")) {
+    db->exec("ROLLBACK");
+    return error;
+  }
+  return std::nullopt;
+}
+
+void SXSqliteBatchWriter::Core::writeBatch(std::vector<RowProducer>& batch) {
+  std::vector<SXSqliteRow> rows = produceRows(batch);
+  if (rows.empty()) return;
+  std::string error;
+  if (!ensureOpen(error)) {
+    SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s", rows.size(), options.rowNoun,
+          error);
+    return;
+  }
+  if (auto failed = commit(rows)) {
+    SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s: %s", rows.size(), options.rowNoun,
+          options.path, *failed);
+    // Start the next batch on a fresh connection, in case this one is what went wrong.
+    insert = SXSqliteStatement();
+    db.reset();
+  }
+}
+
+void SXSqliteBatchWriter::Core::run() {
+  for (;;) {
+    std::vector<RowProducer> batch;
+    uint64_t refusedBefore = 0;
+    {
+      std::unique_lock lock(mutex);
+      wake.wait(lock, [&] { return stopping || !queue.empty(); });
+      if (queue.empty()) return;  // stopping, and everything is written
+      size_t n = std::min(queue.size(), options.maxBatch);
+      batch.assign(std::make_move_iterator(queue.begin()),
+                   std::make_move_iterator(queue.begin() + static_cast<ptrdiff_t>(n)));
+      queue.erase(queue.begin(), queue.begin() + static_cast<ptrdiff_t>(n));
+      if (full && queue.size() < options.maxQueued) {
+        full = false;
+        refusedBefore = std::exchange(refused, 0);
+      }
+    }
+    if (refusedBefore > 0) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "%s: queue has room again; %llu %s were refused",
+            options.path, refusedBefore, options.rowNoun);
+    }
+    size_t n = batch.size();
+    writeBatch(batch);
+    batch.clear();  // producers release what they hold before flush() learns of it
+    {
+      std::lock_guard lock(mutex);
+      done += n;
+    }
+    progress.notify_all();
+  }
+}
+
+SXSqliteBatchWriter::SXSqliteBatchWriter(Options options, std::shared_ptr<SXLogFacility> log)
+    : core_(std::make_shared<Core>(std::move(options), std::move(log))) {
+  std::string error;
+  if (!core_->ensureOpen(error)) SXLOG(*core_->log, nullptr, SXLogLevel::kError, "%s", error);
+  thread_ = std::thread([core = core_] {
+    pthread_setname_np(pthread_self(), core->options.threadName.substr(0, 15).c_str());
+    core->run();
+  });
+}
+
+SXSqliteBatchWriter::~SXSqliteBatchWriter() {
+  {
+    std::lock_guard lock(core_->mutex);
+    core_->stopping = true;
+  }
+  core_->wake.notify_all();
+  // A producer may hold the last reference to our owner, so the writer thread can end up here;
+  // it cannot join itself, and it drains the queue on its own (it shares the core).
+  if (thread_.get_id() == std::this_thread::get_id()) {
+    thread_.detach();
+  } else {
+    thread_.join();
+  }
+}
+
+bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
+  bool accepted = false;
+  bool startedRefusing = false;
+  {
+    std::lock_guard lock(core_->mutex);
+    if (core_->stopping) return false;
+    if (core_->queue.size() < core_->options.maxQueued) {
+      core_->queue.push_back(std::move(producer));
+      ++core_->enqueued;
+      accepted = true;
+    } else {
+      startedRefusing = !core_->full;
+      core_->full = true;
+      ++core_->refused;
+    }
+  }
+  if (accepted) {
+    core_->wake.notify_one();
+  } else if (startedRefusing) {
+    SXLOG(*core_->log, nullptr, SXLogLevel::kError,
+          "%s: %zu %s wait to be written; refusing new ones", core_->options.path,
+          core_->options.maxQueued, core_->options.rowNoun);
+  }
+  return accepted;
+}
+
+void SXSqliteBatchWriter::flush() {
+  std::unique_lock lock(core_->mutex);
+  uint64_t target = core_->enqueued;
+  core_->progress.wait(lock, [&] { return core_->done >= target; });
+}

@@ -1,0 +1,149 @@
+#include "platform/SqliteConnection.h"
+
+namespace {
+
+std::string Describe(sqlite3* db, const std::string& context) {
+  return context + ": " + (db ? sqlite3_errmsg(db) : "out of memory");
+}
+
+SXValue ColumnValue(sqlite3_stmt* stmt, int column) {
+  switch (sqlite3_column_type(stmt, column)) {
+    case SQLITE_INTEGER:
+      return static_cast<int64_t>(sqlite3_column_int64(stmt, column));
+    case SQLITE_FLOAT:
+      return sqlite3_column_double(stmt, column);
+    case SQLITE_NULL:
+      return nullptr;
+    default: {
+      const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(stmt, column));
+      return std::string(text ? text : "", static_cast<size_t>(sqlite3_column_bytes(stmt, column)));
+    }
+  }
+}
+
+}  // namespace
+
+std::string SXSqliteStatement::failure(const char* context) const {
+  std::string sql = stmt_ ? sqlite3_sql(stmt_.get()) : "";
+  return Describe(db_, std::string(context) + " \"" + sql.substr(0, sql.find('(')) + "\"");
+}
+
+std::optional<std::string> SXSqliteStatement::bind(const SXSqliteRow& params) {
+  if (!stmt_) return "statement was never prepared";
+  sqlite3_reset(stmt_.get());
+  sqlite3_clear_bindings(stmt_.get());
+  for (size_t i = 0; i < params.size(); ++i) {
+    int index = static_cast<int>(i) + 1;
+    int rc = std::visit(
+        [&](const auto& v) -> int {
+          using T = std::decay_t<decltype(v)>;
+          if constexpr (std::is_same_v<T, std::nullptr_t>) {
+            return sqlite3_bind_null(stmt_.get(), index);
+          } else if constexpr (std::is_same_v<T, int64_t>) {
+            return sqlite3_bind_int64(stmt_.get(), index, v);
+          } else if constexpr (std::is_same_v<T, double>) {
+            return sqlite3_bind_double(stmt_.get(), index, v);
+          } else {
+            return sqlite3_bind_text64(stmt_.get(), index, v.data(), v.size(), SQLITE_STATIC,
+                                       SQLITE_UTF8);
+          }
+        },
+        params[i]);
+    if (rc != SQLITE_OK) return failure("bind");
+  }
+  return std::nullopt;
+}
+
+std::optional<std::string> SXSqliteStatement::run(const SXSqliteRow& params) {
+  if (auto error = bind(params)) return error;
+  int rc;
+  while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {
+  }
+  std::optional<std::string> error;
+  if (rc != SQLITE_DONE) error = failure("step");
+  // Resetting releases the statement's read of the database and the bound texts (SQLITE_STATIC).
+  sqlite3_reset(stmt_.get());
+  sqlite3_clear_bindings(stmt_.get());
+  return error;
+}
+
+std::optional<std::string> SXSqliteStatement::query(const SXSqliteRow& params,
+                                                    std::vector<SXValue>& rows) {
+  if (auto error = bind(params)) return error;
+  int rc;
+  int columns = sqlite3_column_count(stmt_.get());
+  while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {
+    SXValue row = SXValue::object();
+    for (int c = 0; c < columns; ++c) {
+      row[sqlite3_column_name(stmt_.get(), c)] = ColumnValue(stmt_.get(), c);
+    }
+    rows.push_back(std::move(row));
+  }
+  std::optional<std::string> error;
+  if (rc != SQLITE_DONE) error = failure("step");
+  sqlite3_reset(stmt_.get());
+  sqlite3_clear_bindings(stmt_.get());
+  return error;
+}
+
+std::unique_ptr<SXSqliteConnection> SXSqliteConnection::open(const std::string& path, Mode mode,
+                                                             std::chrono::milliseconds busyTimeout,
+                                                             const std::string& schema,
+                                                             std::string& error) {
+  sqlite3* db = nullptr;
+  int flags =
+      mode == Mode::kReadOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
+  // The owner serialises calls, so SQLite's own per-connection mutex is not needed.
+  int rc = sqlite3_open_v2(path.c_str(), &db, flags | SQLITE_OPEN_NOMUTEX, nullptr);
+  if (rc != SQLITE_OK) {
+    error = Describe(db, "cannot open " + path);
+    sqlite3_close_v2(db);
+    return nullptr;
+  }
+  auto connection = std::make_unique<SXSqliteConnection>(Key(), db);
+  sqlite3_busy_timeout(db, static_cast<int>(busyTimeout.count()));
+  if (mode == Mode::kReadOnly) return connection;
+  for (const std::string& sql :
+       {std::string("PRAGMA journal_mode=WAL"), std::string("PRAGMA synchronous=NORMAL"), schema}) {
+    if (auto failed = connection->exec(sql)) {
+      error = "cannot open " + path + ": " + *failed;
+      return nullptr;
+    }
+  }
+  return connection;
+}
+
+SXSqliteConnection::~SXSqliteConnection() {
+  // close_v2 defers the close until statements still alive are finalized.
+  sqlite3_close_v2(db_);
+}
+
+std::optional<std::string> SXSqliteConnection::exec(const std::string& sql) {
+  char* message = nullptr;
+  int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
+  if (rc == SQLITE_OK) return std::nullopt;
+  std::string text = message ? message : sqlite3_errstr(rc);
+  sqlite3_free(message);
+  std::string first = sql.substr(0, sql.find_first_of(";("));
+  return first + ": " + text;
+}
+
+std::optional<std::string> SXSqliteConnection::prepare(const std::string& sql,
+                                                       SXSqliteStatement& out) {
+  sqlite3_stmt* stmt = nullptr;
+  int rc = sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()),
+                              SQLITE_PREPARE_PERSISTENT, &stmt, nullptr);
+  if (rc != SQLITE_OK) {
+    sqlite3_finalize(stmt);
+    return Describe(db_, "prepare \"" + sql + "\"");
+  }
+  out.stmt_.reset(stmt);
+  out.db_ = db_;
+  return std::nullopt;
+}
+
+int64_t SXSqliteConnection::lastInsertRowId() const { return sqlite3_last_insert_rowid(db_); }
+
+double SXSqliteNow() {
+  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+}

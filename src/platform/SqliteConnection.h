@@ -1,0 +1,90 @@
+// A SQLite connection and its prepared statements: the one place the durable stores (analytics
+// events, power log, server-reporting spool) talk to libsqlite3.
+//
+// Errors are values: every call that can fail returns the failure's text
+// ("<context>: <what SQLite says>"), or nothing on success. Nothing throws.
+//
+// A connection and its statements are not thread-safe: their owner serialises every call (a
+// writer thread of its own, or a mutex). A statement must not outlive its connection.
+#pragma once
+
+#include <sqlite3.h>
+
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "sxreporting/types.h"
+
+// One bound parameter or one stored column.
+using SXSqliteField = std::variant<std::nullptr_t, int64_t, double, std::string>;
+using SXSqliteRow = std::vector<SXSqliteField>;
+
+// How long a write waits for another connection's lock before it fails.
+inline constexpr std::chrono::milliseconds kSXSqliteBusyTimeout{5000};
+
+class SXSqliteStatement {
+ public:
+  SXSqliteStatement() = default;
+  SXSqliteStatement(SXSqliteStatement&&) = default;
+  SXSqliteStatement& operator=(SXSqliteStatement&&) = default;
+
+  explicit operator bool() const { return stmt_ != nullptr; }
+
+  // Binds `params` to ?1..?n, steps until done and resets. On failure returns why.
+  std::optional<std::string> run(const SXSqliteRow& params);
+
+  // Binds `params` and appends each result row to `rows` as an object keyed by column name
+  // (integers, floating values, texts, nulls; blobs as texts). On failure returns why.
+  std::optional<std::string> query(const SXSqliteRow& params, std::vector<SXValue>& rows);
+
+ private:
+  friend class SXSqliteConnection;
+  struct Finalizer {
+    void operator()(sqlite3_stmt* stmt) const { sqlite3_finalize(stmt); }
+  };
+
+  std::optional<std::string> bind(const SXSqliteRow& params);
+  std::string failure(const char* context) const;
+
+  std::unique_ptr<sqlite3_stmt, Finalizer> stmt_;
+  sqlite3* db_ = nullptr;  // the connection that prepared it, for its error text
+};
+
+class SXSqliteConnection {
+ public:
+  enum class Mode { kReadWrite, kReadOnly };
+
+  // Opens `path`. Read-write creates the file, switches it to WAL with synchronous=NORMAL
+  // (committed rows survive a crash of this process, not a power loss) and runs `schema`.
+  // Both modes wait up to `busyTimeout` for another connection's lock. On failure returns
+  // nullptr and sets `error`.
+  static std::unique_ptr<SXSqliteConnection> open(const std::string& path, Mode mode,
+                                                  std::chrono::milliseconds busyTimeout,
+                                                  const std::string& schema, std::string& error);
+
+  struct Key {  // only open() makes connections
+   private:
+    friend class SXSqliteConnection;
+    Key() = default;
+  };
+  SXSqliteConnection(Key, sqlite3* db) : db_(db) {}
+  ~SXSqliteConnection();
+  SXSqliteConnection(const SXSqliteConnection&) = delete;
+  SXSqliteConnection& operator=(const SXSqliteConnection&) = delete;
+
+  // Runs one or more statements that return nothing of interest.
+  std::optional<std::string> exec(const std::string& sql);
+  std::optional<std::string> prepare(const std::string& sql, SXSqliteStatement& out);
+  int64_t lastInsertRowId() const;
+
+ private:
+  sqlite3* db_;
+};
+
+// Seconds since the Unix epoch, the unit of every `time` column.
+double SXSqliteNow();

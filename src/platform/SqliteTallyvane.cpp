@@ -1,0 +1,70 @@
+#include "platform/SqliteTallyvane.h"
+
+namespace {
+
+constexpr const char* kSchema =
+    "CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, name TEXT, "
+    "payload_json TEXT)";
+constexpr const char* kInsert = "INSERT INTO events(time, name, payload_json) VALUES (?1, ?2, ?3)";
+
+// The newest `limit` matches, put back in ascending order.
+constexpr const char* kSelect =
+    "SELECT id, time, name, payload_json FROM (SELECT * FROM events "
+    "WHERE ?1 IS NULL OR name GLOB ?1 ORDER BY id DESC LIMIT ?2) ORDER BY id";
+
+}  // namespace
+
+SXSqliteTallyvane::SXSqliteTallyvane(std::string dbPath, std::shared_ptr<SXLogFacility> log,
+                                     std::chrono::milliseconds busyTimeout)
+    : writer_({.path = std::move(dbPath),
+               .schema = kSchema,
+               .insertSql = kInsert,
+               .rowNoun = "events",
+               .threadName = "sxr-tallyvane",
+               .busyTimeout = busyTimeout},
+              std::move(log)) {}
+
+bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider provider) {
+  return writer_.enqueue([time = SXSqliteNow(), name, provider = std::move(provider)] {
+    SXValue payload = provider ? provider() : SXValue();
+    return SXSqliteRow{time, name, payload.dump(-1, ' ', false, SXValue::error_handler_t::replace)};
+  });
+}
+
+void SXSqliteTallyvane::flush() { writer_.flush(); }
+
+std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
+                                                   std::optional<std::string> nameFilter, int limit,
+                                                   std::string& error) {
+  auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
+                                     kSXSqliteBusyTimeout, "", error);
+  if (!db) return {};
+  SXSqliteStatement select;
+  std::vector<SXValue> rows;
+  if (auto failed = db->prepare(kSelect, select)) {
+    error = dbPath + ": " + *failed;
+    return {};
+  }
+  SXSqliteField filter = nullptr;
+  if (nameFilter) filter = *nameFilter;
+  if (auto failed = select.query({filter, int64_t(limit > 0 ? limit : -1)}, rows)) {
+    error = dbPath + ": " + *failed;
+    return {};
+  }
+  for (SXValue& row : rows) {
+    SXValue& stored = row["payload_json"];
+    SXValue payload = stored.is_string()
+                          ? SXValue::parse(stored.get_ref<const std::string&>(), nullptr, false)
+                          : SXValue();
+    row["payload"] = payload.is_discarded() ? stored : payload;
+    row.erase("payload_json");
+  }
+  return rows;
+}
+
+std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
+                                                   std::optional<std::string> nameFilter,
+                                                   int limit) {
+  std::string ignored;
+  return readEvents(dbPath, std::move(nameFilter), limit, ignored);
+}

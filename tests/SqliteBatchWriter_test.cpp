@@ -1,0 +1,108 @@
+#include "platform/SqliteBatchWriter.h"
+
+#include <gtest/gtest.h>
+
+#include <future>
+
+#include "fakes/FakeLog.h"
+#include "support/SqliteTestSupport.h"
+
+using namespace std::chrono_literals;
+
+namespace {
+
+class SqliteBatchWriterTest : public ::testing::Test {
+ protected:
+  SXSqliteBatchWriter::Options Options(size_t maxQueued, size_t maxBatch) {
+    return {.path = dir_.file("rows.db"),
+            .schema = "CREATE TABLE IF NOT EXISTS rows(id INTEGER PRIMARY KEY, v INTEGER)",
+            .insertSql = "INSERT INTO rows(v) VALUES (?1)",
+            .rowNoun = "rows",
+            .threadName = "test-writer",
+            .maxQueued = maxQueued,
+            .maxBatch = maxBatch};
+  }
+  static SXSqliteBatchWriter::RowProducer Value(int64_t v) {
+    return [v] { return SXSqliteRow{v}; };
+  }
+
+  SXTestTempDir dir_;
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+};
+
+TEST_F(SqliteBatchWriterTest, AFullQueueRefusesRowsAndSaysSoOnceEachWay) {
+  SXSqliteBatchWriter writer(Options(3, 1000), log_);
+  std::promise<void> gate;
+  std::promise<void> writerBusy;
+  std::shared_future<void> open = gate.get_future().share();
+  // Hold the writer thread in its first batch so that the queue fills behind it.
+  ASSERT_TRUE(writer.enqueue([&, open] {
+    writerBusy.set_value();
+    open.wait_for(20s);
+    return SXSqliteRow{int64_t(0)};
+  }));
+  ASSERT_EQ(writerBusy.get_future().wait_for(20s), std::future_status::ready);
+  for (int v = 1; v <= 3; ++v) EXPECT_TRUE(writer.enqueue(Value(v)));
+  EXPECT_FALSE(writer.enqueue(Value(98)));
+  EXPECT_FALSE(writer.enqueue(Value(99)));
+  EXPECT_EQ(log_->lines().size(), 1u);
+  EXPECT_TRUE(log_->contains("3 rows wait to be written; refusing new ones"));
+
+  gate.set_value();
+  writer.flush();
+  EXPECT_TRUE(log_->contains("queue has room again; 2 rows were refused"));
+  EXPECT_TRUE(writer.enqueue(Value(4)));
+  writer.flush();
+  auto rows = SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id");
+  ASSERT_EQ(rows.size(), 5u);
+  for (int v = 0; v <= 4; ++v) EXPECT_EQ(rows[v]["v"], v);
+}
+
+TEST_F(SqliteBatchWriterTest, EachBatchIsOneTransaction) {
+  // A row that cannot be bound fails its whole batch, and only that batch.
+  SXSqliteBatchWriter writer(Options(100, 2), log_);
+  std::promise<void> gate;
+  std::promise<void> writerBusy;
+  std::shared_future<void> open = gate.get_future().share();
+  writer.enqueue([&, open] {
+    writerBusy.set_value();
+    open.wait_for(20s);
+    return SXSqliteRow{int64_t(1)};
+  });
+  ASSERT_EQ(writerBusy.get_future().wait_for(20s), std::future_status::ready);
+  // Queued behind the held batch: [2, bad] then [4].
+  writer.enqueue(Value(2));
+  writer.enqueue([] { return SXSqliteRow{int64_t(3), int64_t(3)}; });  // too many parameters
+  writer.enqueue(Value(4));
+  gate.set_value();
+  writer.flush();
+  auto rows = SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id");
+  ASSERT_EQ(rows.size(), 2u);
+  EXPECT_EQ(rows[0]["v"], 1);
+  EXPECT_EQ(rows[1]["v"], 4);
+  EXPECT_TRUE(log_->contains("dropped 2 rows"));
+}
+
+TEST_F(SqliteBatchWriterTest, TheWriterMayOutliveItsOwnerWhenAProducerHeldIt) {
+  auto writer = std::make_shared<SXSqliteBatchWriter>(Options(100, 1000), log_);
+  std::promise<void> gate;
+  std::shared_future<void> open = gate.get_future().share();
+  // The producer ends up holding the only reference: the writer is destroyed on its own thread.
+  std::weak_ptr<SXSqliteBatchWriter> weak = writer;
+  writer->enqueue([holder = writer, open] {
+    open.wait_for(20s);
+    return SXSqliteRow{int64_t(1)};
+  });
+  writer->enqueue(Value(2));
+  writer.reset();
+  gate.set_value();
+  for (int i = 0; i < 2000 && !weak.expired(); ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(weak.expired());
+  for (int i = 0; i < 2000; ++i) {
+    if (SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows").size() == 2) break;
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows").size(), 2u);
+}
+
+}  // namespace

@@ -1,0 +1,232 @@
+#include "platform/SqliteFernReporting.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <future>
+#include <set>
+#include <thread>
+
+#include "fakes/FakeLog.h"
+#include "support/SqliteTestSupport.h"
+
+using namespace std::chrono_literals;
+
+namespace {
+
+using Backends = std::optional<std::vector<std::string>>;
+
+class SqliteFernReportingTest : public ::testing::Test {
+ protected:
+  std::unique_ptr<SXSqliteFernReporting> Make(std::chrono::milliseconds busy = 5s) {
+    return std::make_unique<SXSqliteFernReporting>(db_, config_, log_, busy);
+  }
+  void WriteConfig(const std::string& text) { std::ofstream(config_) << text; }
+
+  // Waits for the session's configuration completion; returns what it got and on which thread.
+  static std::pair<Backends, std::thread::id> Configure(FernReportingSession& session) {
+    auto result = std::make_shared<std::promise<std::pair<Backends, std::thread::id>>>();
+    auto calls = std::make_shared<std::atomic<int>>(0);
+    session.startConfiguration([result, calls](Backends backends) {
+      if (calls->fetch_add(1) == 0) result->set_value({backends, std::this_thread::get_id()});
+    });
+    auto future = result->get_future();
+    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
+    return future.get();
+  }
+
+  static std::optional<FernError> Flush(FernReportingSession& session) {
+    std::promise<std::optional<FernError>> done;
+    session.flushMessages([&](std::optional<FernError> error) { done.set_value(error); });
+    auto future = done.get_future();
+    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
+    return future.get();
+  }
+
+  SXValue SessionInfo(const std::string& token) {
+    return {{fern::kSessionInfoClientType, 19},
+            {fern::kSessionInfoClientVersion, 1.0f},
+            {fern::kSessionInfoSessionID, 42},
+            {fern::kSessionInfoBatchEvent, true},
+            {fern::kSessionInfoHierarchyToken, token}};
+  }
+  SXValue UserInfo(const std::string& service) {
+    return {{fern::kUserInfoClientName, "com.vendra.sonex"}, {fern::kUserInfoServiceName, service}};
+  }
+
+  SXTestTempDir dir_;
+  std::string db_ = dir_.file("fernreporting.db");
+  std::string config_ = dir_.file("fernreporting.json");
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+};
+
+TEST_F(SqliteFernReportingTest, BackendsComeFromTheConfigurationFile) {
+  using List = std::vector<std::string>;
+  EXPECT_EQ(Make()->backends(), List{"spool"});  // absent file
+  WriteConfig(R"({"backends": ["spool", "upload"]})");
+  EXPECT_EQ(Make()->backends(), (List{"spool", "upload"}));
+  WriteConfig(R"({"backends": []})");
+  EXPECT_EQ(Make()->backends(), List{});
+  WriteConfig(R"({"other": 1})");
+  EXPECT_EQ(Make()->backends(), List{"spool"});
+  EXPECT_TRUE(log_->lines().empty());
+
+  for (const char* malformed : {"{\"backends\": [", "[\"spool\"]", R"({"backends": "spool"})",
+                                R"({"backends": ["spool", 3]})"}) {
+    SCOPED_TRACE(malformed);
+    WriteConfig(malformed);
+    size_t before = log_->lines().size();
+    EXPECT_EQ(Make()->backends(), List{"spool"});
+    ASSERT_EQ(log_->lines().size(), before + 1);
+    EXPECT_EQ(log_->lines().back().level, SXLogLevel::kError);
+    EXPECT_TRUE(log_->contains("fernreporting.json"));
+  }
+}
+
+TEST_F(SqliteFernReportingTest, ConfigurationCompletesOnceOnAnotherThread) {
+  auto fern = Make();
+  auto session = fern->openSession(SessionInfo("t"), UserInfo("telephony_session"), {});
+  ASSERT_NE(session, nullptr);
+  auto [backends, thread] = Configure(*session);
+  EXPECT_EQ(backends, (std::vector<std::string>{"spool"}));
+  EXPECT_NE(thread, std::this_thread::get_id());
+
+  WriteConfig(R"({"backends": []})");
+  auto none = Make()->openSession(SessionInfo("u"), UserInfo("x"), {});
+  ASSERT_NE(none, nullptr);
+  EXPECT_EQ(Configure(*none).first, std::nullopt);
+}
+
+TEST_F(SqliteFernReportingTest, SessionsAreStoredWithTheirInfoAndToken) {
+  auto fern = Make();
+  auto token = fern->newHierarchyToken(nullptr);
+  ASSERT_NE(token, nullptr);
+  auto session = fern->openSession(SessionInfo(token->identifier()), UserInfo("telephony_session"),
+                                   SXValue::array());
+  ASSERT_NE(session, nullptr);
+  auto rows = SXTestQuery(db_, "SELECT * FROM sessions");
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["token"], token->identifier());
+  EXPECT_EQ(SXValue::parse(rows[0]["session_info_json"].get<std::string>()),
+            SessionInfo(token->identifier()));
+  EXPECT_EQ(SXValue::parse(rows[0]["user_info_json"].get<std::string>()),
+            UserInfo("telephony_session"));
+  EXPECT_EQ(session->description(), "<FernReportingSession " +
+                                        std::to_string(rows[0]["id"].get<int64_t>()) +
+                                        " service=telephony_session>");
+}
+
+TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
+  auto fern = Make();
+  std::set<std::string> seen;
+  for (int i = 0; i < 100; ++i) seen.insert(fern->newHierarchyToken(nullptr)->identifier());
+  seen.insert(Make()->newHierarchyToken(nullptr)->identifier());
+  EXPECT_EQ(seen.size(), 101u);
+  auto parent = fern->newHierarchyToken(nullptr);
+  auto child = fern->newHierarchyToken(parent);
+  EXPECT_EQ(child->identifier().rfind(parent->identifier() + "/", 0), 0u);
+  EXPECT_GT(child->identifier().size(), parent->identifier().size() + 1);
+}
+
+TEST_F(SqliteFernReportingTest, SendsAreCommittedWhenTheyReturn) {
+  auto fern = Make();
+  auto session = fern->openSession(SessionInfo("t"), UserInfo("alarms_session"), {});
+  ASSERT_NE(session, nullptr);
+  std::optional<FernError> error;
+  ASSERT_TRUE(session->sendMessage(3, 1, {{"dropped_frames", 2}}, error));
+  SXValue single = {{fern::kSessionInfoClientType, 19}, {fern::kSessionInfoSessionID, -1}};
+  ASSERT_TRUE(fern->sendOneMessage(single, UserInfo("alarms"), 65535, 7, {{"k", "v"}}, error));
+  EXPECT_EQ(error, std::nullopt);
+
+  // Read through another connection while the adapter stays open: nothing waits for a flush.
+  auto rows = SXTestQuery(db_, "SELECT * FROM messages ORDER BY id");
+  ASSERT_EQ(rows.size(), 2u);
+  auto sessionId = SXTestQuery(db_, "SELECT id FROM sessions")[0]["id"];
+  EXPECT_EQ(rows[0]["session_id"], sessionId);
+  EXPECT_EQ(rows[0]["session_info_json"], nullptr);
+  EXPECT_EQ(rows[0]["user_info_json"], nullptr);
+  EXPECT_EQ(rows[0]["category"], 3);
+  EXPECT_EQ(rows[0]["type"], 1);
+  EXPECT_EQ(rows[0]["payload_json"], "{\"dropped_frames\":2}");
+  EXPECT_EQ(rows[1]["session_id"], nullptr);
+  EXPECT_EQ(SXValue::parse(rows[1]["session_info_json"].get<std::string>()), single);
+  EXPECT_EQ(SXValue::parse(rows[1]["user_info_json"].get<std::string>()), UserInfo("alarms"));
+  EXPECT_EQ(rows[1]["category"], 65535);
+  EXPECT_EQ(rows[1]["type"], 7);
+}
+
+TEST_F(SqliteFernReportingTest, FlushIsRecordedAfterItsMessagesAndCompletesElsewhere) {
+  auto fern = Make();
+  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
+  std::optional<FernError> error;
+  session->sendMessage(1, 1, SXValue::object(), error);
+  std::promise<std::pair<std::optional<FernError>, std::thread::id>> done;
+  session->flushMessages([&](std::optional<FernError> e) {
+    done.set_value({e, std::this_thread::get_id()});
+  });
+  auto future = done.get_future();
+  ASSERT_EQ(future.wait_for(20s), std::future_status::ready);
+  auto [flushError, thread] = future.get();
+  EXPECT_EQ(flushError, std::nullopt);
+  EXPECT_NE(thread, std::this_thread::get_id());
+  auto flushes = SXTestQuery(db_, "SELECT * FROM flushes");
+  ASSERT_EQ(flushes.size(), 1u);
+  EXPECT_EQ(flushes[0]["session_id"], SXTestQuery(db_, "SELECT id FROM sessions")[0]["id"]);
+  EXPECT_GE(flushes[0]["time"].get<double>(),
+            SXTestQuery(db_, "SELECT time FROM messages")[0]["time"].get<double>());
+}
+
+TEST_F(SqliteFernReportingTest, SessionsKeepTheSpoolAfterTheAdapterIsGone) {
+  auto fern = Make();
+  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
+  fern.reset();
+  std::optional<FernError> error;
+  EXPECT_TRUE(session->sendMessage(1, 2, SXValue::object(), error));
+  EXPECT_EQ(Configure(*session).first, (std::vector<std::string>{"spool"}));
+  EXPECT_EQ(Flush(*session), std::nullopt);
+  EXPECT_EQ(SXTestQuery(db_, "SELECT * FROM messages").size(), 1u);
+}
+
+TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
+  std::filesystem::create_directory(db_);
+  auto fern = Make();
+  EXPECT_TRUE(log_->contains("cannot open"));
+  EXPECT_EQ(fern->openSession(SessionInfo("t"), UserInfo("s"), {}), nullptr);
+  EXPECT_TRUE(log_->contains("cannot store the session"));
+  std::optional<FernError> error;
+  EXPECT_FALSE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
+  ASSERT_TRUE(error.has_value());
+  EXPECT_NE(error->localizedDescription.find("fernreporting.db"), std::string::npos)
+      << error->localizedDescription;
+
+  // The store is opened again on the next call once it can be.
+  std::filesystem::remove(db_);
+  error.reset();
+  EXPECT_TRUE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
+  EXPECT_EQ(SXTestQuery(db_, "SELECT * FROM messages").size(), 1u);
+}
+
+TEST_F(SqliteFernReportingTest, ALockedStoreFailsSendsAndFlushesUntilItIsFree) {
+  auto fern = Make(20ms);
+  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
+  ASSERT_NE(session, nullptr);
+  std::optional<FernError> error;
+  {
+    SXTestWriteLock lock(db_);
+    EXPECT_FALSE(session->sendMessage(1, 1, SXValue::object(), error));
+    ASSERT_TRUE(error.has_value());
+    EXPECT_NE(error->localizedDescription.find("database is locked"), std::string::npos)
+        << error->localizedDescription;
+    auto flushError = Flush(*session);
+    ASSERT_TRUE(flushError.has_value());
+    EXPECT_NE(flushError->localizedDescription.find("locked"), std::string::npos);
+  }
+  error.reset();
+  EXPECT_TRUE(session->sendMessage(1, 2, SXValue::object(), error));
+  EXPECT_EQ(Flush(*session), std::nullopt);
+  auto rows = SXTestQuery(db_, "SELECT type FROM messages");
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["type"], 2);
+}
+
+}  // namespace

@@ -1,0 +1,307 @@
+#include "fakes/FakeFernReporting.h"
+
+#include <condition_variable>
+#include <map>
+#include <mutex>
+#include <thread>
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// A thread that runs tasks once their time has come, in time order (posting order for equal
+// times). Tasks not yet due when it is destroyed are dropped.
+class Deliverer {
+ public:
+  Deliverer() : shared_(std::make_shared<Shared>()) {
+    thread_ = std::thread([shared = shared_] { shared->run(); });
+  }
+  ~Deliverer() {
+    {
+      std::lock_guard lock(shared_->mutex);
+      shared_->stopping = true;
+    }
+    shared_->wake.notify_all();
+    // A completion may drop the last reference to the fake; the thread cannot join itself.
+    if (thread_.get_id() == std::this_thread::get_id()) {
+      thread_.detach();
+    } else {
+      thread_.join();
+    }
+  }
+  Deliverer(const Deliverer&) = delete;
+  Deliverer& operator=(const Deliverer&) = delete;
+
+  void post(std::chrono::milliseconds delay, std::function<void()> task) {
+    {
+      std::lock_guard lock(shared_->mutex);
+      shared_->due.emplace(Clock::now() + delay, std::move(task));
+    }
+    shared_->wake.notify_all();
+  }
+
+ private:
+  struct Shared {
+    void run() {
+      std::unique_lock lock(mutex);
+      while (!stopping) {
+        if (due.empty()) {
+          wake.wait(lock);
+        } else if (due.begin()->first > Clock::now()) {
+          wake.wait_until(lock, due.begin()->first);
+        } else {
+          auto task = std::move(due.begin()->second);
+          due.erase(due.begin());
+          lock.unlock();
+          task();
+          task = nullptr;
+          lock.lock();
+        }
+      }
+    }
+    std::mutex mutex;
+    std::condition_variable wake;                                 // guarded by `mutex`
+    std::multimap<Clock::time_point, std::function<void()>> due;  // guarded by `mutex`
+    bool stopping = false;                                        // guarded by `mutex`
+  };
+  std::shared_ptr<Shared> shared_;
+  std::thread thread_;
+};
+
+}  // namespace
+
+class FakeFernReporting::State {
+ public:
+  using Kind = Event::Kind;
+
+  std::shared_ptr<FernSecureHierarchyToken> token(
+      const std::shared_ptr<FernSecureHierarchyToken>& parent) {
+    std::lock_guard lock(mutex);
+    Event& e = append({.kind = Kind::kToken, .accepted = !tokenFails});
+    if (tokenFails) return nullptr;
+    e.token = "fake-token-" + std::to_string(++tokens);
+    if (parent) e.token = parent->identifier() + "/" + e.token;
+    return std::make_shared<FernSecureHierarchyToken>(e.token);
+  }
+
+  // Returns the new session's number, or 0 when opening fails.
+  int open(const SXValue& sessionInfo, const SXValue& userInfo) {
+    std::lock_guard lock(mutex);
+    int number = openFails ? 0 : ++sessions;
+    Event& e = append({.kind = Kind::kOpen,
+                       .session = number,
+                       .sessionInfo = sessionInfo,
+                       .userInfo = userInfo,
+                       .accepted = !openFails});
+    if (sessionInfo.is_object() && sessionInfo.contains(fern::kSessionInfoHierarchyToken) &&
+        sessionInfo[fern::kSessionInfoHierarchyToken].is_string()) {
+      e.token = sessionInfo[fern::kSessionInfoHierarchyToken].get<std::string>();
+    }
+    return number;
+  }
+
+  void startConfiguration(int session, FernBackendsCompletion completion) {
+    std::lock_guard lock(mutex);
+    append({.kind = Kind::kStartConfiguration, .session = session});
+    complete(configurationDelivery, configurationDelay, [completion, found = backends] {
+      if (completion) completion(found);
+    });
+  }
+
+  bool send(Kind kind, int session, const SXValue* sessionInfo, const SXValue* userInfo,
+            uint16_t category, uint16_t type, const SXValue& payload,
+            std::optional<FernError>& error) {
+    std::lock_guard lock(mutex);
+    const SendFailure& failure = kind == Kind::kMessage ? messageFailure : singleFailure;
+    append({.kind = kind,
+            .session = session,
+            .sessionInfo = sessionInfo ? *sessionInfo : SXValue(),
+            .userInfo = userInfo ? *userInfo : SXValue(),
+            .category = category,
+            .type = type,
+            .payload = payload,
+            .accepted = !failure.fails});
+    if (failure.fails && failure.error) error = failure.error;
+    return !failure.fails;
+  }
+
+  void flush(int session, FernFlushCompletion completion) {
+    std::lock_guard lock(mutex);
+    append({.kind = Kind::kFlush, .session = session});
+    complete(flushDelivery, flushDelay, [completion, error = flushError] {
+      if (completion) completion(error);
+    });
+  }
+
+  void deliverHeld() {
+    std::lock_guard lock(mutex);
+    for (auto& task : held) deliverer.post(std::chrono::milliseconds(0), std::move(task));
+    held.clear();
+  }
+
+  bool waitFor(const std::function<bool(const std::vector<Event>&)>& ready,
+               std::chrono::milliseconds timeout) {
+    std::unique_lock lock(mutex);
+    return changed.wait_for(lock, timeout, [&] { return ready(events); });
+  }
+
+  std::mutex mutex;
+  std::condition_variable changed;  // guarded by `mutex`
+  std::vector<Event> events;        // guarded by `mutex`
+  std::optional<std::vector<std::string>> backends = std::vector<std::string>{"fake"};
+  Delivery configurationDelivery = Delivery::kImmediate;  // guarded by `mutex`, like the rest
+  std::chrono::milliseconds configurationDelay{0};
+  Delivery flushDelivery = Delivery::kImmediate;
+  std::chrono::milliseconds flushDelay{0};
+  std::optional<FernError> flushError;
+  SendFailure messageFailure;
+  SendFailure singleFailure;
+  bool openFails = false;
+  bool tokenFails = false;
+  int sessions = 0;
+  int tokens = 0;
+  std::vector<std::function<void()>> held;  // kNever completions
+  Deliverer deliverer;                      // declared last: stopped before the rest goes
+
+ private:
+  // REQUIRES: mutex held.
+  Event& append(Event event) {
+    events.push_back(std::move(event));
+    changed.notify_all();
+    return events.back();
+  }
+
+  // REQUIRES: mutex held.
+  void complete(Delivery delivery, std::chrono::milliseconds delay, std::function<void()> task) {
+    if (delivery == Delivery::kNever) {
+      held.push_back(std::move(task));
+    } else {
+      deliverer.post(delivery == Delivery::kDelayed ? delay : std::chrono::milliseconds(0),
+                     std::move(task));
+    }
+  }
+};
+
+class FakeFernReporting::Session final : public FernReportingSession {
+ public:
+  Session(std::weak_ptr<State> state, int number) : state_(std::move(state)), number_(number) {}
+
+  std::string description() const override {
+    return "<FakeFernReportingSession " + std::to_string(number_) + ">";
+  }
+  void startConfiguration(FernBackendsCompletion completion) override {
+    if (auto state = state_.lock()) state->startConfiguration(number_, std::move(completion));
+  }
+  bool sendMessage(uint16_t category, uint16_t type, const SXValue& payload,
+                   std::optional<FernError>& error) override {
+    auto state = state_.lock();
+    if (!state) {
+      error = FernError{"the fake server-reporting service is gone"};
+      return false;
+    }
+    return state->send(Event::Kind::kMessage, number_, nullptr, nullptr, category, type, payload,
+                       error);
+  }
+  void flushMessages(FernFlushCompletion completion) override {
+    if (auto state = state_.lock()) state->flush(number_, std::move(completion));
+  }
+
+ private:
+  const std::weak_ptr<State> state_;
+  const int number_;
+};
+
+FakeFernReporting::FakeFernReporting() : state_(std::make_shared<State>()) {}
+
+FakeFernReporting::~FakeFernReporting() = default;
+
+std::shared_ptr<FernSecureHierarchyToken> FakeFernReporting::newHierarchyToken(
+    const std::shared_ptr<FernSecureHierarchyToken>& parent) {
+  return state_->token(parent);
+}
+
+std::shared_ptr<FernReportingSession> FakeFernReporting::openSession(const SXValue& sessionInfo,
+                                                                     const SXValue& userInfo,
+                                                                     const SXValue&) {
+  int number = state_->open(sessionInfo, userInfo);
+  if (number == 0) return nullptr;
+  return std::make_shared<Session>(state_, number);
+}
+
+bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue& userInfo,
+                                       uint16_t category, uint16_t type, const SXValue& payload,
+                                       std::optional<FernError>& error) {
+  return state_->send(Event::Kind::kSingleMessage, 0, &sessionInfo, &userInfo, category, type,
+                      payload, error);
+}
+
+void FakeFernReporting::setBackends(std::optional<std::vector<std::string>> backends) {
+  std::lock_guard lock(state_->mutex);
+  state_->backends = std::move(backends);
+}
+
+void FakeFernReporting::setConfigurationDelivery(Delivery delivery,
+                                                 std::chrono::milliseconds delay) {
+  std::lock_guard lock(state_->mutex);
+  state_->configurationDelivery = delivery;
+  state_->configurationDelay = delay;
+}
+
+void FakeFernReporting::setFlushDelivery(Delivery delivery, std::chrono::milliseconds delay) {
+  std::lock_guard lock(state_->mutex);
+  state_->flushDelivery = delivery;
+  state_->flushDelay = delay;
+}
+
+void FakeFernReporting::setFlushError(std::optional<FernError> error) {
+  std::lock_guard lock(state_->mutex);
+  state_->flushError = std::move(error);
+}
+
+void FakeFernReporting::setMessageFailure(SendFailure failure) {
+  std::lock_guard lock(state_->mutex);
+  state_->messageFailure = std::move(failure);
+}
+
+void FakeFernReporting::setSingleMessageFailure(SendFailure failure) {
+  std::lock_guard lock(state_->mutex);
+  state_->singleFailure = std::move(failure);
+}
+
+void FakeFernReporting::setOpenFails(bool fails) {
+  std::lock_guard lock(state_->mutex);
+  state_->openFails = fails;
+}
+
+void FakeFernReporting::setTokenFails(bool fails) {
+  std::lock_guard lock(state_->mutex);
+  state_->tokenFails = fails;
+}
+
+void FakeFernReporting::deliverHeld() { state_->deliverHeld(); }
+
+std::vector<FakeFernReporting::Event> FakeFernReporting::events() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->events;
+}
+
+std::vector<FakeFernReporting::Event> FakeFernReporting::events(Event::Kind kind) const {
+  std::vector<Event> out;
+  for (auto& e : events()) {
+    if (e.kind == kind) out.push_back(std::move(e));
+  }
+  return out;
+}
+
+std::vector<FakeFernReporting::Event> FakeFernReporting::messages(int session) const {
+  std::vector<Event> out;
+  for (auto& e : events(Event::Kind::kMessage)) {
+    if (e.session == session) out.push_back(std::move(e));
+  }
+  return out;
+}
+
+bool FakeFernReporting::waitFor(const std::function<bool(const std::vector<Event>&)>& ready,
+                                std::chrono::milliseconds timeout) const {
+  return state_->waitFor(ready, timeout);
+}

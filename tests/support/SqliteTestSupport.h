@@ -1,0 +1,73 @@
+// Temporary directories and direct SQL access for the tests of the SQLite stores.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <chrono>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "platform/SqliteConnection.h"
+
+// A fresh directory under the system's temporary directory, removed with everything in it.
+class SXTestTempDir {
+ public:
+  SXTestTempDir() {
+    std::string pattern = (std::filesystem::temp_directory_path() / "sxr-test-XXXXXX").string();
+    if (::mkdtemp(pattern.data()) == nullptr) ADD_FAILURE() << "mkdtemp failed";
+    path_ = pattern;
+  }
+  ~SXTestTempDir() {
+    std::error_code ignored;
+    std::filesystem::remove_all(path_, ignored);
+  }
+  SXTestTempDir(const SXTestTempDir&) = delete;
+  SXTestTempDir& operator=(const SXTestTempDir&) = delete;
+
+  std::string file(const std::string& name) const { return path_ + "/" + name; }
+
+ private:
+  std::string path_;
+};
+
+// Every row `sql` returns, read through a connection of its own.
+inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::string& sql) {
+  std::string error;
+  auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
+                                     std::chrono::seconds(5), "", error);
+  if (!db) {
+    ADD_FAILURE() << error;
+    return {};
+  }
+  SXSqliteStatement statement;
+  std::vector<SXValue> rows;
+  if (auto failed = db->prepare(sql, statement)) {
+    ADD_FAILURE() << *failed;
+  } else if (auto failed = statement.query({}, rows)) {
+    ADD_FAILURE() << *failed;
+  }
+  return rows;
+}
+
+// Holds the write lock of a database until destroyed, as another process's writer would.
+class SXTestWriteLock {
+ public:
+  explicit SXTestWriteLock(const std::string& dbPath) {
+    std::string error;
+    db_ = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadWrite,
+                                   std::chrono::seconds(5), "", error);
+    if (!db_) {
+      ADD_FAILURE() << error;
+    } else if (auto failed = db_->exec("BEGIN EXCLUSIVE")) {
+      ADD_FAILURE() << *failed;
+    }
+  }
+  ~SXTestWriteLock() {
+    if (db_) db_->exec("ROLLBACK");
+  }
+
+ private:
+  std::unique_ptr<SXSqliteConnection> db_;
+};
