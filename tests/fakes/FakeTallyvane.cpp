@@ -8,11 +8,13 @@ FakeTallyvane::FakeTallyvane(Delivery delivery) : delivery_(delivery) {
 
 FakeTallyvane::~FakeTallyvane() { thread_.reset(); }
 
-void FakeTallyvane::record(const std::string& name, const SXPayloadProvider& provider) {
+void FakeTallyvane::record(const std::string& name, const SXPayloadProvider& provider,
+                           bool wasInFlight) {
   SXValue payload = provider ? provider() : SXValue();
   {
     std::lock_guard lock(mutex_);
     events_.push_back({name, std::move(payload), std::this_thread::get_id()});
+    if (wasInFlight) --inFlight_;
   }
   recorded_.notify_all();
 }
@@ -24,16 +26,12 @@ bool FakeTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider pro
   switch (delivery_) {
     case Delivery::kInline:
       lock.unlock();
-      record(name, provider);
+      record(name, provider, false);
       break;
     case Delivery::kOwnThread:
       ++inFlight_;
       lock.unlock();
-      thread_->post([this, name, provider = std::move(provider)] {
-        record(name, provider);
-        std::lock_guard done(mutex_);
-        --inFlight_;
-      });
+      thread_->post([this, name, provider = std::move(provider)] { record(name, provider, true); });
       break;
     case Delivery::kOnDeliver:
       held_.emplace_back(name, std::move(provider));
@@ -53,7 +51,7 @@ void FakeTallyvane::deliver() {
     std::lock_guard lock(mutex_);
     held.swap(held_);
   }
-  for (const auto& [name, provider] : held) record(name, provider);
+  for (const auto& [name, provider] : held) record(name, provider, false);
 }
 
 std::vector<FakeTallyvane::Event> FakeTallyvane::events() const {

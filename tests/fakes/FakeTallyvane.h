@@ -41,7 +41,7 @@ class FakeTallyvane final : public SXTallyvane {
   bool waitForEvents(size_t count, std::chrono::milliseconds timeout) const;
 
  private:
-  void record(const std::string& name, const SXPayloadProvider& provider);
+  void record(const std::string& name, const SXPayloadProvider& provider, bool wasInFlight);
 
   const Delivery delivery_;
   mutable std::mutex mutex_;
