@@ -1,0 +1,332 @@
+#include "SXReportingSession.h"
+
+#include <gtest/gtest.h>
+
+#include "support/TestEnvironment.h"
+
+namespace {
+
+using Kind = FakeFernReporting::Event::Kind;
+
+std::shared_ptr<SXReportingSession> makeSession(TestEnvironment& t, int64_t id = 42,
+                                                SXReportingServiceType type = 7) {
+  auto session = SXReportingSession::initWithID(t.environment, id, SXValue::array({1234}));
+  session->setServiceType(type);
+  return session;
+}
+
+SXValue internalBuild(int deviceClass = 1) {
+  return {{"InternalBuild", true}, {"DeviceClassNumber", deviceClass}};
+}
+
+}  // namespace
+
+TEST(SXReportingSessionRecord, NewSessionDefaultsAndConfigurationMerge) {
+  TestEnvironment t;
+  auto session = SXReportingSession::initWithID(t.environment, 42, SXValue::array({1}));
+  EXPECT_EQ(session->serviceType(), 65535);
+  EXPECT_EQ(session->serviceName(), "unknown");
+  EXPECT_FALSE(session->started());
+  EXPECT_EQ(session->userInfo(), SXValue::object());
+  EXPECT_TRUE(session->aggregatedPayloadEntries().empty());
+  EXPECT_EQ(t.dispatch->createdQueues().back(), "com.vendra.sonex.session.fernreporting");
+
+  session->setServiceType(1);
+  EXPECT_EQ(session->serviceName(), "vokira");
+  SXValue config = {{"a", 1}};
+  SXValue defaults = {{"a", 2}, {"b", 3}};
+  session->setConfiguration(&config);
+  session->updateDefaults(&defaults);
+  session->setConfiguration(nullptr);
+  EXPECT_EQ(session->userInfo(), (SXValue{{"a", 2}, {"b", 3}}));
+}
+
+TEST(SXReportingSessionRecord, ScopeRegisteredOnceAndLifetimeTraced) {
+  TestEnvironment t;
+  {
+    auto a = SXReportingSession::initWithID(t.environment, 1, SXValue::array());
+    auto b = SXReportingSession::initWithID(t.environment, 2, SXValue::array());
+  }
+  auto registrations = t.log->registrations();
+  ASSERT_EQ(registrations.size(), 1u);
+  EXPECT_EQ(registrations[0].shortName, "sxrr");
+  EXPECT_EQ(registrations[0].code, 0x73787272u);
+  EXPECT_EQ(registrations[0].subsystem, "com.vendra.sonex");
+  EXPECT_EQ(registrations[0].category, "reporting_session_verbose");
+  EXPECT_EQ(registrations[0].options, 31);
+  EXPECT_EQ(t.tracer->codes(),
+            (std::vector<uint32_t>{0x21042828, 0x21042828, 0x21042834, 0x21042834}));
+  EXPECT_EQ(t.log->count("deallocing this session 1"), 1u);
+  EXPECT_EQ(t.log->count("deallocing this session 2"), 1u);
+}
+
+TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
+  TestEnvironment t;
+  auto session = makeSession(t);
+  EXPECT_EQ(session->messageIdForCategory(3, 1), "Playback_Start_1");
+  EXPECT_EQ(session->messageIdForCategory(3, 1), "Playback_Start_2");
+  EXPECT_EQ(session->messageIdForCategory(0x08000003, 1), "Session_Playback_Start_1");
+
+  session->start();
+  SXValue payload = {{"peak level", 1}, {"route", "a b"}, {"a b", 1}, {"a_b", 2}};
+  int replies = 0;
+  session->sendMessage(payload, 3, 1, [&](std::optional<FernError> error) {
+    EXPECT_FALSE(error);
+    ++replies;
+  });
+  EXPECT_EQ(replies, 1);  // at once, before the send task ran
+  auto entries = session->aggregatedPayloadEntries();
+  ASSERT_EQ(entries.size(), 1u);
+  EXPECT_EQ(entries[0], (SXValue{{"Playback_Start_3",
+                                  {{"peak_level", 1}, {"route", "a b"}, {"a_b", 2}}}}));
+  t.drain();
+  auto sent = t.fern->events(Kind::kMessage);
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0].payload, entries[0]["Playback_Start_3"]);
+}
+
+TEST(SXReportingSessionMessages, NotStartedGoesStandaloneWithSessionServiceType) {
+  TestEnvironment t;
+  auto session = makeSession(t, 42, 2);
+  SXValue config = {{"HostApplicationDisplayID", "phone"}};
+  session->setConfiguration(&config);
+  session->sendMessage({{"dropped frames", 3}}, 0x08000003, 1, nullptr);
+  t.drain();
+  auto single = t.fern->events(Kind::kSingleMessage);
+  ASSERT_EQ(single.size(), 1u);
+  EXPECT_EQ(single[0].category, 3);
+  EXPECT_EQ(single[0].payload, (SXValue{{"dropped_frames", 3}}));
+  EXPECT_EQ(single[0].userInfo, (SXValue{{fern::kUserInfoClientName, "com.vendra.sonex"},
+                                         {fern::kUserInfoServiceName, "telephony"}}));
+  EXPECT_EQ(single[0].sessionInfo[fern::kSessionInfoSessionID], -1);
+  EXPECT_FALSE(single[0].sessionInfo.contains(fern::kSessionInfoBatchEvent));
+  EXPECT_TRUE(t.log->contains("message {\"dropped_frames\":3} : category 134217731 : type 1"));
+  EXPECT_TRUE(t.fern->events(Kind::kOpen).empty());
+}
+
+TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarms) {
+  TestEnvironment t;
+  makeSession(t);  // registers the session scope, whose verbose lines we read
+  for (SXReportingServiceType type : {0, 2, 5, 65535, 4}) {
+    SXReportingSession::sendSingleMessage(t.environment, SXValue::object(), 1, 1, type, nullptr,
+                                          nullptr);
+  }
+  auto delays = t.dispatch->delays();
+  ASSERT_EQ(delays.size(), 5u);
+  for (size_t i = 0; i < 4; ++i) EXPECT_EQ(delays[i].count(), 0);
+  EXPECT_EQ(delays[4], std::chrono::seconds(59));
+  EXPECT_TRUE(t.log->contains("sending single message after delta 0 for service 5"));
+  EXPECT_TRUE(t.log->contains("sending single message after delta 59 for service 4"));
+
+  SXSystemRandom random;
+  for (int i = 0; i < 2000; ++i) EXPECT_LT(random.uniform(60), 60u);
+}
+
+TEST(SXReportingSessionMessages, StandaloneFailureReachesTheReply) {
+  TestEnvironment t;
+  t.fern->setSingleMessageFailure({true, FernError{"spool full"}});
+  std::optional<FernError> got;
+  SXReportingSession::sendSingleMessage(t.environment, SXValue::object(), 1, 1, 2, nullptr,
+                                        [&](std::optional<FernError> e) { got = e; });
+  t.drain();
+  ASSERT_TRUE(got);
+  EXPECT_EQ(got->localizedDescription, "spool full");
+  EXPECT_TRUE(t.log->contains("sendOneMessageWithSessionInfo spool full"));
+}
+
+TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThenFlush) {
+  TestEnvironment t;
+  auto session = makeSession(t, 42, 2);
+  SXValue config = {{"HostApplicationDisplayID", "phone"}};
+  session->setConfiguration(&config);
+  bool completed = false;
+  session->start();
+  session->setTransactionCompleteBlock([&](bool ok) { completed = ok; });
+  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  session->stop();  // before the setup task ran: everything waits behind it
+  EXPECT_TRUE(completed);
+  EXPECT_FALSE(session->started());
+  EXPECT_FALSE(session->aggregatedPayloadData());
+  t.drain();
+  ASSERT_TRUE(t.fern->waitFor(
+      [](const auto& events) {
+        return !events.empty() && events.back().kind == Kind::kFlush;
+      },
+      std::chrono::seconds(5)));
+
+  std::vector<Kind> kinds;
+  for (const auto& e : t.fern->events()) kinds.push_back(e.kind);
+  EXPECT_EQ(kinds, (std::vector<Kind>{Kind::kToken, Kind::kOpen, Kind::kStartConfiguration,
+                                      Kind::kMessage, Kind::kMessage, Kind::kFlush}));
+  auto open = t.fern->events(Kind::kOpen)[0];
+  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoClientType], 19);
+  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoSessionID], 42);
+  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoBatchEvent], true);
+  EXPECT_EQ(open.userInfo[fern::kUserInfoServiceName], "telephony_session");
+  EXPECT_EQ(open.userInfo["HostApplicationDisplayID"], "phone");
+  auto summary = t.fern->events(Kind::kMessage)[1];
+  EXPECT_EQ(summary.category, 65535);
+  EXPECT_EQ(summary.type, 65535);
+  EXPECT_EQ(summary.payload["SX_Session_Summary_Event"], "2");
+  EXPECT_EQ(summary.payload["Playback_Start_1"], R"({"k":1})");
+  EXPECT_TRUE(t.log->contains("sending summary event for reporter 42"));
+  EXPECT_TRUE(t.log->contains("List of backends [\"fake\"]"));
+}
+
+TEST(SXReportingSessionLifecycle, NoBackendsDropsTheServerSession) {
+  TestEnvironment t;
+  t.fern->setBackends(std::vector<std::string>{});
+  auto session = makeSession(t);
+  session->start();
+  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  session->stop();
+  t.drain();
+  EXPECT_TRUE(t.log->contains("waiting for fernreportingd to find backends"));
+  EXPECT_TRUE(t.log->contains("No backends found, this session won't get sent to the server"));
+  EXPECT_EQ(t.log->count("failed to find backend"), 1u);
+  EXPECT_EQ(t.log->count("No valid FernReportingSession"), 2u);  // the message and the summary
+  EXPECT_TRUE(t.fern->events(Kind::kMessage).empty());
+  EXPECT_TRUE(t.fern->events(Kind::kFlush).empty());
+  EXPECT_FALSE(session->fernReportingSession());
+}
+
+TEST(SXReportingSessionLifecycle, TestSessionsNeverTalkToTheServer) {
+  TestEnvironment t;
+  auto session = makeSession(t, 42, 11);
+  session->start();
+  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  session->stop();
+  t.drain();
+  EXPECT_TRUE(t.fern->events().empty());
+  EXPECT_EQ(t.log->count("transactions aren't allowed on this platform"), 2u);
+  EXPECT_FALSE(session->fernReportingAgentToken());
+}
+
+TEST(SXReportingSessionLifecycle, SecondStartKeepsEverythingAndRestartContinuesNumbering) {
+  TestEnvironment t;
+  auto session = makeSession(t);
+  session->start();
+  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  session->start();
+  EXPECT_TRUE(t.log->contains("42 is already started"));
+  EXPECT_EQ(session->aggregatedPayloadEntries().size(), 1u);
+  session->stop();
+  session->start();
+  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  EXPECT_TRUE(session->aggregatedPayloadEntries()[0].contains("Playback_Start_2"));
+  t.drain();
+  EXPECT_EQ(t.fern->events(Kind::kToken).size(), 2u);
+}
+
+TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
+  TestEnvironment t;
+  auto session = makeSession(t);
+  EXPECT_FALSE(session->createSummaryEventForSession());  // creation-time aggregate is empty
+  session->start();
+  EXPECT_FALSE(session->createSummaryEventForSession());
+  session->sendMessage({{"a", 1}}, 3, 1, nullptr);
+  session->sendMessage({{"b", "x"}}, 3, 1, nullptr);
+  auto event = session->createSummaryEventForSession();
+  ASSERT_TRUE(event);
+  EXPECT_EQ(*event, (SXValue{{"SX_Session_Summary_Event", "7"},
+                             {"Playback_Start_1", R"({"a":1})"},
+                             {"Playback_Start_2", R"({"b":"x"})"}}));
+  // Not an internal build: no file, but the configuration now heads the aggregate.
+  EXPECT_TRUE(t.fileSystem->files.empty());
+  EXPECT_TRUE(t.fileSystem->directories.empty());
+  EXPECT_EQ(session->aggregatedPayloadEntries()[0], SXValue::object());
+}
+
+TEST(SXReportingSessionSummary, InternalBuildWritesTheFileWithConfigurationFirst) {
+  TestEnvironment t(internalBuild());
+  auto session = makeSession(t);
+  SXValue config = {{"HostApplicationDisplayID", "../evil/player"}};
+  session->setConfiguration(&config);
+  session->start();
+  session->sendMessage({{"a", 1}}, 3, 1, nullptr);
+  ASSERT_TRUE(session->createSummaryEventForSession());
+  EXPECT_EQ(t.fileSystem->directories.at("/diag"), 0777u);
+  ASSERT_EQ(t.fileSystem->files.size(), 1u);
+  const auto& [path, contents] = *t.fileSystem->files.begin();
+  EXPECT_EQ(path.rfind("/diag/", 0), 0u);
+  EXPECT_EQ(path.find('/', 6), std::string::npos) << path;  // no directories below /diag
+  EXPECT_NE(path.find("-sonex-.._evil_player-longformaudio.json"), std::string::npos) << path;
+  SXValue written = SXValue::parse(contents);
+  EXPECT_EQ(written[0], config);
+  EXPECT_EQ(written[1], (SXValue{{"Playback_Start_1", {{"a", 1}}}}));
+}
+
+TEST(SXReportingSessionSummary, FileFailuresAreLoggedAndTheEventStillReturned) {
+  TestEnvironment t(internalBuild());
+  t.fileSystem->failDirectories = true;
+  t.fileSystem->failWrites = true;
+  auto session = makeSession(t);
+  session->start();
+  session->sendMessage({{"a", 1}}, 3, 1, nullptr);
+  EXPECT_TRUE(session->createSummaryEventForSession());
+  auto lines = t.log->lines();
+  auto fromSummary = [&](const std::string& fragment) {
+    for (const auto& l : lines) {
+      if (l.message.find(fragment) != std::string::npos) {
+        return l.level == SXLogLevel::kError &&
+               l.text.find(":-[SXReportingSession createSummaryEventForSession]: ") !=
+                   std::string::npos;
+      }
+    }
+    return false;
+  };
+  EXPECT_TRUE(fromSummary("can't create logging directory at /diag: "));
+  EXPECT_TRUE(fromSummary("jsonOutput writeToURL: "));
+}
+
+TEST(SXReportingSessionOrientation, WhoTracks) {
+  struct Case {
+    SXValue device;
+    SXReportingServiceType type;
+    bool tracks;
+  };
+  for (const auto& c : {Case{internalBuild(), 2, true}, Case{internalBuild(), 7, true},
+                        Case{internalBuild(), 1, false}, Case{internalBuild(6), 2, false},
+                        Case{{{"InternalBuild", true}}, 7, true},
+                        Case{SXValue::object(), 2, false}}) {
+    TestEnvironment t(c.device);
+    auto session = makeSession(t, 42, c.type);
+    session->start();
+    EXPECT_EQ(session->startDate().has_value(), c.tracks);
+    session->stop();
+    std::vector<std::string> expected;
+    if (c.tracks) {
+      expected = {"registerDevice SXReportingService 42", "registerInterface SXReportingService 42",
+                  "unregisterDevice SXReportingService 42",
+                  "unregisterInterface SXReportingService 42"};
+    }
+    EXPECT_EQ(t.orientation->calls(), expected) << c.device.dump() << " type " << c.type;
+  }
+}
+
+TEST(SXReportingSessionOrientation, ReportsRoundedTimesIntoTheSummary) {
+  TestEnvironment t(internalBuild());
+  auto session = makeSession(t, 42, 2);
+  session->start();
+  const std::string id = "SXReportingService 42";
+  t.clock->advance(0.0005);
+  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 1)); }).join();
+  t.clock->advance(1.23456 - 0.0005);
+  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 3)); }).join();
+  t.clock->advance(12.0004 - 1.23456);
+  std::thread([&] { EXPECT_TRUE(t.orientation->fireInterface(id, 4)); }).join();
+  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 2)); }).join();
+
+  auto event = session->createSummaryEventForSession();
+  ASSERT_TRUE(event);
+  EXPECT_EQ((*event)["device_orientation"], "orientation1,orientation3,orientation2");
+  EXPECT_EQ((*event)["device_orientation_time"], "0.001,1.235,12");
+  EXPECT_EQ((*event)["ui_orientation"], "orientation4");
+  EXPECT_EQ((*event)["ui_orientation_time"], "12");
+  EXPECT_TRUE(t.log->contains(
+      "Orientation handler callback mode=device orientation=\"orientation1\" app=\"(null)\", "
+      "time=0.001, id=\"SXReportingService 42\""));
+
+  session->stop();
+  EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
+}
