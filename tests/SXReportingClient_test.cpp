@@ -1,11 +1,10 @@
-#include "sxreporting/client.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <condition_variable>
 
 #include "fakes/FakeRpcServer.h"
+#include "sxreporting/client.h"
 
 using namespace std::chrono_literals;
 using namespace sxr::method;
@@ -149,9 +148,8 @@ TEST_F(SXReportingClientTest, ManyCallsInFlightMatchOutOfOrderReplies) {
 }
 
 TEST_F(SXReportingClientTest, WithheldReplyTimesOutAndItsLateReplyIsIgnored) {
-  server_.on(kStop, [](const SXValue& p) {
-    return p[0] == 0 ? Answer::none() : Answer::reply(true);
-  });
+  server_.on(kStop,
+             [](const SXValue& p) { return p[0] == 0 ? Answer::none() : Answer::reply(true); });
   server_.on(kCreate, [](auto&) { return Answer::reply(true); });
   auto stop = client_->stopReportingSessionForID(0, 100ms);
   auto longer = client_->stopReportingSessionForID(0, 60s);
@@ -178,7 +176,8 @@ TEST_F(SXReportingClientTest, DefaultTimeoutComesFromTheOptions) {
 TEST_F(SXReportingClientTest, ConnectionLossCompletesEveryPendingCall) {
   server_.on(kStart, [](auto&) { return Answer::none(); });
   std::vector<std::future<SXCallResult<bool>>> starts;
-  for (int i = 1; i <= 5; ++i) starts.push_back(client_->startReportingSessionForID(i, kSXWaitForever));
+  for (int i = 1; i <= 5; ++i)
+    starts.push_back(client_->startReportingSessionForID(i, kSXWaitForever));
   ASSERT_TRUE(server_.waitForRequests(5));
   server_.closeConnections();
   for (auto& start : starts) {

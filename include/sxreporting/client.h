@@ -101,8 +101,7 @@ class SXReportingClient {
                                                  int64_t reporterID, SXTimeout timeout = {});
 
   // 65535 when no session has the ID.
-  void getServiceNameForReporterID(int64_t reporterID,
-                                   SXCallback<SXReportingServiceType> callback,
+  void getServiceNameForReporterID(int64_t reporterID, SXCallback<SXReportingServiceType> callback,
                                    SXTimeout timeout = {});
   std::future<SXCallResult<SXReportingServiceType>> getServiceNameForReporterID(
       int64_t reporterID, SXTimeout timeout = {});
@@ -169,8 +168,7 @@ class SXReportingClient {
   template <typename T>
   void typedCall(const char* method, SXValue params, SXCallback<T> callback, SXTimeout timeout);
   template <typename T>
-  std::future<SXCallResult<T>> futureCall(const char* method, SXValue params,
-                                          SXTimeout timeout);
+  std::future<SXCallResult<T>> futureCall(const char* method, SXValue params, SXTimeout timeout);
 
   std::shared_ptr<SXRpcChannel> impl_;  // shared with the I/O thread, which may outlive this object
   std::thread thread_;

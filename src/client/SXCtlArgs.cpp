@@ -160,8 +160,8 @@ bool parseBool(const std::string& text, bool& out) {
 
 bool buildDefaultsValue(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   const std::string& text = raw.positional[2];
-  const size_t kinds = raw.flags.count("--bool") + raw.flags.count("--int") +
-                       raw.flags.count("--string");
+  const size_t kinds =
+      raw.flags.count("--bool") + raw.flags.count("--int") + raw.flags.count("--string");
   if (kinds > 1) {
     error = "give at most one of --bool, --int and --string";
     return false;
@@ -186,14 +186,15 @@ bool buildDefaultsValue(const RawArgs& raw, SXCtlRequest& r, std::string& error)
 bool buildDefaults(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   r.defaultsAction = raw.positional[0];
   const size_t keyAndValue = raw.positional.size() - 1;
-  const bool typed = raw.flags.contains("--bool") || raw.flags.contains("--int") ||
-                     raw.flags.contains("--string");
+  const bool typed =
+      raw.flags.contains("--bool") || raw.flags.contains("--int") || raw.flags.contains("--string");
   if (keyAndValue >= 1) r.key = raw.positional[1];
   if (r.defaultsAction == "read" && keyAndValue <= 1 && !typed) return true;
   if (r.defaultsAction == "delete" && keyAndValue == 1 && !typed) return true;
   if (r.defaultsAction == "write" && keyAndValue == 2) return buildDefaultsValue(raw, r, error);
-  error = "usage: sxreportctl defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | "
-          "delete KEY";
+  error =
+      "usage: sxreportctl defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | "
+      "delete KEY";
   return false;
 }
 
@@ -250,8 +251,7 @@ bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSp
   const std::string& arg = args[i];
   const size_t equals = arg.find('=');
   const std::string name = arg.substr(0, equals);
-  const bool wantsValue =
-      isGlobalValueOption(name) || (spec && contains(spec->valueOptions, name));
+  const bool wantsValue = isGlobalValueOption(name) || (spec && contains(spec->valueOptions, name));
   if (name == "--json" || name == "--help" || (spec && contains(spec->flagOptions, name))) {
     if (equals != std::string::npos) {
       error = name + " takes no value";
@@ -331,6 +331,47 @@ bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& r, std::stri
   return spec.build(raw, r, error);
 }
 
+namespace {
+
+void applyGlobals(const SXCtlRequest& from, SXCtlRequest& to) {
+  if (from.socketPath) to.socketPath = from.socketPath;
+  if (from.stateDir) to.stateDir = from.stateDir;
+  if (from.configDir) to.configDir = from.configDir;
+  if (from.runtimeDir) to.runtimeDir = from.runtimeDir;
+  if (from.timeoutSeconds) to.timeoutSeconds = from.timeoutSeconds;
+  to.json = to.json || from.json;
+}
+
+}  // namespace
+
+bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
+                     std::string& error) {
+  requests.clear();
+  std::vector<std::vector<std::string>> segments(1);
+  for (const auto& arg : args) {
+    auto& segment = segments.back();
+    const bool literal = std::find(segment.begin(), segment.end(), "--") != segment.end();
+    if (arg == "then" && !literal) {
+      segments.emplace_back();
+    } else {
+      segment.push_back(arg);
+    }
+  }
+  const bool gap = std::any_of(segments.begin(), segments.end(),
+                               [](const auto& segment) { return segment.empty(); });
+  if (segments.size() > 1 && gap) {
+    error = "'then' must stand between two commands";
+    return false;
+  }
+  SXCtlRequest globals;
+  for (const auto& segment : segments) {
+    if (!SXCtlParse(segment, requests.emplace_back(), error)) return false;
+    applyGlobals(requests.back(), globals);
+  }
+  for (auto& request : requests) applyGlobals(globals, request);
+  return true;
+}
+
 SXTimeout SXCtlTimeout(const SXCtlRequest& request) {
   if (!request.timeoutSeconds) {
     if (request.command == "start") return kSXWaitForever;
@@ -359,10 +400,12 @@ SXPaths SXCtlPaths(const SXCtlRequest& request) {
 namespace {
 
 const std::vector<CommandSpec>& commandSpecs() {
+  // clang-format off
   static const std::vector<CommandSpec> specs = {
       {"create", "create ID", "create a reporting session",
        "Creates a session with reporter ID ID (a signed 64-bit number of your choosing).\n"
-       "Replies true.",
+       "Replies true. The session belongs to this connection and goes when it closes, so\n"
+       "chain the commands that need it: create 42 then start 42.",
        1, 1, {}, {}, buildReporterID},
       {"set-type", "set-type TYPE ID", "set a session's service type",
        "TYPE is a number (0-65535) or a name: generic, vokira, telephony, haptics, alarms,\n"
@@ -420,6 +463,7 @@ const std::vector<CommandSpec>& commandSpecs() {
        "Touches <runtime-dir>/notify/NAME, which wakes every process watching that name.", 1, 1,
        {}, {}, buildNotify},
   };
+  // clang-format on
   return specs;
 }
 
@@ -452,14 +496,18 @@ std::string SXCtlHelp(const std::string& command) {
   if (const CommandSpec* spec = findSpec(command)) {
     std::string summary(spec->summary);
     summary[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(summary[0])));
-    return "usage: sxreportctl [options] " + std::string(spec->usage) + "\n\n" + summary +
-           ".\n" + std::string(spec->details) + "\n\n" + std::string(kCommandOptionsHelp);
+    return "usage: sxreportctl [options] " + std::string(spec->usage) + "\n\n" + summary + ".\n" +
+           std::string(spec->details) + "\n\n" + std::string(kCommandOptionsHelp);
   }
   std::string text =
       "usage: sxreportctl [options] COMMAND [ARGS]\n\n"
-      "Talks to the reporting service and reads its local stores.\n\nCommands:\n";
+      "Talks to the reporting service and reads its local stores.\n"
+      "Commands joined by `then` run in order on one connection, stopping at the first that\n"
+      "fails. A session lives as long as the connection that created it, so create and start\n"
+      "it in one run: sxreportctl create 42 then set-type telephony 42 then start 42\n"
+      "\nCommands:\n";
   for (const auto& spec : commandSpecs()) {
-    std::string usage(spec.name == "send" ? "send ... PAYLOAD_JSON"
+    std::string usage(spec.name == "send"       ? "send ... PAYLOAD_JSON"
                       : spec.name == "defaults" ? "defaults read|write|delete ..."
                                                 : spec.usage);
     usage.resize(std::max<size_t>(usage.size() + 2, 34), ' ');

@@ -24,10 +24,10 @@ struct SXCtlRequest {
   // Arguments; each is set only by the commands that take it.
   int64_t reporterID = 0;
   SXReportingServiceType serviceType = 0;
-  std::optional<SXValue> configuration;  // configure: nothing when the JSON is null
-  SXValue payload;                       // send
-  SXReportingCategory category = 3;      // send: "Playback"
-  SXReportingMessageType messageType = 1;  // send: "Start"
+  std::optional<SXValue> configuration;             // configure: nothing when the JSON is null
+  SXValue payload;                                  // send
+  SXReportingCategory category = 3;                 // send: "Playback"
+  SXReportingMessageType messageType = 1;           // send: "Start"
   std::optional<std::vector<int64_t>> reporterIDs;  // send: nothing means broadcast
   std::optional<std::string> eventName;             // events
   std::optional<int64_t> limit;                     // events: the newest N only
@@ -40,6 +40,12 @@ struct SXCtlRequest {
 // Parses the arguments that follow the program name. On failure returns false and says what
 // is wrong in `error`.
 bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& request, std::string& error);
+
+// Parses a chain of commands joined by the word "then" ("create 42 then start 42"), which
+// run in order on one connection: a session lives only as long as the connection that created
+// it. Global options anywhere apply to every command. After "--", "then" is an argument.
+bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
+                     std::string& error);
 
 // The help of `command`, or the overview for an empty or unknown command.
 std::string SXCtlHelp(const std::string& command);

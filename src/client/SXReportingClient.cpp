@@ -1,7 +1,6 @@
-#include "sxreporting/client.h"
-
 #include "client/SXRpcChannel.h"
 #include "common/SXPaths.h"
+#include "sxreporting/client.h"
 
 namespace {
 
@@ -83,11 +82,16 @@ SXValue idList(const std::optional<std::vector<int64_t>>& ids) {
 
 const char* SXCallStatusName(SXCallStatus status) {
   switch (status) {
-    case SXCallStatus::kReplied: return "replied";
-    case SXCallStatus::kRemoteError: return "remote error";
-    case SXCallStatus::kTimedOut: return "timed out";
-    case SXCallStatus::kConnectionLost: return "connection lost";
-    case SXCallStatus::kBadReply: return "bad reply";
+    case SXCallStatus::kReplied:
+      return "replied";
+    case SXCallStatus::kRemoteError:
+      return "remote error";
+    case SXCallStatus::kTimedOut:
+      return "timed out";
+    case SXCallStatus::kConnectionLost:
+      return "connection lost";
+    case SXCallStatus::kBadReply:
+      return "bad reply";
   }
   return "unknown";
 }
@@ -125,20 +129,19 @@ const std::string& SXReportingClient::socketPath() const { return impl_->socketP
 template <typename T>
 void SXReportingClient::typedCall(const char* method, SXValue params, SXCallback<T> callback,
                                   SXTimeout timeout) {
-  impl_->call(method, params, timeout,
-              [callback = std::move(callback)](SXCallResult<SXValue> raw) {
-                SXCallResult<T> result{raw.status, T{}, std::move(raw.error)};
-                if (raw.replied()) {
-                  if (auto value = decodeReply<T>(raw.value)) {
-                    result.value = std::move(*value);
-                  } else {
-                    result.status = SXCallStatus::kBadReply;
-                    result.error = "unexpected reply " + raw.value.dump(-1, ' ', false,
-                                                                    SXValue::error_handler_t::replace);
-                  }
-                }
-                callback(std::move(result));
-              });
+  impl_->call(method, params, timeout, [callback = std::move(callback)](SXCallResult<SXValue> raw) {
+    SXCallResult<T> result{raw.status, T{}, std::move(raw.error)};
+    if (raw.replied()) {
+      if (auto value = decodeReply<T>(raw.value)) {
+        result.value = std::move(*value);
+      } else {
+        result.status = SXCallStatus::kBadReply;
+        result.error =
+            "unexpected reply " + raw.value.dump(-1, ' ', false, SXValue::error_handler_t::replace);
+      }
+    }
+    callback(std::move(result));
+  });
 }
 
 template <typename T>
@@ -153,14 +156,14 @@ std::future<SXCallResult<T>> SXReportingClient::futureCall(const char* method, S
 }
 
 // Both forms of each operation, from the method name, the params and the reply type.
-#define SX_OPERATION(Name, T, Method, Params, ...)                                         \
-  void SXReportingClient::Name(__VA_ARGS__ __VA_OPT__(, ) SXCallback<T> callback,         \
-                               SXTimeout timeout) {                                       \
-    typedCall<T>(Method, Params, std::move(callback), timeout);                           \
-  }                                                                                       \
-  std::future<SXCallResult<T>> SXReportingClient::Name(__VA_ARGS__ __VA_OPT__(, )         \
-                                                           SXTimeout timeout) {           \
-    return futureCall<T>(Method, Params, timeout);                                        \
+#define SX_OPERATION(Name, T, Method, Params, ...)                                \
+  void SXReportingClient::Name(__VA_ARGS__ __VA_OPT__(, ) SXCallback<T> callback, \
+                               SXTimeout timeout) {                               \
+    typedCall<T>(Method, Params, std::move(callback), timeout);                   \
+  }                                                                               \
+  std::future<SXCallResult<T>> SXReportingClient::Name(__VA_ARGS__ __VA_OPT__(, ) \
+                                                           SXTimeout timeout) {   \
+    return futureCall<T>(Method, Params, timeout);                                \
   }
 
 using namespace sxr::method;

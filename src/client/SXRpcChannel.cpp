@@ -157,17 +157,16 @@ void SXRpcChannel::flush() {
 
 void SXRpcChannel::startRead() {
   char* buffer = decoder_.prepare(kReadChunk);
-  socket_.async_read_some(asio::buffer(buffer, kReadChunk),
-                          [this](const asio::error_code& ec, size_t size) {
-                            if (ec) {
-                              fail(ec == asio::error::eof
-                                       ? "the service closed the connection"
-                                       : "connection to the service lost: " + ec.message());
-                              return;
-                            }
-                            decoder_.commit(size);
-                            if (drainReplies()) startRead();
-                          });
+  socket_.async_read_some(
+      asio::buffer(buffer, kReadChunk), [this](const asio::error_code& ec, size_t size) {
+        if (ec) {
+          fail(ec == asio::error::eof ? "the service closed the connection"
+                                      : "connection to the service lost: " + ec.message());
+          return;
+        }
+        decoder_.commit(size);
+        if (drainReplies()) startRead();
+      });
 }
 
 bool SXRpcChannel::drainReplies() {

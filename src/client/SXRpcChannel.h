@@ -69,18 +69,18 @@ class SXRpcChannel {
 
   asio::io_context io_;
   asio::executor_work_guard<asio::io_context::executor_type> work_;  // I/O thread only
-  asio::local::stream_protocol::socket socket_;                        // I/O thread only
-  asio::steady_timer timer_;                                           // I/O thread only
-  RpcStreamDecoder decoder_;                                           // I/O thread only
+  asio::local::stream_protocol::socket socket_;                      // I/O thread only
+  asio::steady_timer timer_;                                         // I/O thread only
+  RpcStreamDecoder decoder_;                                         // I/O thread only
   msgpack::sbuffer writing_;  // I/O thread only: the bytes of the write in flight
 
   mutable std::mutex mutex_;
-  State state_ = State::kIdle;                                // GUARDED_BY(mutex_)
-  std::string closeReason_;                                   // GUARDED_BY(mutex_)
-  uint32_t nextMsgid_ = 1;                                    // GUARDED_BY(mutex_)
-  std::unordered_map<uint32_t, Pending> pending_;             // GUARDED_BY(mutex_)
-  std::multimap<Clock::time_point, uint32_t> deadlines_;      // GUARDED_BY(mutex_)
+  State state_ = State::kIdle;                                  // GUARDED_BY(mutex_)
+  std::string closeReason_;                                     // GUARDED_BY(mutex_)
+  uint32_t nextMsgid_ = 1;                                      // GUARDED_BY(mutex_)
+  std::unordered_map<uint32_t, Pending> pending_;               // GUARDED_BY(mutex_)
+  std::multimap<Clock::time_point, uint32_t> deadlines_;        // GUARDED_BY(mutex_)
   Clock::time_point timerArmedFor_ = Clock::time_point::max();  // GUARDED_BY(mutex_)
-  msgpack::sbuffer outbox_;  // GUARDED_BY(mutex_): requests not yet handed to a write
+  msgpack::sbuffer outbox_;      // GUARDED_BY(mutex_): requests not yet handed to a write
   bool writeScheduled_ = false;  // GUARDED_BY(mutex_): a write is in flight or a flush posted
 };

@@ -8,9 +8,9 @@
 namespace {
 
 constexpr std::array<std::string_view, 12> kNames = {
-    "generic",       "vokira",           "telephony",        "haptics",
-    "alarms",        "standalone",       "soundautoconfig",  "longformaudio",
-    "nonlongformaudio", "audiodeviceusage", "alerts",        "test"};
+    "generic",          "vokira",           "telephony",       "haptics",
+    "alarms",           "standalone",       "soundautoconfig", "longformaudio",
+    "nonlongformaudio", "audiodeviceusage", "alerts",          "test"};
 
 constexpr std::string_view kUnknownName = "unknown";
 

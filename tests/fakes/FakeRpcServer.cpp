@@ -15,19 +15,18 @@ class FakeRpcServer::Connection : public std::enable_shared_from_this<Connection
 
   void read() {
     char* buffer = decoder_.prepare(4096);
-    socket_.async_read_some(asio::buffer(buffer, 4096),
-                            [self = shared_from_this()](const asio::error_code& ec, size_t n) {
-                              if (ec) return self->close();
-                              self->decoder_.commit(n);
-                              SXValue message;
-                              RpcStreamDecoder::Status status;
-                              while ((status = self->decoder_.next(message)) ==
-                                     RpcStreamDecoder::Status::kMessage) {
-                                self->server_.handle(self, message);
-                              }
-                              if (status == RpcStreamDecoder::Status::kBroken) return self->close();
-                              self->read();
-                            });
+    socket_.async_read_some(asio::buffer(buffer, 4096), [self = shared_from_this()](
+                                                            const asio::error_code& ec, size_t n) {
+      if (ec) return self->close();
+      self->decoder_.commit(n);
+      SXValue message;
+      RpcStreamDecoder::Status status;
+      while ((status = self->decoder_.next(message)) == RpcStreamDecoder::Status::kMessage) {
+        self->server_.handle(self, message);
+      }
+      if (status == RpcStreamDecoder::Status::kBroken) return self->close();
+      self->read();
+    });
   }
 
   void send(std::string bytes) {
@@ -89,23 +88,22 @@ FakeRpcServer::~FakeRpcServer() {
 }
 
 void FakeRpcServer::accept() {
-  acceptor_.async_accept([this](const asio::error_code& ec,
-                                asio::local::stream_protocol::socket socket) {
-    if (ec) return;
-    auto connection = std::make_shared<Connection>(*this, std::move(socket));
-    connections_.insert(connection);
-    connection->read();
-    {
-      std::lock_guard lock(mutex_);
-      ++connectionCount_;
-    }
-    changed_.notify_all();
-    accept();
-  });
+  acceptor_.async_accept(
+      [this](const asio::error_code& ec, asio::local::stream_protocol::socket socket) {
+        if (ec) return;
+        auto connection = std::make_shared<Connection>(*this, std::move(socket));
+        connections_.insert(connection);
+        connection->read();
+        {
+          std::lock_guard lock(mutex_);
+          ++connectionCount_;
+        }
+        changed_.notify_all();
+        accept();
+      });
 }
 
-void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection,
-                           const SXValue& message) {
+void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const SXValue& message) {
   std::string why;
   std::optional<uint32_t> msgid;
   auto request = RpcParseRequest(message, why, msgid);
@@ -118,8 +116,8 @@ void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection,
     handler = it != handlers_.end() ? it->second : anyHandler_;
   }
   changed_.notify_all();
-  Answer answer = handler ? handler(request->params)
-                          : Answer::fail("unknown method " + request->method);
+  Answer answer =
+      handler ? handler(request->params) : Answer::fail("unknown method " + request->method);
   if (answer.withhold) return;
   connection->send(encodeResponse(request->msgid, answer.error, answer.result));
 }
@@ -142,6 +140,11 @@ std::vector<FakeRpcServer::Request> FakeRpcServer::requests() const {
 bool FakeRpcServer::waitForRequests(size_t count, std::chrono::milliseconds timeout) {
   std::unique_lock lock(mutex_);
   return changed_.wait_for(lock, timeout, [&] { return requests_.size() >= count; });
+}
+
+size_t FakeRpcServer::connectionCount() const {
+  std::lock_guard lock(mutex_);
+  return connectionCount_;
 }
 
 bool FakeRpcServer::waitForConnections(size_t count, std::chrono::milliseconds timeout) {

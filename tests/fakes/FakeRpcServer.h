@@ -55,6 +55,7 @@ class FakeRpcServer {
   std::vector<Request> requests() const;
   // Waits until at least `count` requests have arrived. False when they did not in time.
   bool waitForRequests(size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10));
+  size_t connectionCount() const;  // accepted so far
   bool waitForConnections(size_t count,
                           std::chrono::milliseconds timeout = std::chrono::seconds(10));
 

@@ -146,8 +146,7 @@ int readDefaults(const SXCtlRequest& r, const SXValue& domain) {
   }
   auto it = domain.find(*r.key);
   if (it == domain.end()) {
-    std::cerr << "defaults: " << kSXCtlPreferencesDomain << " has no value for " << *r.key
-              << "\n";
+    std::cerr << "defaults: " << kSXCtlPreferencesDomain << " has no value for " << *r.key << "\n";
     return 1;
   }
   std::cout << (r.json ? jsonText(*it) : SXValueText(*it)) << "\n";

@@ -3,8 +3,8 @@
 #include <cstdio>
 #include <iostream>
 
-#include "client/SXServiceTypeNames.h"
 #include "CtlStatus.h"
+#include "client/SXServiceTypeNames.h"
 
 namespace {
 
@@ -40,17 +40,16 @@ std::string boolText(bool value) { return value ? "true" : "false"; }
 
 std::string sendText(const std::optional<SXError>& error) {
   if (!error) return "delivered";
-  std::string what = error->domain == kSXReportingErrorDomain &&
-                             error->code == kSXReportingErrorReportingDisabled
-                         ? "reporting is disabled"
-                         : "the service replied with an error";
+  std::string what =
+      error->domain == kSXReportingErrorDomain && error->code == kSXReportingErrorReportingDisabled
+          ? "reporting is disabled"
+          : "the service replied with an error";
   return "not delivered: " + what + " (domain " + error->domain + ", code " +
          std::to_string(error->code) + ")";
 }
 
 std::string validText(const SXReporterIDValidity& v) {
-  return "reporterID " + std::to_string(v.reporterID) + ", serviceType " +
-         typeText(v.serviceType);
+  return "reporterID " + std::to_string(v.reporterID) + ", serviceType " + typeText(v.serviceType);
 }
 
 std::string listText(const std::vector<int64_t>& ids) {
@@ -83,9 +82,8 @@ Outcome perform(SXReportingClient& client, const SXCtlRequest& r) {
   }
   if (c == "start") return finish(client.startReportingSessionForID(id, timeout), boolText);
   if (c == "send") {
-    return finish(
-        client.sendMessage(r.payload, r.category, r.messageType, r.reporterIDs, timeout),
-        sendText);
+    return finish(client.sendMessage(r.payload, r.category, r.messageType, r.reporterIDs, timeout),
+                  sendText);
   }
   if (c == "stop") return finish(client.stopReportingSessionForID(id, timeout), boolText);
   if (c == "destroy") return finish(client.destroyReportingSession(id, timeout), boolText);
@@ -131,12 +129,6 @@ int report(const SXCtlRequest& request, const Outcome& outcome) {
 
 }  // namespace
 
-int SXCtlRunRemote(const SXCtlRequest& request, const SXPaths& paths) {
-  SXReportingClient client(SXClientOptions{paths.socketPath});
-  std::string error;
-  if (!client.connect(&error)) {
-    std::cerr << "sxreportctl: " << error << " (is sxreportingd running?)\n";
-    return 2;
-  }
+int SXCtlRunRemote(const SXCtlRequest& request, SXReportingClient& client) {
   return report(request, perform(client, request));
 }

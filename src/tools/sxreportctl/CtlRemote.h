@@ -4,7 +4,6 @@
 
 #include "client/SXCtlArgs.h"
 
-// Connects, performs the request's operation and prints the outcome. Returns the exit status:
-// 0 replied, 1 no reply in time, 2 connection or request error.
-int SXCtlRunRemote(const SXCtlRequest& request, const SXPaths& paths);
-
+// Performs the request's operation on `client` (connected) and prints the outcome. Returns the
+// exit status: 0 replied, 1 no reply in time, 2 connection or request error.
+int SXCtlRunRemote(const SXCtlRequest& request, SXReportingClient& client);

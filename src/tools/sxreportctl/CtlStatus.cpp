@@ -48,8 +48,8 @@ std::string sessionText(const SXValue& session) {
 std::string clientText(const SXValue& client) {
   const SXValue& name = field(client, "processName");
   std::string text = "  pid " + SXValueText(field(client, "pid")) + " " +
-                     (name.is_string() ? name.get<std::string>() : "(unknown process)") +
-                     ", up " + uptimeText(field(client, "uptimeSeconds")) + "\n";
+                     (name.is_string() ? name.get<std::string>() : "(unknown process)") + ", up " +
+                     uptimeText(field(client, "uptimeSeconds")) + "\n";
   const SXValue& sessions = field(client, "sessions");
   if (!sessions.is_array() || sessions.empty()) return text + "    (no sessions)\n";
   for (const auto& session : sessions) text += sessionText(session);
@@ -69,10 +69,9 @@ std::string keyValueLines(const SXValue& object) {
 
 std::string SXCtlStatusText(const SXValue& status) {
   const SXValue& enabled = field(status, "reportingEnabled");
-  std::string text = "reporting enabled: " +
-                     std::string(enabled.is_boolean() ? (enabled.get<bool>() ? "yes" : "no")
-                                                      : "unknown") +
-                     "\n";
+  std::string text =
+      "reporting enabled: " +
+      std::string(enabled.is_boolean() ? (enabled.get<bool>() ? "yes" : "no") : "unknown") + "\n";
   const SXValue& clients = field(status, "clients");
   if (!clients.is_array() || clients.empty()) {
     text += "clients: (none)\n";
