@@ -1,0 +1,517 @@
+#include "client/SXCtlArgs.h"
+
+#include <algorithm>
+#include <cctype>
+#include <charconv>
+#include <cmath>
+#include <map>
+#include <set>
+#include <string_view>
+
+#include "client/SXServiceTypeNames.h"
+
+namespace {
+
+// The arguments of one command line, sorted but not yet read.
+struct RawArgs {
+  std::vector<std::string> positional;  // after the command name
+  std::map<std::string, std::string> options;
+  std::set<std::string> flags;
+};
+
+using Builder = bool (*)(const RawArgs&, SXCtlRequest&, std::string&);
+
+struct CommandSpec {
+  std::string_view name;
+  std::string_view usage;    // what follows "sxreportctl"
+  std::string_view summary;  // one line in the overview
+  std::string_view details;  // the rest of the command's help
+  size_t minArgs;
+  size_t maxArgs;
+  std::vector<std::string_view> valueOptions;
+  std::vector<std::string_view> flagOptions;
+  Builder build;
+};
+
+bool parseInt64(const std::string& text, const char* what, int64_t& out, std::string& error) {
+  auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), out);
+  if (text.empty() || ec != std::errc() || end != text.data() + text.size()) {
+    error = std::string("not ") + what + ": '" + text + "'";
+    return false;
+  }
+  return true;
+}
+
+// A decimal or 0x-hexadecimal number no larger than `max`.
+bool parseUnsigned(const std::string& text, uint64_t max, const char* what, uint64_t& out,
+                   std::string& error) {
+  const bool hex = text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
+  const char* begin = text.data() + (hex ? 2 : 0);
+  auto [end, ec] = std::from_chars(begin, text.data() + text.size(), out, hex ? 16 : 10);
+  if (text.empty() || ec != std::errc() || end != text.data() + text.size() || out > max) {
+    error = std::string("not ") + what + ": '" + text + "' (0 to " + std::to_string(max) + ")";
+    return false;
+  }
+  return true;
+}
+
+bool parseJson(const std::string& text, const char* what, SXValue& out, std::string& error) {
+  out = SXValue::parse(text, nullptr, false);
+  if (out.is_discarded()) {
+    error = std::string(what) + " is not valid JSON: " + text;
+    return false;
+  }
+  return true;
+}
+
+bool parseIDList(const std::string& text, std::vector<int64_t>& ids, std::string& error) {
+  size_t start = 0;
+  while (start < text.size()) {
+    size_t comma = std::min(text.find(',', start), text.size());
+    int64_t id = 0;
+    if (!parseInt64(text.substr(start, comma - start), "a reporter ID", id, error)) return false;
+    ids.push_back(id);
+    start = comma + 1;
+  }
+  return true;
+}
+
+bool buildNothing(const RawArgs&, SXCtlRequest&, std::string&) { return true; }
+
+bool buildReporterID(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  return parseInt64(raw.positional.back(), "a reporter ID", r.reporterID, error);
+}
+
+bool buildSetType(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  auto type = SXClientServiceTypeFromText(raw.positional[0]);
+  if (!type) {
+    error = "not a service type: '" + raw.positional[0] + "' (0-65535 or a name: generic, " +
+            "vokira, telephony, haptics, alarms, standalone, soundautoconfig, longformaudio, " +
+            "nonlongformaudio, audiodeviceusage, alerts, test, unknown)";
+    return false;
+  }
+  r.serviceType = *type;
+  return buildReporterID(raw, r, error);
+}
+
+bool buildConfigure(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  auto it = raw.options.find("--config");
+  if (it == raw.options.end()) {
+    error = "configure needs --config JSON (a JSON object, or null for none)";
+    return false;
+  }
+  SXValue config;
+  if (!parseJson(it->second, "--config", config, error)) return false;
+  if (!config.is_object() && !config.is_null()) {
+    error = "--config must be a JSON object or null";
+    return false;
+  }
+  if (config.is_object()) r.configuration = std::move(config);
+  return buildReporterID(raw, r, error);
+}
+
+bool buildSend(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  uint64_t number = 0;
+  if (auto it = raw.options.find("--category"); it != raw.options.end()) {
+    if (!parseUnsigned(it->second, UINT32_MAX, "a category", number, error)) return false;
+    r.category = static_cast<SXReportingCategory>(number);
+  }
+  if (auto it = raw.options.find("--type"); it != raw.options.end()) {
+    if (!parseUnsigned(it->second, UINT16_MAX, "a message type", number, error)) return false;
+    r.messageType = static_cast<SXReportingMessageType>(number);
+  }
+  auto ids = raw.options.find("--ids");
+  const bool broadcast = raw.flags.contains("--broadcast");
+  if ((ids == raw.options.end()) == !broadcast) {
+    error = "send needs either --ids ID,ID,... (--ids '' for none) or --broadcast";
+    return false;
+  }
+  if (!broadcast && !parseIDList(ids->second, r.reporterIDs.emplace(), error)) return false;
+  if (!parseJson(raw.positional[0], "the payload", r.payload, error)) return false;
+  if (!r.payload.is_object()) {
+    error = "the payload must be a JSON object";
+    return false;
+  }
+  return true;
+}
+
+bool buildEvents(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  if (auto it = raw.options.find("--name"); it != raw.options.end()) r.eventName = it->second;
+  if (auto it = raw.options.find("--limit"); it != raw.options.end()) {
+    int64_t limit = 0;
+    if (!parseInt64(it->second, "a count", limit, error)) return false;
+    if (limit < 0) {
+      error = "--limit must not be negative";
+      return false;
+    }
+    r.limit = limit;
+  }
+  return true;
+}
+
+bool parseBool(const std::string& text, bool& out) {
+  std::string lower(text);
+  std::transform(lower.begin(), lower.end(), lower.begin(),
+                 [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  if (lower == "true" || lower == "yes" || lower == "1") return out = true, true;
+  if (lower == "false" || lower == "no" || lower == "0") return out = false, true;
+  return false;
+}
+
+bool buildDefaultsValue(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  const std::string& text = raw.positional[2];
+  const size_t kinds =
+      raw.flags.count("--bool") + raw.flags.count("--int") + raw.flags.count("--string");
+  if (kinds > 1) {
+    error = "give at most one of --bool, --int and --string";
+    return false;
+  }
+  if (raw.flags.contains("--bool")) {
+    bool flag = false;
+    if (!parseBool(text, flag)) {
+      error = "not a boolean: '" + text + "' (true, false, yes, no, 1 or 0)";
+      return false;
+    }
+    r.value = flag;
+  } else if (raw.flags.contains("--int")) {
+    int64_t number = 0;
+    if (!parseInt64(text, "an integer", number, error)) return false;
+    r.value = number;
+  } else {
+    r.value = text;
+  }
+  return true;
+}
+
+bool buildDefaults(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  r.defaultsAction = raw.positional[0];
+  const size_t keyAndValue = raw.positional.size() - 1;
+  const bool typed =
+      raw.flags.contains("--bool") || raw.flags.contains("--int") || raw.flags.contains("--string");
+  if (keyAndValue >= 1) r.key = raw.positional[1];
+  if (r.defaultsAction == "read" && keyAndValue <= 1 && !typed) return true;
+  if (r.defaultsAction == "delete" && keyAndValue == 1 && !typed) return true;
+  if (r.defaultsAction == "write" && keyAndValue == 2) return buildDefaultsValue(raw, r, error);
+  error =
+      "usage: sxreportctl defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | "
+      "delete KEY";
+  return false;
+}
+
+bool buildNotify(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  r.notificationName = raw.positional[0];
+  if (r.notificationName.empty() || r.notificationName == "." || r.notificationName == ".." ||
+      r.notificationName.find('/') != std::string::npos) {
+    error = "not a notification name: '" + r.notificationName + "'";
+    return false;
+  }
+  return true;
+}
+
+const std::vector<CommandSpec>& commandSpecs();
+
+const CommandSpec* findSpec(std::string_view name) {
+  for (const auto& spec : commandSpecs()) {
+    if (spec.name == name) return &spec;
+  }
+  return nullptr;
+}
+
+bool contains(const std::vector<std::string_view>& names, std::string_view name) {
+  return std::find(names.begin(), names.end(), name) != names.end();
+}
+
+bool isGlobalValueOption(std::string_view name) {
+  return name == "--socket" || name == "--state-dir" || name == "--config-dir" ||
+         name == "--runtime-dir" || name == "--timeout";
+}
+
+bool setGlobal(const std::string& name, const std::string& value, SXCtlRequest& r,
+               std::string& error) {
+  if (name == "--socket") r.socketPath = value;
+  if (name == "--state-dir") r.stateDir = value;
+  if (name == "--config-dir") r.configDir = value;
+  if (name == "--runtime-dir") r.runtimeDir = value;
+  if (name == "--timeout") {
+    char* end = nullptr;
+    double seconds = std::strtod(value.c_str(), &end);
+    if (value.empty() || *end != '\0' || !std::isfinite(seconds) || seconds < 0) {
+      error = "not a time-out in seconds: '" + value + "'";
+      return false;
+    }
+    r.timeoutSeconds = seconds;
+  }
+  return true;
+}
+
+// One "--name[=value]" argument at `args[i]`; takes the next argument as the value when the
+// option wants one and none was attached.
+bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSpec* spec,
+                RawArgs& raw, SXCtlRequest& r, std::string& error) {
+  const std::string& arg = args[i];
+  const size_t equals = arg.find('=');
+  const std::string name = arg.substr(0, equals);
+  const bool wantsValue = isGlobalValueOption(name) || (spec && contains(spec->valueOptions, name));
+  if (name == "--json" || name == "--help" || (spec && contains(spec->flagOptions, name))) {
+    if (equals != std::string::npos) {
+      error = name + " takes no value";
+      return false;
+    }
+    if (name == "--json") r.json = true;
+    if (name == "--help") r.help = true;
+    raw.flags.insert(name);
+    return true;
+  }
+  if (!wantsValue) {
+    error = spec ? std::string(spec->name) + " has no option " + name
+                 : "unknown option " + name + " (subcommand options follow the subcommand)";
+    return false;
+  }
+  std::string value;
+  if (equals != std::string::npos) {
+    value = arg.substr(equals + 1);
+  } else if (i + 1 < args.size()) {
+    value = args[++i];
+  } else {
+    error = name + " needs a value";
+    return false;
+  }
+  if (isGlobalValueOption(name)) return setGlobal(name, value, r, error);
+  raw.options[name] = value;
+  return true;
+}
+
+bool sortArguments(const std::vector<std::string>& args, RawArgs& raw, SXCtlRequest& r,
+                   std::string& error) {
+  const CommandSpec* spec = nullptr;
+  bool onlyPositional = false;
+  for (size_t i = 0; i < args.size(); ++i) {
+    const std::string& arg = args[i];
+    if (!onlyPositional && arg == "--") {
+      onlyPositional = true;
+    } else if (!onlyPositional && arg == "-h") {
+      r.help = true;
+    } else if (!onlyPositional && arg.starts_with("--")) {
+      if (!takeOption(args, i, spec, raw, r, error)) return false;
+    } else if (r.command.empty()) {
+      r.command = arg;
+      spec = findSpec(arg);
+      if (!spec && arg != "help") {
+        error = "unknown command '" + arg + "'";
+        return false;
+      }
+    } else {
+      raw.positional.push_back(arg);
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& r, std::string& error) {
+  r = SXCtlRequest();
+  RawArgs raw;
+  if (!sortArguments(args, raw, r, error)) return false;
+  if (r.command == "help") {  // "help [COMMAND]"
+    r.help = true;
+    r.command = raw.positional.empty() ? "" : raw.positional[0];
+    return true;
+  }
+  if (r.help) return true;
+  if (r.command.empty()) {
+    error = "no command given; see sxreportctl --help";
+    return false;
+  }
+  const CommandSpec& spec = *findSpec(r.command);
+  if (raw.positional.size() < spec.minArgs || raw.positional.size() > spec.maxArgs) {
+    error = "usage: sxreportctl " + std::string(spec.usage);
+    return false;
+  }
+  return spec.build(raw, r, error);
+}
+
+namespace {
+
+void applyGlobals(const SXCtlRequest& from, SXCtlRequest& to) {
+  if (from.socketPath) to.socketPath = from.socketPath;
+  if (from.stateDir) to.stateDir = from.stateDir;
+  if (from.configDir) to.configDir = from.configDir;
+  if (from.runtimeDir) to.runtimeDir = from.runtimeDir;
+  if (from.timeoutSeconds) to.timeoutSeconds = from.timeoutSeconds;
+  to.json = to.json || from.json;
+}
+
+}  // namespace
+
+bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
+                     std::string& error) {
+  requests.clear();
+  std::vector<std::vector<std::string>> segments(1);
+  for (const auto& arg : args) {
+    auto& segment = segments.back();
+    const bool literal = std::find(segment.begin(), segment.end(), "--") != segment.end();
+    if (arg == "then" && !literal) {
+      segments.emplace_back();
+    } else {
+      segment.push_back(arg);
+    }
+  }
+  const bool gap = std::any_of(segments.begin(), segments.end(),
+                               [](const auto& segment) { return segment.empty(); });
+  if (segments.size() > 1 && gap) {
+    error = "'then' must stand between two commands";
+    return false;
+  }
+  SXCtlRequest globals;
+  for (const auto& segment : segments) {
+    if (!SXCtlParse(segment, requests.emplace_back(), error)) return false;
+    applyGlobals(requests.back(), globals);
+  }
+  for (auto& request : requests) applyGlobals(globals, request);
+  return true;
+}
+
+SXTimeout SXCtlTimeout(const SXCtlRequest& request) {
+  if (!request.timeoutSeconds) {
+    if (request.command == "start") return kSXWaitForever;
+    return std::chrono::seconds(5);
+  }
+  if (*request.timeoutSeconds == 0) return kSXWaitForever;
+  return std::chrono::milliseconds(
+      std::max<int64_t>(1, std::llround(std::min(*request.timeoutSeconds, 1e12) * 1000)));
+}
+
+SXPaths SXCtlPaths(const SXCtlRequest& request) {
+  SXPaths paths = SXPaths::fromEnvironment();
+  if (request.stateDir) paths.stateDir = *request.stateDir;
+  if (request.configDir) paths.configDir = *request.configDir;
+  if (request.runtimeDir) {
+    paths.runtimeDir = *request.runtimeDir;
+    paths.runtimeDirChanged();
+  }
+  if (request.socketPath) {
+    paths.socketPath = *request.socketPath;
+    paths.socketPathExplicit = true;
+  }
+  return paths;
+}
+
+namespace {
+
+const std::vector<CommandSpec>& commandSpecs() {
+  // clang-format off
+  static const std::vector<CommandSpec> specs = {
+      {"create", "create ID", "create a reporting session",
+       "Creates a session with reporter ID ID (a signed 64-bit number of your choosing).\n"
+       "Replies true. The session belongs to this connection and goes when it closes, so\n"
+       "chain the commands that need it: create 42 then start 42.",
+       1, 1, {}, {}, buildReporterID},
+      {"set-type", "set-type TYPE ID", "set a session's service type",
+       "TYPE is a number (0-65535) or a name: generic, vokira, telephony, haptics, alarms,\n"
+       "standalone, soundautoconfig, longformaudio, nonlongformaudio, audiodeviceusage,\n"
+       "alerts, test. Replies true; sends no reply for ID 0.",
+       2, 2, {}, {}, buildSetType},
+      {"get-type", "get-type ID", "print a session's service type",
+       "Prints the service type and its name, e.g. \"2 (telephony)\";\n"
+       "65535 (unknown) when there is no such session.",
+       1, 1, {}, {}, buildReporterID},
+      {"configure", "configure --config JSON ID", "set a session's configuration",
+       "JSON is a JSON object, or null to send no configuration. Replies true.", 1, 1,
+       {"--config"}, {}, buildConfigure},
+      {"start", "start ID", "start a session and wait until it stops",
+       "The service replies when the session stops (true), or at once with false when there\n"
+       "is no such session; it never replies for ID 0 or a session already started. So start\n"
+       "waits without limit unless --timeout is given: run `sxreportctl stop ID` elsewhere.",
+       1, 1, {}, {}, buildReporterID},
+      {"send", "send [--category N] [--type N] (--ids ID,ID,...|--broadcast) PAYLOAD_JSON",
+       "send a message to sessions",
+       "PAYLOAD_JSON is a JSON object. --category defaults to 3 (Playback), --type to 1\n"
+       "(Start); both take decimal or 0x-hexadecimal numbers. --ids names the sessions\n"
+       "(--ids '' sends to none); --broadcast sends to every started session.\n"
+       "Prints \"delivered\", or the error the service replied with when reporting is disabled.",
+       1, 1, {"--category", "--type", "--ids"}, {"--broadcast"}, buildSend},
+      {"stop", "stop ID", "stop a session",
+       "Replies true (and the session's `start` returns); no reply for ID 0.", 1, 1, {}, {},
+       buildReporterID},
+      {"destroy", "destroy ID", "destroy a session",
+       "Replies true; sends no reply for ID 0.", 1, 1, {}, {}, buildReporterID},
+      {"valid", "valid ID", "tell whether a session exists",
+       "Prints the reporter ID and service type of the session, or\n"
+       "\"reporterID 0, serviceType 65535 (unknown)\" when there is none.",
+       1, 1, {}, {}, buildReporterID},
+      {"list", "list", "list every session's reporter ID",
+       "One reporter ID a line, client by client; \"(none)\" when there are none.", 0, 0, {},
+       {}, buildNothing},
+      {"kill", "kill", "make the service exit",
+       "The service exits with status 2 and never replies, so kill always ends with\n"
+       "\"the service sent no reply\" and exit status 1.",
+       0, 0, {}, {}, buildNothing},
+      {"status", "status", "show clients, sessions, the enable switch and the defaults",
+       "Read-only: changes nothing in the service.", 0, 0, {}, {}, buildNothing},
+      {"events", "events [--name NAME] [--limit N]", "print the stored analytics events",
+       "Reads <state-dir>/tallyvane.db: id, time, name and payload of each event, oldest\n"
+       "first. --name keeps one event name; --limit keeps the newest N.",
+       0, 0, {"--name", "--limit"}, {}, buildEvents},
+      {"defaults", "defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | delete KEY",
+       "read and change the preferences",
+       "The domain com.vendra.sonex, kept in <config-dir>/preferences/com.vendra.sonex.json.\n"
+       "read prints the whole domain or one key (exit status 1 when the key is not set);\n"
+       "write stores VALUE as a string unless --bool or --int says otherwise.",
+       1, 3, {}, {"--bool", "--int", "--string"}, buildDefaults},
+      {"notify", "notify NAME", "post a named notification",
+       "Touches <runtime-dir>/notify/NAME, which wakes every process watching that name.", 1, 1,
+       {}, {}, buildNotify},
+  };
+  // clang-format on
+  return specs;
+}
+
+constexpr std::string_view kOptionsHelp =
+    "Options:\n"
+    "  --socket PATH       the service's socket\n"
+    "                      (default <runtime-dir>/com.vendra.audio.kitbench.reporting.service)\n"
+    "  --state-dir DIR     where tallyvane.db is (default ./var/lib;\n"
+    "                      as root /var/lib/sxreportingd)\n"
+    "  --config-dir DIR    where preferences/ is (default ./var/etc; as root /etc/sxreportingd)\n"
+    "  --runtime-dir DIR   where the socket and notify/ are (default ./var/run;\n"
+    "                      as root /run/sxreportingd)\n"
+    "  --json              print the reply as JSON\n"
+    "  --timeout SECONDS   wait this long for a reply; 0 waits without limit\n"
+    "                      (default 5, and no limit for start)\n"
+    "  -h, --help          show help; `sxreportctl COMMAND --help` for one command\n"
+    "\n"
+    "Environment: SXREPORTING_SOCKET, SXREPORTING_STATE_DIR, SXREPORTING_CONFIG_DIR and\n"
+    "SXREPORTING_RUNTIME_DIR stand in for the options of the same name.\n"
+    "Exit status: 0 the service replied, 1 it sent no reply in time, 2 a usage, connection\n"
+    "or request error.\n";
+
+constexpr std::string_view kCommandOptionsHelp =
+    "Options: --socket PATH, --state-dir DIR, --config-dir DIR, --runtime-dir DIR, --json,\n"
+    "--timeout SECONDS (0: no limit); see sxreportctl --help.\n";
+
+}  // namespace
+
+std::string SXCtlHelp(const std::string& command) {
+  if (const CommandSpec* spec = findSpec(command)) {
+    std::string summary(spec->summary);
+    summary[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(summary[0])));
+    return "usage: sxreportctl [options] " + std::string(spec->usage) + "\n\n" + summary + ".\n" +
+           std::string(spec->details) + "\n\n" + std::string(kCommandOptionsHelp);
+  }
+  std::string text =
+      "usage: sxreportctl [options] COMMAND [ARGS]\n\n"
+      "Talks to the reporting service and reads its local stores.\n"
+      "Commands joined by `then` run in order on one connection, stopping at the first that\n"
+      "fails. A session lives as long as the connection that created it, so create and start\n"
+      "it in one run: sxreportctl create 42 then set-type telephony 42 then start 42\n"
+      "\nCommands:\n";
+  for (const auto& spec : commandSpecs()) {
+    std::string usage(spec.name == "send"       ? "send ... PAYLOAD_JSON"
+                      : spec.name == "defaults" ? "defaults read|write|delete ..."
+                                                : spec.usage);
+    usage.resize(std::max<size_t>(usage.size() + 2, 34), ' ');
+    text += "  " + usage + std::string(spec.summary) + "\n";
+  }
+  return text + "\n" + std::string(kOptionsHelp);
+}

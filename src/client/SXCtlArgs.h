@@ -1,0 +1,60 @@
+// The command line of sxreportctl: parsing and help texts, kept out of the tool itself so that
+// tests can reach them. Pure functions apart from reading the environment in SXCtlPaths.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "common/SXPaths.h"
+#include "sxreporting/client.h"
+
+struct SXCtlRequest {
+  std::string command;  // "create", "send", ...; empty when none was given
+  bool help = false;    // show the help of `command` (the overview when there is none)
+
+  // Global options.
+  std::optional<std::string> socketPath;
+  std::optional<std::string> stateDir;
+  std::optional<std::string> configDir;
+  std::optional<std::string> runtimeDir;
+  bool json = false;
+  std::optional<double> timeoutSeconds;  // 0: wait without limit
+
+  // Arguments; each is set only by the commands that take it.
+  int64_t reporterID = 0;
+  SXReportingServiceType serviceType = 0;
+  std::optional<SXValue> configuration;             // configure: nothing when the JSON is null
+  SXValue payload;                                  // send
+  SXReportingCategory category = 3;                 // send: "Playback"
+  SXReportingMessageType messageType = 1;           // send: "Start"
+  std::optional<std::vector<int64_t>> reporterIDs;  // send: nothing means broadcast
+  std::optional<std::string> eventName;             // events
+  std::optional<int64_t> limit;                     // events: the newest N only
+  std::string defaultsAction;                       // defaults: "read", "write" or "delete"
+  std::optional<std::string> key;                   // defaults
+  SXValue value;                                    // defaults write
+  std::string notificationName;                     // notify
+};
+
+// Parses the arguments that follow the program name. On failure returns false and says what
+// is wrong in `error`.
+bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& request, std::string& error);
+
+// Parses a chain of commands joined by the word "then" ("create 42 then start 42"), which
+// run in order on one connection: a session lives only as long as the connection that created
+// it. Global options anywhere apply to every command. After "--", "then" is an argument.
+bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
+                     std::string& error);
+
+// The help of `command`, or the overview for an empty or unknown command.
+std::string SXCtlHelp(const std::string& command);
+
+// How long the command waits for its reply: --timeout when given (0: no limit), else no limit
+// for `start` (its reply comes when the session stops) and 5 s for everything else.
+SXTimeout SXCtlTimeout(const SXCtlRequest& request);
+
+// The directories and socket: the flags over the environment over the defaults.
+SXPaths SXCtlPaths(const SXCtlRequest& request);
+
+inline constexpr const char* kSXCtlPreferencesDomain = "com.vendra.sonex";

@@ -1,0 +1,186 @@
+#include "CtlLocal.h"
+
+#include <fcntl.h>
+#include <sqlite3.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iostream>
+#include <memory>
+#include <sstream>
+
+#include "common/SXValueText.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+int fail(const std::string& message) {
+  std::cerr << message << "\n";
+  return 2;
+}
+
+std::string jsonText(const SXValue& value, int indent = -1) {
+  return value.dump(indent, ' ', false, SXValue::error_handler_t::replace);
+}
+
+std::string columnText(sqlite3_stmt* statement, int column) {
+  const auto* text = sqlite3_column_text(statement, column);
+  return text ? reinterpret_cast<const char*>(text) : "(null)";
+}
+
+// The newest `limit` events (all when no limit), oldest first.
+std::string eventsQuery(const SXCtlRequest& r) {
+  return std::string("SELECT id, time, name, payload_json FROM (SELECT * FROM events") +
+         (r.eventName ? " WHERE name = ?1" : "") + " ORDER BY id DESC" +
+         (r.limit ? " LIMIT " + std::to_string(*r.limit) : "") + ") ORDER BY id";
+}
+
+void printEvent(sqlite3_stmt* statement, bool json, SXValue& all) {
+  const int64_t id = sqlite3_column_int64(statement, 0);
+  const double time = sqlite3_column_double(statement, 1);
+  const std::string name = columnText(statement, 2);
+  const std::string payload = columnText(statement, 3);
+  if (json) {
+    SXValue parsed = SXValue::parse(payload, nullptr, false);
+    all.push_back({{"id", id},
+                   {"time", time},
+                   {"name", name},
+                   {"payload", parsed.is_discarded() ? SXValue(payload) : parsed}});
+    return;
+  }
+  std::printf("%lld  %.3f  %s  %s\n", static_cast<long long>(id), time, name.c_str(),
+              payload.c_str());
+}
+
+}  // namespace
+
+int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
+  const std::string path = paths.stateDir + "/tallyvane.db";
+  if (!fs::exists(path)) return fail("events: no analytics store at " + path);
+  sqlite3* raw = nullptr;
+  int rc = sqlite3_open_v2(path.c_str(), &raw, SQLITE_OPEN_READONLY, nullptr);
+  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> db(raw, sqlite3_close);
+  if (rc != SQLITE_OK) return fail("events: cannot open " + path + ": " + sqlite3_errmsg(raw));
+  sqlite3_busy_timeout(db.get(), 2000);
+
+  sqlite3_stmt* statementRaw = nullptr;
+  rc = sqlite3_prepare_v2(db.get(), eventsQuery(r).c_str(), -1, &statementRaw, nullptr);
+  std::unique_ptr<sqlite3_stmt, decltype(&sqlite3_finalize)> statement(statementRaw,
+                                                                       sqlite3_finalize);
+  if (rc != SQLITE_OK) return fail("events: cannot read " + path + ": " + sqlite3_errmsg(raw));
+  if (r.eventName) {
+    sqlite3_bind_text(statement.get(), 1, r.eventName->c_str(), -1, SQLITE_TRANSIENT);
+  }
+  SXValue all = SXValue::array();
+  size_t count = 0;
+  while ((rc = sqlite3_step(statement.get())) == SQLITE_ROW) {
+    printEvent(statement.get(), r.json, all);
+    ++count;
+  }
+  if (rc != SQLITE_DONE) return fail("events: cannot read " + path + ": " + sqlite3_errmsg(raw));
+  if (r.json) std::cout << jsonText(all) << "\n";
+  if (!r.json && count == 0) std::cout << "(none)\n";
+  return 0;
+}
+
+// ---- defaults
+
+namespace {
+
+std::string domainPath(const SXPaths& paths) {
+  return paths.configDir + "/preferences/" + kSXCtlPreferencesDomain + ".json";
+}
+
+// The stored domain; an absent file is an empty domain.
+bool loadDomain(const std::string& path, SXValue& domain, std::string& error) {
+  std::ifstream in(path);
+  if (!in) {
+    domain = SXValue::object();
+    if (!fs::exists(path)) return true;
+    error = "cannot read " + path + ": " + std::strerror(errno);
+    return false;
+  }
+  std::stringstream text;
+  text << in.rdbuf();
+  domain = SXValue::parse(text.str(), nullptr, false);
+  if (!domain.is_object()) {
+    error = path + " does not hold a JSON object; not touching it";
+    return false;
+  }
+  return true;
+}
+
+// Writes a temporary file beside the domain's file and renames it over, so that a reader
+// never sees half a file.
+bool storeDomain(const std::string& path, const SXValue& domain, std::string& error) {
+  std::error_code ec;
+  fs::create_directories(fs::path(path).parent_path(), ec);
+  const std::string temp = path + ".tmp." + std::to_string(::getpid());
+  {
+    std::ofstream out(temp, std::ios::trunc);
+    out << domain.dump(2, ' ', false, SXValue::error_handler_t::replace) << "\n";
+    out.flush();
+    if (!out) {
+      error = "cannot write " + temp + ": " + std::strerror(errno);
+      fs::remove(temp, ec);
+      return false;
+    }
+  }
+  if (std::rename(temp.c_str(), path.c_str()) != 0) {
+    error = "cannot replace " + path + ": " + std::strerror(errno);
+    fs::remove(temp, ec);
+    return false;
+  }
+  return true;
+}
+
+int readDefaults(const SXCtlRequest& r, const SXValue& domain) {
+  if (!r.key) {
+    std::cout << jsonText(domain, r.json ? -1 : 2) << "\n";
+    return 0;
+  }
+  auto it = domain.find(*r.key);
+  if (it == domain.end()) {
+    std::cerr << "defaults: " << kSXCtlPreferencesDomain << " has no value for " << *r.key << "\n";
+    return 1;
+  }
+  std::cout << (r.json ? jsonText(*it) : SXValueText(*it)) << "\n";
+  return 0;
+}
+
+}  // namespace
+
+int SXCtlRunDefaults(const SXCtlRequest& r, const SXPaths& paths) {
+  const std::string path = domainPath(paths);
+  SXValue domain;
+  std::string error;
+  if (!loadDomain(path, domain, error)) return fail("defaults: " + error);
+  if (r.defaultsAction == "read") return readDefaults(r, domain);
+  if (r.defaultsAction == "write") {
+    domain[*r.key] = r.value;
+  } else if (domain.erase(*r.key) == 0) {
+    return 0;  // nothing to delete
+  }
+  if (!storeDomain(path, domain, error)) return fail("defaults: " + error);
+  return 0;
+}
+
+int SXCtlRunNotify(const SXCtlRequest& r, const SXPaths& paths) {
+  const fs::path dir = fs::path(paths.runtimeDir) / "notify";
+  std::error_code ec;
+  fs::create_directories(dir, ec);
+  const std::string path = (dir / r.notificationName).string();
+  // Watchers wait for a close after writing, so the file is written, not just opened.
+  const int fd = ::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644);
+  if (fd < 0) return fail("notify: cannot open " + path + ": " + std::strerror(errno));
+  const bool written = ::write(fd, "1", 1) == 1;
+  const int writeErrno = errno;
+  ::close(fd);
+  if (!written) return fail("notify: cannot write " + path + ": " + std::strerror(writeErrno));
+  return 0;
+}

@@ -1,0 +1,9 @@
+// The sxreportctl commands that talk to the service: one protocol operation each, its reply
+// printed for people or as JSON.
+#pragma once
+
+#include "client/SXCtlArgs.h"
+
+// Performs the request's operation on `client` (connected) and prints the outcome. Returns the
+// exit status: 0 replied, 1 no reply in time, 2 connection or request error.
+int SXCtlRunRemote(const SXCtlRequest& request, SXReportingClient& client);

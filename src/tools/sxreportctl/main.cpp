@@ -1,0 +1,64 @@
+// sxreportctl: the command-line client and admin tool of the reporting service.
+#include <exception>
+#include <iostream>
+#include <memory>
+
+#include "CtlLocal.h"
+#include "CtlRemote.h"
+#include "client/SXCtlArgs.h"
+
+namespace {
+
+int runLocal(const SXCtlRequest& request, const SXPaths& paths) {
+  if (request.command == "events") return SXCtlRunEvents(request, paths);
+  if (request.command == "defaults") return SXCtlRunDefaults(request, paths);
+  return SXCtlRunNotify(request, paths);
+}
+
+bool isLocal(const SXCtlRequest& request) {
+  return request.command == "events" || request.command == "defaults" ||
+         request.command == "notify";
+}
+
+// Runs the commands in order on one connection, made when the first command needs it.
+int runChain(const std::vector<SXCtlRequest>& requests) {
+  const SXPaths paths = SXCtlPaths(requests.front());
+  std::unique_ptr<SXReportingClient> client;
+  for (const auto& request : requests) {
+    if (!isLocal(request) && !client) {
+      client = std::make_unique<SXReportingClient>(SXClientOptions{paths.socketPath});
+      std::string error;
+      if (!client->connect(&error)) {
+        std::cerr << "sxreportctl: " << error << " (is sxreportingd running?)\n";
+        return 2;
+      }
+    }
+    const int status =
+        isLocal(request) ? runLocal(request, paths) : SXCtlRunRemote(request, *client);
+    if (status != 0) return status;
+  }
+  return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  try {
+    std::vector<SXCtlRequest> requests;
+    std::string error;
+    if (!SXCtlParseChain(std::vector<std::string>(argv + 1, argv + argc), requests, error)) {
+      std::cerr << "sxreportctl: " << error << "\n";
+      return 2;
+    }
+    for (const auto& request : requests) {
+      if (request.help) {
+        std::cout << SXCtlHelp(request.command);
+        return 0;
+      }
+    }
+    return runChain(requests);
+  } catch (const std::exception& e) {
+    std::cerr << "sxreportctl: " << e.what() << "\n";
+    return 2;
+  }
+}

@@ -1,0 +1,230 @@
+// The sxreportctl executable against a fake service and its files in a temporary directory.
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <sstream>
+
+#include "fakes/FakeRpcServer.h"
+
+using namespace sxr::method;
+using Answer = FakeRpcServer::Answer;
+
+namespace {
+
+struct CtlRun {
+  int status = -1;
+  std::string out;
+  std::string err;
+};
+
+std::string quoted(const std::string& arg) {
+  std::string text = "'";
+  for (char c : arg) text += c == '\'' ? std::string("'\\''") : std::string(1, c);
+  return text + "'";
+}
+
+std::string slurp(const std::string& path) {
+  std::ifstream in(path);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+class SxreportctlTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!std::filesystem::exists(SXR_CTL_PATH)) GTEST_SKIP() << "sxreportctl not built";
+  }
+
+  // Runs the tool with every directory inside the server's temporary directory.
+  CtlRun run(const std::vector<std::string>& args) {
+    const std::string& dir = server_.directory();
+    std::string command = std::string(SXR_CTL_PATH) + " --socket " + quoted(server_.socketPath()) +
+                          " --state-dir " + quoted(dir) + " --config-dir " + quoted(dir) +
+                          " --runtime-dir " + quoted(dir);
+    for (const auto& arg : args) command += " " + quoted(arg);
+    const std::string out = dir + "/out", err = dir + "/err";
+    int raw = std::system((command + " >" + out + " 2>" + err).c_str());
+    return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
+  }
+
+  FakeRpcServer server_;
+};
+
+TEST_F(SxreportctlTest, RepliesPrintWithServiceTypeNames) {
+  server_.on(kGetServiceType, [](auto&) { return Answer::reply(2); });
+  server_.on(kValid, [](auto&) {
+    return Answer::reply({{"reporterID", 0}, {"serviceType", 65535}});
+  });
+  server_.on(kGetAllReporters, [](auto&) { return Answer::reply(SXValue::array()); });
+  server_.on(kCreate, [](auto&) { return Answer::reply(true); });
+
+  EXPECT_EQ(run({"get-type", "42"}).out, "2 (telephony)\n");
+  EXPECT_EQ(run({"valid", "7"}).out, "reporterID 0, serviceType 65535 (unknown)\n");
+  EXPECT_EQ(run({"list"}).out, "(none)\n");
+  EXPECT_EQ(run({"--json", "valid", "7"}).out, "{\"reporterID\":0,\"serviceType\":65535}\n");
+  CtlRun create = run({"create", "42"});
+  EXPECT_EQ(create.status, 0);
+  EXPECT_EQ(create.out, "true\n");
+}
+
+TEST_F(SxreportctlTest, SendPutsItsArgumentsOnTheWire) {
+  server_.on(kSendMessage, [](const SXValue& params) {
+    if (params[3].is_null())
+      return Answer::reply({{"domain", kSXReportingErrorDomain}, {"code", 1}});
+    return Answer::reply(nullptr);
+  });
+  CtlRun none = run({"send", "--ids", "", "{\"k\":1}"});
+  EXPECT_EQ(none.status, 0);
+  EXPECT_EQ(none.out, "delivered\n");
+  CtlRun all = run({"send", "--broadcast", "--category", "0x08000003", "--type", "2", "{}"});
+  EXPECT_EQ(all.status, 0);
+  EXPECT_EQ(all.out,
+            "not delivered: reporting is disabled (domain com.vendra.audio.reporting, code 1)\n");
+
+  auto requests = server_.requests();
+  ASSERT_EQ(requests.size(), 2u);
+  EXPECT_EQ(requests[0].params, SXValue::array({{{"k", 1}}, 3, 1, SXValue::array()}));
+  EXPECT_EQ(requests[1].params, SXValue::array({SXValue::object(), 0x08000003, 2, nullptr}));
+}
+
+TEST_F(SxreportctlTest, ExitStatusTellsReplyNoReplyAndErrors) {
+  server_.on(kKillService, [](auto&) { return Answer::none(); });
+  server_.on(kSetServiceType, [](auto&) { return Answer::fail("service type above 65535"); });
+
+  CtlRun kill = run({"--timeout", "0.2", "kill"});
+  EXPECT_EQ(kill.status, 1);
+  EXPECT_NE(kill.err.find("kill: the service sent no reply"), std::string::npos) << kill.err;
+
+  CtlRun rejected = run({"set-type", "1", "5"});
+  EXPECT_EQ(rejected.status, 2);
+  EXPECT_NE(rejected.err.find("service type above 65535"), std::string::npos) << rejected.err;
+
+  EXPECT_EQ(run({"create"}).status, 2);
+  EXPECT_EQ(run({"--help"}).status, 0);
+
+  CtlRun absent = run({"--socket", server_.directory() + "/nothing", "list"});
+  EXPECT_EQ(absent.status, 2);
+  EXPECT_NE(absent.err.find("cannot connect"), std::string::npos) << absent.err;
+}
+
+TEST_F(SxreportctlTest, KillEndsWhenTheServiceCloses) {
+  server_.on(kKillService, [&](auto&) {
+    server_.closeConnections();
+    return Answer::none();
+  });
+  CtlRun kill = run({"kill"});
+  EXPECT_EQ(kill.status, 1);
+  EXPECT_NE(kill.err.find("kill: the service sent no reply"), std::string::npos) << kill.err;
+}
+
+TEST_F(SxreportctlTest, StartReturnsWhenTheServiceRepliesAtStop) {
+  server_.on(kStart, [](auto&) { return Answer::none(); });
+  auto start = std::async(std::launch::async, [&] { return run({"start", "42"}); });
+  ASSERT_TRUE(server_.waitForRequests(1));
+  server_.respond(server_.requests()[0].msgid, nullptr, true);
+  CtlRun result = start.get();
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.out, "true\n");
+}
+
+TEST_F(SxreportctlTest, ChainedCommandsShareOneConnectionAndStopAtAFailure) {
+  server_.on(kCreate, [](auto&) { return Answer::reply(true); });
+  server_.on(kStart, [](auto&) { return Answer::reply(false); });
+  server_.on(kStop, [](auto&) { return Answer::none(); });
+  CtlRun chain = run({"create", "42", "then", "start", "42"});
+  EXPECT_EQ(chain.status, 0);
+  EXPECT_EQ(chain.out, "true\nfalse\n");
+  EXPECT_EQ(server_.connectionCount(), 1u);
+
+  CtlRun stopped = run({"--timeout", "0.2", "stop", "0", "then", "create", "1"});
+  EXPECT_EQ(stopped.status, 1);
+  EXPECT_EQ(stopped.err, "stop: the service sent no reply within 0.2 s\n");
+  EXPECT_EQ(server_.requests().size(), 3u);  // create 1 was never sent
+}
+
+TEST_F(SxreportctlTest, StatusPrintsClientsSessionsDefaultsAndCounters) {
+  SXValue status = {{"clients",
+                     {{{"pid", 1234},
+                       {"processName", "mixer"},
+                       {"uptimeSeconds", 12.5},
+                       {"sessions",
+                        {{{"reporterID", 42},
+                          {"serviceType", 2},
+                          {"serviceName", "telephony"},
+                          {"started", true}}}}},
+                      {{"pid", 99},
+                       {"processName", nullptr},
+                       {"uptimeSeconds", nullptr},
+                       {"sessions", SXValue::array()}}}},
+                    {"reportingEnabled", true},
+                    {"defaults", {{"ReportingEnabled", true}}},
+                    {"counters", {{"messages", 7}}}};
+  server_.on(kStatus, [&](auto&) { return Answer::reply(status); });
+  CtlRun result = run({"status"});
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.out,
+            "reporting enabled: yes\n"
+            "clients (2):\n"
+            "  pid 1234 mixer, up 12.5 s\n"
+            "    session 42: telephony (2), started\n"
+            "  pid 99 (unknown process), up unknown\n"
+            "    (no sessions)\n"
+            "defaults:\n"
+            "  ReportingEnabled = 1\n"
+            "counters:\n"
+            "  messages = 7\n");
+}
+
+TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
+  EXPECT_EQ(run({"defaults", "write", "--bool", "ReportingEnabled", "no"}).status, 0);
+  EXPECT_EQ(run({"defaults", "write", "--int", "Level", "3"}).status, 0);
+  EXPECT_EQ(run({"defaults", "write", "Name", "x"}).status, 0);
+  EXPECT_EQ(run({"defaults", "delete", "Name"}).status, 0);
+
+  const std::string file = server_.directory() + "/preferences/com.vendra.sonex.json";
+  EXPECT_EQ(SXValue::parse(slurp(file)), (SXValue{{"Level", 3}, {"ReportingEnabled", false}}));
+  EXPECT_EQ(run({"defaults", "read", "ReportingEnabled"}).out, "0\n");
+  EXPECT_EQ(run({"--json", "defaults", "read"}).out, "{\"Level\":3,\"ReportingEnabled\":false}\n");
+  EXPECT_EQ(run({"defaults", "read", "Name"}).status, 1);
+
+  std::ofstream(file) << "[not an object";
+  EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 2);
+  EXPECT_EQ(slurp(file), "[not an object");  // left as it was
+}
+
+TEST_F(SxreportctlTest, NotifyWritesTheNamedFile) {
+  EXPECT_EQ(run({"notify", "com.vendra.sonex.changed"}).status, 0);
+  EXPECT_EQ(slurp(server_.directory() + "/notify/com.vendra.sonex.changed").size(), 1u);
+}
+
+TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
+  EXPECT_EQ(run({"events"}).status, 2);  // no store yet
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open((server_.directory() + "/tallyvane.db").c_str(), &db), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(db,
+                         "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, "
+                         "payload_json TEXT);"
+                         "INSERT INTO events VALUES (1, 10.5, 'a', '{\"n\":1}');"
+                         "INSERT INTO events VALUES (2, 11.0, 'b', '{}');"
+                         "INSERT INTO events VALUES (3, 12.25, 'a', '{\"n\":3}');",
+                         nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(db);
+
+  EXPECT_EQ(run({"events"}).out,
+            "1  10.500  a  {\"n\":1}\n2  11.000  b  {}\n3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(run({"events", "--name", "a", "--limit", "1"}).out, "3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(run({"events", "--name", "zzz"}).out, "(none)\n");
+  SXValue json = SXValue::parse(run({"--json", "events", "--name", "b"}).out);
+  EXPECT_EQ(
+      json,
+      SXValue::array({{{"id", 2}, {"time", 11.0}, {"name", "b"}, {"payload", SXValue::object()}}}));
+}
+
+}  // namespace
