@@ -1,0 +1,212 @@
+// The session registry and the protocol's guard rails, through the real daemon.
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "common/RpcCodec.h"
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+template <typename T>
+T replied(std::future<SXCallResult<T>> future) {
+  auto result = future.get();
+  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
+  return result.value;
+}
+
+// A plain socket for bytes the client library would never send.
+class RawConnection {
+ public:
+  explicit RawConnection(const std::string& path) {
+    fd_ = ::socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+    EXPECT_EQ(::connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  }
+  ~RawConnection() { ::close(fd_); }
+  void send(const std::string& bytes) {
+    size_t done = 0;
+    while (done < bytes.size()) {
+      ssize_t n = ::send(fd_, bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
+      if (n <= 0) return;  // the daemon may close while we write
+      done += static_cast<size_t>(n);
+    }
+  }
+  // True when the daemon closed the connection (EOF or reset) within `timeout`.
+  bool closedByPeer(std::chrono::milliseconds timeout = 10s) {
+    timeval tv{static_cast<time_t>(timeout.count() / 1000), 0};
+    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+    char buf[4096];
+    for (;;) {
+      ssize_t n = ::recv(fd_, buf, sizeof buf, 0);
+      if (n == 0) return true;
+      if (n < 0) return errno == ECONNRESET;
+    }
+  }
+
+ private:
+  int fd_ = -1;
+};
+
+std::string request(uint32_t id, const std::string& method, const SXValue& params) {
+  msgpack::sbuffer buffer;
+  RpcEncodeRequest(buffer, id, method, params);
+  return std::string(buffer.data(), buffer.size());
+}
+
+}  // namespace
+
+TEST(RegistryEndToEnd, SxreportctlWalkThrough) {
+  TestDaemon daemon;
+  std::string out;
+  ASSERT_EQ(daemon.ctl({"create", "42", "then", "set-type", "2", "42", "then", "get-type", "42",
+                        "then", "valid", "42", "then", "valid", "7", "then", "get-type", "0",
+                        "then", "list"},
+                       &out),
+            0)
+      << out;
+  EXPECT_NE(out.find("2 (telephony)"), std::string::npos) << out;
+  EXPECT_NE(out.find("reporterID 42, serviceType 2 (telephony)"), std::string::npos) << out;
+  EXPECT_NE(out.find("reporterID 0, serviceType 65535 (unknown)"), std::string::npos) << out;
+  EXPECT_NE(out.find("65535 (unknown)"), std::string::npos) << out;
+}
+
+TEST(RegistryEndToEnd, RepliesForKnownAndUnknownIDs) {
+  TestDaemon daemon;
+  auto client = daemon.client();
+  EXPECT_TRUE(replied(client->createReportingSession(42)));
+  EXPECT_TRUE(replied(client->setServiceType(2, 42)));
+  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 2);
+  EXPECT_EQ(replied(client->reporterID(42)), (SXReporterIDValidity{42, 2}));
+  EXPECT_EQ(replied(client->reporterID(7)), (SXReporterIDValidity{0, 65535}));
+  EXPECT_TRUE(replied(client->setConfiguration(SXValue{{"a", 1}}, 7)));
+  EXPECT_TRUE(replied(client->setServiceType(3, 7)));  // unknown ID: still true
+
+  // Reporter ID 0: one reply for get-type, none for set-type.
+  std::atomic<int> replies{0};
+  client->getServiceNameForReporterID(0, [&](SXCallResult<SXReportingServiceType> r) {
+    EXPECT_EQ(r.value, 65535);
+    ++replies;
+  });
+  EXPECT_EQ(client->setServiceType(2, 0, 500ms).get().status, SXCallStatus::kTimedOut);
+  EXPECT_EQ(replies.load(), 1);
+  // A reporter ID created twice: the second session replaces the first.
+  EXPECT_TRUE(replied(client->createReportingSession(42)));
+  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 65535);
+  EXPECT_EQ(replied(client->getAllReporters()), (std::vector<int64_t>{42}));
+}
+
+TEST(RegistryEndToEnd, TwoClientsAndTheServiceWideLookup) {
+  TestDaemon daemon;
+  auto first = daemon.client();
+  auto second = daemon.client();
+  ASSERT_TRUE(replied(first->createReportingSession(42)));
+  ASSERT_TRUE(replied(first->setServiceType(2, 42)));
+  ASSERT_TRUE(replied(first->createReportingSession(1)));
+  ASSERT_TRUE(replied(second->createReportingSession(42)));
+  ASSERT_TRUE(replied(second->setServiceType(3, 42)));
+  ASSERT_TRUE(replied(second->createReportingSession(5)));
+
+  auto third = daemon.client();
+  EXPECT_EQ(replied(third->getServiceNameForReporterID(42)), 2);  // first-registered client's
+  EXPECT_EQ(replied(third->getAllReporters()), (std::vector<int64_t>{1, 42, 5, 42}));
+
+  // Own-map-only operations do not reach another client's session.
+  EXPECT_TRUE(replied(third->setServiceType(7, 1)));
+  EXPECT_TRUE(replied(third->destroyReportingSession(1)));
+  EXPECT_EQ(replied(third->getServiceNameForReporterID(1)), 65535);  // still unnamed, still there
+  EXPECT_EQ(replied(third->reporterID(1)), (SXReporterIDValidity{1, 65535}));
+  // setConfiguration and reporterID:valid: do see other clients' sessions.
+  EXPECT_EQ(replied(third->reporterID(5)), (SXReporterIDValidity{5, 65535}));
+}
+
+TEST(RegistryEndToEnd, RequestLinesOnlyWithTheVerboseServiceScope) {
+  {
+    TestDaemon quiet;
+    auto client = quiet.client();
+    replied(client->createReportingSession(42));
+    EXPECT_TRUE(quiet.waitForLog("session created for reporter 42"));
+    EXPECT_EQ(quiet.countInLog("creating session for reporter"), 0u);
+  }
+  TestDaemon verbose({{"--log-scope", "sxrs=5"}, nullptr, nullptr});
+  auto client = verbose.client();
+  replied(client->createReportingSession(42));
+  replied(client->setServiceType(2, 42));
+  EXPECT_TRUE(verbose.waitForLog("<7>SXReportingServerInstance.cpp:"));
+  EXPECT_EQ(verbose.countInLog(": creating session for reporter 42"), 1u);
+  EXPECT_EQ(verbose.countInLog(": setting service type 2 for reporter 42"), 1u);
+}
+
+TEST(RegistryEndToEnd, BadRequestsGetAnErrorAndChangeNothing) {
+  TestDaemon daemon;
+  auto client = daemon.client();
+  struct Case {
+    std::string method;
+    SXValue params;
+    std::string says;
+  };
+  for (const auto& c : std::vector<Case>{
+           {"nonsense:", SXValue::array(), "unknown method 'nonsense:'"},
+           {sxr::method::kCreate, SXValue::array({1, 2}), "takes 1 param, got 2"},
+           {sxr::method::kCreate, SXValue::array({"42"}), "(reporterID) must be a signed 64-bit"},
+           {sxr::method::kSetServiceType, SXValue::array({70000, 42}),
+            "(serviceType) out of range: 70000"},
+           {sxr::method::kSendMessage, SXValue::array({1, 3, 1, nullptr}), "must be a dictionary"},
+           {sxr::method::kSendMessage, SXValue::array({SXValue::object(), 3, 1, SXValue{1, "x"}}),
+            "element 1 is not a signed 64-bit reporter ID"},
+           {sxr::method::kSendMessage,
+            SXValue::array({SXValue::object(), uint64_t{1} << 32, 1, nullptr}),
+            "(category) out of range"},
+           {sxr::method::kCreate, SXValue::array({uint64_t{1} << 63}), "out of range"}}) {
+    auto result = client->call(c.method, c.params).get();
+    EXPECT_EQ(result.status, SXCallStatus::kRemoteError) << c.method;
+    EXPECT_NE(result.error.find(c.says), std::string::npos) << result.error;
+  }
+  EXPECT_EQ(replied(client->getAllReporters()), std::vector<int64_t>{});
+}
+
+TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
+  TestDaemon daemon({{"--max-message-bytes", "65536"}, nullptr, nullptr});
+  auto bystander = daemon.client();
+  ASSERT_TRUE(replied(bystander->createReportingSession(9)));
+
+  SXValue deep = 1;
+  for (int i = 0; i < 33; ++i) deep = SXValue{{"k", deep}};
+  std::vector<std::string> attacks = {
+      std::string("\xc1\xc1\xc1\xc1", 4),  // not MessagePack
+      request(1, sxr::method::kSendMessage,
+              SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),  // too large
+      request(1, sxr::method::kSendMessage, SXValue::array({deep, 3, 1, nullptr})),  // too deep
+      request(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3) +
+          std::string(70000, '\0'),  // a message that never ends
+      std::string("\x93\x02\xa1m\x90", 5),  // a notification: no msgid to answer
+  };
+  for (const auto& bytes : attacks) {
+    RawConnection raw(daemon.socket());
+    raw.send(bytes);
+    EXPECT_TRUE(raw.closedByPeer());
+  }
+  EXPECT_TRUE(daemon.waitForLog("InterruptionHandler: connection exited", attacks.size()));
+  EXPECT_EQ(replied(bystander->reporterID(9)), (SXReporterIDValidity{9, 65535}));
+  EXPECT_FALSE(daemon.waitForExit(100ms));
+}
+
+TEST(RegistryEndToEnd, KillServiceExitsWithStatusTwoAndNeverReplies) {
+  TestDaemon daemon;
+  auto client = daemon.client();
+  auto result = client->killService(5s).get();
+  EXPECT_NE(result.status, SXCallStatus::kReplied);
+  EXPECT_EQ(daemon.waitForExit(), 2);
+  EXPECT_TRUE(daemon.waitForLog("DESTROYING SERVICE"));
+
+  TestDaemon another;
+  std::string out;
+  EXPECT_EQ(another.ctl({"kill"}, &out), 1);
+  EXPECT_NE(out.find("no reply"), std::string::npos) << out;
+  EXPECT_EQ(another.waitForExit(), 2);
+}

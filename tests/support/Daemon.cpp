@@ -1,0 +1,151 @@
+#include "support/Daemon.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <thread>
+
+bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds timeout) {
+  auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!ready()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return true;
+}
+
+namespace {
+
+void writeJson(const std::string& path, const SXValue& value) {
+  std::ofstream(path) << value.dump();
+}
+
+}  // namespace
+
+TestDaemon::TestDaemon() : TestDaemon(Options{}) {}
+
+TestDaemon::TestDaemon(Options options) {
+  for (const char* sub : {"lib", "etc", "run", "kestrel", "diag"}) {
+    std::filesystem::create_directories(dir_.file(sub));
+  }
+  if (!options.device.is_null()) writeJson(dir_.file("etc/device.json"), options.device);
+  if (!options.fernConfig.is_null()) {
+    writeJson(dir_.file("etc/fernreporting.json"), options.fernConfig);
+  }
+  socket_ = dir_.file("run/sxr.sock");
+  std::vector<std::string> args = {SXR_DAEMON_PATH,
+                                   "--socket", socket_,
+                                   "--state-dir", dir_.file("lib"),
+                                   "--config-dir", dir_.file("etc"),
+                                   "--runtime-dir", dir_.file("run"),
+                                   "--kestrel-root", dir_.file("kestrel"),
+                                   "--diagnostic-logs-dir", dir_.file("diag")};
+  args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
+  std::string logPath = dir_.file("daemon.log");
+  pid_ = ::fork();
+  if (pid_ == 0) {
+    int fd = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    ::dup2(fd, STDERR_FILENO);
+    ::dup2(fd, STDOUT_FILENO);
+    std::vector<char*> argv;
+    for (auto& a : args) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    ::execv(argv[0], argv.data());
+    ::_exit(127);
+  }
+  if (!waitForLog("ready, listening on")) ADD_FAILURE() << "daemon did not start:\n" << log();
+}
+
+TestDaemon::~TestDaemon() {
+  if (!exitStatus_ && pid_ > 0) {
+    ::kill(pid_, SIGKILL);
+    int status = 0;
+    ::waitpid(pid_, &status, 0);
+  }
+}
+
+std::unique_ptr<SXReportingClient> TestDaemon::client() const {
+  SXClientOptions options;
+  options.socketPath = socket_;
+  options.defaultTimeout = std::chrono::seconds(10);
+  auto client = std::make_unique<SXReportingClient>(options);
+  std::string error;
+  if (!client->connect(&error)) ADD_FAILURE() << "connect: " << error;
+  return client;
+}
+
+std::string TestDaemon::log() const {
+  std::ifstream in(dir_.file("daemon.log"));
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+size_t TestDaemon::countInLog(const std::string& fragment) const {
+  std::string text = log();
+  size_t count = 0;
+  for (size_t pos = text.find(fragment); pos != std::string::npos;
+       pos = text.find(fragment, pos + fragment.size())) {
+    ++count;
+  }
+  return count;
+}
+
+bool TestDaemon::waitForLog(const std::string& fragment, size_t times,
+                            std::chrono::milliseconds timeout) const {
+  return waitUntil([&] { return countInLog(fragment) >= times; }, timeout);
+}
+
+std::optional<int> TestDaemon::waitForExit(std::chrono::milliseconds timeout) {
+  if (exitStatus_) return exitStatus_;
+  waitUntil(
+      [&] {
+        int status = 0;
+        if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+          exitStatus_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+        }
+        return exitStatus_.has_value();
+      },
+      timeout);
+  return exitStatus_;
+}
+
+std::vector<SXValue> TestDaemon::rows(const std::string& db, const std::string& sql) const {
+  if (!std::filesystem::exists(stateFile(db))) return {};
+  return SXTestQuery(stateFile(db), sql);
+}
+
+std::vector<SXValue> TestDaemon::waitForRows(const std::string& db, const std::string& sql,
+                                             size_t count,
+                                             std::chrono::milliseconds timeout) const {
+  std::vector<SXValue> found;
+  waitUntil(
+      [&] {
+        found = rows(db, sql);
+        return found.size() >= count;
+      },
+      timeout);
+  return found;
+}
+
+int TestDaemon::ctl(const std::vector<std::string>& args, std::string* output) const {
+  std::string command = std::string(SXR_CTL_PATH) + " --socket '" + socket_ + "' --state-dir '" +
+                        dir_.file("lib") + "' --config-dir '" + dir_.file("etc") +
+                        "' --runtime-dir '" + dir_.file("run") + "'";
+  for (const auto& a : args) command += " '" + a + "'";
+  command += " 2>&1";
+  FILE* pipe = ::popen(command.c_str(), "r");
+  if (!pipe) return -1;
+  std::string text;
+  char buf[4096];
+  size_t n;
+  while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) text.append(buf, n);
+  int status = ::pclose(pipe);
+  if (output) *output = text;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}

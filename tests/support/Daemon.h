@@ -1,0 +1,64 @@
+// The real daemon binary, started on a socket and stores in a temporary directory, for
+// end-to-end tests. Its stderr goes to a file the test can search.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "support/SqliteTestSupport.h"
+#include "sxreporting/client.h"
+
+class TestDaemon {
+ public:
+  struct Options {
+    std::vector<std::string> extraArgs;  // e.g. {"--log-scope", "sxrs=5"}
+    SXValue device;                      // device.json, when not null
+    SXValue fernConfig;                  // fernreporting.json, when not null
+  };
+
+  TestDaemon();
+  explicit TestDaemon(Options options);
+  ~TestDaemon();  // kills the daemon if it still runs
+
+  const std::string& socket() const { return socket_; }
+  std::string stateFile(const std::string& name) const { return dir_.file("lib/" + name); }
+  std::string dir(const std::string& name) const { return dir_.file(name); }
+
+  // A connected client; fails the test when it cannot connect.
+  std::unique_ptr<SXReportingClient> client() const;
+
+  // The daemon's log so far.
+  std::string log() const;
+  // Waits until the log holds `fragment` `times` times; false after `timeout`.
+  bool waitForLog(const std::string& fragment, size_t times = 1,
+                  std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
+  size_t countInLog(const std::string& fragment) const;
+
+  // Waits for the daemon to exit; its exit status, or nothing after `timeout`.
+  std::optional<int> waitForExit(std::chrono::milliseconds timeout = std::chrono::seconds(10));
+  pid_t pid() const { return pid_; }
+
+  // Rows of a query on one of the stores, e.g. rows("tallyvane.db", "SELECT ...").
+  std::vector<SXValue> rows(const std::string& db, const std::string& sql) const;
+  // Waits until the query returns at least `count` rows.
+  std::vector<SXValue> waitForRows(const std::string& db, const std::string& sql, size_t count,
+                                   std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
+
+  // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
+  int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
+
+ private:
+  SXTestTempDir dir_;
+  std::string socket_;
+  pid_t pid_ = -1;
+  std::optional<int> exitStatus_;
+};
+
+// Polls `ready` until it holds or `timeout` passes.
+bool waitUntil(const std::function<bool()>& ready,
+               std::chrono::milliseconds timeout = std::chrono::seconds(15));
