@@ -133,7 +133,7 @@ TEST(RegistryEndToEnd, RequestLinesOnlyWithTheVerboseServiceScope) {
     EXPECT_TRUE(quiet.waitForLog("session created for reporter 42"));
     EXPECT_EQ(quiet.countInLog("creating session for reporter"), 0u);
   }
-  TestDaemon verbose({{"--log-scope", "sxrs=5"}, nullptr, nullptr});
+  TestDaemon verbose({{"--log-scope", "sxrs=5"}, nullptr, nullptr, {}});
   auto client = verbose.client();
   replied(client->createReportingSession(42));
   replied(client->setServiceType(2, 42));
@@ -171,7 +171,7 @@ TEST(RegistryEndToEnd, BadRequestsGetAnErrorAndChangeNothing) {
 }
 
 TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
-  TestDaemon daemon({{"--max-message-bytes", "65536"}, nullptr, nullptr});
+  TestDaemon daemon({{"--max-message-bytes", "65536"}, nullptr, nullptr, {}});
   auto bystander = daemon.client();
   ASSERT_TRUE(replied(bystander->createReportingSession(9)));
 

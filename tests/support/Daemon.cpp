@@ -37,6 +37,7 @@ TestDaemon::TestDaemon(Options options) {
   if (!options.fernConfig.is_null()) {
     writeJson(dir_.file("etc/fernreporting.json"), options.fernConfig);
   }
+  for (const auto& [path, value] : options.counters) setCounter(path, value);
   socket_ = dir_.file("run/sxr.sock");
   std::vector<std::string> args = {SXR_DAEMON_PATH,
                                    "--socket", socket_,
@@ -59,6 +60,12 @@ TestDaemon::TestDaemon(Options options) {
     ::_exit(127);
   }
   if (!waitForLog("ready, listening on")) ADD_FAILURE() << "daemon did not start:\n" << log();
+}
+
+void TestDaemon::setCounter(const std::string& channelPath, int64_t value) const {
+  std::string path = dir_.file("kestrel/" + channelPath);
+  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+  std::ofstream(path) << value << "\n";
 }
 
 TestDaemon::~TestDaemon() {

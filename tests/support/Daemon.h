@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -19,7 +20,12 @@ class TestDaemon {
     std::vector<std::string> extraArgs;  // e.g. {"--log-scope", "sxrs=5"}
     SXValue device;                      // device.json, when not null
     SXValue fernConfig;                  // fernreporting.json, when not null
+    // Driver counters present at start-up: "<group>/<subgroup>/<channel>" -> value.
+    std::map<std::string, int64_t> counters;
   };
+
+  // Writes a driver counter file under the kestrel root.
+  void setCounter(const std::string& channelPath, int64_t value) const;
 
   TestDaemon();
   explicit TestDaemon(Options options);

@@ -1,0 +1,127 @@
+// Session start, stop and destroy through the real daemon: the held start reply, the driver
+// delta, the summary, the flush and the JSON file.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+template <typename T>
+T replied(std::future<SXCallResult<T>> future) {
+  auto result = future.get();
+  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
+  return result.value;
+}
+
+TestDaemon::Options internalDevice() {
+  TestDaemon::Options options;
+  options.device = {{"InternalBuild", true}, {"DeviceClassNumber", 1}};
+  options.counters = {{"Speaker/-/underruns", 5}, {"Speaker/-/resets", 9},
+                      {"Haptics/Stats/kicks", 1}};
+  return options;
+}
+
+const char* kSessionMessages =
+    "SELECT m.category, m.type, m.payload_json, m.time FROM messages m "
+    "WHERE m.session_id IS NOT NULL ORDER BY m.id";
+
+}  // namespace
+
+TEST(LifecycleEndToEnd, StartReplyWaitsForStopThenSpoolAndFileHoldTheSession) {
+  TestDaemon daemon(internalDevice());
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  ASSERT_TRUE(replied(client->setServiceType(7, 42)));
+  ASSERT_TRUE(replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
+  auto start = client->startReportingSessionForID(42, kSXWaitForever);
+  EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
+  EXPECT_EQ(start.wait_for(300ms), std::future_status::timeout);  // held until stop
+
+  daemon.setCounter("Speaker/-/underruns", 8);  // rose by 3
+  daemon.setCounter("Speaker/-/resets", 2);     // went down: not reported
+  auto other = daemon.client();                  // stop from another client reaches it too
+  EXPECT_TRUE(replied(other->stopReportingSessionForID(42)));
+  auto held = start.get();
+  EXPECT_EQ(held.status, SXCallStatus::kReplied);
+  EXPECT_TRUE(held.value);
+
+  auto flushes = daemon.waitForRows("fernreporting.db", "SELECT time FROM flushes", 1);
+  ASSERT_EQ(flushes.size(), 1u);
+  auto messages = daemon.rows("fernreporting.db", kSessionMessages);
+  ASSERT_EQ(messages.size(), 3u);
+  EXPECT_EQ(messages[0]["category"], 3);
+  EXPECT_EQ(messages[1]["category"], 9);  // the driver delta, before the summary
+  EXPECT_EQ(SXValue::parse(messages[1]["payload_json"].get<std::string>()),
+            (SXValue{{"Speaker_underruns", 3}}));
+  EXPECT_EQ(messages[2]["category"], 65535);
+  EXPECT_EQ(messages[2]["type"], 65535);
+  SXValue summary = SXValue::parse(messages[2]["payload_json"].get<std::string>());
+  EXPECT_EQ(summary["SX_Session_Summary_Event"], "7");
+  EXPECT_EQ(summary["Playback_Start_1"], R"({"k":1})");
+  EXPECT_EQ(summary["KestrelStats_Generic_1"], R"({"Speaker_underruns":3})");
+  EXPECT_LE(messages[2]["time"].get<double>(), flushes[0]["time"].get<double>());
+  EXPECT_TRUE(daemon.waitForLog("fetching driver logs {\"Speaker_underruns\":3}"));
+
+  std::vector<std::filesystem::path> files;
+  for (const auto& entry : std::filesystem::directory_iterator(daemon.dir("diag"))) {
+    files.push_back(entry.path());
+  }
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_NE(files[0].filename().string().find("-sonex-player-longformaudio.json"),
+            std::string::npos);
+  std::ifstream in(files[0]);
+  SXValue written = SXValue::parse(in);
+  EXPECT_EQ(written[0], (SXValue{{"HostApplicationDisplayID", "player"}}));
+  EXPECT_TRUE(written[1].contains("Playback_Start_1"));
+}
+
+TEST(LifecycleEndToEnd, UnknownRepeatedAndZeroIDs) {
+  TestDaemon daemon;
+  auto client = daemon.client();
+  EXPECT_FALSE(replied(client->startReportingSessionForID(5)));
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(5)));
+  EXPECT_TRUE(replied(client->destroyReportingSession(5)));
+  for (auto status : {client->startReportingSessionForID(0, 300ms).get().status,
+                      client->stopReportingSessionForID(0, 300ms).get().status,
+                      client->destroyReportingSession(0, 300ms).get().status}) {
+    EXPECT_EQ(status, SXCallStatus::kTimedOut);
+  }
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  auto first = client->startReportingSessionForID(42, kSXWaitForever);
+  auto second = client->startReportingSessionForID(42, 500ms);
+  EXPECT_EQ(second.get().status, SXCallStatus::kTimedOut);  // a repeated start gets no reply
+  // Destroying a started session stops it first, which answers the held start.
+  EXPECT_TRUE(replied(client->destroyReportingSession(42)));
+  EXPECT_TRUE(first.get().value);
+  EXPECT_EQ(replied(client->getAllReporters()), std::vector<int64_t>{});
+}
+
+TEST(LifecycleEndToEnd, NoBackendsWaitsNineSecondsWithoutDelayingOtherSessions) {
+  TestDaemon::Options options;
+  options.fernConfig = {{"backends", SXValue::array()}};
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  for (int64_t id : {1, 2}) ASSERT_TRUE(replied(client->createReportingSession(id)));
+  auto startOne = client->startReportingSessionForID(1, kSXWaitForever);
+  EXPECT_TRUE(daemon.waitForLog("waiting for fernreportingd to find backends"));
+  // Session 2 is not started: its send goes standalone at once, though session 1 waits.
+  auto before = std::chrono::steady_clock::now();
+  EXPECT_FALSE(replied(client->sendMessage({{"k", 2}}, 3, 1, std::vector<int64_t>{2})));
+  auto singles = daemon.waitForRows(
+      "fernreporting.db", "SELECT id FROM messages WHERE session_id IS NULL", 1, 5s);
+  EXPECT_EQ(singles.size(), 1u);
+  EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
+  EXPECT_TRUE(daemon.waitForLog("No backends found, this session won't get sent to the server"));
+  EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{1})));
+
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(1)));
+  EXPECT_TRUE(startOne.get().value);
+  EXPECT_TRUE(daemon.waitForLog("failed to find backend", 1, 20s));
+  EXPECT_TRUE(daemon.waitForLog("No valid FernReportingSession"));
+  EXPECT_TRUE(daemon.rows("fernreporting.db", "SELECT id FROM flushes").empty());
+}
