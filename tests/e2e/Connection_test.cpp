@@ -1,0 +1,113 @@
+// The defaults switch and the end of client connections, through the real daemon.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+template <typename T>
+T replied(std::future<SXCallResult<T>> future) {
+  auto result = future.get();
+  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
+  return result.value;
+}
+
+// Starts sxreportctl with `args` against `daemon`; returns its pid.
+pid_t spawnCtl(const TestDaemon& daemon, const std::vector<std::string>& args) {
+  std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", daemon.socket()};
+  argv.insert(argv.end(), args.begin(), args.end());
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    std::vector<char*> raw;
+    for (auto& a : argv) raw.push_back(a.data());
+    raw.push_back(nullptr);
+    ::execv(raw[0], raw.data());
+    ::_exit(127);
+  }
+  return pid;
+}
+
+}  // namespace
+
+TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
+  TestDaemon daemon;
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
+
+  ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "true"}), 0);
+  ASSERT_EQ(daemon.ctl({"defaults", "write", "device_name", "bench"}), 0);
+  EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
+  ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
+  ASSERT_TRUE(waitUntil([&] { return !replied(client->status())["reportingEnabled"].get<bool>(); }));
+  auto disabled = replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42}));
+  ASSERT_TRUE(disabled);
+  EXPECT_EQ(*disabled, (SXError{"com.vendra.audio.reporting", 1}));
+  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 65535);  // own map still answers
+
+  ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "false"}), 0);
+  ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
+  ASSERT_TRUE(waitUntil([&] { return replied(client->status())["reportingEnabled"].get<bool>(); }));
+  EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
+  EXPECT_EQ(daemon.countInLog("re-reading sonex defaults"), 2u);
+
+  // A post with nothing changed still reaches every session: the merged defaults travel in
+  // the user info of the session's next server-reporting session.
+  ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
+  ASSERT_TRUE(daemon.waitForLog("re-reading sonex defaults", 3));
+  auto start = client->startReportingSessionForID(42, kSXWaitForever);
+  auto sessions = daemon.waitForRows("fernreporting.db", "SELECT user_info_json FROM sessions", 1);
+  ASSERT_EQ(sessions.size(), 1u);
+  SXValue userInfo = SXValue::parse(sessions[0]["user_info_json"].get<std::string>());
+  EXPECT_EQ(userInfo["device_name"], "bench");
+  EXPECT_EQ(userInfo["disable_reporting"], false);
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
+  EXPECT_TRUE(start.get().value);
+}
+
+TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
+  TestDaemon daemon;
+  auto observer = daemon.client();
+  auto began = std::chrono::steady_clock::now();
+  pid_t child = spawnCtl(daemon, {"create", "42", "then", "start", "42"});
+  // The start never answers while the session runs, so the tool sits waiting.
+  ASSERT_TRUE(waitUntil([&] { return replied(observer->getAllReporters()).size() == 1; }));
+  ASSERT_TRUE(waitUntil([&] {
+    auto clients = replied(observer->status())["clients"];
+    for (const auto& c : clients) {
+      for (const auto& s : c["sessions"]) {
+        if (s["started"].get<bool>()) return true;
+      }
+    }
+    return false;
+  }));
+  // Gather something, so that the stop has a summary to send.
+  EXPECT_FALSE(replied(observer->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
+  std::this_thread::sleep_for(300ms);
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+  double lifetime = std::chrono::duration<double>(std::chrono::steady_clock::now() - began).count();
+
+  EXPECT_TRUE(daemon.waitForLog("removing " + std::to_string(child) + " from the server client list"));
+  auto uptime = daemon.waitForRows(
+      "tallyvane.db",
+      "SELECT payload_json FROM events WHERE name = 'com.vendra.sonex.sxreportingclientuptime'", 1);
+  EXPECT_TRUE(replied(observer->getAllReporters()).empty());
+  auto summaries = daemon.waitForRows(
+      "fernreporting.db", "SELECT payload_json FROM messages WHERE category = 65535", 1);
+  std::this_thread::sleep_for(200ms);  // nothing more may come
+  EXPECT_EQ(daemon.rows("fernreporting.db",
+                        "SELECT id FROM messages WHERE category = 65535").size(), 1u);
+  EXPECT_EQ(daemon.countInLog("removing " + std::to_string(child)), 1u);
+  ASSERT_EQ(uptime.size(), 1u);
+  SXValue event = SXValue::parse(uptime[0]["payload_json"].get<std::string>());
+  EXPECT_EQ(event["processName"], "sxreportctl");
+  EXPECT_GT(event["seconds"].get<double>(), 0.3);
+  EXPECT_LE(event["seconds"].get<double>(), lifetime + 0.5);
+  EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=sxreportctl"));
+}
