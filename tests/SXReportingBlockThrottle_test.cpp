@@ -338,8 +338,10 @@ TEST_F(SXReportingBlockThrottleTest, WaitForCompletionGivesUpWhileDuplicatesKeep
   std::thread adder([&] {
     while (waiting.load()) {
       lastAdd = Clock::now();
-      add(++added, {{"a", 1}});
-      std::this_thread::sleep_for(milliseconds(300));
+      int id = added.load() + 1;
+      add(id, {{"a", 1}});
+      added = id;  // only once the entry is in the table
+      std::this_thread::sleep_for(milliseconds(200));
     }
   });
   while (added.load() == 0) std::this_thread::yield();

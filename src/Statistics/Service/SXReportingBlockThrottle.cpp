@@ -19,8 +19,8 @@ using Clock = SXReportingBlockThrottleSchedule::Clock;
 // keys, so that neither a time stamp nor a control value makes two messages differ. Constant
 // initialised, so the list exists before `main` and before any client can connect.
 constexpr std::array<std::string_view, 5> kDefaultExclusionList = {
-    "systemuptime_sec", "processuptime_ms", "sxreporting_timestamp",
-    "_comparison_field_blacklist", "_throttle_seconds"};
+    "systemuptime_sec", "processuptime_ms", "sxreporting_timestamp", "_comparison_field_blacklist",
+    "_throttle_seconds"};
 
 constexpr std::string_view kBlacklistKey = "_comparison_field_blacklist";
 constexpr std::string_view kThrottleSecondsKey = "_throttle_seconds";
@@ -195,10 +195,9 @@ std::shared_ptr<SXReportingBlockThrottleTimer> SXReportingBlockThrottleSchedule:
   for (;;) {
     std::erase_if(timers_, [](const auto& timer) { return !timer->valid_; });
     if (timers_.empty()) return nullptr;
-    auto earliest = std::min_element(timers_.begin(), timers_.end(), [](const auto& a,
-                                                                         const auto& b) {
-      return a->due_ < b->due_;
-    });
+    auto earliest =
+        std::min_element(timers_.begin(), timers_.end(),
+                         [](const auto& a, const auto& b) { return a->due_ < b->due_; });
     Clock::time_point due = (*earliest)->due_;
     if (due <= Clock::now()) {
       auto timer = std::move(*earliest);
@@ -304,13 +303,13 @@ double SXReportingBlockThrottle::determineSleepTime(const SXValue& payload, SXLo
   const SXValue& time = *it;
   // Booleans are numbers of the value model (1 and 0).
   if (!time.is_number() && !time.is_boolean()) {
-    SXLOG(log, nullptr, SXLogLevel::kInfo,
-          "Rejecting non Numbox value of throttle time. {time=%@}", time);
+    SXLOG(log, nullptr, SXLogLevel::kInfo, "Rejecting non Numbox value of throttle time. {time=%@}",
+          time);
     return kDefaultSleepTime;
   }
   if (!integerPartAtMostFour(time)) {
-    SXLOG(log, nullptr, SXLogLevel::kInfo, "Rejecting large throttle time. {time=%@, max=%f}",
-          time, kMaxSleepTime);
+    SXLOG(log, nullptr, SXLogLevel::kInfo, "Rejecting large throttle time. {time=%@, max=%f}", time,
+          kMaxSleepTime);
     return kDefaultSleepTime;
   }
   return narrowedToFloat(time.get<double>());
@@ -320,8 +319,8 @@ double SXReportingBlockThrottle::determineSleepTime(const SXValue& payload, SXLo
 
 std::shared_ptr<SXReportingBlockThrottle> SXReportingBlockThrottle::create(
     std::shared_ptr<SXLogFacility> log, std::shared_ptr<const SXLogScope> verboseScope) {
-  auto throttle =
-      std::make_shared<SXReportingBlockThrottle>(Passkey{}, std::move(log), std::move(verboseScope));
+  auto throttle = std::make_shared<SXReportingBlockThrottle>(Passkey{}, std::move(log),
+                                                             std::move(verboseScope));
   throttle->queueThread_ = std::thread([self = throttle] { self->workerLoop(); });
   return throttle;
 }
@@ -344,16 +343,14 @@ SXReportingBlockThrottle::~SXReportingBlockThrottle() {
 }
 
 void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int64_t reporterID,
-                                               const SXValue& message,
-                                               SXReportingCategory category,
+                                               const SXValue& message, SXReportingCategory category,
                                                SXReportingMessageType type) {
   std::string key = buildMessageKey(message, reporterID, category, type);
   double sleepTime = determineSleepTime(message, *log_);
 
   std::unique_lock inFlight(inFlightMutex_);
   if (auto it = timersInFlight_.find(key); it != timersInFlight_.end()) {
-    SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "Dropping duplicate message for %@",
-          key);
+    SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "Dropping duplicate message for %@", key);
     it->second->sleepFor(sleepTime);
     // The replaced operation is never run; it is destroyed only after the lock is released.
     std::function<void()> replaced = it->second->exchangeBlock(std::move(block));
@@ -380,7 +377,15 @@ void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int6
 
 void SXReportingBlockThrottle::fire(
     const std::string& key, const std::shared_ptr<SXReportingBlockThrottleTimerWrapper>& entry) {
-  if (auto block = entry->block()) {
+  std::function<void()> block;
+  {
+    // Read under the in-flight lock so that a duplicate's re-arm and replacement, which form one
+    // critical section, are seen whole: a duplicate whose re-arm makes the entry due at once
+    // must have its own operation sent, not the one it replaces.
+    std::lock_guard inFlight(inFlightMutex_);
+    block = entry->block();
+  }
+  if (block) {
     // A throwing operation must not end the worker, which runs every other send.
     try {
       block();

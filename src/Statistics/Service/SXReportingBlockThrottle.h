@@ -83,8 +83,8 @@ class SXReportingBlockThrottleTimer {
  private:
   friend class SXReportingBlockThrottleSchedule;
   std::shared_ptr<SXReportingBlockThrottleSchedule::TimerLock> lock_;
-  Clock::time_point due_;                // guarded by lock_->mutex
-  bool valid_ = true;                    // guarded by lock_->mutex
+  Clock::time_point due_;               // guarded by lock_->mutex
+  bool valid_ = true;                   // guarded by lock_->mutex
   const std::function<void()> action_;  // run by the worker only
 };
 
@@ -175,7 +175,7 @@ class SXReportingBlockThrottle : public std::enable_shared_from_this<SXReporting
   SXReportingBlockThrottleSchedule schedule_;  // run by the worker only; timers refer to it
 
   std::atomic<bool> shouldKeepRunning_{true};
-  std::mutex idleMutex_;                // with idleCondition_, lets `stop` cut the idle sleep
+  std::mutex idleMutex_;  // with idleCondition_, lets `stop` cut the idle sleep
   std::condition_variable idleCondition_;
   std::thread queueThread_;  // set once by `create`
 };
