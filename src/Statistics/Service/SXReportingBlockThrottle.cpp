@@ -1,0 +1,470 @@
+#include "SXReportingBlockThrottle.h"
+
+#include <algorithm>
+#include <array>
+#include <charconv>
+#include <cmath>
+#include <exception>
+#include <limits>
+#include <string_view>
+#include <unordered_set>
+
+#include "SXReportingUtility.h"
+
+namespace {
+
+using Clock = SXReportingBlockThrottleSchedule::Clock;
+
+// Keys whose values never take part in the comparison: three time stamps and the two control
+// keys, so that neither a time stamp nor a control value makes two messages differ. Constant
+// initialised, so the list exists before `main` and before any client can connect.
+constexpr std::array<std::string_view, 5> kDefaultExclusionList = {
+    "systemuptime_sec", "processuptime_ms", "sxreporting_timestamp", "_comparison_field_blacklist",
+    "_throttle_seconds"};
+
+constexpr std::string_view kBlacklistKey = "_comparison_field_blacklist";
+constexpr std::string_view kThrottleSecondsKey = "_throttle_seconds";
+constexpr double kDefaultSleepTime = 0.5;
+constexpr double kMaxSleepTime = 5.0;
+constexpr unsigned kCompletionWaitSeconds = 5;
+constexpr int kCompletionPolls = 10;
+constexpr auto kCompletionPollInterval = std::chrono::milliseconds(500);
+constexpr auto kIdlePollInterval = std::chrono::milliseconds(100);
+// Far enough for any throttle time, near enough that the clock arithmetic cannot overflow.
+constexpr double kMaxDelaySeconds = 1e9;
+
+Clock::time_point dueIn(double seconds) {
+  Clock::time_point now = Clock::now();
+  if (!(seconds > 0)) return now;  // zero, negative and not-a-number: due at once
+  seconds = std::min(seconds, kMaxDelaySeconds);
+  return now + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
+}
+
+// Plain decimal: integral values (of any number kind) as exact integers, so that 1, 1u and 1.0
+// give the same text; other floating values in the shortest fixed-point form that reads back.
+std::string numberText(const SXValue& value) {
+  if (value.is_boolean()) return value.get<bool>() ? "1" : "0";
+  if (value.is_number_unsigned()) return std::to_string(value.get<uint64_t>());
+  if (value.is_number_integer()) return std::to_string(value.get<int64_t>());
+  double d = value.get<double>();
+  if (std::isnan(d)) return "nan";
+  if (std::isinf(d)) return d > 0 ? "inf" : "-inf";
+  if (d == std::trunc(d) && d >= -0x1p63 && d < 0x1p64) {
+    return d < 0 ? std::to_string(static_cast<int64_t>(d))
+                 : std::to_string(static_cast<uint64_t>(d));
+  }
+  std::array<char, 400> buf;  // the longest fixed-point double has about 330 characters
+  auto [end, ec] = std::to_chars(buf.data(), buf.data() + buf.size(), d, std::chars_format::fixed);
+  return ec == std::errc() ? std::string(buf.data(), end) : std::string("nan");
+}
+
+// Quoted, with only the quote, the backslash and control bytes escaped: injective on any bytes,
+// valid UTF-8 or not.
+void appendQuoted(std::string& out, std::string_view text) {
+  static constexpr char kHex[] = "0123456789abcdef";
+  out.push_back('"');
+  for (char c : text) {
+    auto byte = static_cast<unsigned char>(c);
+    if (c == '"' || c == '\\') {
+      out.push_back('\\');
+      out.push_back(c);
+    } else if (byte < 0x20) {
+      out.append("\\u00");
+      out.push_back(kHex[byte >> 4]);
+      out.push_back(kHex[byte & 0xF]);
+    } else {
+      out.push_back(c);
+    }
+  }
+  out.push_back('"');
+}
+
+// The nested form of a value inside an array or dictionary: compact JSON with dictionary keys in
+// ascending byte order, numbers as `numberText`, strings quoted (so "1" and 1 differ here).
+void appendNested(std::string& out, const SXValue& value) {
+  switch (value.type()) {
+    case SXValue::value_t::string:
+      appendQuoted(out, value.get_ref<const std::string&>());
+      return;
+    case SXValue::value_t::array: {
+      out.push_back('[');
+      for (size_t i = 0; i < value.size(); ++i) {
+        if (i) out.push_back(',');
+        appendNested(out, value[i]);
+      }
+      out.push_back(']');
+      return;
+    }
+    case SXValue::value_t::object: {
+      out.push_back('{');
+      bool first = true;
+      for (const auto& [key, element] : value.items()) {  // std::map order: ascending bytes
+        if (!first) out.push_back(',');
+        first = false;
+        appendQuoted(out, key);
+        out.push_back(':');
+        appendNested(out, element);
+      }
+      out.push_back('}');
+      return;
+    }
+    case SXValue::value_t::binary: {
+      static constexpr char kHex[] = "0123456789abcdef";
+      const auto& bytes = value.get_binary();
+      out.push_back('<');
+      for (uint8_t b : bytes) {
+        out.push_back(kHex[b >> 4]);
+        out.push_back(kHex[b & 0xF]);
+      }
+      if (bytes.has_subtype()) out.append(":" + std::to_string(bytes.subtype()));
+      out.push_back('>');
+      return;
+    }
+    case SXValue::value_t::null:
+    case SXValue::value_t::discarded:
+      out.append("null");
+      return;
+    default:
+      out.append(numberText(value));
+      return;
+  }
+}
+
+// The text of a payload value in the key: a string as it is, null as "(null)", anything else in
+// its nested form.
+std::string keyFieldText(const SXValue& value) {
+  if (value.is_string()) return value.get<std::string>();
+  if (value.is_null()) return "(null)";
+  std::string out;
+  appendNested(out, value);
+  return out;
+}
+
+std::unordered_set<std::string_view> excludedKeys(const SXValue& payload) {
+  std::unordered_set<std::string_view> excluded(kDefaultExclusionList.begin(),
+                                                kDefaultExclusionList.end());
+  auto blacklist = payload.find(kBlacklistKey);
+  if (blacklist != payload.end() && blacklist->is_array()) {
+    for (const auto& element : *blacklist) {
+      // Non-string elements name no key.
+      if (element.is_string()) excluded.insert(element.get_ref<const std::string&>());
+    }
+  }
+  if (payload.contains("Volume") && payload.contains("VolumeOperationTime")) {
+    excluded.insert("Volume");
+    excluded.insert("VolumeOperationTime");
+  }
+  return excluded;
+}
+
+// Whether the integer part of a number, truncated toward zero, is at most 4. Not-a-number has
+// no integer part and fails.
+bool integerPartAtMostFour(const SXValue& value) {
+  if (value.is_number_unsigned()) return value.get<uint64_t>() <= 4;
+  if (value.is_number_integer() || value.is_boolean()) return value.get<int64_t>() <= 4;
+  return std::trunc(value.get<double>()) <= 4;
+}
+
+double narrowedToFloat(double seconds) {
+  // Below the float range the conversion itself is undefined; IEEE rounding would give -inf.
+  if (seconds < -std::numeric_limits<float>::max()) {
+    return -std::numeric_limits<double>::infinity();
+  }
+  return static_cast<double>(static_cast<float>(seconds));
+}
+
+}  // namespace
+
+// ---- SXReportingBlockThrottleSchedule ----
+
+void SXReportingBlockThrottleSchedule::add(std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
+  if (timer) timers_.push_back(std::move(timer));
+}
+
+void SXReportingBlockThrottleSchedule::run() {
+  std::unique_lock lock(timerLock_->mutex);
+  while (auto timer = nextDueTimer(lock)) {
+    lock.unlock();
+    if (timer->action_) timer->action_();
+    lock.lock();
+  }
+}
+
+std::shared_ptr<SXReportingBlockThrottleTimer> SXReportingBlockThrottleSchedule::nextDueTimer(
+    std::unique_lock<std::mutex>& lock) {
+  for (;;) {
+    std::erase_if(timers_, [](const auto& timer) { return !timer->valid_; });
+    if (timers_.empty()) return nullptr;
+    auto earliest =
+        std::min_element(timers_.begin(), timers_.end(),
+                         [](const auto& a, const auto& b) { return a->due_ < b->due_; });
+    Clock::time_point due = (*earliest)->due_;
+    if (due <= Clock::now()) {
+      auto timer = std::move(*earliest);
+      timers_.erase(earliest);
+      timer->valid_ = false;  // one-shot
+      return timer;
+    }
+    // Woken early when some thread moves a due time or invalidates a timer; due times are
+    // then read afresh.
+    timerLock_->changed.wait_until(lock, due);
+  }
+}
+
+// ---- SXReportingBlockThrottleTimer ----
+
+SXReportingBlockThrottleTimer::SXReportingBlockThrottleTimer(
+    const SXReportingBlockThrottleSchedule& schedule, Clock::time_point due,
+    std::function<void()> action)
+    : lock_(schedule.timerLock_), due_(due), action_(std::move(action)) {}
+
+void SXReportingBlockThrottleTimer::setFireDate(Clock::time_point due) {
+  {
+    std::lock_guard lock(lock_->mutex);
+    due_ = due;
+  }
+  lock_->changed.notify_all();
+}
+
+SXReportingBlockThrottleTimer::Clock::time_point SXReportingBlockThrottleTimer::fireDate() const {
+  std::lock_guard lock(lock_->mutex);
+  return due_;
+}
+
+void SXReportingBlockThrottleTimer::invalidate() {
+  {
+    std::lock_guard lock(lock_->mutex);
+    valid_ = false;
+  }
+  lock_->changed.notify_all();
+}
+
+bool SXReportingBlockThrottleTimer::isValid() const {
+  std::lock_guard lock(lock_->mutex);
+  return valid_;
+}
+
+// ---- SXReportingBlockThrottleTimerWrapper ----
+
+std::function<void()> SXReportingBlockThrottleTimerWrapper::block() const {
+  std::lock_guard lock(mutex_);
+  return block_;
+}
+
+void SXReportingBlockThrottleTimerWrapper::setBlock(std::function<void()> block) {
+  // The replaced operation is destroyed here, outside the lock: its captures may do anything.
+  exchangeBlock(std::move(block));
+}
+
+std::function<void()> SXReportingBlockThrottleTimerWrapper::exchangeBlock(
+    std::function<void()> block) {
+  std::lock_guard lock(mutex_);
+  return std::exchange(block_, std::move(block));
+}
+
+std::shared_ptr<SXReportingBlockThrottleTimer> SXReportingBlockThrottleTimerWrapper::timer() const {
+  std::lock_guard lock(mutex_);
+  return timer_;
+}
+
+void SXReportingBlockThrottleTimerWrapper::setTimer(
+    std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
+  std::lock_guard lock(mutex_);
+  timer_ = std::move(timer);
+}
+
+void SXReportingBlockThrottleTimerWrapper::sleepFor(double seconds) {
+  if (auto current = timer()) current->setFireDate(dueIn(seconds));
+}
+
+// ---- SXReportingBlockThrottle: message keys and throttle time ----
+
+std::string SXReportingBlockThrottle::buildMessageKey(const SXValue& payload, int64_t reporterID,
+                                                      SXReportingCategory category,
+                                                      SXReportingMessageType type) {
+  std::string key;
+  if (payload.is_object()) {
+    auto excluded = excludedKeys(payload);
+    for (const auto& [name, value] : payload.items()) {  // std::map order: ascending bytes
+      key.append(name).push_back('|');
+      key.append(excluded.count(name) ? "^" : keyFieldText(value)).push_back('|');
+    }
+  }
+  key.append("reporterID|").append(std::to_string(reporterID)).push_back('|');
+  key.append(SXReportingUtilityCategoryName(category)).push_back('|');
+  key.append(SXReportingUtilityTypeName(type));
+  return key;
+}
+
+double SXReportingBlockThrottle::determineSleepTime(const SXValue& payload, SXLogFacility& log) {
+  if (!payload.is_object()) return kDefaultSleepTime;
+  auto it = payload.find(kThrottleSecondsKey);
+  if (it == payload.end()) return kDefaultSleepTime;
+  const SXValue& time = *it;
+  // Booleans are numbers of the value model (1 and 0).
+  if (!time.is_number() && !time.is_boolean()) {
+    SXLOG(log, nullptr, SXLogLevel::kInfo, "Rejecting non Numbox value of throttle time. {time=%@}",
+          time);
+    return kDefaultSleepTime;
+  }
+  if (!integerPartAtMostFour(time)) {
+    SXLOG(log, nullptr, SXLogLevel::kInfo, "Rejecting large throttle time. {time=%@, max=%f}", time,
+          kMaxSleepTime);
+    return kDefaultSleepTime;
+  }
+  return narrowedToFloat(time.get<double>());
+}
+
+// ---- SXReportingBlockThrottle: the throttle ----
+
+std::shared_ptr<SXReportingBlockThrottle> SXReportingBlockThrottle::create(
+    std::shared_ptr<SXLogFacility> log, std::shared_ptr<const SXLogScope> verboseScope) {
+  auto throttle = std::make_shared<SXReportingBlockThrottle>(Passkey{}, std::move(log),
+                                                             std::move(verboseScope));
+  throttle->queueThread_ = std::thread([self = throttle] { self->workerLoop(); });
+  return throttle;
+}
+
+SXReportingBlockThrottle::SXReportingBlockThrottle(Passkey, std::shared_ptr<SXLogFacility> log,
+                                                   std::shared_ptr<const SXLogScope> verboseScope)
+    : log_(std::move(log)), verboseScope_(std::move(verboseScope)) {
+  unscheduledTimerKeys_.reserve(6);
+}
+
+SXReportingBlockThrottle::~SXReportingBlockThrottle() {
+  if (!queueThread_.joinable()) return;
+  // While the worker runs it holds the throttle, so only the worker itself can get here with a
+  // joinable thread, as it lets go of the throttle on its way out.
+  if (queueThread_.get_id() == std::this_thread::get_id()) {
+    queueThread_.detach();
+  } else {
+    queueThread_.join();
+  }
+}
+
+void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int64_t reporterID,
+                                               const SXValue& message, SXReportingCategory category,
+                                               SXReportingMessageType type) {
+  std::string key = buildMessageKey(message, reporterID, category, type);
+  double sleepTime = determineSleepTime(message, *log_);
+
+  std::unique_lock inFlight(inFlightMutex_);
+  if (auto it = timersInFlight_.find(key); it != timersInFlight_.end()) {
+    SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "Dropping duplicate message for %@", key);
+    it->second->sleepFor(sleepTime);
+    // The replaced operation is never run; it is destroyed only after the lock is released.
+    std::function<void()> replaced = it->second->exchangeBlock(std::move(block));
+    inFlight.unlock();
+    return;
+  }
+  auto wrapper = std::make_shared<SXReportingBlockThrottleTimerWrapper>();
+  wrapper->setBlock(std::move(block));
+  // Weak captures: the wrapper owns the timer, and the throttle outlives every timer it runs.
+  auto action = [weakThrottle = weak_from_this(),
+                 weakWrapper = std::weak_ptr<SXReportingBlockThrottleTimerWrapper>(wrapper), key] {
+    auto throttle = weakThrottle.lock();
+    auto entry = weakWrapper.lock();
+    if (throttle && entry) throttle->fire(key, entry);
+  };
+  wrapper->setTimer(std::make_shared<SXReportingBlockThrottleTimer>(schedule_, dueIn(sleepTime),
+                                                                    std::move(action)));
+  timersInFlight_.emplace(key, std::move(wrapper));
+  inFlight.unlock();
+
+  std::lock_guard unscheduled(unscheduledMutex_);
+  unscheduledTimerKeys_.push_back(std::move(key));
+}
+
+void SXReportingBlockThrottle::fire(
+    const std::string& key, const std::shared_ptr<SXReportingBlockThrottleTimerWrapper>& entry) {
+  std::function<void()> block;
+  {
+    // Read under the in-flight lock so that a duplicate's re-arm and replacement, which form one
+    // critical section, are seen whole: a duplicate whose re-arm makes the entry due at once
+    // must have its own operation sent, not the one it replaces.
+    std::lock_guard inFlight(inFlightMutex_);
+    block = entry->block();
+  }
+  if (block) {
+    // A throwing operation must not end the worker, which runs every other send.
+    try {
+      block();
+    } catch (const std::exception& e) {
+      SXLOG(*log_, nullptr, SXLogLevel::kError, "Send operation failed: %s", e.what());
+    } catch (...) {
+      SXLOG(*log_, nullptr, SXLogLevel::kError, "Send operation failed");
+    }
+  }
+  std::lock_guard inFlight(inFlightMutex_);
+  if (auto timer = entry->timer()) timer->invalidate();
+  auto it = timersInFlight_.find(key);
+  if (it != timersInFlight_.end() && it->second == entry) timersInFlight_.erase(it);
+}
+
+void SXReportingBlockThrottle::workerLoop() {
+  while (shouldKeepRunning_.load()) {
+    if (unscheduledTimerKeysCount() > 0) {
+      SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug,
+            "calling workingRunLoop run from inside thread block");
+      scheduleUnscheduledTimers();
+      schedule_.run();
+    }
+    SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "sleeping in thread");
+    idleSleep();
+  }
+}
+
+void SXReportingBlockThrottle::scheduleUnscheduledTimers() {
+  std::lock_guard unscheduled(unscheduledMutex_);
+  {
+    std::lock_guard inFlight(inFlightMutex_);
+    for (const auto& key : unscheduledTimerKeys_) {
+      auto it = timersInFlight_.find(key);
+      if (it != timersInFlight_.end()) schedule_.add(it->second->timer());
+    }
+  }
+  unscheduledTimerKeys_.clear();
+}
+
+void SXReportingBlockThrottle::idleSleep() {
+  std::unique_lock lock(idleMutex_);
+  idleCondition_.wait_for(lock, kIdlePollInterval, [this] { return !shouldKeepRunning_.load(); });
+}
+
+void SXReportingBlockThrottle::stop() {
+  {
+    std::lock_guard lock(idleMutex_);
+    shouldKeepRunning_.store(false);
+  }
+  idleCondition_.notify_all();
+  if (queueThread_.joinable() && queueThread_.get_id() != std::this_thread::get_id()) {
+    queueThread_.join();
+  }
+}
+
+void SXReportingBlockThrottle::waitForCompletion() {
+  SXLOG(*log_, nullptr, SXLogLevel::kInfo,
+        "waitForCompletion. timersInFlight=%u unscheduledTimerKeys=%u", timersInFlightCount(),
+        unscheduledTimerKeysCount());
+  if (timersInFlightCount() == 0) return;
+  SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug,
+        "Waiting up to %u seconds for blockThrottle queue to be empty.", kCompletionWaitSeconds);
+  for (int poll = 0; poll < kCompletionPolls && timersInFlightCount() > 0; ++poll) {
+    std::this_thread::sleep_for(kCompletionPollInterval);
+  }
+  if (size_t pending = timersInFlightCount()) {
+    SXLOG(*log_, nullptr, SXLogLevel::kDefault,
+          "Giving up on waiting for completion after %u seconds. timersInFlight=%u",
+          kCompletionWaitSeconds, pending);
+  }
+}
+
+size_t SXReportingBlockThrottle::timersInFlightCount() const {
+  std::lock_guard lock(inFlightMutex_);
+  return timersInFlight_.size();
+}
+
+size_t SXReportingBlockThrottle::unscheduledTimerKeysCount() const {
+  std::lock_guard lock(unscheduledMutex_);
+  return unscheduledTimerKeys_.size();
+}
