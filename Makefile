@@ -21,9 +21,19 @@ $(BUILD)/CMakeCache.txt:
 build: deps $(BUILD)/CMakeCache.txt
 	cmake --build $(BUILD) -j $(JOBS)
 
+# Everything under ./var, for root too; var/env.sh lets sxreportctl in another shell find it.
+VAR := $(CURDIR)/var
+RUN_ENV = SXREPORTING_STATE_DIR=$(VAR)/lib SXREPORTING_CONFIG_DIR=$(VAR)/etc \
+          SXREPORTING_RUNTIME_DIR=$(VAR)/run SXREPORTING_KESTREL_ROOT=$(VAR)/kestrel \
+          SXREPORTING_DIAGNOSTIC_LOGS_DIR=$(VAR)/log/DiagnosticLogs/Audio/Reporting
+
 run: build
-	@mkdir -p var
-	$(BUILD)/sxreportingd
+	@mkdir -p $(VAR)
+	@for v in $(RUN_ENV); do echo "export $$v"; done > $(VAR)/env.sh
+	@echo "sxreportingd: state, configuration and socket under $(VAR)"
+	@echo "In another shell:  . var/env.sh && $(BUILD)/sxreportctl status"
+	@echo "                   $(BUILD)/sxreportctl create 42 then set-type telephony 42 then valid 42"
+	$(RUN_ENV) $(BUILD)/sxreportingd $(ARGS)
 
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)

@@ -48,3 +48,9 @@ std::vector<std::string> FakeNotifications::posts() const {
   std::lock_guard lock(mutex_);
   return posts_;
 }
+
+void FakeNotifications::clear() {
+  std::multimap<std::string, Registration> dropped;
+  std::lock_guard lock(mutex_);
+  dropped.swap(registrations_);
+}

@@ -21,6 +21,8 @@ class FakeNotifications final : public SXNotifications {
   size_t registrationCount(const std::string& name) const;
   // The names posted successfully, in order.
   std::vector<std::string> posts() const;
+  // Drops every registration (and what its handler holds).
+  void clear();
 
  private:
   struct Registration {

@@ -12,6 +12,7 @@ TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string>
 TestEnvironment::~TestEnvironment() {
   // Queued work holds sessions strongly; run it so nothing outlives the fakes.
   dispatch->runAll();
+  notifications->clear();  // registrations hold the service delegate
 }
 
 SXPlatform TestEnvironment::platform() const {

@@ -45,7 +45,8 @@ bool isSigned64(const SXValue& v) {
 
 std::string checkUnsigned(const SXValue& v, uint64_t max, const char* what) {
   if (!v.is_number_integer()) return std::string("must be ") + what;
-  if (!v.is_number_unsigned() || v.get<uint64_t>() > max) {
+  bool negative = !v.is_number_unsigned() && v.get<int64_t>() < 0;
+  if (negative || v.get<uint64_t>() > max) {
     return "out of range: " + SXValueText(v) + " (expected 0.." + std::to_string(max) + ")";
   }
   return {};
