@@ -76,13 +76,13 @@ std::shared_ptr<SXReportingSession> SXReportingServerInstance::findReportingSess
 
 void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("creating session for reporter %lli", reporterID);
-  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceCreate);
     auto session = SXReportingSession::initWithID(
         self.environment_, reporterID, SXValue::array({self.processIdentifier_}));
     if (session) {
       self.sessions_[reporterID] = std::move(session);
-      SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "session created for reporter %lli",
+      SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "session created for reporter %lli",
             reporterID);
     }
     reply(true);
@@ -92,11 +92,11 @@ void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply
 void SXReportingServerInstance::setServiceType(SXReportingServiceType serviceType,
                                                int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("setting service type %i for reporter %lli", serviceType, reporterID);
-  enqueue([serviceType, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, serviceType, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     if (reporterID == 0) return;
     if (auto session = self.ownSession(reporterID)) {
       session->setServiceType(serviceType);
-      SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+      SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
             "service type %i set for reporter  %lli", serviceType, reporterID);
     }
     reply(true);
@@ -106,7 +106,7 @@ void SXReportingServerInstance::setServiceType(SXReportingServiceType serviceTyp
 void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
                                                             Reply<SXReportingServiceType> reply) {
   SXR_REQUEST_LINE("fetching seviceType");
-  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     if (reporterID == 0) {
       reply(kSXReportingServiceTypeUnknown);
       return;
@@ -114,7 +114,7 @@ void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
     auto session = self.findReportingSessionForID(reporterID);
     SXReportingServiceType type = session ? session->serviceType() : kSXReportingServiceTypeUnknown;
     reply(type);
-    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
           "returnning service type %i for reporter  %lli", type, reporterID);
   });
 }
@@ -122,7 +122,7 @@ void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
 void SXReportingServerInstance::setConfiguration(std::optional<SXValue> configuration,
                                                  int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("setting configuration");
-  enqueue([configuration = std::move(configuration), reporterID,
+  enqueue([fn = __func__, configuration = std::move(configuration), reporterID,
            reply = std::move(reply)](SXReportingServerInstance& self) {
     if (auto session = self.findReportingSessionForID(reporterID)) {
       session->setConfiguration(configuration ? &*configuration : nullptr);
@@ -133,19 +133,19 @@ void SXReportingServerInstance::setConfiguration(std::optional<SXValue> configur
 
 void SXReportingServerInstance::reporterID(int64_t reporterID, Reply<SXValue> valid) {
   SXR_REQUEST_LINE("validating reporter %lli", reporterID);
-  enqueue([reporterID, valid = std::move(valid)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, valid = std::move(valid)](SXReportingServerInstance& self) {
     SXValue reply = {{"reporterID", int64_t{0}}, {"serviceType", kSXReportingServiceTypeUnknown}};
     if (auto session = self.findReportingSessionForID(reporterID)) {
       reply["reporterID"] = reporterID;
       reply["serviceType"] = session->serviceType();
     }
-    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "validating reporter %lli", reporterID);
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "validating reporter %lli", reporterID);
     valid(std::move(reply));
   });
 }
 
 void SXReportingServerInstance::getAllReporters(Reply<std::vector<int64_t>> reply) {
-  enqueue([reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reply = std::move(reply)](SXReportingServerInstance& self) {
     std::vector<int64_t> reporters;
     if (auto delegate = self.delegate_.lock()) {
       for (const auto& client : delegate->getAllClients()) {
@@ -162,7 +162,7 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
                                             Reply<std::optional<SXError>> reply) {
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
-  enqueue([message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
+  enqueue([fn = __func__, message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceSend);
     auto delegate = self.delegate_.lock();
@@ -225,7 +225,7 @@ void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReporti
 
 void SXReportingServerInstance::startReportingSessionForID(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("starting session for reporter %lli", reporterID);
-  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceStart);
     if (reporterID == 0) return;
     auto session = self.findReportingSessionForID(reporterID);
@@ -258,27 +258,27 @@ void SXReportingServerInstance::sendDriverDeltaAndStop(
 
 void SXReportingServerInstance::stopReportingSessionForID(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("stopping session for reporter %lli", reporterID);
-  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceStop);
     if (reporterID == 0) return;
     if (auto session = self.findReportingSessionForID(reporterID)) {
       self.sendDriverDeltaAndStop(session);
     }
-    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "stopping %lli", reporterID);
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "stopping %lli", reporterID);
     reply(true);
   });
 }
 
 void SXReportingServerInstance::destroyReportingSession(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("destroying session for reporter %lli", reporterID);
-  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceDestroy);
     if (reporterID == 0) return;
     if (auto session = self.ownSession(reporterID)) {
       if (session->started()) session->stop();
       self.sessions_.erase(reporterID);
     }
-    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault, "destroying %lli", reporterID);
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "destroying %lli", reporterID);
     reply(true);
   });
 }
@@ -289,7 +289,7 @@ void SXReportingServerInstance::killService(Reply<bool> /*never sent*/) {
 }
 
 void SXReportingServerInstance::handleConnectionError() {
-  enqueue([](SXReportingServerInstance& self) {
+  enqueue([fn = __func__](SXReportingServerInstance& self) {
     auto delegate = self.delegate_.lock();
     if (!delegate) return;
     const auto& clients = delegate->getAllClients();
@@ -299,7 +299,7 @@ void SXReportingServerInstance::handleConnectionError() {
       if (session->started()) session->stop();
     }
     delegate->removeClient(self_ptr);
-    SXLOG(self.log(), self.scope(), SXLogLevel::kDefault,
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
           "removing %i from the server client list", self.processIdentifier_);
   });
 }

@@ -133,15 +133,16 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
   }
   if (fernSession) {
     fernSession->startConfiguration(
-        [environment = environment_, setup](std::optional<std::vector<std::string>> backends) {
+        [fn = __func__, environment = environment_, setup](
+            std::optional<std::vector<std::string>> backends) {
           auto& log = environment->log();
           auto* scope = environment->sessionLogScope();
           if (!backends || backends->empty()) {
-            SXLOG(log, scope, SXLogLevel::kError,
+            SXLOG_IN(fn, log, scope, SXLogLevel::kError,
                   "No backends found, this session won't get sent to the server");
             return;
           }
-          SXLOG(log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
+          SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
           std::lock_guard lock(setup->condition.mutex);
           setup->backendsFound = true;
           setup->condition.signal();
@@ -197,9 +198,9 @@ void SXReportingSession::runTeardownTask() {
     fernSession = std::exchange(fernReportingSession_, nullptr);
   }
   if (!fernSession) return;
-  fernSession->flushMessages([environment = environment_](std::optional<FernError> error) {
+  fernSession->flushMessages([fn = __func__, environment = environment_](std::optional<FernError> error) {
     if (error) {
-      SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kError,
+      SXLOG_IN(fn, environment->log(), environment->sessionLogScope(), SXLogLevel::kError,
             "flush error %@", error->localizedDescription);
     }
   });

@@ -95,11 +95,11 @@ void SXReportingSession::sendSingleMessage(
         "sending single message after delta %lli for service %i", static_cast<int64_t>(delay),
         serviceType);
 
-  auto task = [environment, payload, category, type, serviceType, reply = std::move(reply)] {
+  auto task = [fn = __func__, environment, payload, category, type, serviceType, reply = std::move(reply)] {
     auto& log = environment->log();
     auto* scope = environment->sessionLogScope();
     environment->tracer().trace(kTraceMessage);
-    SXLOG(log, scope, SXLogLevel::kDebug, "sending single message");
+    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "sending single message");
     SXValue sessionInfo = {{fern::kSessionInfoClientType, 19},
                            {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
                            {fern::kSessionInfoSessionID, int32_t{-1}}};
@@ -110,10 +110,10 @@ void SXReportingSession::sendSingleMessage(
     bool sent = environment->platform().fernReporting->sendOneMessage(
         sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, rewritten, error);
     if (!sent && error) {
-      SXLOG(log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
+      SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
             error->localizedDescription);
     } else if (sent) {
-      SXLOG(log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
+      SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
             static_cast<int32_t>(category), type);
     }
     if (reply) reply(error);
