@@ -10,13 +10,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-template <typename T>
-T replied(std::future<SXCallResult<T>> future) {
-  auto result = future.get();
-  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
-  return result.value;
-}
-
 // Starts sxreportctl with `args` against `daemon`; returns its pid.
 pid_t spawnCtl(const TestDaemon& daemon, const std::vector<std::string>& args) {
   std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", daemon.socket()};

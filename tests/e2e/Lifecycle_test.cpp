@@ -11,13 +11,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-template <typename T>
-T replied(std::future<SXCallResult<T>> future) {
-  auto result = future.get();
-  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
-  return result.value;
-}
-
 TestDaemon::Options internalDevice() {
   TestDaemon::Options options;
   options.device = {{"InternalBuild", true}, {"DeviceClassNumber", 1}};
@@ -124,4 +117,22 @@ TEST(LifecycleEndToEnd, NoBackendsWaitsNineSecondsWithoutDelayingOtherSessions) 
   EXPECT_TRUE(daemon.waitForLog("failed to find backend", 1, 20s));
   EXPECT_TRUE(daemon.waitForLog("No valid FernReportingSession"));
   EXPECT_TRUE(daemon.rows("fernreporting.db", "SELECT id FROM flushes").empty());
+}
+
+TEST(LifecycleEndToEnd, UnwritableDiagnosticLogsAreLoggedAndTheStopCompletes) {
+  TestDaemon::Options options = internalDevice();
+  options.extraArgs = {"--diagnostic-logs-dir", "/proc/version/Reporting"};  // never a directory
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  auto start = client->startReportingSessionForID(42, kSXWaitForever);
+  EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
+  EXPECT_TRUE(start.get().value);
+  EXPECT_TRUE(daemon.waitForLog(
+      "-[SXReportingSession createSummaryEventForSession]: can't create logging directory at "
+      "/proc/version/Reporting: "));
+  EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: "));
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db",
+                               "SELECT id FROM messages WHERE category = 65535", 1).size(), 1u);
 }

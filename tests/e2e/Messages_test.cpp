@@ -7,13 +7,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-template <typename T>
-T replied(std::future<SXCallResult<T>> future) {
-  auto result = future.get();
-  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
-  return result.value;
-}
-
 const char* kEvents = "SELECT name, payload_json FROM events WHERE name LIKE 'com.vendra.sonex.%' "
                       "AND name != 'com.vendra.sonex.sxreportingclientuptime' ORDER BY id";
 const char* kSingles =

@@ -11,13 +11,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-template <typename T>
-T replied(std::future<SXCallResult<T>> future) {
-  auto result = future.get();
-  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
-  return result.value;
-}
-
 // A plain socket for bytes the client library would never send.
 class RawConnection {
  public:

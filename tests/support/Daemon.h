@@ -68,3 +68,11 @@ class TestDaemon {
 // Polls `ready` until it holds or `timeout` passes.
 bool waitUntil(const std::function<bool()>& ready,
                std::chrono::milliseconds timeout = std::chrono::seconds(15));
+
+// The value of a call that must have been answered; fails the test otherwise.
+template <typename T>
+T replied(std::future<SXCallResult<T>> future) {
+  auto result = future.get();
+  EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
+  return result.value;
+}
