@@ -29,6 +29,14 @@ struct SXReportingSession::SetupState {
   bool backendsFound = false;  // GUARDED_BY(condition.mutex)
 };
 
+bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
+  if (!payload.is_object()) return true;  // the rewrite turns it into a dictionary
+  for (const auto& [key, value] : payload.items()) {
+    if (key.find(' ') != std::string::npos) return true;
+  }
+  return false;
+}
+
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   SXValue rewritten = SXValue::object();
   if (!payload.is_object()) return rewritten;

@@ -30,6 +30,8 @@ using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
 
 // A copy of `payload` in which every space in a key is replaced by "_"; values untouched.
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload);
+// Whether the rewrite would change `payload`.
+bool SXReportingSessionHasSpacedKeys(const SXValue& payload);
 
 class SXReportingSession : public std::enable_shared_from_this<SXReportingSession> {
  public:
@@ -63,11 +65,20 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   std::optional<SXValue> createSummaryEventForSession();
   bool shouldReportOrientation();
 
-  // A server-reporting message without a session of its own.
+  // A server-reporting message without a session of its own. `userInfo` is accepted and not
+  // sent: a standalone message carries only the client and service names.
+  static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
+                                std::shared_ptr<const SXValue> payload,
+                                SXReportingCategory category, SXReportingMessageType type,
+                                SXReportingServiceType serviceType, const SXValue* userInfo,
+                                SXReportingSendReply reply);
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
                                 const SXValue& payload, SXReportingCategory category,
                                 SXReportingMessageType type, SXReportingServiceType serviceType,
-                                const SXValue* userInfo, SXReportingSendReply reply);
+                                const SXValue* userInfo, SXReportingSendReply reply) {
+    sendSingleMessage(environment, std::make_shared<const SXValue>(payload), category, type,
+                      serviceType, userInfo, std::move(reply));
+  }
 
   // Accessors (any thread).
   int64_t reporterID() const { return reporterID_.load(); }
@@ -106,7 +117,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
 
   void runSetupTask(SXValue userInfo, std::string serviceName,
                     std::shared_ptr<SetupState> setup);
-  void runSendTask(const std::shared_ptr<const SXValue>& entry, const SXValue& callerPayload,
+  void runSendTask(const std::shared_ptr<const SXValue>& entry,
+                   const std::shared_ptr<const SXValue>& callerPayload,
                    SXReportingCategory category, SXReportingMessageType type,
                    bool startedSnapshot);
   void runTeardownTask();

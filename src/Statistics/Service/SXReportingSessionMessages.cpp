@@ -40,22 +40,30 @@ void SXReportingSession::sendMessage(const SXValue& payload, SXReportingCategory
   appendToAggregate(entry);
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
-  fernReportingQueue_->async(
-      [self = shared_from_this(), entry, payload, category, type, startedSnapshot] {
-        self->runSendTask(entry, payload, category, type, startedSnapshot);
-      });
+  // The caller's own payload appears only in a verbose line; keep a copy only for that.
+  auto callerPayload = log().isEnabled(scope(), kSXLogVerboseLevel)
+                           ? std::make_shared<const SXValue>(payload)
+                           : nullptr;
+  fernReportingQueue_->async([self = shared_from_this(), entry, callerPayload = std::move(callerPayload),
+                              category, type, startedSnapshot] {
+    self->runSendTask(entry, callerPayload, category, type, startedSnapshot);
+  });
   if (reply) reply(std::nullopt);
 }
 
 void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry,
-                                     const SXValue& callerPayload, SXReportingCategory category,
-                                     SXReportingMessageType type, bool startedSnapshot) {
+                                     const std::shared_ptr<const SXValue>& callerPayload,
+                                     SXReportingCategory category, SXReportingMessageType type,
+                                     bool startedSnapshot) {
   const SXValue& rewritten = entry->begin().value();
   if (!startedSnapshot) {
     SXLOG(log(), scope(), SXLogLevel::kDebug,
           "session not started, will send as a single message");
+    // Shares the aggregate entry's payload instead of copying it.
+    std::shared_ptr<const SXValue> payload(entry, &rewritten);
     SXValue info = userInfo();
-    sendSingleMessage(environment_, rewritten, category, type, serviceType(), &info, nullptr);
+    sendSingleMessage(environment_, std::move(payload), category, type, serviceType(), &info,
+                      nullptr);
     return;
   }
   if (serviceType() == kTestServiceType) {
@@ -79,12 +87,13 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
   }
   SXLOG(log(), scope(), SXLogLevel::kDebug,
         "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
-        callerPayload, static_cast<int32_t>(category), type);
+        callerPayload ? *callerPayload : SXValue(), static_cast<int32_t>(category), type);
 }
 
 void SXReportingSession::sendSingleMessage(
-    const std::shared_ptr<SXReportingEnvironment>& environment, const SXValue& payload,
-    SXReportingCategory category, SXReportingMessageType type,
+    const std::shared_ptr<SXReportingEnvironment>& environment,
+    std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+    SXReportingMessageType type,
     SXReportingServiceType serviceType, const SXValue* /*userInfo: not sent*/,
     SXReportingSendReply reply) {
   const SXPlatform& platform = environment->platform();
@@ -105,15 +114,18 @@ void SXReportingSession::sendSingleMessage(
                            {fern::kSessionInfoSessionID, int32_t{-1}}};
     SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
                         {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
-    SXValue rewritten = SXReportingSessionUnderscoreKeys(payload);
+    // A payload the session already rewrote needs no second copy.
+    auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
+                         ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
+                         : payload;
     std::optional<FernError> error;
     bool sent = environment->platform().fernReporting->sendOneMessage(
-        sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, rewritten, error);
+        sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
     if (!sent && error) {
       SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
             error->localizedDescription);
     } else if (sent) {
-      SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
+      SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
             static_cast<int32_t>(category), type);
     }
     if (reply) reply(error);
