@@ -62,3 +62,10 @@ std::vector<std::string> FakeOrientationService::calls() const {
   std::lock_guard lock(mutex_);
   return calls_;
 }
+
+void FakeOrientationService::clear() {
+  std::map<std::string, SXOrientationCallback> device, interface;
+  std::lock_guard lock(mutex_);
+  device.swap(device_);
+  interface.swap(interface_);
+}

@@ -89,6 +89,8 @@ class FakeOrientationService final : public SXOrientationService {
   bool fireDevice(const std::string& id, int32_t orientation);
   bool fireInterface(const std::string& id, int32_t orientation);
   std::vector<std::string> calls() const;  // "registerDevice <id>", ...
+  // Drops every registration (callbacks hold their sessions).
+  void clear();
 
  private:
   mutable std::mutex mutex_;

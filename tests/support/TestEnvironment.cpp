@@ -13,6 +13,7 @@ TestEnvironment::~TestEnvironment() {
   // Queued work holds sessions strongly; run it so nothing outlives the fakes.
   dispatch->runAll();
   notifications->clear();  // registrations hold the service delegate
+  orientation->clear();    // and callbacks their sessions
 }
 
 SXPlatform TestEnvironment::platform() const {
