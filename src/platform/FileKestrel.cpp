@@ -1,4 +1,5 @@
 #include "platform/FileKestrel.h"
+#include "platform/FileSystem.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -114,20 +115,6 @@ std::optional<int64_t> sampleValue(const SXValue& entry) {
   if (value == entry.end() || !value->is_number_integer()) return std::nullopt;
   return value->get<int64_t>();
 }
-
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ~ScopedFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 // Reads at most `buffer.size()` bytes; returns the count, or -1 with errno set.
 ssize_t readUpTo(int fd, std::string& buffer) {
@@ -245,7 +232,7 @@ void SXFileKestrel::iterate(const SXValue& samples,
 std::optional<int64_t> SXFileKestrel::readCounter(const std::string& key) const {
   const std::string path = root_ + "/" + key;
   // Non-blocking, so that a FIFO put where a counter belongs cannot stall sampling.
-  ScopedFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  SXScopedFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
   if (fd.get() < 0) {
     // A channel that went away since the subscription is simply not sampled.
     if (errno != ENOENT && errno != ENOTDIR) {

@@ -7,6 +7,10 @@
 #include <cerrno>
 #include <cstring>
 
+SXScopedFd::~SXScopedFd() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
 std::string SXPosixError(const std::string& context, int errnum) {
   return context + ": " + std::strerror(errnum);
 }

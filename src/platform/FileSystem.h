@@ -23,5 +23,18 @@ class SXPosixFileSystem final : public SXFileSystem {
                                                  const std::string& contents) override;
 };
 
+// Owns one file descriptor and closes it (which also releases an flock taken through it).
+class SXScopedFd {
+ public:
+  explicit SXScopedFd(int fd) : fd_(fd) {}
+  ~SXScopedFd();
+  SXScopedFd(const SXScopedFd&) = delete;
+  SXScopedFd& operator=(const SXScopedFd&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
 // "<context>: <strerror(errno)>", the one place errno becomes text.
 std::string SXPosixError(const std::string& context, int errnum);

@@ -15,28 +15,13 @@ namespace {
 
 constexpr unsigned kDirectoryMode = 0755;
 
-// Owns one file descriptor; closing it also releases any flock taken through it.
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ~ScopedFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
-
 struct FileRead {
   std::optional<std::string> contents;  // nothing when the file could not be read
   int error = 0;                        // errno of the failure; ENOENT when absent
 };
 
 FileRead ReadWholeFile(const std::string& path) {
-  ScopedFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  SXScopedFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
   if (fd.get() < 0) return {std::nullopt, errno};
   std::string contents;
   char buffer[8192];
@@ -136,7 +121,7 @@ std::optional<std::string> SXJsonPreferences::setValue(const std::string& domain
   // the file; the lock file itself is never replaced, unlike the domain file.
   std::string path = domainPath(domain);
   std::string lockPath = path + ".lock";
-  ScopedFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+  SXScopedFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
   if (lock.get() < 0) return SXPosixError(lockPath, errno);
   if (int err = LockExclusive(lock.get())) return SXPosixError(lockPath, err);
 
