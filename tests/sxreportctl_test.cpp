@@ -165,7 +165,7 @@ TEST_F(SxreportctlTest, StatusPrintsClientsSessionsDefaultsAndCounters) {
                     {"reportingEnabled", true},
                     {"defaults", {{"ReportingEnabled", true}}},
                     {"counters", {{"messages", 7}}}};
-  server_.on(kStatus, [&](auto&) { return Answer::reply(status); });
+  server_.on(kStatus, [status](auto&) { return Answer::reply(status); });
   CtlRun result = run({"status"});
   EXPECT_EQ(result.status, 0);
   EXPECT_EQ(result.out,
