@@ -78,9 +78,7 @@ class InotifyNotificationsTest : public ::testing::Test {
     EXPECT_EQ(notify.registerDispatch(name, token, queue, deliveries_.handler(queue, tag)), 0);
     return token;
   }
-  std::string notifyFile(const std::string& name) const {
-    return runtimeDir_ + "/notify/" + name;
-  }
+  std::string notifyFile(const std::string& name) const { return runtimeDir_ + "/notify/" + name; }
 
   std::string runtimeDir_;
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
@@ -142,9 +140,8 @@ TEST_F(InotifyNotificationsTest, PostsReachRegistrationsOfOtherInstances) {
 TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArguments) {
   auto notify = open();
   int token = -7;
-  for (std::string name : {std::string(""), std::string("."), std::string(".."),
-                           std::string("a/b"), std::string("/"), std::string("a\0b", 3),
-                           std::string(300, 'x')}) {
+  for (std::string name : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
+                           std::string("/"), std::string("a\0b", 3), std::string(300, 'x')}) {
     EXPECT_NE(notify->post(name), 0) << name;
     EXPECT_NE(notify->registerDispatch(name, token, queue1_, [](int) {}), 0) << name;
   }

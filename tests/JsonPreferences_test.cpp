@@ -65,15 +65,15 @@ TEST(PreferencesValueTest, ReadsAsString) {
 }
 
 TEST(PreferencesValueTest, ReadsAsBool) {
-  for (SXValue yes : {SXValue(true), SXValue(1), SXValue(-1), SXValue(7u), SXValue(0.5),
-                      SXValue("YES"), SXValue("yes"), SXValue("True"), SXValue("TRUE"),
-                      SXValue("1")}) {
+  for (SXValue yes :
+       {SXValue(true), SXValue(1), SXValue(-1), SXValue(7u), SXValue(0.5), SXValue("YES"),
+        SXValue("yes"), SXValue("True"), SXValue("TRUE"), SXValue("1")}) {
     EXPECT_TRUE(SXPreferencesValueAsBool(yes)) << yes.dump();
   }
-  for (SXValue no : {SXValue(false), SXValue(0), SXValue(0u), SXValue(0.0), SXValue("NO"),
-                     SXValue("false"), SXValue("0"), SXValue("Y"), SXValue(" YES"),
-                     SXValue("yess"), SXValue("2"), SXValue(""), SXValue(nullptr),
-                     SXValue::array({true}), SXValue::object({{"a", true}})}) {
+  for (SXValue no :
+       {SXValue(false), SXValue(0), SXValue(0u), SXValue(0.0), SXValue("NO"), SXValue("false"),
+        SXValue("0"), SXValue("Y"), SXValue(" YES"), SXValue("yess"), SXValue("2"), SXValue(""),
+        SXValue(nullptr), SXValue::array({true}), SXValue::object({{"a", true}})}) {
     EXPECT_FALSE(SXPreferencesValueAsBool(no)) << no.dump();
   }
   EXPECT_FALSE(SXPreferencesValueAsBool(std::string("YES\0", 4)));
@@ -135,9 +135,9 @@ TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {
 TEST_F(JsonPreferencesTest, RefusesDomainsThatAreNotFileNames) {
   auto prefs = open();
   writeFile(configDir_ + "/secret.json", R"({"a": 1})");
-  for (std::string domain : {std::string(""), std::string("."), std::string(".."),
-                             std::string("../secret"), std::string("a/b"), std::string("/etc"),
-                             std::string("a\0b", 3)}) {
+  for (std::string domain :
+       {std::string(""), std::string("."), std::string(".."), std::string("../secret"),
+        std::string("a/b"), std::string("/etc"), std::string("a\0b", 3)}) {
     EXPECT_NE(prefs->setValue(domain, "a", SXValue(2)), std::nullopt) << domain;
     EXPECT_EQ(prefs->copyValue(domain, "a"), std::nullopt) << domain;
     EXPECT_EQ(prefs->copyDomain(domain), SXValue::object()) << domain;
@@ -164,8 +164,7 @@ TEST_F(JsonPreferencesTest, ReplacingAKeyKeepsTheOthersAndLeavesNoTemporaries) {
   ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(1)), std::nullopt);
   ASSERT_EQ(prefs->setValue(kDomain, "b", SXValue::object({{"nested", {1, 2}}})), std::nullopt);
   ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue("one")), std::nullopt);
-  EXPECT_EQ(prefs->copyDomain(kDomain),
-            SXValue({{"a", "one"}, {"b", {{"nested", {1, 2}}}}}));
+  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", "one"}, {"b", {{"nested", {1, 2}}}}}));
   for (const auto& entry : fs::directory_iterator(configDir_ + "/preferences")) {
     std::string name = entry.path().filename();
     EXPECT_TRUE(name == std::string(kDomain) + ".json" ||

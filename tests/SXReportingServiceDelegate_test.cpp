@@ -112,7 +112,8 @@ TEST(SXReportingServiceDelegateRouting, AddressedHitsBridgesFirstBroadcastHitsSe
                                           "failed to get SXReporting timestamp for joulebook",
                                           "sending message for session owned by 42"};
   EXPECT_EQ(s.messagesContaining(marks), marks);
-  EXPECT_EQ(s.tallyvane->payloads[0]["HostApplicationDisplayID"], "y");  // the session's, not the payload's
+  EXPECT_EQ(s.tallyvane->payloads[0]["HostApplicationDisplayID"],
+            "y");  // the session's, not the payload's
   EXPECT_EQ(s.t.joulebook->entries().size(), 1u);
 
   // Broadcast to a started session: the session first, then the bridges.
@@ -128,7 +129,8 @@ TEST(SXReportingServiceDelegateRouting, AddressedHitsBridgesFirstBroadcastHitsSe
     }
   }
   EXPECT_EQ(seen, (std::vector<std::string>{marks[2], marks[0], marks[1]}));
-  EXPECT_TRUE(s.t.log->contains("active reporting sessions 1 : (<SXReportingSession reporterID=42"));
+  EXPECT_TRUE(
+      s.t.log->contains("active reporting sessions 1 : (<SXReportingSession reporterID=42"));
   s.call(*c, sxr::method::kStop, {42});
 }
 
@@ -199,7 +201,8 @@ TEST(SXReportingServiceDelegateConnections, InterruptThenInvalidateStopsOnceAndT
   EXPECT_EQ(s.t.log->count("removing 10 from the server client list"), 1u);
   EXPECT_EQ(s.t.log->count("sending summary event for reporter 42"), 1u);
   EXPECT_EQ(s.t.log->count("InterruptionHandler: connection exited"), 1u);
-  EXPECT_TRUE(s.t.log->contains("InvalidationHandler: connection exited process=player uptime_sec=2"));
+  EXPECT_TRUE(
+      s.t.log->contains("InvalidationHandler: connection exited process=player uptime_sec=2"));
   ASSERT_EQ(c->responses().size(), 3u);  // create, send, and the start held until the stop
   EXPECT_EQ(c->responses()[2].result, true);
   EXPECT_EQ(s.call(*other, sxr::method::kGetAllReporters, SXValue::array())[0].result,
@@ -215,7 +218,8 @@ TEST(SXReportingServiceDelegateConnections, FallbacksWhenNameOrStartDateAreMissi
   early->end(false);
   s.t.drain();
   EXPECT_TRUE(s.t.log->contains("clientStartDate is nil. clientpid=33 clientprocessname=unknown"));
-  EXPECT_TRUE(s.t.log->contains("InvalidationHandler: connection exited process=(null) uptime_sec=-1"));
+  EXPECT_TRUE(
+      s.t.log->contains("InvalidationHandler: connection exited process=(null) uptime_sec=-1"));
   EXPECT_TRUE(s.t.log->contains("clientProcessName is nil. clientpid=33"));
   EXPECT_TRUE(s.tallyvane->payloads.empty());
 }

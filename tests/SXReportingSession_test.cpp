@@ -77,8 +77,8 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   EXPECT_EQ(replies, 1);  // at once, before the send task ran
   auto entries = session->aggregatedPayloadEntries();
   ASSERT_EQ(entries.size(), 1u);
-  EXPECT_EQ(entries[0], (SXValue{{"Playback_Start_3",
-                                  {{"peak_level", 1}, {"route", "a b"}, {"a_b", 2}}}}));
+  EXPECT_EQ(entries[0],
+            (SXValue{{"Playback_Start_3", {{"peak_level", 1}, {"route", "a b"}, {"a_b", 2}}}}));
   t.drain();
   auto sent = t.fern->events(Kind::kMessage);
   ASSERT_EQ(sent.size(), 1u);
@@ -149,9 +149,7 @@ TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThen
   EXPECT_FALSE(session->aggregatedPayloadData());
   t.drain();
   ASSERT_TRUE(t.fern->waitFor(
-      [](const auto& events) {
-        return !events.empty() && events.back().kind == Kind::kFlush;
-      },
+      [](const auto& events) { return !events.empty() && events.back().kind == Kind::kFlush; },
       std::chrono::seconds(5)));
 
   std::vector<Kind> kinds;
@@ -285,10 +283,10 @@ TEST(SXReportingSessionOrientation, WhoTracks) {
     SXReportingServiceType type;
     bool tracks;
   };
-  for (const auto& c : {Case{internalBuild(), 2, true}, Case{internalBuild(), 7, true},
-                        Case{internalBuild(), 1, false}, Case{internalBuild(6), 2, false},
-                        Case{{{"InternalBuild", true}}, 7, true},
-                        Case{SXValue::object(), 2, false}}) {
+  for (const auto& c :
+       {Case{internalBuild(), 2, true}, Case{internalBuild(), 7, true},
+        Case{internalBuild(), 1, false}, Case{internalBuild(6), 2, false},
+        Case{{{"InternalBuild", true}}, 7, true}, Case{SXValue::object(), 2, false}}) {
     TestEnvironment t(c.device);
     auto session = makeSession(t, 42, c.type);
     session->start();

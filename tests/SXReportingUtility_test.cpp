@@ -92,7 +92,8 @@ TEST(SXReportingUtilityWait, SignalWithoutFlagRestartsThePassThenTimesOut) {
   });
   EXPECT_FALSE(SXReportingUtilityWait(condition, done, "waiting", "failed", log, nullptr, 0.3));
   signaller.join();
-  EXPECT_EQ(log.messages(), (std::vector<std::string>{"waiting", "continuing", "waiting", "failed"}));
+  EXPECT_EQ(log.messages(),
+            (std::vector<std::string>{"waiting", "continuing", "waiting", "failed"}));
   EXPECT_EQ(log.lines().back().level, SXLogLevel::kError);
 }
 

@@ -3,10 +3,9 @@
 
 #include <cstdint>
 #include <functional>
+#include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
-
-#include <nlohmann/json.hpp>
 
 // Payloads, configurations, defaults and reply dictionaries. Objects keep their keys sorted,
 // which is the enumeration order everywhere in the service.

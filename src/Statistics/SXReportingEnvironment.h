@@ -21,7 +21,9 @@ class SXReportingEnvironment {
 
   // The service scope "sxrs"; set by the service delegate's init (nullptr before it).
   const SXLogScope* serviceLogScope() const { return serviceScope_.load().get(); }
-  void setServiceLogScope(std::shared_ptr<const SXLogScope> scope) { serviceScope_ = std::move(scope); }
+  void setServiceLogScope(std::shared_ptr<const SXLogScope> scope) {
+    serviceScope_ = std::move(scope);
+  }
 
   // The session scope "sxrr", registered by the first session created.
   const SXLogScope* sessionLogScope() const { return sessionScope_.load().get(); }
@@ -29,7 +31,9 @@ class SXReportingEnvironment {
 
   // The driver scope "sxrd"; set at every creation of a driver utility.
   const SXLogScope* driverLogScope() const { return driverScope_.load().get(); }
-  void setDriverLogScope(std::shared_ptr<const SXLogScope> scope) { driverScope_ = std::move(scope); }
+  void setDriverLogScope(std::shared_ptr<const SXLogScope> scope) {
+    driverScope_ = std::move(scope);
+  }
 
   // The serial server queue "com.vendra.sonex.reporting.server"; set by the delegate's init,
   // before any client connects.

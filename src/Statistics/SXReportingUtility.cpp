@@ -9,25 +9,31 @@
 namespace {
 
 const std::array<std::string, 12> kServiceTypeNames = {
-    "generic",         "vokira",           "telephony",        "haptics",
-    "alarms",          "standalone",       "soundautoconfig",  "longformaudio",
-    "nonlongformaudio", "audiodeviceusage", "alerts",           "test"};
+    "generic",          "vokira",           "telephony",       "haptics",
+    "alarms",           "standalone",       "soundautoconfig", "longformaudio",
+    "nonlongformaudio", "audiodeviceusage", "alerts",          "test"};
 
 const std::array<std::string, 12> kCategoryNames = {
-    "Undefined", "Generic",  "Record", "Playback",    "PlaybackAndRecord", "Setup",
-    "ClientRequest", "RouteChange", "Error", "KestrelStats", "Performance", "Volume"};
+    "Undefined",     "Generic",     "Record", "Playback",     "PlaybackAndRecord", "Setup",
+    "ClientRequest", "RouteChange", "Error",  "KestrelStats", "Performance",       "Volume"};
 
 const std::array<std::string, 6> kTypeNames = {"Generic", "Start", "Stop",
                                                "Setup",   "Error", "IssueDetector"};
 
 const char* componentName(uint32_t upperMask) {
   switch (upperMask) {
-    case 0x08000000: return "Session";
-    case 0x10000000: return "DSP";
-    case 0x20000000: return "HAL";
-    case 0x40000000: return "Routing";
-    case 0x80000000: return "Kitbench";
-    default: return "";
+    case 0x08000000:
+      return "Session";
+    case 0x10000000:
+      return "DSP";
+    case 0x20000000:
+      return "HAL";
+    case 0x40000000:
+      return "Routing";
+    case 0x80000000:
+      return "Kitbench";
+    default:
+      return "";
   }
 }
 

@@ -10,10 +10,10 @@ constexpr int kEnvelopeDepth = 2;
 RpcStreamDecoder::RpcStreamDecoder(RpcLimits limits)
     : limits_(limits),
       unpacker_(nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE,
-                msgpack::unpack_limit(limits.maxContainerEntries, limits.maxContainerEntries,
-                                      limits.maxMessageBytes, limits.maxMessageBytes,
-                                      limits.maxMessageBytes,
-                                      static_cast<size_t>(limits.maxPayloadDepth + kEnvelopeDepth))) {}
+                msgpack::unpack_limit(
+                    limits.maxContainerEntries, limits.maxContainerEntries, limits.maxMessageBytes,
+                    limits.maxMessageBytes, limits.maxMessageBytes,
+                    static_cast<size_t>(limits.maxPayloadDepth + kEnvelopeDepth))) {}
 
 char* RpcStreamDecoder::prepare(size_t size) {
   unpacker_.reserve_buffer(size);
@@ -30,7 +30,8 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
         error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
         return Status::kBroken;
       }
-      msgpack::object_handle handle(unpacker_.data(), msgpack::unique_ptr<msgpack::zone>(unpacker_.release_zone()));
+      msgpack::object_handle handle(unpacker_.data(),
+                                    msgpack::unique_ptr<msgpack::zone>(unpacker_.release_zone()));
       unpacker_.reset();
       message = SXValueFromMsgpack(handle.get(), limits_.maxPayloadDepth + kEnvelopeDepth);
       return Status::kMessage;

@@ -16,11 +16,12 @@
 class SXFormatArg {
  public:
   template <typename T>
-    requires(std::is_integral_v<T> && std::is_signed_v<T> && !std::is_same_v<T, bool>)
-  SXFormatArg(T v) : v_(static_cast<int64_t>(v)) {}
+  requires(std::is_integral_v<T>&& std::is_signed_v<T> && !std::is_same_v<T, bool>) SXFormatArg(T v)
+      : v_(static_cast<int64_t>(v)) {}
   template <typename T>
-    requires(std::is_integral_v<T> && std::is_unsigned_v<T> && !std::is_same_v<T, bool>)
-  SXFormatArg(T v) : v_(static_cast<uint64_t>(v)) {}
+  requires(std::is_integral_v<T>&& std::is_unsigned_v<T> && !std::is_same_v<T, bool>)
+      SXFormatArg(T v)
+      : v_(static_cast<uint64_t>(v)) {}
   SXFormatArg(bool v) : v_(static_cast<int64_t>(v)) {}
   SXFormatArg(double v) : v_(v) {}
   SXFormatArg(float v) : v_(static_cast<double>(v)) {}

@@ -19,10 +19,10 @@ SXPaths SXPaths::fromEnvironment() {
   p.stateDir = fromEnv("SXREPORTING_STATE_DIR", root ? "/var/lib/sxreportingd" : "./var/lib");
   p.configDir = fromEnv("SXREPORTING_CONFIG_DIR", root ? "/etc/sxreportingd" : "./var/etc");
   p.runtimeDir = fromEnv("SXREPORTING_RUNTIME_DIR", root ? "/run/sxreportingd" : "./var/run");
-  p.diagnosticLogsDir = fromEnv(
-      "SXREPORTING_DIAGNOSTIC_LOGS_DIR",
-      root ? "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting"
-           : "./var/log/DiagnosticLogs/Audio/Reporting");
+  p.diagnosticLogsDir =
+      fromEnv("SXREPORTING_DIAGNOSTIC_LOGS_DIR",
+              root ? "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting"
+                   : "./var/log/DiagnosticLogs/Audio/Reporting");
   p.kestrelRoot = fromEnv("SXREPORTING_KESTREL_ROOT", root ? "/run/kestrel" : "./var/kestrel");
   const char* socket = std::getenv("SXREPORTING_SOCKET");
   p.socketPathExplicit = socket && *socket;

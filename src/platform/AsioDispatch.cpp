@@ -209,8 +209,8 @@ void SXAsioDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWor
     return;
   }
   auto timer = std::make_shared<asio::steady_timer>(timers_, delay);
-  timer->async_wait([timer, queue = std::move(queue), task = std::move(task)](
-                        const std::error_code& ec) mutable {
-    if (!ec) queue->async(std::move(task));
-  });
+  timer->async_wait(
+      [timer, queue = std::move(queue), task = std::move(task)](const std::error_code& ec) mutable {
+        if (!ec) queue->async(std::move(task));
+      });
 }

@@ -1,5 +1,4 @@
 #include "platform/FileKestrel.h"
-#include "platform/FileSystem.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>

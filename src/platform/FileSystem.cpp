@@ -28,7 +28,7 @@ std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string&
       continue;
     }
     if (errno == EEXIST) {
-      struct stat st{};
+      struct stat st {};
       if (::stat(partial.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) continue;
       return SXPosixError(partial, ENOTDIR);
     }

@@ -192,13 +192,13 @@ void SXInotifyNotifications::deliver(const std::vector<std::string>& names, bool
   }
   // Queued outside the lock: a queue may run the task inline or block on its own lock.
   for (Registration& registration : due) {
-    registration.queue->async([handler = std::move(registration.handler),
-                               token = registration.token, log = log_] {
-      try {
-        handler(token);
-      } catch (...) {
-        SXLOG(*log, nullptr, SXLogLevel::kError, "notification handler %d threw", token);
-      }
-    });
+    registration.queue->async(
+        [handler = std::move(registration.handler), token = registration.token, log = log_] {
+          try {
+            handler(token);
+          } catch (...) {
+            SXLOG(*log, nullptr, SXLogLevel::kError, "notification handler %d threw", token);
+          }
+        });
   }
 }

@@ -40,10 +40,18 @@ bool SXStderrLog::isEnabled(const SXLogScope* scope, int level) const {
 void SXStderrLog::write(const SXLogScope*, SXLogLevel level, std::string_view line) {
   const char* priority = "<5>";
   switch (level) {
-    case SXLogLevel::kDefault: priority = "<5>"; break;
-    case SXLogLevel::kInfo: priority = "<6>"; break;
-    case SXLogLevel::kError: priority = "<3>"; break;
-    case SXLogLevel::kDebug: priority = "<7>"; break;
+    case SXLogLevel::kDefault:
+      priority = "<5>";
+      break;
+    case SXLogLevel::kInfo:
+      priority = "<6>";
+      break;
+    case SXLogLevel::kError:
+      priority = "<3>";
+      break;
+    case SXLogLevel::kDebug:
+      priority = "<7>";
+      break;
   }
   std::lock_guard lock(writeMutex_);
   std::fputs(priority, stderr);

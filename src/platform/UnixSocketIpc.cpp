@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <asio/post.hpp>
+#include <asio/steady_timer.hpp>
 #include <asio/write.hpp>
 #include <cstdlib>
 
@@ -17,7 +18,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   SXUnixSocketConnection(asio::local::stream_protocol::socket socket, RpcLimits limits,
                          SXUnixSocketListener& listener, std::shared_ptr<SXLogFacility> log)
       : socket_(std::move(socket)), decoder_(limits), listener_(listener), log_(std::move(log)) {
-    struct ucred cred{};
+    struct ucred cred {};
     socklen_t len = sizeof cred;
     if (::getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &cred, &len) == 0) {
       pid_ = cred.pid;
@@ -77,16 +78,15 @@ class SXUnixSocketConnection final : public SXIpcConnection,
  private:
   void read() {
     char* buffer = decoder_.prepare(kReadSize);
-    socket_.async_read_some(
-        asio::buffer(buffer, kReadSize),
-        [self = shared_from_this()](const std::error_code& ec, size_t n) {
-          if (ec) {
-            self->end(ec != asio::error::eof);
-            return;
-          }
-          self->decoder_.commit(n);
-          if (self->dispatchMessages()) self->read();
-        });
+    socket_.async_read_some(asio::buffer(buffer, kReadSize),
+                            [self = shared_from_this()](const std::error_code& ec, size_t n) {
+                              if (ec) {
+                                self->end(ec != asio::error::eof);
+                                return;
+                              }
+                              self->decoder_.commit(n);
+                              if (self->dispatchMessages()) self->read();
+                            });
   }
 
   // Hands every whole message to the exported object. Returns false when the stream broke.
@@ -247,8 +247,12 @@ void SXUnixSocketListener::accept() {
       if (!delegate_ || !delegate_->shouldAcceptNewConnection(connection)) {
         connection->end(false);
       }
-    } else if (ec == asio::error::no_descriptors || ec == asio::error::no_buffer_space) {
+    } else {
+      // Out of descriptors or memory: accepting again at once would spin, so pause first.
       SXLOG(*log_, nullptr, SXLogLevel::kError, "accept: %@", ec.message());
+      auto pause = std::make_shared<asio::steady_timer>(io_, std::chrono::milliseconds(100));
+      pause->async_wait([this, pause](const std::error_code&) { accept(); });
+      return;
     }
     accept();
   });

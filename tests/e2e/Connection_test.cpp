@@ -37,7 +37,8 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   ASSERT_EQ(daemon.ctl({"defaults", "write", "device_name", "bench"}), 0);
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
   ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
-  ASSERT_TRUE(waitUntil([&] { return !replied(client->status())["reportingEnabled"].get<bool>(); }));
+  ASSERT_TRUE(
+      waitUntil([&] { return !replied(client->status())["reportingEnabled"].get<bool>(); }));
   auto disabled = replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42}));
   ASSERT_TRUE(disabled);
   EXPECT_EQ(*disabled, (SXError{"com.vendra.audio.reporting", 1}));
@@ -86,7 +87,8 @@ TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
   ::waitpid(child, nullptr, 0);
   double lifetime = std::chrono::duration<double>(std::chrono::steady_clock::now() - began).count();
 
-  EXPECT_TRUE(daemon.waitForLog("removing " + std::to_string(child) + " from the server client list"));
+  EXPECT_TRUE(
+      daemon.waitForLog("removing " + std::to_string(child) + " from the server client list"));
   auto uptime = daemon.waitForRows(
       "tallyvane.db",
       "SELECT payload_json FROM events WHERE name = 'com.vendra.sonex.sxreportingclientuptime'", 1);
@@ -94,8 +96,8 @@ TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
   auto summaries = daemon.waitForRows(
       "fernreporting.db", "SELECT payload_json FROM messages WHERE category = 65535", 1);
   std::this_thread::sleep_for(200ms);  // nothing more may come
-  EXPECT_EQ(daemon.rows("fernreporting.db",
-                        "SELECT id FROM messages WHERE category = 65535").size(), 1u);
+  EXPECT_EQ(
+      daemon.rows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535").size(), 1u);
   EXPECT_EQ(daemon.countInLog("removing " + std::to_string(child)), 1u);
   ASSERT_EQ(uptime.size(), 1u);
   SXValue event = SXValue::parse(uptime[0]["payload_json"].get<std::string>());

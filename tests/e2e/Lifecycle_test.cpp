@@ -14,8 +14,8 @@ using namespace std::chrono_literals;
 TestDaemon::Options internalDevice() {
   TestDaemon::Options options;
   options.device = {{"InternalBuild", true}, {"DeviceClassNumber", 1}};
-  options.counters = {{"Speaker/-/underruns", 5}, {"Speaker/-/resets", 9},
-                      {"Haptics/Stats/kicks", 1}};
+  options.counters = {
+      {"Speaker/-/underruns", 5}, {"Speaker/-/resets", 9}, {"Haptics/Stats/kicks", 1}};
   return options;
 }
 
@@ -30,14 +30,15 @@ TEST(LifecycleEndToEnd, StartReplyWaitsForStopThenSpoolAndFileHoldTheSession) {
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
   ASSERT_TRUE(replied(client->setServiceType(7, 42)));
-  ASSERT_TRUE(replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
+  ASSERT_TRUE(
+      replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
   auto start = client->startReportingSessionForID(42, kSXWaitForever);
   EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
   EXPECT_EQ(start.wait_for(300ms), std::future_status::timeout);  // held until stop
 
   daemon.setCounter("Speaker/-/underruns", 8);  // rose by 3
   daemon.setCounter("Speaker/-/resets", 2);     // went down: not reported
-  auto other = daemon.client();                  // stop from another client reaches it too
+  auto other = daemon.client();                 // stop from another client reaches it too
   EXPECT_TRUE(replied(other->stopReportingSessionForID(42)));
   auto held = start.get();
   EXPECT_EQ(held.status, SXCallStatus::kReplied);
@@ -105,8 +106,8 @@ TEST(LifecycleEndToEnd, NoBackendsWaitsNineSecondsWithoutDelayingOtherSessions) 
   // Session 2 is not started: its send goes standalone at once, though session 1 waits.
   auto before = std::chrono::steady_clock::now();
   EXPECT_FALSE(replied(client->sendMessage({{"k", 2}}, 3, 1, std::vector<int64_t>{2})));
-  auto singles = daemon.waitForRows(
-      "fernreporting.db", "SELECT id FROM messages WHERE session_id IS NULL", 1, 5s);
+  auto singles = daemon.waitForRows("fernreporting.db",
+                                    "SELECT id FROM messages WHERE session_id IS NULL", 1, 5s);
   EXPECT_EQ(singles.size(), 1u);
   EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
   EXPECT_TRUE(daemon.waitForLog("No backends found, this session won't get sent to the server"));
@@ -133,6 +134,8 @@ TEST(LifecycleEndToEnd, UnwritableDiagnosticLogsAreLoggedAndTheStopCompletes) {
       "-[SXReportingSession createSummaryEventForSession]: can't create logging directory at "
       "/proc/version/Reporting: "));
   EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: "));
-  EXPECT_EQ(daemon.waitForRows("fernreporting.db",
-                               "SELECT id FROM messages WHERE category = 65535", 1).size(), 1u);
+  EXPECT_EQ(
+      daemon.waitForRows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535", 1)
+          .size(),
+      1u);
 }

@@ -7,8 +7,9 @@ namespace {
 
 using namespace std::chrono_literals;
 
-const char* kEvents = "SELECT name, payload_json FROM events WHERE name LIKE 'com.vendra.sonex.%' "
-                      "AND name != 'com.vendra.sonex.sxreportingclientuptime' ORDER BY id";
+const char* kEvents =
+    "SELECT name, payload_json FROM events WHERE name LIKE 'com.vendra.sonex.%' "
+    "AND name != 'com.vendra.sonex.sxreportingclientuptime' ORDER BY id";
 const char* kSingles =
     "SELECT category, type, user_info_json, payload_json FROM messages WHERE session_id IS NULL "
     "ORDER BY id";
@@ -19,10 +20,11 @@ TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStore) {
   TestDaemon daemon;
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
-  ASSERT_TRUE(replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
-  EXPECT_FALSE(replied(client->sendMessage({{"peak level", 1}, {"EngineOnTime", 12.5},
-                                            {"sxreporting_timestamp", 1000}},
-                                           3, 1, std::vector<int64_t>{42})));
+  ASSERT_TRUE(
+      replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
+  EXPECT_FALSE(replied(client->sendMessage(
+      {{"peak level", 1}, {"EngineOnTime", 12.5}, {"sxreporting_timestamp", 1000}}, 3, 1,
+      std::vector<int64_t>{42})));
 
   auto events = daemon.waitForRows("tallyvane.db", kEvents, 1);
   ASSERT_EQ(events.size(), 1u);
@@ -31,13 +33,14 @@ TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStore) {
   EXPECT_EQ(payload["HostApplicationDisplayID"], "player");
   EXPECT_EQ(payload["peak level"], 1);  // the analytics event keeps the client's keys
 
-  auto power = daemon.waitForRows("joulebook.db", "SELECT client_id, event, payload_json FROM entries", 1);
+  auto power =
+      daemon.waitForRows("joulebook.db", "SELECT client_id, event, payload_json FROM entries", 1);
   ASSERT_EQ(power.size(), 1u);
   EXPECT_EQ(power[0]["client_id"], 28);
   EXPECT_EQ(power[0]["event"], "Flumen_Haptics");
-  EXPECT_EQ(SXValue::parse(power[0]["payload_json"].get<std::string>()),
-            (SXValue{{"EngineOnDuration", 12.5}, {"ApplicationName", "player"},
-                     {"TimestampEnd", 1000}}));
+  EXPECT_EQ(
+      SXValue::parse(power[0]["payload_json"].get<std::string>()),
+      (SXValue{{"EngineOnDuration", 12.5}, {"ApplicationName", "player"}, {"TimestampEnd", 1000}}));
 
   // Not started: the session sends it on as a standalone message with its own service type.
   auto singles = daemon.waitForRows("fernreporting.db", kSingles, 1);
@@ -85,8 +88,12 @@ TEST(MessagesEndToEnd, EveryValueKindTravelsUnchanged) {
   TestDaemon daemon;
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
-  SXValue payload = {{"int", -5}, {"big", uint64_t{18446744073709551615u}}, {"float", 0.1},
-                     {"bool", true}, {"nil", nullptr}, {"list", {1, "two", {{"three", 3}}}},
+  SXValue payload = {{"int", -5},
+                     {"big", uint64_t{18446744073709551615u}},
+                     {"float", 0.1},
+                     {"bool", true},
+                     {"nil", nullptr},
+                     {"list", {1, "two", {{"three", 3}}}},
                      {"bytes", SXValue::binary({0, 1, 255})}};
   EXPECT_FALSE(replied(client->sendMessage(payload, 3, 1, std::vector<int64_t>{42})));
   auto singles = daemon.waitForRows("fernreporting.db", kSingles, 1);

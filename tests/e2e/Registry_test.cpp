@@ -57,9 +57,9 @@ std::string request(uint32_t id, const std::string& method, const SXValue& param
 TEST(RegistryEndToEnd, SxreportctlWalkThrough) {
   TestDaemon daemon;
   std::string out;
-  ASSERT_EQ(daemon.ctl({"create", "42", "then", "set-type", "2", "42", "then", "get-type", "42",
-                        "then", "valid", "42", "then", "valid", "7", "then", "get-type", "0",
-                        "then", "list"},
+  ASSERT_EQ(daemon.ctl({"create",   "42",   "then",     "set-type", "2",    "42",   "then",
+                        "get-type", "42",   "then",     "valid",    "42",   "then", "valid",
+                        "7",        "then", "get-type", "0",        "then", "list"},
                        &out),
             0)
       << out;
@@ -173,10 +173,10 @@ TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
   std::vector<std::string> attacks = {
       std::string("\xc1\xc1\xc1\xc1", 4),  // not MessagePack
       request(1, sxr::method::kSendMessage,
-              SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),  // too large
+              SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),    // too large
       request(1, sxr::method::kSendMessage, SXValue::array({deep, 3, 1, nullptr})),  // too deep
       request(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3) +
-          std::string(70000, '\0'),  // a message that never ends
+          std::string(70000, '\0'),         // a message that never ends
       std::string("\x93\x02\xa1m\x90", 5),  // a notification: no msgid to answer
   };
   for (const auto& bytes : attacks) {

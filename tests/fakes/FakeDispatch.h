@@ -65,8 +65,7 @@ class FakeDispatch final : public SXDispatch {
              SXTask task) override;
 
   // Every queue created so far, in creation order, and the quality of service asked for.
-  std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>> createdQueues()
-      const;
+  std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>> createdQueues() const;
   std::shared_ptr<FakeWorkQueue> lowPriorityQueue() const { return lowPriority_; }
 
  private:
@@ -81,8 +80,8 @@ class FakeDispatch final : public SXDispatch {
   mutable std::mutex mutex_;
   std::condition_variable timersChanged_;
   std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>>
-      created_;                                 // guarded by mutex_
+      created_;                                     // guarded by mutex_
   std::multimap<Clock::time_point, Timer> timers_;  // guarded by mutex_
-  bool stopping_ = false;                       // guarded by mutex_
+  bool stopping_ = false;                           // guarded by mutex_
   std::thread timerThread_;
 };

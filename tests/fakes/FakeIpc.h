@@ -11,7 +11,9 @@ class FakeIpcConnection final : public SXIpcConnection {
  public:
   explicit FakeIpcConnection(int32_t pid) : pid_(pid) {}
   int32_t processIdentifier() const override { return pid_; }
-  std::string description() const override { return "<fake connection " + std::to_string(pid_) + ">"; }
+  std::string description() const override {
+    return "<fake connection " + std::to_string(pid_) + ">";
+  }
   void setExportedObject(std::shared_ptr<SXIpcExportedObject> object) override {
     exported_ = std::move(object);
   }

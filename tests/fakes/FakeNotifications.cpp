@@ -26,10 +26,8 @@ int FakeNotifications::post(const std::string& name) {
     for (auto it = first; it != last; ++it) due.push_back(it->second);
   }
   for (Registration& registration : due) {
-    registration.queue->async(
-        [handler = std::move(registration.handler), token = registration.token] {
-          handler(token);
-        });
+    registration.queue->async([handler = std::move(registration.handler),
+                               token = registration.token] { handler(token); });
   }
   return 0;
 }

@@ -39,13 +39,11 @@ TestDaemon::TestDaemon(Options options) {
   }
   for (const auto& [path, value] : options.counters) setCounter(path, value);
   socket_ = dir_.file("run/sxr.sock");
-  std::vector<std::string> args = {SXR_DAEMON_PATH,
-                                   "--socket", socket_,
-                                   "--state-dir", dir_.file("lib"),
-                                   "--config-dir", dir_.file("etc"),
-                                   "--runtime-dir", dir_.file("run"),
-                                   "--kestrel-root", dir_.file("kestrel"),
-                                   "--diagnostic-logs-dir", dir_.file("diag")};
+  std::vector<std::string> args = {SXR_DAEMON_PATH,  "--socket",           socket_,
+                                   "--state-dir",    dir_.file("lib"),     "--config-dir",
+                                   dir_.file("etc"), "--runtime-dir",      dir_.file("run"),
+                                   "--kestrel-root", dir_.file("kestrel"), "--diagnostic-logs-dir",
+                                   dir_.file("diag")};
   args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
   std::string logPath = dir_.file("daemon.log");
   pid_ = ::fork();

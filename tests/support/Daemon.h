@@ -52,8 +52,9 @@ class TestDaemon {
   // Rows of a query on one of the stores, e.g. rows("tallyvane.db", "SELECT ...").
   std::vector<SXValue> rows(const std::string& db, const std::string& sql) const;
   // Waits until the query returns at least `count` rows.
-  std::vector<SXValue> waitForRows(const std::string& db, const std::string& sql, size_t count,
-                                   std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
+  std::vector<SXValue> waitForRows(
+      const std::string& db, const std::string& sql, size_t count,
+      std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
 
   // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;

@@ -32,8 +32,8 @@ std::shared_ptr<SXReportingServerInstance> SXReportingServerInstance::initWithPI
     std::weak_ptr<SXReportingServiceDelegateProtocol> delegate) {
   SXLOG(environment->log(), environment->serviceLogScope(), SXLogLevel::kDefault,
         "new client with pid %lu", static_cast<uint64_t>(static_cast<uint32_t>(processIdentifier)));
-  return std::shared_ptr<SXReportingServerInstance>(
-      new SXReportingServerInstance(std::move(environment), processIdentifier, std::move(delegate)));
+  return std::shared_ptr<SXReportingServerInstance>(new SXReportingServerInstance(
+      std::move(environment), processIdentifier, std::move(delegate)));
 }
 
 SXReportingServerInstance::SXReportingServerInstance(
@@ -67,23 +67,23 @@ std::shared_ptr<SXReportingSession> SXReportingServerInstance::findReportingSess
 }
 
 // Request lines are verbose lines of the service scope, written on the connection's thread.
-#define SXR_REQUEST_LINE(...)                                                  \
-  do {                                                                         \
-    if (log().isEnabled(scope(), kSXLogVerboseLevel)) {                        \
-      SXLOG(log(), scope(), SXLogLevel::kDebug, __VA_ARGS__);                  \
-    }                                                                          \
+#define SXR_REQUEST_LINE(...)                                 \
+  do {                                                        \
+    if (log().isEnabled(scope(), kSXLogVerboseLevel)) {       \
+      SXLOG(log(), scope(), SXLogLevel::kDebug, __VA_ARGS__); \
+    }                                                         \
   } while (0)
 
 void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("creating session for reporter %lli", reporterID);
   enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceCreate);
-    auto session = SXReportingSession::initWithID(
-        self.environment_, reporterID, SXValue::array({self.processIdentifier_}));
+    auto session = SXReportingSession::initWithID(self.environment_, reporterID,
+                                                  SXValue::array({self.processIdentifier_}));
     if (session) {
       self.sessions_[reporterID] = std::move(session);
-      SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "session created for reporter %lli",
-            reporterID);
+      SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
+               "session created for reporter %lli", reporterID);
     }
     reply(true);
   });
@@ -92,12 +92,13 @@ void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply
 void SXReportingServerInstance::setServiceType(SXReportingServiceType serviceType,
                                                int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("setting service type %i for reporter %lli", serviceType, reporterID);
-  enqueue([fn = __func__, serviceType, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([fn = __func__, serviceType, reporterID,
+           reply = std::move(reply)](SXReportingServerInstance& self) {
     if (reporterID == 0) return;
     if (auto session = self.ownSession(reporterID)) {
       session->setServiceType(serviceType);
       SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
-            "service type %i set for reporter  %lli", serviceType, reporterID);
+               "service type %i set for reporter  %lli", serviceType, reporterID);
     }
     reply(true);
   });
@@ -115,7 +116,7 @@ void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
     SXReportingServiceType type = session ? session->serviceType() : kSXReportingServiceTypeUnknown;
     reply(type);
     SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
-          "returnning service type %i for reporter  %lli", type, reporterID);
+             "returnning service type %i for reporter  %lli", type, reporterID);
   });
 }
 
@@ -139,7 +140,8 @@ void SXReportingServerInstance::reporterID(int64_t reporterID, Reply<SXValue> va
       reply["reporterID"] = reporterID;
       reply["serviceType"] = session->serviceType();
     }
-    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "validating reporter %lli", reporterID);
+    SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "validating reporter %lli",
+             reporterID);
     valid(std::move(reply));
   });
 }
@@ -162,7 +164,8 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
                                             Reply<std::optional<SXError>> reply) {
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
-  enqueue([fn = __func__, message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
+  enqueue([fn = __func__, message = std::move(message), category, type,
+           reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceSend);
     auto delegate = self.delegate_.lock();
@@ -212,8 +215,8 @@ void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReporti
           "no active reporting sessions found, sending as standalone");
     auto defaults = delegate->getDefaults();
     SXReportingSession::sendSingleMessage(environment_, message, category, type,
-                                          kStandaloneServiceType,
-                                          defaults ? &*defaults : nullptr, nullptr);
+                                          kStandaloneServiceType, defaults ? &*defaults : nullptr,
+                                          nullptr);
     return;
   }
   for (const auto& session : active) {
@@ -243,9 +246,9 @@ void SXReportingServerInstance::startReportingSessionForID(int64_t reporterID, R
 void SXReportingServerInstance::sendDriverDeltaAndStop(
     const std::shared_ptr<SXReportingSession>& session) {
   auto delegate = delegate_.lock();
-  auto statistics =
-      delegate ? delegate->getDriverStatisticsRelativeToSnapShot(session->driverSnapShot())
-               : std::nullopt;
+  auto statistics = delegate
+                        ? delegate->getDriverStatisticsRelativeToSnapShot(session->driverSnapShot())
+                        : std::nullopt;
   if (statistics) {
     session->sendMessage(*statistics, kDriverStatisticsCategory, 0, nullptr);
     SXLOG(log(), scope(), SXLogLevel::kDefault, "fetching driver logs %@", *statistics);
@@ -300,7 +303,7 @@ void SXReportingServerInstance::handleConnectionError() {
     }
     delegate->removeClient(self_ptr);
     SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
-          "removing %i from the server client list", self.processIdentifier_);
+             "removing %i from the server client list", self.processIdentifier_);
   });
 }
 

@@ -39,7 +39,8 @@ void connectionInvalidated(SXReportingEnvironment& environment,
     seconds = std::abs(SXSecondsBetween(*start, now));
     if (*start > now) {
       SXLOG(log, scope, SXLogLevel::kDefault,
-            "clientStartDate is in the past. clientpid=%d clientprocessname=%@", pid, nameOrUnknown);
+            "clientStartDate is in the past. clientpid=%d clientprocessname=%@", pid,
+            nameOrUnknown);
     }
   }
   SXLOG(log, scope, SXLogLevel::kDefault,
@@ -134,15 +135,13 @@ bool SXReportingServiceDelegate::shouldAcceptNewConnection(
   }
   std::weak_ptr<SXReportingServerInstance> weakInstance = instance;
   instance.reset();  // the connection holds it from here on
-  environment_->serverQueue()->async([self = shared_from_this(), weakInstance, pid] {
-    self->registerClient(weakInstance, pid);
-  });
+  environment_->serverQueue()->async(
+      [self = shared_from_this(), weakInstance, pid] { self->registerClient(weakInstance, pid); });
   auto environment = environment_;
   connection->setInterruptionHandler(
       [environment, weakInstance] { connectionInterrupted(*environment, weakInstance); });
-  connection->setInvalidationHandler([environment, weakInstance, pid] {
-    connectionInvalidated(*environment, weakInstance, pid);
-  });
+  connection->setInvalidationHandler(
+      [environment, weakInstance, pid] { connectionInvalidated(*environment, weakInstance, pid); });
   connection->resume();
   return true;
 }
@@ -197,10 +196,11 @@ SXValue SXReportingServiceDelegate::statusSnapshot() const {
     }
     auto name = client->clientProcessName();
     auto start = client->clientStartDate();
-    clients.push_back({{"pid", client->processIdentifier()},
-                       {"processName", name ? SXValue(*name) : SXValue()},
-                       {"uptimeSeconds", start ? SXValue(SXSecondsBetween(*start, now)) : SXValue()},
-                       {"sessions", std::move(sessions)}});
+    clients.push_back(
+        {{"pid", client->processIdentifier()},
+         {"processName", name ? SXValue(*name) : SXValue()},
+         {"uptimeSeconds", start ? SXValue(SXSecondsBetween(*start, now)) : SXValue()},
+         {"sessions", std::move(sessions)}});
   }
   std::lock_guard lock(defaultsMutex_);
   return {{"clients", std::move(clients)},

@@ -8,8 +8,15 @@
 
 namespace {
 
-enum class Kind { kReporterID, kServiceType, kCategory, kMessageType, kDictionary,
-                  kDictionaryOrNil, kReporterIDListOrNil };
+enum class Kind {
+  kReporterID,
+  kServiceType,
+  kCategory,
+  kMessageType,
+  kDictionary,
+  kDictionaryOrNil,
+  kReporterIDListOrNil
+};
 
 struct Signature {
   const char* method;
@@ -57,7 +64,9 @@ std::string check(const SXValue& v, Kind kind) {
   switch (kind) {
     case Kind::kReporterID:
       if (!v.is_number_integer()) return "must be a signed 64-bit integer";
-      return isSigned64(v) ? "" : "out of range: " + SXValueText(v) + " (expected a signed 64-bit integer)";
+      return isSigned64(v)
+                 ? ""
+                 : "out of range: " + SXValueText(v) + " (expected a signed 64-bit integer)";
     case Kind::kServiceType:
       return checkUnsigned(v, 0xFFFF, "an unsigned 16-bit integer");
     case Kind::kCategory:
@@ -73,8 +82,8 @@ std::string check(const SXValue& v, Kind kind) {
       if (!v.is_array()) return "must be an array of reporter IDs or nil";
       for (size_t i = 0; i < v.size(); ++i) {
         if (!isSigned64(v[i])) {
-          return "element " + std::to_string(i) + " is not a signed 64-bit reporter ID: " +
-                 SXValueText(v[i]);
+          return "element " + std::to_string(i) +
+                 " is not a signed 64-bit reporter ID: " + SXValueText(v[i]);
         }
       }
       return "";
@@ -149,11 +158,10 @@ void SXReportingServiceExport::dispatch(std::string_view method, const SXValue& 
   } else if (method == sxr::method::kSendMessage) {
     std::optional<std::vector<int64_t>> ids;
     if (!params[3].is_null()) ids = params[3].get<std::vector<int64_t>>();
-    instance.sendMessage(params[0], params[1].get<SXReportingCategory>(),
-                         params[2].get<SXReportingMessageType>(), std::move(ids),
-                         [reply](std::optional<SXError> error) {
-                           reply(nullptr, errorValue(error));
-                         });
+    instance.sendMessage(
+        params[0], params[1].get<SXReportingCategory>(), params[2].get<SXReportingMessageType>(),
+        std::move(ids),
+        [reply](std::optional<SXError> error) { reply(nullptr, errorValue(error)); });
   } else if (method == sxr::method::kStop) {
     instance.stopReportingSessionForID(params[0].get<int64_t>(), boolReply);
   } else if (method == sxr::method::kDestroy) {

@@ -20,8 +20,7 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
                            std::weak_ptr<SXReportingServiceDelegate> delegate,
                            std::shared_ptr<SXReportingEnvironment> environment);
 
-  void handleRequest(std::string_view method, const SXValue& params,
-                     SXIpcReplyFn reply) override;
+  void handleRequest(std::string_view method, const SXValue& params, SXIpcReplyFn reply) override;
 
   // Checks a request without running it: an empty string when it is well formed, else why not.
   static std::string validate(std::string_view method, const SXValue& params);

@@ -58,8 +58,8 @@ std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(
   environment->registerSessionLogScopeOnce();
   std::shared_ptr<SXReportingSession> session(
       new SXReportingSession(std::move(environment), reporterID, std::move(processIdentifiers)));
-  SXLOG(session->log(), session->scope(), SXLogLevel::kInfo, "created reporting session for ID: %lli",
-        reporterID);
+  SXLOG(session->log(), session->scope(), SXLogLevel::kInfo,
+        "created reporting session for ID: %lli", reporterID);
   session->environment_->tracer().trace(kTraceCreated);
   return session;
 }
@@ -111,10 +111,9 @@ void SXReportingSession::start() {
 
   auto setup = std::make_shared<SetupState>();
   setup->backendsFound = fernReportingSessionStarted();
-  fernReportingQueue_->async(
-      [self = shared_from_this(), userInfo = this->userInfo(), name = serviceName(), setup] {
-        self->runSetupTask(userInfo, name, setup);
-      });
+  fernReportingQueue_->async([self = shared_from_this(), userInfo = this->userInfo(),
+                              name = serviceName(),
+                              setup] { self->runSetupTask(userInfo, name, setup); });
 }
 
 void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
@@ -140,25 +139,24 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
     fernReportingSession_ = fernSession;
   }
   if (fernSession) {
-    fernSession->startConfiguration(
-        [fn = __func__, environment = environment_, setup](
-            std::optional<std::vector<std::string>> backends) {
-          auto& log = environment->log();
-          auto* scope = environment->sessionLogScope();
-          if (!backends || backends->empty()) {
-            SXLOG_IN(fn, log, scope, SXLogLevel::kError,
-                  "No backends found, this session won't get sent to the server");
-            return;
-          }
-          SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
-          std::lock_guard lock(setup->condition.mutex);
-          setup->backendsFound = true;
-          setup->condition.signal();
-        });
+    fernSession->startConfiguration([fn = __func__, environment = environment_,
+                                     setup](std::optional<std::vector<std::string>> backends) {
+      auto& log = environment->log();
+      auto* scope = environment->sessionLogScope();
+      if (!backends || backends->empty()) {
+        SXLOG_IN(fn, log, scope, SXLogLevel::kError,
+                 "No backends found, this session won't get sent to the server");
+        return;
+      }
+      SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
+      std::lock_guard lock(setup->condition.mutex);
+      setup->backendsFound = true;
+      setup->condition.signal();
+    });
   }
-  bool found = SXReportingUtilityWait(setup->condition, setup->backendsFound, kWaitingForBackends,
-                                      kNoBackendFound, log(), scope(),
-                                      environment_->backendWaitSeconds());
+  bool found =
+      SXReportingUtilityWait(setup->condition, setup->backendsFound, kWaitingForBackends,
+                             kNoBackendFound, log(), scope(), environment_->backendWaitSeconds());
   if (!found) {
     {
       std::lock_guard lock(mutex_);
@@ -206,12 +204,13 @@ void SXReportingSession::runTeardownTask() {
     fernSession = std::exchange(fernReportingSession_, nullptr);
   }
   if (!fernSession) return;
-  fernSession->flushMessages([fn = __func__, environment = environment_](std::optional<FernError> error) {
-    if (error) {
-      SXLOG_IN(fn, environment->log(), environment->sessionLogScope(), SXLogLevel::kError,
-            "flush error %@", error->localizedDescription);
-    }
-  });
+  fernSession->flushMessages(
+      [fn = __func__, environment = environment_](std::optional<FernError> error) {
+        if (error) {
+          SXLOG_IN(fn, environment->log(), environment->sessionLogScope(), SXLogLevel::kError,
+                   "flush error %@", error->localizedDescription);
+        }
+      });
 }
 
 std::string SXReportingSession::serviceName() const {

@@ -92,9 +92,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   void setDriverSnapShot(std::optional<SXValue> snapshot);
   void setTransactionCompleteBlock(Reply<bool> block);
   const SXValue& processIdentifiers() const { return processIdentifiers_; }
-  std::shared_ptr<SXReportingAggregate> aggregatedPayloadData() const {
-    return aggregate_.load();
-  }
+  std::shared_ptr<SXReportingAggregate> aggregatedPayloadData() const { return aggregate_.load(); }
   // A copy of the aggregate's entries (empty when there is none).
   std::vector<SXValue> aggregatedPayloadEntries() const;
   std::map<std::string, int64_t> messageTypeCounts() const { return messageTypeCounts_; }
@@ -115,12 +113,10 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->sessionLogScope(); }
 
-  void runSetupTask(SXValue userInfo, std::string serviceName,
-                    std::shared_ptr<SetupState> setup);
+  void runSetupTask(SXValue userInfo, std::string serviceName, std::shared_ptr<SetupState> setup);
   void runSendTask(const std::shared_ptr<const SXValue>& entry,
                    const std::shared_ptr<const SXValue>& callerPayload,
-                   SXReportingCategory category, SXReportingMessageType type,
-                   bool startedSnapshot);
+                   SXReportingCategory category, SXReportingMessageType type, bool startedSnapshot);
   void runTeardownTask();
   void registerOrientationCallbacks();
   void unregisterOrientationCallbacks();
@@ -142,12 +138,12 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   std::map<std::string, int64_t> messageTypeCounts_;  // server queue only
 
   mutable std::mutex mutex_;
-  std::string serviceName_ = "unknown";                          // GUARDED_BY(mutex_)
-  SXValue userInfo_ = SXValue::object();                         // GUARDED_BY(mutex_)
-  std::optional<SXValue> driverSnapShot_;                        // GUARDED_BY(mutex_)
-  Reply<bool> transactionCompleteBlock_;                         // GUARDED_BY(mutex_)
-  std::optional<std::string> orientationCallbackID_;             // GUARDED_BY(mutex_)
-  std::optional<SXDate> startDate_;                              // GUARDED_BY(mutex_)
-  std::shared_ptr<FernReportingSession> fernReportingSession_;   // GUARDED_BY(mutex_)
+  std::string serviceName_ = "unknown";                                // GUARDED_BY(mutex_)
+  SXValue userInfo_ = SXValue::object();                               // GUARDED_BY(mutex_)
+  std::optional<SXValue> driverSnapShot_;                              // GUARDED_BY(mutex_)
+  Reply<bool> transactionCompleteBlock_;                               // GUARDED_BY(mutex_)
+  std::optional<std::string> orientationCallbackID_;                   // GUARDED_BY(mutex_)
+  std::optional<SXDate> startDate_;                                    // GUARDED_BY(mutex_)
+  std::shared_ptr<FernReportingSession> fernReportingSession_;         // GUARDED_BY(mutex_)
   std::shared_ptr<FernSecureHierarchyToken> fernReportingAgentToken_;  // GUARDED_BY(mutex_)
 };

@@ -44,8 +44,9 @@ void SXReportingSession::sendMessage(const SXValue& payload, SXReportingCategory
   auto callerPayload = log().isEnabled(scope(), kSXLogVerboseLevel)
                            ? std::make_shared<const SXValue>(payload)
                            : nullptr;
-  fernReportingQueue_->async([self = shared_from_this(), entry, callerPayload = std::move(callerPayload),
-                              category, type, startedSnapshot] {
+  fernReportingQueue_->async([self = shared_from_this(), entry,
+                              callerPayload = std::move(callerPayload), category, type,
+                              startedSnapshot] {
     self->runSendTask(entry, callerPayload, category, type, startedSnapshot);
   });
   if (reply) reply(std::nullopt);
@@ -57,8 +58,7 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
                                      bool startedSnapshot) {
   const SXValue& rewritten = entry->begin().value();
   if (!startedSnapshot) {
-    SXLOG(log(), scope(), SXLogLevel::kDebug,
-          "session not started, will send as a single message");
+    SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
     // Shares the aggregate entry's payload instead of copying it.
     std::shared_ptr<const SXValue> payload(entry, &rewritten);
     SXValue info = userInfo();
@@ -76,8 +76,8 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
     return;
   }
   std::optional<FernError> error;
-  bool sent = fernSession->sendMessage(static_cast<uint16_t>(category & 0xFFFF), type, rewritten,
-                                       error);
+  bool sent =
+      fernSession->sendMessage(static_cast<uint16_t>(category & 0xFFFF), type, rewritten, error);
   if (!sent) {
     if (error) {
       SXLOG(log(), scope(), SXLogLevel::kError, "error sending message %@",
@@ -93,18 +93,17 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
 void SXReportingSession::sendSingleMessage(
     const std::shared_ptr<SXReportingEnvironment>& environment,
     std::shared_ptr<const SXValue> payload, SXReportingCategory category,
-    SXReportingMessageType type,
-    SXReportingServiceType serviceType, const SXValue* /*userInfo: not sent*/,
-    SXReportingSendReply reply) {
+    SXReportingMessageType type, SXReportingServiceType serviceType,
+    const SXValue* /*userInfo: not sent*/, SXReportingSendReply reply) {
   const SXPlatform& platform = environment->platform();
-  uint32_t delay = serviceType == kAlarmsServiceType
-                       ? platform.random->uniform(kAlarmsMaxDelaySeconds)
-                       : 0;
+  uint32_t delay =
+      serviceType == kAlarmsServiceType ? platform.random->uniform(kAlarmsMaxDelaySeconds) : 0;
   SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kDebug,
         "sending single message after delta %lli for service %i", static_cast<int64_t>(delay),
         serviceType);
 
-  auto task = [fn = __func__, environment, payload, category, type, serviceType, reply = std::move(reply)] {
+  auto task = [fn = __func__, environment, payload, category, type, serviceType,
+               reply = std::move(reply)] {
     auto& log = environment->log();
     auto* scope = environment->sessionLogScope();
     environment->tracer().trace(kTraceMessage);
@@ -112,24 +111,26 @@ void SXReportingSession::sendSingleMessage(
     SXValue sessionInfo = {{fern::kSessionInfoClientType, 19},
                            {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
                            {fern::kSessionInfoSessionID, int32_t{-1}}};
-    SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
-                        {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
+    SXValue userInfo = {
+        {fern::kUserInfoClientName, "com.vendra.sonex"},
+        {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
     // A payload the session already rewrote needs no second copy.
-    auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
-                         ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
-                         : payload;
+    auto rewritten =
+        SXReportingSessionHasSpacedKeys(*payload)
+            ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
+            : payload;
     std::optional<FernError> error;
     bool sent = environment->platform().fernReporting->sendOneMessage(
         sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
     if (!sent && error) {
       SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
-            error->localizedDescription);
+               error->localizedDescription);
     } else if (sent) {
       SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
-            static_cast<int32_t>(category), type);
+               static_cast<int32_t>(category), type);
     }
     if (reply) reply(error);
   };
-  platform.dispatch->after(std::chrono::seconds(delay), platform.dispatch->lowPriorityConcurrentQueue(),
-                           std::move(task));
+  platform.dispatch->after(std::chrono::seconds(delay),
+                           platform.dispatch->lowPriorityConcurrentQueue(), std::move(task));
 }

@@ -28,9 +28,12 @@ constexpr const char* kUsage =
     "\n"
     "options (each also read from its environment variable):\n"
     "  --socket PATH               socket path (SXREPORTING_SOCKET)\n"
-    "                              default <runtime-dir>/com.vendra.audio.kitbench.reporting.service\n"
-    "  --state-dir DIR             analytics, power-log and spool databases (SXREPORTING_STATE_DIR)\n"
-    "  --config-dir DIR            device.json, fernreporting.json, preferences/ (SXREPORTING_CONFIG_DIR)\n"
+    "                              default "
+    "<runtime-dir>/com.vendra.audio.kitbench.reporting.service\n"
+    "  --state-dir DIR             analytics, power-log and spool databases "
+    "(SXREPORTING_STATE_DIR)\n"
+    "  --config-dir DIR            device.json, fernreporting.json, preferences/ "
+    "(SXREPORTING_CONFIG_DIR)\n"
     "  --runtime-dir DIR           socket and notify/ directory (SXREPORTING_RUNTIME_DIR)\n"
     "  --diagnostic-logs-dir DIR   session summary files of internal builds\n"
     "                              (SXREPORTING_DIAGNOSTIC_LOGS_DIR)\n"
@@ -151,8 +154,8 @@ int main(int argc, char** argv) {
 
   auto log = std::make_shared<SXStderrLog>(options.logScopes);
   SXPosixFileSystem fs;
-  for (const auto& dir : {options.paths.stateDir, options.paths.configDir,
-                          options.paths.runtimeDir}) {
+  for (const auto& dir :
+       {options.paths.stateDir, options.paths.configDir, options.paths.runtimeDir}) {
     if (auto error = fs.createDirectory(dir, 0755)) {
       SXLOG(*log, nullptr, SXLogLevel::kError, "cannot create %@: %@", dir, *error);
       return 1;
@@ -171,10 +174,11 @@ int main(int argc, char** argv) {
     return 1;
   }
   listener.setDelegate(delegate);
-  SXLOG(*log, nullptr, SXLogLevel::kDefault,
-        "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
-        environment->platform().process->processIdentifier(), options.paths.socketPath,
-        listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
+  SXLOG(
+      *log, nullptr, SXLogLevel::kDefault,
+      "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
+      environment->platform().process->processIdentifier(), options.paths.socketPath,
+      listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
   listener.resume();
   return 0;
 }
