@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/AsioDispatch.h"
 #include "support/TestEnvironment.h"
 
 namespace {
@@ -327,4 +328,49 @@ TEST(SXReportingSessionOrientation, ReportsRoundedTimesIntoTheSummary) {
 
   session->stop();
   EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
+}
+
+TEST(SXReportingSessionLifecycle, OneSessionsBackendWaitNeverHoldsUpAnother) {
+  TestEnvironment t;
+  auto dispatch = std::make_shared<SXAsioDispatch>();  // real queues: each wait blocks a thread
+  SXPlatform platform = t.platform();
+  platform.dispatch = dispatch;
+  auto environment = std::make_shared<SXReportingEnvironment>(platform);
+  environment->setBackendWaitSeconds(30);
+  t.fern->setConfigurationDelivery(FakeFernReporting::Delivery::kNever);
+  auto waiting = [&](size_t n) {
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (t.log->count("waiting for fernreportingd to find backends") < n) {
+      if (std::chrono::steady_clock::now() > deadline) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return true;
+  };
+
+  auto first = SXReportingSession::initWithID(environment, 1, SXValue::array());
+  first->start();
+  first->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  ASSERT_TRUE(waiting(1));
+  auto second = SXReportingSession::initWithID(environment, 2, SXValue::array());
+  second->start();  // its setup runs while the first still waits
+  second->sendMessage({{"k", 2}}, 3, 1, nullptr);
+  ASSERT_TRUE(waiting(2));
+
+  t.fern->deliverHeld();
+  EXPECT_TRUE(t.fern->waitFor(
+      [](const auto& events) {
+        return std::count_if(events.begin(), events.end(), [](const auto& e) {
+                 return e.kind == FakeFernReporting::Event::Kind::kMessage;
+               }) == 2;
+      },
+      std::chrono::seconds(10)));
+  first->stop();
+  second->stop();
+  EXPECT_TRUE(t.fern->waitFor(
+      [](const auto& events) {
+        return std::count_if(events.begin(), events.end(), [](const auto& e) {
+                 return e.kind == FakeFernReporting::Event::Kind::kFlush;
+               }) == 2;
+      },
+      std::chrono::seconds(10)));
 }
