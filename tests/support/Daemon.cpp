@@ -139,10 +139,16 @@ std::vector<SXValue> TestDaemon::waitForRows(const std::string& db, const std::s
 }
 
 int TestDaemon::ctl(const std::vector<std::string>& args, std::string* output) const {
-  std::string command = std::string(SXR_CTL_PATH) + " --socket '" + socket_ + "' --state-dir '" +
-                        dir_.file("lib") + "' --config-dir '" + dir_.file("etc") +
-                        "' --runtime-dir '" + dir_.file("run") + "'";
-  for (const auto& a : args) command += " '" + a + "'";
+  std::vector<std::string> words = {"--socket",      socket_,          "--state-dir",
+                                    dir_.file("lib"), "--config-dir",  dir_.file("etc"),
+                                    "--runtime-dir", dir_.file("run")};
+  words.insert(words.end(), args.begin(), args.end());
+  std::string command = SXR_CTL_PATH;
+  for (const auto& word : words) {
+    command += " '";
+    command += word;
+    command += "'";
+  }
   command += " 2>&1";
   FILE* pipe = ::popen(command.c_str(), "r");
   if (!pipe) return -1;
