@@ -44,7 +44,6 @@ class FakeIpcConnection final : public SXIpcConnection {
     exported_.reset();
   }
   bool resumed() const { return resumed_; }
-  bool hasExportedObject() const { return exported_ != nullptr; }
 
  private:
   const int32_t pid_;

@@ -57,23 +57,6 @@ size_t ManualDispatch::runAll() {
   }
 }
 
-size_t ManualDispatch::runQueue(const std::string& label) {
-  size_t ran = 0;
-  for (;;) {
-    SXTask task;
-    {
-      std::lock_guard lock(mutex_);
-      auto it = std::find_if(tasks_.begin(), tasks_.end(),
-                             [&](const auto& entry) { return entry.first == label; });
-      if (it == tasks_.end()) return ran;
-      task = std::move(it->second);
-      tasks_.erase(it);
-    }
-    task();
-    ++ran;
-  }
-}
-
 size_t ManualDispatch::pending() const {
   std::lock_guard lock(mutex_);
   return tasks_.size();

@@ -4,7 +4,6 @@
 // Thread-safe, so that tasks submitted from other threads are seen.
 #pragma once
 
-#include <algorithm>
 #include <deque>
 #include <mutex>
 #include <vector>
@@ -22,8 +21,6 @@ class ManualDispatch final : public SXDispatch {
 
   // Runs queued tasks in submission order until none is left; returns how many ran.
   size_t runAll();
-  // Runs only the tasks of queues whose label is `label`.
-  size_t runQueue(const std::string& label);
   size_t pending() const;
   // Delays passed to `after`, in order.
   std::vector<std::chrono::nanoseconds> delays() const;
