@@ -1,7 +1,6 @@
 #include "SXReportingJoulebookUtility.h"
 
 #include "SXReportingSession.h"
-#include "SXReportingUtility.h"
 
 void SXReportingJoulebookUtility::handleEvent(SXReportingEnvironment& environment,
                                               const SXValue* payload, SXReportingCategory,
@@ -10,9 +9,8 @@ void SXReportingJoulebookUtility::handleEvent(SXReportingEnvironment& environmen
   if (!payload || !payload->is_object()) return;
   auto onTime = payload->find("EngineOnTime");
   if (onTime == payload->end()) return;
-  SXValue userInfo = session.userInfo();
   SXValue entry = {{"EngineOnDuration", *onTime},
-                   {"ApplicationName", SXReportingUtilityHostApplicationName(&userInfo)}};
+                   {"ApplicationName", session.hostApplicationName()}};
   if (auto stamp = payload->find("sxreporting_timestamp"); stamp != payload->end()) {
     entry["TimestampEnd"] = *stamp;
   } else {

@@ -15,8 +15,7 @@ void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment
                                              const SXReportingSession& session) {
   // The provider may run later on another thread, so it owns its own copy.
   auto copy = std::make_shared<SXValue>(payload.is_object() ? payload : SXValue::object());
-  SXValue userInfo = session.userInfo();
-  (*copy)["HostApplicationDisplayID"] = SXReportingUtilityHostApplicationName(&userInfo);
+  (*copy)["HostApplicationDisplayID"] = session.hostApplicationName();
   environment.platform().tallyvane->sendEventLazy(eventName(category, type),
                                                   [copy] { return *copy; });
 }

@@ -223,6 +223,11 @@ SXValue SXReportingSession::userInfo() const {
   return userInfo_;
 }
 
+SXValue SXReportingSession::hostApplicationName() const {
+  std::lock_guard lock(mutex_);
+  return SXReportingUtilityHostApplicationName(&userInfo_);
+}
+
 std::optional<SXValue> SXReportingSession::driverSnapShot() const {
   std::lock_guard lock(mutex_);
   return driverSnapShot_;

@@ -88,6 +88,9 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   SXReportingServiceType serviceType() const { return serviceType_.load(); }
   std::string serviceName() const;
   SXValue userInfo() const;
+  // The configuration's host application name ("Unknown" when unset), without copying the
+  // whole configuration: the bridges ask for it on every delivered message.
+  SXValue hostApplicationName() const;
   std::optional<SXValue> driverSnapShot() const;
   void setDriverSnapShot(std::optional<SXValue> snapshot);
   void setTransactionCompleteBlock(Reply<bool> block);

@@ -61,8 +61,8 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
     SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
     // Shares the aggregate entry's payload instead of copying it.
     std::shared_ptr<const SXValue> payload(entry, &rewritten);
-    SXValue info = userInfo();
-    sendSingleMessage(environment_, std::move(payload), category, type, serviceType(), &info,
+    // The session's configuration is not part of a standalone message, so none is copied.
+    sendSingleMessage(environment_, std::move(payload), category, type, serviceType(), nullptr,
                       nullptr);
     return;
   }
