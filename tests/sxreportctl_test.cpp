@@ -164,7 +164,10 @@ TEST_F(SxreportctlTest, StatusPrintsClientsSessionsDefaultsAndCounters) {
                        {"sessions", SXValue::array()}}}},
                     {"reportingEnabled", true},
                     {"defaults", {{"ReportingEnabled", true}}},
-                    {"counters", {{"messages", 7}}}};
+                    {"counters",
+                     {{"messages_received", 7},
+                      {"messages_delivered", {{"fernreporting", 5}, {"tallyvane", 7}}}}},
+                    {"gauges", {{"sessions_live", 1}}}};
   server_.on(kStatus, [status](auto&) { return Answer::reply(status); });
   CtlRun result = run({"status"});
   EXPECT_EQ(result.status, 0);
@@ -178,7 +181,12 @@ TEST_F(SxreportctlTest, StatusPrintsClientsSessionsDefaultsAndCounters) {
             "defaults:\n"
             "  ReportingEnabled = 1\n"
             "counters:\n"
-            "  messages = 7\n");
+            "  messages_delivered:\n"
+            "    fernreporting = 5\n"
+            "    tallyvane = 7\n"
+            "  messages_received = 7\n"
+            "gauges:\n"
+            "  sessions_live = 1\n");
 }
 
 TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {

@@ -1,5 +1,13 @@
 #include "SXReportingEnvironment.h"
 
+SXReportingEnvironment::SXReportingEnvironment(SXPlatform platform, SXReportingLimits limits)
+    : platform_(std::move(platform)), limits_(limits) {
+  if (platform_.joulebook) {
+    platform_.joulebook =
+        std::make_shared<SXReportingCountingJoulebook>(platform_.joulebook, counters_);
+  }
+}
+
 SXLogScope SXReportingLogScope(std::string_view shortName, std::string category) {
   SXLogScope scope;
   scope.enabled = true;

@@ -1,17 +1,21 @@
 // The platform together with the state this service keeps once per process: the log scope
-// handles, the server queue and the internal-build flag. One environment per service; tests
-// make a fresh one per case, so "once per process" means once per environment.
+// handles, the server queue, the internal-build flag, the guardrail limits and the counters.
+// One environment per service; tests make a fresh one per case, so "once per process" means
+// once per environment.
 #pragma once
 
 #include <atomic>
 #include <memory>
 #include <mutex>
 
+#include "SXReportingCounters.h"
+#include "SXReportingLimits.h"
 #include "platform/Platform.h"
 
 class SXReportingEnvironment {
  public:
-  explicit SXReportingEnvironment(SXPlatform platform) : platform_(std::move(platform)) {}
+  // Power-log entries reach the platform's power log through a counting forwarder.
+  explicit SXReportingEnvironment(SXPlatform platform, SXReportingLimits limits = {});
   SXReportingEnvironment(const SXReportingEnvironment&) = delete;
   SXReportingEnvironment& operator=(const SXReportingEnvironment&) = delete;
 
@@ -52,8 +56,14 @@ class SXReportingEnvironment {
   double backendWaitSeconds() const { return backendWaitSeconds_.load(); }
   void setBackendWaitSeconds(double seconds) { backendWaitSeconds_.store(seconds); }
 
+  // Fixed at construction, so any thread may read them.
+  const SXReportingLimits& limits() const { return limits_; }
+  SXReportingCounters& counters() const { return *counters_; }
+
  private:
+  const std::shared_ptr<SXReportingCounters> counters_ = std::make_shared<SXReportingCounters>();
   SXPlatform platform_;
+  const SXReportingLimits limits_;
   // Scope handles are read from any thread; a handle, once stored, lives as long as this.
   std::atomic<std::shared_ptr<const SXLogScope>> serviceScope_;
   std::atomic<std::shared_ptr<const SXLogScope>> sessionScope_;

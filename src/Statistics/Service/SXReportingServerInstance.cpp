@@ -41,11 +41,14 @@ SXReportingServerInstance::SXReportingServerInstance(
     std::weak_ptr<SXReportingServiceDelegateProtocol> delegate)
     : environment_(std::move(environment)),
       processIdentifier_(processIdentifier),
-      delegate_(std::move(delegate)) {}
+      delegate_(std::move(delegate)),
+      standaloneBudget_(std::make_shared<SXReportingPendingBudget>(
+          environment_->limits().maxPendingStandalone, processIdentifier)) {}
 
 SXReportingServerInstance::~SXReportingServerInstance() {
   SXLOG(log(), scope(), SXLogLevel::kDefault, "dealloc %i from the server client list",
         processIdentifier_);
+  environment_->counters().sessionsRemoved(sessions_.size());
 }
 
 void SXReportingServerInstance::enqueue(std::function<void(SXReportingServerInstance&)> work) {
@@ -78,15 +81,46 @@ void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply
   SXR_REQUEST_LINE("creating session for reporter %lli", reporterID);
   enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceCreate);
-    auto session = SXReportingSession::initWithID(self.environment_, reporterID,
-                                                  SXValue::array({self.processIdentifier_}));
+    if (!self.hasRoomForSession(reporterID, fn)) {
+      reply(true);
+      return;
+    }
+    auto session =
+        SXReportingSession::initWithID(self.environment_, reporterID,
+                                       SXValue::array({self.processIdentifier_}),
+                                       self.standaloneBudget_);
     if (session) {
-      self.sessions_[reporterID] = std::move(session);
+      auto [it, added] = self.sessions_.insert_or_assign(reporterID, std::move(session));
+      if (added) self.environment_->counters().sessionsAdded(1);
       SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault,
                "session created for reporter %lli", reporterID);
     }
     reply(true);
   });
+}
+
+bool SXReportingServerInstance::hasRoomForSession(int64_t reporterID, const char* fn) const {
+  if (sessions_.count(reporterID)) return true;
+  const SXReportingLimits& limits = environment_->limits();
+  SXReportingCounters& counters = environment_->counters();
+  if (sessions_.size() >= limits.maxSessionsPerClient) {
+    counters.dropped(SXReportingGuardrail::kSessionsPerClient);
+    SXLOG_IN(fn, log(), scope(), SXLogLevel::kError,
+             "session limit reached: client %i already has %llu sessions "
+             "(--max-sessions-per-client); reporter %lli not created",
+             processIdentifier_, static_cast<unsigned long long>(sessions_.size()), reporterID);
+    return false;
+  }
+  if (counters.sessionsLive() >= limits.maxSessions) {
+    counters.dropped(SXReportingGuardrail::kSessionsTotal);
+    SXLOG_IN(fn, log(), scope(), SXLogLevel::kError,
+             "session limit reached: the service already has %llu sessions (--max-sessions); "
+             "reporter %lli of client %i not created",
+             static_cast<unsigned long long>(counters.sessionsLive()), reporterID,
+             processIdentifier_);
+    return false;
+  }
+  return true;
 }
 
 void SXReportingServerInstance::setServiceType(SXReportingServiceType serviceType,
@@ -164,6 +198,7 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
                                             Reply<std::optional<SXError>> reply) {
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
+  environment_->counters().messageReceived();
   enqueue([fn = __func__, message = std::move(message), category, type,
            reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
@@ -190,6 +225,7 @@ void SXReportingServerInstance::routeAddressed(const SXValue& message, SXReporti
     auto session = findReportingSessionForID(reporterID);
     if (!session) continue;
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
     session->sendMessage(message, category, type, nullptr);
   }
@@ -222,6 +258,7 @@ void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReporti
   for (const auto& session : active) {
     session->sendMessage(message, category, type, nullptr);
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
   }
 }
@@ -280,6 +317,7 @@ void SXReportingServerInstance::destroyReportingSession(int64_t reporterID, Repl
     if (auto session = self.ownSession(reporterID)) {
       if (session->started()) session->stop();
       self.sessions_.erase(reporterID);
+      self.environment_->counters().sessionsRemoved(1);
     }
     SXLOG_IN(fn, self.log(), self.scope(), SXLogLevel::kDefault, "destroying %lli", reporterID);
     reply(true);

@@ -69,6 +69,9 @@ class SXReportingServerInstance final
   // Runs `work` on the server queue, holding this instance until it has run.
   void enqueue(std::function<void(SXReportingServerInstance&)> work);
   std::shared_ptr<SXReportingSession> ownSession(int64_t reporterID) const;
+  // Whether the session limits leave room for a new session under `reporterID` (replacing
+  // one always does); logs and counts a refusal as the function `fn`.
+  bool hasRoomForSession(int64_t reporterID, const char* fn) const;
   void routeAddressed(const SXValue& message, SXReportingCategory category,
                       SXReportingMessageType type, const std::vector<int64_t>& reporterIDs);
   void routeBroadcast(const SXValue& message, SXReportingCategory category,
@@ -78,7 +81,9 @@ class SXReportingServerInstance final
   const std::shared_ptr<SXReportingEnvironment> environment_;
   const int32_t processIdentifier_;
   const std::weak_ptr<SXReportingServiceDelegateProtocol> delegate_;
-  SessionMap sessions_;  // server queue only
+  SessionMap sessions_;  // server queue only; its size is counted in the environment's gauge
+  // Standalone sends of this client's sessions waiting for their delay.
+  const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;
   mutable std::mutex mutex_;
   std::optional<SXDate> clientStartDate_;         // GUARDED_BY(mutex_)
   std::optional<std::string> clientProcessName_;  // GUARDED_BY(mutex_)

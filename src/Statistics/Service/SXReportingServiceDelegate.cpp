@@ -202,9 +202,39 @@ SXValue SXReportingServiceDelegate::statusSnapshot() const {
          {"uptimeSeconds", start ? SXValue(SXSecondsBetween(*start, now)) : SXValue()},
          {"sessions", std::move(sessions)}});
   }
+  SXValue status = {{"clients", std::move(clients)},
+                    {"reportingEnabled", reportingEnabled_.load()},
+                    {"counters", countersValue()},
+                    {"gauges", gaugesValue()}};
   std::lock_guard lock(defaultsMutex_);
-  return {{"clients", std::move(clients)},
-          {"reportingEnabled", reportingEnabled_.load()},
-          {"defaults", defaults_ ? *defaults_ : SXValue()},
-          {"counters", SXValue::object()}};
+  status["defaults"] = defaults_ ? *defaults_ : SXValue();
+  return status;
+}
+
+void SXReportingServiceDelegate::setStatusProviders(SXReportingStatusProviders providers) {
+  std::lock_guard lock(providersMutex_);
+  providers_ = std::move(providers);
+}
+
+SXValue SXReportingServiceDelegate::countersValue() const {
+  SXValue counters = environment_->counters().toValue();
+  std::lock_guard lock(providersMutex_);
+  const auto& p = providers_;
+  counters["guardrail_dropped"]["requests_backpressure"] =
+      p.requestsBackpressure ? p.requestsBackpressure() : 0;
+  SXValue errors = SXValue::object();
+  if (p.tallyvaneWriteErrors) errors["tallyvane"] = p.tallyvaneWriteErrors();
+  if (p.joulebookWriteErrors) errors["joulebook"] = p.joulebookWriteErrors();
+  if (p.fernReportingWriteErrors) errors["fernreporting"] = p.fernReportingWriteErrors();
+  if (!errors.empty()) counters["store_write_errors"] = std::move(errors);
+  return counters;
+}
+
+// Server queue: the client list is read here.
+SXValue SXReportingServiceDelegate::gaugesValue() const {
+  SXValue gauges = {{"sessions_live", environment_->counters().sessionsLive()},
+                    {"clients_live", static_cast<uint64_t>(clients_.size())}};
+  std::lock_guard lock(providersMutex_);
+  if (providers_.spoolBacklog) gauges["spool_backlog"] = providers_.spoolBacklog();
+  return gauges;
 }

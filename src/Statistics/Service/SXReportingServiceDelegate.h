@@ -9,6 +9,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <mutex>
 
@@ -20,6 +21,17 @@
 
 // The defaults dictionary read from the preferences domain "com.vendra.sonex".
 SXValue SXReportingDefaults(SXPreferences& preferences);
+
+// Numbers that other parts of the daemon keep and `status:` shows. Each is read on the server
+// queue whenever a status is asked for, so it must be cheap and thread-safe; an unset provider
+// leaves its key out of the status (requests_backpressure shows 0).
+struct SXReportingStatusProviders {
+  std::function<uint64_t()> requestsBackpressure{};  // requests held back by a slow reader
+  std::function<uint64_t()> tallyvaneWriteErrors{};
+  std::function<uint64_t()> joulebookWriteErrors{};
+  std::function<uint64_t()> fernReportingWriteErrors{};
+  std::function<uint64_t()> spoolBacklog{};  // spooled messages not yet uploaded
+};
 
 class SXReportingServiceDelegate final
     : public SXReportingServiceDelegateProtocol,
@@ -45,6 +57,8 @@ class SXReportingServiceDelegate final
 
   // Read-only picture of the service for `status:`. Server queue only.
   SXValue statusSnapshot() const;
+  // Any thread; usually once, before the listener resumes.
+  void setStatusProviders(SXReportingStatusProviders providers);
 
   void setReportingEnabled(bool enabled) { reportingEnabled_.store(enabled); }
   const std::shared_ptr<SXReportingEnvironment>& environment() const { return environment_; }
@@ -58,6 +72,8 @@ class SXReportingServiceDelegate final
  private:
   explicit SXReportingServiceDelegate(std::shared_ptr<SXReportingEnvironment> environment);
   void listenForDefaultsNotification();
+  SXValue countersValue() const;
+  SXValue gaugesValue() const;
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->serviceLogScope(); }
 
@@ -68,4 +84,6 @@ class SXReportingServiceDelegate final
   std::unique_ptr<SXReportingDriverUtility> driverUtility_;
   mutable std::mutex defaultsMutex_;
   std::optional<SXValue> defaults_;  // GUARDED_BY(defaultsMutex_)
+  mutable std::mutex providersMutex_;
+  SXReportingStatusProviders providers_;  // GUARDED_BY(providersMutex_)
 };

@@ -54,10 +54,11 @@ SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
 
 std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(
     std::shared_ptr<SXReportingEnvironment> environment, int64_t reporterID,
-    SXValue processIdentifiers) {
+    SXValue processIdentifiers, std::shared_ptr<SXReportingPendingBudget> standaloneBudget) {
   environment->registerSessionLogScopeOnce();
   std::shared_ptr<SXReportingSession> session(
-      new SXReportingSession(std::move(environment), reporterID, std::move(processIdentifiers)));
+      new SXReportingSession(std::move(environment), reporterID, std::move(processIdentifiers),
+                             std::move(standaloneBudget)));
   SXLOG(session->log(), session->scope(), SXLogLevel::kInfo,
         "created reporting session for ID: %lli", reporterID);
   session->environment_->tracer().trace(kTraceCreated);
@@ -65,12 +66,14 @@ std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(
 }
 
 SXReportingSession::SXReportingSession(std::shared_ptr<SXReportingEnvironment> environment,
-                                       int64_t reporterID, SXValue processIdentifiers)
+                                       int64_t reporterID, SXValue processIdentifiers,
+                                       std::shared_ptr<SXReportingPendingBudget> standaloneBudget)
     : environment_(std::move(environment)),
       reporterID_(reporterID),
       processIdentifiers_(std::move(processIdentifiers)),
       fernReportingQueue_(environment_->platform().dispatch->createSerialQueue(
           "com.vendra.sonex.session.fernreporting", SXQualityOfService::kUtility)),
+      standaloneBudget_(std::move(standaloneBudget)),
       aggregate_(std::make_shared<SXReportingAggregate>()) {}
 
 SXReportingSession::~SXReportingSession() {

@@ -21,9 +21,11 @@
 // The payloads gathered since start. Every change of `entries` and every walk over it holds
 // `mutex`, the recursive lock keyed on the array itself. Entries never change once appended,
 // so a walk may copy the pointers and read them after unlocking.
+// Holds at most the environment's maxAggregateEntries; what did not fit is only counted.
 struct SXReportingAggregate {
   std::recursive_mutex mutex;
   std::vector<std::shared_ptr<const SXValue>> entries;  // GUARDED_BY(mutex)
+  uint64_t dropped = 0;                                 // GUARDED_BY(mutex)
 };
 
 using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
@@ -38,11 +40,15 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   static constexpr SXReportingServiceType kTestServiceType = 11;
   static constexpr SXReportingCategory kSummaryCategory = 0xFFFFFFFF;
   static constexpr SXReportingMessageType kSummaryType = 0xFFFF;
+  // The summary event's count of entries the aggregate had no room for; present only then.
+  static constexpr const char* kDroppedEntriesKey = "SX_Session_Entries_Dropped";
 
-  // Creation. Never fails on this platform; callers still test for none.
+  // Creation. Never fails on this platform; callers still test for none. `standaloneBudget`
+  // is the owning client's: the session's delayed standalone sends wait within it.
   static std::shared_ptr<SXReportingSession> initWithID(
       std::shared_ptr<SXReportingEnvironment> environment, int64_t reporterID,
-      SXValue processIdentifiers);
+      SXValue processIdentifiers,
+      std::shared_ptr<SXReportingPendingBudget> standaloneBudget = nullptr);
   ~SXReportingSession();
   SXReportingSession(const SXReportingSession&) = delete;
   SXReportingSession& operator=(const SXReportingSession&) = delete;
@@ -66,12 +72,14 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   bool shouldReportOrientation();
 
   // A server-reporting message without a session of its own. `userInfo` is accepted and not
-  // sent: a standalone message carries only the client and service names.
+  // sent: a standalone message carries only the client and service names. A delayed send
+  // waits within `budget` when one is given; when the budget is full it goes out at once.
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
                                 std::shared_ptr<const SXValue> payload,
                                 SXReportingCategory category, SXReportingMessageType type,
                                 SXReportingServiceType serviceType, const SXValue* userInfo,
-                                SXReportingSendReply reply);
+                                SXReportingSendReply reply,
+                                const std::shared_ptr<SXReportingPendingBudget>& budget = nullptr);
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
                                 const SXValue& payload, SXReportingCategory category,
                                 SXReportingMessageType type, SXReportingServiceType serviceType,
@@ -111,7 +119,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   struct SetupState;
 
   SXReportingSession(std::shared_ptr<SXReportingEnvironment> environment, int64_t reporterID,
-                     SXValue processIdentifiers);
+                     SXValue processIdentifiers,
+                     std::shared_ptr<SXReportingPendingBudget> standaloneBudget);
 
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->sessionLogScope(); }
@@ -137,6 +146,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   std::atomic<SXReportingServiceType> serviceType_{kSXReportingServiceTypeUnknown};
   const SXValue processIdentifiers_;
   const std::shared_ptr<SXWorkQueue> fernReportingQueue_;
+  const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;  // may be null
   std::atomic<std::shared_ptr<SXReportingAggregate>> aggregate_;
   std::map<std::string, int64_t> messageTypeCounts_;  // server queue only
 

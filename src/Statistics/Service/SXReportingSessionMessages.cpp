@@ -25,7 +25,19 @@ void SXReportingSession::appendToAggregate(std::shared_ptr<const SXValue> entry)
   std::lock_guard lock(aggregate->mutex);
   // Stop may have dropped this array while we waited for its lock.
   if (aggregate_.load() != aggregate) return;
-  aggregate->entries.push_back(std::move(entry));
+  uint64_t limit = environment_->limits().maxAggregateEntries;
+  if (aggregate->entries.size() < limit) {
+    aggregate->entries.push_back(std::move(entry));
+    return;
+  }
+  environment_->counters().dropped(SXReportingGuardrail::kAggregateEntries);
+  // One line per aggregate: a client that floods a session would otherwise flood the log.
+  if (aggregate->dropped++ == 0) {
+    SXLOG(log(), scope(), SXLogLevel::kError,
+          "aggregate of reporter %lli is full (%llu entries, --max-aggregate-entries); further "
+          "entries are sent but not aggregated",
+          reporterID(), static_cast<unsigned long long>(limit));
+  }
 }
 
 void SXReportingSession::sendMessage(const SXValue& payload, SXReportingCategory category,
@@ -63,7 +75,7 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
     std::shared_ptr<const SXValue> payload(entry, &rewritten);
     // The session's configuration is not part of a standalone message, so none is copied.
     sendSingleMessage(environment_, std::move(payload), category, type, serviceType(), nullptr,
-                      nullptr);
+                      nullptr, standaloneBudget_);
     return;
   }
   if (serviceType() == kTestServiceType) {
@@ -85,51 +97,87 @@ void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry
     }
     return;
   }
+  environment_->counters().delivered(SXReportingSink::kFernReporting);
   SXLOG(log(), scope(), SXLogLevel::kDebug,
         "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
         callerPayload ? *callerPayload : SXValue(), static_cast<int32_t>(category), type);
 }
 
+namespace {
+
+// The standalone send task: one message to the server-reporting service with its own session
+// info and user info.
+void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environment,
+                       const std::shared_ptr<const SXValue>& payload, SXReportingCategory category,
+                       SXReportingMessageType type, SXReportingServiceType serviceType,
+                       const SXReportingSendReply& reply) {
+  constexpr const char* fn = "sendSingleMessage";
+  auto& log = environment->log();
+  auto* scope = environment->sessionLogScope();
+  environment->tracer().trace(kTraceMessage);
+  SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "sending single message");
+  SXValue sessionInfo = {{fern::kSessionInfoClientType, 19},
+                         {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
+                         {fern::kSessionInfoSessionID, int32_t{-1}}};
+  SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
+                      {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
+  // A payload the session already rewrote needs no second copy.
+  auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
+                       ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
+                       : payload;
+  std::optional<FernError> error;
+  bool sent = environment->platform().fernReporting->sendOneMessage(
+      sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
+  if (!sent && error) {
+    SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
+             error->localizedDescription);
+  } else if (sent) {
+    environment->counters().delivered(SXReportingSink::kFernReporting);
+    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
+             static_cast<int32_t>(category), type);
+  }
+  if (reply) reply(error);
+}
+
+// A place in `budget` for a send that waits `delay` seconds, or nothing when it need not wait
+// or has no budget. A full budget cancels the wait: the send goes out at once rather than being
+// dropped, and the overflow is logged and counted.
+std::shared_ptr<SXReportingPendingBudget::Slot> reserveWait(
+    SXReportingEnvironment& environment, const std::shared_ptr<SXReportingPendingBudget>& budget,
+    uint32_t& delay) {
+  if (delay == 0 || !budget) return nullptr;
+  if (auto slot = budget->tryAcquire()) return slot;
+  delay = 0;
+  environment.counters().dropped(SXReportingGuardrail::kStandalonePending);
+  if (budget->firstRefusal()) {
+    SXLOG_IN("sendSingleMessage", environment.log(), environment.sessionLogScope(),
+             SXLogLevel::kError,
+             "client %i has %llu standalone sends waiting for their delay "
+             "(--max-pending-standalone); sending further ones at once",
+             budget->owner(), static_cast<unsigned long long>(budget->capacity()));
+  }
+  return nullptr;
+}
+
+}  // namespace
+
 void SXReportingSession::sendSingleMessage(
     const std::shared_ptr<SXReportingEnvironment>& environment,
     std::shared_ptr<const SXValue> payload, SXReportingCategory category,
     SXReportingMessageType type, SXReportingServiceType serviceType,
-    const SXValue* /*userInfo: not sent*/, SXReportingSendReply reply) {
+    const SXValue* /*userInfo: not sent*/, SXReportingSendReply reply,
+    const std::shared_ptr<SXReportingPendingBudget>& budget) {
   const SXPlatform& platform = environment->platform();
   uint32_t delay =
       serviceType == kAlarmsServiceType ? platform.random->uniform(kAlarmsMaxDelaySeconds) : 0;
+  auto slot = reserveWait(*environment, budget, delay);
   SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kDebug,
         "sending single message after delta %lli for service %i", static_cast<int64_t>(delay),
         serviceType);
-
-  auto task = [fn = __func__, environment, payload, category, type, serviceType,
-               reply = std::move(reply)] {
-    auto& log = environment->log();
-    auto* scope = environment->sessionLogScope();
-    environment->tracer().trace(kTraceMessage);
-    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "sending single message");
-    SXValue sessionInfo = {{fern::kSessionInfoClientType, 19},
-                           {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
-                           {fern::kSessionInfoSessionID, int32_t{-1}}};
-    SXValue userInfo = {
-        {fern::kUserInfoClientName, "com.vendra.sonex"},
-        {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
-    // A payload the session already rewrote needs no second copy.
-    auto rewritten =
-        SXReportingSessionHasSpacedKeys(*payload)
-            ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
-            : payload;
-    std::optional<FernError> error;
-    bool sent = environment->platform().fernReporting->sendOneMessage(
-        sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
-    if (!sent && error) {
-      SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
-               error->localizedDescription);
-    } else if (sent) {
-      SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
-               static_cast<int32_t>(category), type);
-    }
-    if (reply) reply(error);
+  auto task = [environment, payload = std::move(payload), category, type, serviceType,
+               reply = std::move(reply), slot = std::move(slot)] {
+    (void)slot;  // the place in the budget is held until the send has run
+    runStandaloneSend(environment, payload, category, type, serviceType, reply);
   };
   platform.dispatch->after(std::chrono::seconds(delay),
                            platform.dispatch->lowPriorityConcurrentQueue(), std::move(task));

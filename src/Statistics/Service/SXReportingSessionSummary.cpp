@@ -40,9 +40,11 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   if (!aggregate) return std::nullopt;
 
   std::vector<std::shared_ptr<const SXValue>> entries;
+  uint64_t dropped = 0;
   {
     std::lock_guard lock(aggregate->mutex);
     entries = aggregate->entries;
+    dropped = aggregate->dropped;
   }
   if (entries.empty()) return std::nullopt;
 
@@ -60,6 +62,7 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
     }
     event[key] = std::move(joined);
   }
+  if (dropped) event[kDroppedEntriesKey] = std::to_string(dropped);
 
   SXValue info = userInfo();
   {

@@ -44,6 +44,18 @@ constexpr const char* kUsage =
     "                              default 1048576)\n"
     "  --socket-mode MODE          permissions of the socket, octal (SXREPORTING_SOCKET_MODE,\n"
     "                              default 0660)\n"
+    "\n"
+    "limits (a positive number each; what they refuse is logged and counted in `status`):\n"
+    "  --max-sessions-per-client N live sessions of one client; a create beyond it makes\n"
+    "                              nothing (SXREPORTING_MAX_SESSIONS_PER_CLIENT, default 4096)\n"
+    "  --max-sessions N            live sessions of all clients (SXREPORTING_MAX_SESSIONS,\n"
+    "                              default 65536)\n"
+    "  --max-aggregate-entries N   entries a session gathers for its summary; later messages\n"
+    "                              are sent but only counted (SXREPORTING_MAX_AGGREGATE_ENTRIES,\n"
+    "                              default 100000)\n"
+    "  --max-pending-standalone N  standalone sends of one client waiting for their delay;\n"
+    "                              beyond it they go out at once\n"
+    "                              (SXREPORTING_MAX_PENDING_STANDALONE, default 1024)\n"
     "  -h, --help                  this text\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
@@ -53,6 +65,23 @@ struct Options {
   std::string logScopes;
   size_t maxMessageBytes = 1 << 20;
   unsigned socketMode = 0660;
+  SXReportingLimits limits;
+};
+
+struct LimitFlag {
+  const char* flag;
+  const char* environment;
+  uint64_t SXReportingLimits::*member;
+};
+
+constexpr LimitFlag kLimitFlags[] = {
+    {"--max-sessions-per-client", "SXREPORTING_MAX_SESSIONS_PER_CLIENT",
+     &SXReportingLimits::maxSessionsPerClient},
+    {"--max-sessions", "SXREPORTING_MAX_SESSIONS", &SXReportingLimits::maxSessions},
+    {"--max-aggregate-entries", "SXREPORTING_MAX_AGGREGATE_ENTRIES",
+     &SXReportingLimits::maxAggregateEntries},
+    {"--max-pending-standalone", "SXREPORTING_MAX_PENDING_STANDALONE",
+     &SXReportingLimits::maxPendingStandalone},
 };
 
 const char* envOr(const char* name, const char* fallback) {
@@ -67,8 +96,40 @@ bool parseNumber(const char* text, unsigned long long& out, int base) {
   return errno == 0 && end && *end == '\0' && end != text;
 }
 
+bool parsePositive(const char* text, uint64_t& out) {
+  unsigned long long number = 0;
+  if (!parseNumber(text, number, 10) || number == 0) return false;
+  out = number;
+  return true;
+}
+
+// The limits from their environment variables; false (and a message) when one is malformed.
+bool limitsFromEnvironment(SXReportingLimits& limits) {
+  for (const auto& limit : kLimitFlags) {
+    const char* text = envOr(limit.environment, nullptr);
+    if (text && !parsePositive(text, limits.*limit.member)) {
+      std::fprintf(stderr, "sxreportingd: bad %s '%s' (expected a positive number)\n",
+                   limit.environment, text);
+      return false;
+    }
+  }
+  return true;
+}
+
+// Whether `arg` names a limit; `ok` says whether its value was good.
+bool parseLimitFlag(const std::string& arg, const char* value, SXReportingLimits& limits,
+                    bool& ok) {
+  for (const auto& limit : kLimitFlags) {
+    if (arg != limit.flag) continue;
+    ok = parsePositive(value, limits.*limit.member);
+    return true;
+  }
+  return false;
+}
+
 // Returns 0 to go on, or the exit status.
 int parseOptions(int argc, char** argv, Options& options) {
+  if (!limitsFromEnvironment(options.limits)) return 2;
   options.logScopes = envOr("SXREPORTING_LOG_SCOPES", "");
   unsigned long long number = 0;
   if (parseNumber(envOr("SXREPORTING_MAX_MESSAGE_BYTES", "1048576"), number, 10)) {
@@ -89,6 +150,13 @@ int parseOptions(int argc, char** argv, Options& options) {
     }
     const char* value = argv[++i];
     SXPaths& p = options.paths;
+    bool limitOk = false;
+    if (parseLimitFlag(arg, value, options.limits, limitOk)) {
+      if (limitOk) continue;
+      std::fprintf(stderr, "sxreportingd: bad option %s %s (expected a positive number)\n",
+                   arg.c_str(), value);
+      return 2;
+    }
     if (arg == "--socket") {
       p.socketPath = value;
       p.socketPathExplicit = true;
@@ -162,7 +230,8 @@ int main(int argc, char** argv) {
     }
   }
 
-  auto environment = std::make_shared<SXReportingEnvironment>(productionPlatform(options, log));
+  auto environment =
+      std::make_shared<SXReportingEnvironment>(productionPlatform(options, log), options.limits);
   auto delegate = SXReportingServiceDelegate::init(environment);
 
   RpcLimits limits;
@@ -174,6 +243,14 @@ int main(int argc, char** argv) {
     return 1;
   }
   listener.setDelegate(delegate);
+  const SXReportingLimits& l = options.limits;
+  SXLOG(*log, nullptr, SXLogLevel::kDefault,
+        "limits: %llu sessions per client, %llu sessions, %llu aggregate entries, %llu pending "
+        "standalone sends per client",
+        static_cast<unsigned long long>(l.maxSessionsPerClient),
+        static_cast<unsigned long long>(l.maxSessions),
+        static_cast<unsigned long long>(l.maxAggregateEntries),
+        static_cast<unsigned long long>(l.maxPendingStandalone));
   SXLOG(
       *log, nullptr, SXLogLevel::kDefault,
       "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",

@@ -56,11 +56,17 @@ std::string clientText(const SXValue& client) {
   return text;
 }
 
-std::string keyValueLines(const SXValue& object) {
+// One "key = value" line per member; a member that is itself an object (a metric with a
+// label, such as messages_delivered{sink}) gets its own lines, indented under its name.
+std::string keyValueLines(const SXValue& object, const std::string& indent = "  ") {
   if (!object.is_object() || object.empty()) return " (none)\n";
   std::string text = "\n";
   for (const auto& [key, value] : object.items()) {
-    text += "  " + key + " = " + SXValueText(value) + "\n";
+    if (value.is_object() && !value.empty()) {
+      text += indent + key + ":" + keyValueLines(value, indent + "  ");
+    } else {
+      text += indent + key + " = " + SXValueText(value) + "\n";
+    }
   }
   return text;
 }
@@ -80,8 +86,10 @@ std::string SXCtlStatusText(const SXValue& status) {
     for (const auto& client : clients) text += clientText(client);
   }
   text += "defaults:" + keyValueLines(field(status, "defaults"));
-  if (status.is_object() && status.contains("counters")) {
-    text += "counters:" + keyValueLines(field(status, "counters"));
+  for (const char* section : {"counters", "gauges"}) {
+    if (status.is_object() && status.contains(section)) {
+      text += std::string(section) + ":" + keyValueLines(field(status, section));
+    }
   }
   text.pop_back();  // the caller ends the line
   return text;

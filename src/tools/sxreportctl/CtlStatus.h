@@ -5,6 +5,7 @@
 
 #include "sxreporting/types.h"
 
-// Clients with their sessions, the enable switch, the defaults and the counters, without a
-// final newline. Tolerates missing or mistyped entries: they print as "unknown" or "(none)".
+// Clients with their sessions, the enable switch, the defaults, the counters and the gauges
+// (labelled metrics as indented blocks), without a final newline. Tolerates missing or
+// mistyped entries: they print as "unknown" or "(none)".
 std::string SXCtlStatusText(const SXValue& status);
