@@ -79,7 +79,8 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
       {{fern::kUserInfoServiceName, "telephony_session"}, {fern::kUserInfoClientName, "c"}},
       SXValue::array());
   std::optional<FernError> error;
-  SXValue payload = {{"n", 7}, {"x", 1.5}, {"on", true}, {"list", {1, "a"}}, {"d", {{"k", nullptr}}}};
+  SXValue payload = {
+      {"n", 7}, {"x", 1.5}, {"on", true}, {"list", {1, "a"}}, {"d", {{"k", nullptr}}}};
   ASSERT_TRUE(session->sendMessage(9, 2, payload, error));
   Standalone({{"big", uint64_t(1) << 63}}, 0xFFFF);
 
@@ -106,8 +107,7 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
   EXPECT_NEAR(nanos / 1e9, stored[0]["time"].get<double>(), 1e-3);
   EXPECT_EQ(inSession["observedTimeUnixNano"], "1800000000000000000");  // from the clock
   EXPECT_EQ(inSession["severityText"], "INFO");
-  EXPECT_EQ(inSession["body"]["kvlistValue"]["values"],
-            SXValue::parse(R"([
+  EXPECT_EQ(inSession["body"]["kvlistValue"]["values"], SXValue::parse(R"([
       {"key": "d", "value": {"kvlistValue": {"values": [{"key": "k", "value": {}}]}}},
       {"key": "list", "value": {"arrayValue": {"values": [{"intValue": "1"},
                                                           {"stringValue": "a"}]}}},
@@ -187,8 +187,9 @@ TEST_F(OtlpHttpExporterTest, CursorMovesOnlyAfterA2xxAndFailuresBackOff) {
   for (const SXValue& body : http_->bodies()) EXPECT_EQ(Ids(body)[0], 1);  // the same batch
   EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
   EXPECT_EQ(DurableCursor(), 2);
-  EXPECT_TRUE(log_->contains("exporting to http://collector.test:4318/v1/logs again after 4 "
-                             "failed attempts"));
+  EXPECT_TRUE(
+      log_->contains("exporting to http://collector.test:4318/v1/logs again after 4 "
+                     "failed attempts"));
 }
 
 TEST_F(OtlpHttpExporterTest, BackOffIsCappedAndHalfOfItIsRandom) {
@@ -200,8 +201,8 @@ TEST_F(OtlpHttpExporterTest, BackOffIsCappedAndHalfOfItIsRandom) {
   for (int attempt = 0; attempt < 6; ++attempt) {
     delays.push_back(exporter->delayAfter(exporter->exportOnce()));
   }
-  EXPECT_EQ(delays, (std::vector<std::chrono::milliseconds>{300ms, 600ms, 1000ms, 1000ms, 1000ms,
-                                                            1000ms}));
+  EXPECT_EQ(delays,
+            (std::vector<std::chrono::milliseconds>{300ms, 600ms, 1000ms, 1000ms, 1000ms, 1000ms}));
 }
 
 TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
@@ -223,8 +224,9 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
   EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4, 5}));
   EXPECT_EQ(DurableCursor(), 5);
-  EXPECT_TRUE(log_->contains("dropping messages 3 to 5: the collector rejected them with 400 "
-                             "bad field"));
+  EXPECT_TRUE(
+      log_->contains("dropping messages 3 to 5: the collector rejected them with 400 "
+                     "bad field"));
 
   // A single message still too large is dropped too.
   Standalone({{"i", 6}});
@@ -243,9 +245,9 @@ TEST_F(OtlpHttpExporterTest, PartialSuccessIsLoggedAndTheCursorMoves) {
 }
 
 TEST_F(OtlpHttpExporterTest, ASpoolThatCannotBeOpenedIsAFailedAttempt) {
-  auto exporter = std::make_unique<SXOtlpHttpExporter>(
-      dir_.file("missing/dir/spool.db"), options_, http_, clock_,
-      std::make_shared<FixedRandom>(0), log_);
+  auto exporter =
+      std::make_unique<SXOtlpHttpExporter>(dir_.file("missing/dir/spool.db"), options_, http_,
+                                           clock_, std::make_shared<FixedRandom>(0), log_);
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kFailed);
   EXPECT_EQ(exporter->backlog(), 0u);
   EXPECT_TRUE(http_->requests().empty());
@@ -274,10 +276,13 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
   EXPECT_EQ(defaults->batchSize, 256u);
   EXPECT_EQ(defaults->maxBackoff, 60s);
 
-  auto options = SXOtlpExportOptions::fromJson(
-      {{"endpoint", "https://c:4318/v1/logs"}, {"batchSize", 10}, {"intervalMs", 50},
-       {"maxBackoffMs", 2000}, {"initialBackoffMs", 20}, {"headers", {{"X-Key", "v"}}}},
-      error);
+  auto options = SXOtlpExportOptions::fromJson({{"endpoint", "https://c:4318/v1/logs"},
+                                                {"batchSize", 10},
+                                                {"intervalMs", 50},
+                                                {"maxBackoffMs", 2000},
+                                                {"initialBackoffMs", 20},
+                                                {"headers", {{"X-Key", "v"}}}},
+                                               error);
   ASSERT_TRUE(options) << error;
   EXPECT_EQ(options->endpoint, "https://c:4318/v1/logs");
   EXPECT_EQ(options->batchSize, 10u);

@@ -81,8 +81,8 @@ void LogPartialSuccess(SXLogFacility& log, const std::string& responseBody, int6
   if (!partial.is_object() || !partial.contains("rejectedLogRecords")) return;
   std::string rejected = SXValueText(partial["rejectedLogRecords"]);
   if (rejected == "0") return;
-  SXLOG(log, nullptr, SXLogLevel::kError,
-        "the collector rejected %@ of messages %lli to %lli: %@", rejected, first, last,
+  SXLOG(log, nullptr, SXLogLevel::kError, "the collector rejected %@ of messages %lli to %lli: %@",
+        rejected, first, last,
         partial.contains("errorMessage") ? SXValueText(partial["errorMessage"]) : "");
 }
 
@@ -90,9 +90,9 @@ void LogPartialSuccess(SXLogFacility& log, const std::string& responseBody, int6
 
 std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& section,
                                                                  std::string& error) {
-  static const char* const kKnown[] = {"endpoint",         "headers",      "batchSize",
-                                       "maxBatchBytes",    "intervalMs",   "initialBackoffMs",
-                                       "maxBackoffMs",     "timeoutMs"};
+  static const char* const kKnown[] = {"endpoint",      "headers",    "batchSize",
+                                       "maxBatchBytes", "intervalMs", "initialBackoffMs",
+                                       "maxBackoffMs",  "timeoutMs"};
   if (!section.is_object()) {
     error = "must be an object";
     return std::nullopt;
@@ -196,8 +196,7 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& ro
   Outcome outcome = status < 300 ? Outcome::kExported : Outcome::kDropped;
   if (auto failedWrite = spool_.advance(last)) {
     // The cursor moved in memory, so nothing goes twice while this process runs.
-    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot store the export cursor: %@",
-          *failedWrite);
+    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot store the export cursor: %@", *failedWrite);
   }
   succeeded();
   return {outcome, rows.size()};

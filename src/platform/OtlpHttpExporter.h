@@ -121,8 +121,8 @@ class SXOtlpHttpExporter {
   SXOtlpSpoolReader spool_;  // has its own lock: backlog() reads it from other threads
 
   // Used by the exporting thread only (or the one caller of exportOnce).
-  size_t batchLimit_;         // batchSize, halved after a 413, restored after a 2xx
-  unsigned failures_ = 0;     // failed attempts in the current streak
+  size_t batchLimit_;      // batchSize, halved after a 413, restored after a 2xx
+  unsigned failures_ = 0;  // failed attempts in the current streak
 
   std::mutex mutex_;
   std::condition_variable wake_;  // with mutex_: stop() wakes the thread from its wait

@@ -77,7 +77,8 @@ SXValue LogRecord(const SXOtlpSpooledRow& row, const std::string& observedNano) 
 }
 
 SXValue ResourceAttributes(const SXOtlpResource& resource) {
-  SXValue attributes = SXValue::array({KeyValue("service.name", StringValue(resource.serviceName))});
+  SXValue attributes =
+      SXValue::array({KeyValue("service.name", StringValue(resource.serviceName))});
   if (!resource.serviceVersion.empty()) {
     attributes.push_back(KeyValue("service.version", StringValue(resource.serviceVersion)));
   }
@@ -124,8 +125,8 @@ SXValue SXOtlpAnyValue(const SXValue& value) {
   }
 }
 
-SXValue SXOtlpLogsRequest(const std::vector<SXOtlpSpooledRow>& rows,
-                          const SXOtlpResource& resource, SXDate observed) {
+SXValue SXOtlpLogsRequest(const std::vector<SXOtlpSpooledRow>& rows, const SXOtlpResource& resource,
+                          SXDate observed) {
   std::string observedNano = std::to_string(
       std::chrono::duration_cast<std::chrono::nanoseconds>(observed.time_since_epoch()).count());
   SXValue records = SXValue::array();

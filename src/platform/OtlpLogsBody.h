@@ -36,5 +36,5 @@ using SXOtlpSpooledRow = SXValue;
 SXValue SXOtlpAnyValue(const SXValue& value);
 
 // The ExportLogsServiceRequest for `rows`, exported at `observed`.
-SXValue SXOtlpLogsRequest(const std::vector<SXOtlpSpooledRow>& rows,
-                          const SXOtlpResource& resource, SXDate observed);
+SXValue SXOtlpLogsRequest(const std::vector<SXOtlpSpooledRow>& rows, const SXOtlpResource& resource,
+                          SXDate observed);

@@ -52,11 +52,10 @@ std::optional<std::string> SXOtlpSpoolReader::ensureOpen() {
   if (!connection) return error;
   db_ = std::make_unique<Db>();
   db_->connection = std::move(connection);
-  std::pair<const char*, SXSqliteStatement*> statements[] = {
-      {kSelectBatch, &db_->selectBatch},
-      {kSelectCursor, &db_->selectCursor},
-      {kStoreCursor, &db_->storeCursor},
-      {kCountBeyond, &db_->countBeyond}};
+  std::pair<const char*, SXSqliteStatement*> statements[] = {{kSelectBatch, &db_->selectBatch},
+                                                             {kSelectCursor, &db_->selectCursor},
+                                                             {kStoreCursor, &db_->storeCursor},
+                                                             {kCountBeyond, &db_->countBeyond}};
   for (auto& [sql, statement] : statements) {
     // A spool not yet made by its writer has no messages table: a failure to retry later.
     if (auto failed = db_->connection->prepare(sql, *statement)) return fail(*failed);

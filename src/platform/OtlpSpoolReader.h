@@ -56,9 +56,9 @@ class SXOtlpSpoolReader {
   const std::string path_;
   const std::chrono::milliseconds busyTimeout_;
   mutable std::mutex mutex_;
-  std::unique_ptr<Db> db_;           // guarded by mutex_; null while closed
-  int64_t cursor_ = 0;               // guarded by mutex_
-  bool cursorLoaded_ = false;        // guarded by mutex_: read from the database once
-  bool cursorDirty_ = false;         // guarded by mutex_: moved, not yet stored
+  std::unique_ptr<Db> db_;            // guarded by mutex_; null while closed
+  int64_t cursor_ = 0;                // guarded by mutex_
+  bool cursorLoaded_ = false;         // guarded by mutex_: read from the database once
+  bool cursorDirty_ = false;          // guarded by mutex_: moved, not yet stored
   mutable uint64_t lastBacklog_ = 0;  // guarded by mutex_
 };

@@ -29,7 +29,7 @@ class FakeHttpPost final : public SXHttpPost {
 
  private:
   mutable std::mutex mutex_;
-  std::deque<SXHttpResult> script_;       // guarded by mutex_
+  std::deque<SXHttpResult> script_;      // guarded by mutex_
   std::vector<SXHttpRequest> requests_;  // guarded by mutex_
   bool cancelled_ = false;               // guarded by mutex_
 };

@@ -188,8 +188,7 @@ const SXValue* AttributeValue(const SXValue& record, const std::string& key) {
 
 }  // namespace
 
-std::optional<int64_t> OtlpReceiver::intAttribute(const SXValue& record,
-                                                  const std::string& key) {
+std::optional<int64_t> OtlpReceiver::intAttribute(const SXValue& record, const std::string& key) {
   const SXValue* value = AttributeValue(record, key);
   if (!value || !value->contains("intValue")) return std::nullopt;
   const SXValue& number = (*value)["intValue"];
