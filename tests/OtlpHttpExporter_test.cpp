@@ -258,6 +258,8 @@ TEST_F(OtlpHttpExporterTest, ThreadExportsUntilStoppedAndStopCancelsThePost) {
   auto exporter = Make();
   exporter->start();
   for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
+  // The table exists once the thread has posted; the cursor follows the last 2xx.
+  ASSERT_TRUE(waitUntil([&] { return !http_->requests().empty() && LastIds().back() == 5; }));
   EXPECT_TRUE(waitUntil([&] { return DurableCursor() == 5; }));
   exporter->stop();
   EXPECT_TRUE(http_->cancelled());
