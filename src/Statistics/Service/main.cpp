@@ -1,5 +1,6 @@
 // sxreportingd: the reporting service of the audio stack.
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -12,6 +13,7 @@
 #include "platform/FileKestrel.h"
 #include "platform/InotifyNotifications.h"
 #include "platform/JsonPreferences.h"
+#include "platform/OtlpHttpExporter.h"
 #include "platform/SqliteFernReporting.h"
 #include "platform/SqliteJoulebook.h"
 #include "platform/SqliteTallyvane.h"
@@ -214,6 +216,22 @@ SXPlatform productionPlatform(const Options& options, std::shared_ptr<SXLogFacil
   return platform;
 }
 
+// The "otlp-http" backend, when fernreporting.json lists it; it reads the spool's database.
+std::unique_ptr<SXOtlpHttpExporter> otlpExporter(const Options& options, const SXPlatform& platform,
+                                                 const std::shared_ptr<SXLogFacility>& log) {
+  const SXPaths& p = options.paths;
+  std::string configPath = p.configDir + "/fernreporting.json";
+  // The spool adapter has already logged whatever is wrong with the backends list.
+  auto backends = SXSqliteFernReporting::loadBackends(configPath, nullptr);
+  auto exportOptions = SXOtlpExportOptions::load(configPath, backends, *log);
+  if (!exportOptions) return nullptr;
+  char host[256] = "";
+  if (::gethostname(host, sizeof host - 1) == 0) exportOptions->resource.hostName = host;
+  return std::make_unique<SXOtlpHttpExporter>(p.stateDir + "/fernreporting.db", *exportOptions,
+                                              std::make_shared<SXCurlHttpPost>(), platform.clock,
+                                              platform.random, log);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -233,6 +251,7 @@ int main(int argc, char** argv) {
   auto environment =
       std::make_shared<SXReportingEnvironment>(productionPlatform(options, log), options.limits);
   auto delegate = SXReportingServiceDelegate::init(environment);
+  auto exporter = otlpExporter(options, environment->platform(), log);
 
   RpcLimits limits;
   limits.maxMessageBytes = options.maxMessageBytes;
@@ -256,6 +275,8 @@ int main(int argc, char** argv) {
       "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
       environment->platform().process->processIdentifier(), options.paths.socketPath,
       listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
+  if (exporter) exporter->start();
   listener.resume();
+  if (exporter) exporter->stop();
   return 0;
 }

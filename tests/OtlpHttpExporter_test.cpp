@@ -1,0 +1,324 @@
+#include "platform/OtlpHttpExporter.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+
+#include "fakes/FakeClock.h"
+#include "fakes/FakeHttpPost.h"
+#include "fakes/FakeLog.h"
+#include "platform/SqliteFernReporting.h"
+#include "support/Daemon.h"
+#include "support/SqliteTestSupport.h"
+#include "support/TestEnvironment.h"
+
+using namespace std::chrono_literals;
+using Outcome = SXOtlpHttpExporter::Outcome;
+
+namespace {
+
+class OtlpHttpExporterTest : public ::testing::Test {
+ protected:
+  OtlpHttpExporterTest() {
+    options_.endpoint = "http://collector.test:4318/v1/logs";
+    options_.headers = {{"Authorization", "Bearer token"}};
+    options_.batchSize = 2;
+    options_.interval = 10ms;
+    options_.initialBackoff = 100ms;
+    options_.maxBackoff = 1000ms;
+    options_.resource.hostName = "box";
+  }
+
+  std::unique_ptr<SXOtlpHttpExporter> Make(uint32_t random = 0) {
+    return std::make_unique<SXOtlpHttpExporter>(db_, options_, http_, clock_,
+                                                std::make_shared<FixedRandom>(random), log_);
+  }
+  // A standalone message, stored as the daemon stores it.
+  void Standalone(const SXValue& payload, uint16_t category = 3) {
+    std::optional<FernError> error;
+    ASSERT_TRUE(spool_.sendOneMessage({{fern::kSessionInfoSessionID, -1}},
+                                      {{fern::kUserInfoServiceName, "standalone"}}, category, 1,
+                                      payload, error));
+  }
+  int64_t DurableCursor() {
+    auto rows = SXTestQuery(db_, "SELECT last_message_id FROM otlp_export");
+    return rows.empty() ? 0 : rows[0]["last_message_id"].get<int64_t>();
+  }
+  // The sxr.message.id of every record of a request body.
+  static std::vector<int64_t> Ids(const SXValue& body) {
+    std::vector<int64_t> ids;
+    for (const SXValue& record : body["resourceLogs"][0]["scopeLogs"][0]["logRecords"]) {
+      ids.push_back(std::stoll(record["attributes"][0]["value"]["intValue"].get<std::string>()));
+    }
+    return ids;
+  }
+  std::vector<int64_t> LastIds() { return Ids(http_->bodies().back()); }
+
+  SXTestTempDir dir_;
+  std::string db_ = dir_.file("fernreporting.db");
+  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+  SXSqliteFernReporting spool_{db_, dir_.file("none.json"), log_};
+  std::shared_ptr<FakeHttpPost> http_ = std::make_shared<FakeHttpPost>();
+  std::shared_ptr<FakeClock> clock_ = std::make_shared<FakeClock>();
+  SXOtlpExportOptions options_;
+};
+
+// The value of attribute `key` of `record`, or null.
+SXValue Attribute(const SXValue& record, const std::string& key) {
+  for (const SXValue& attribute : record["attributes"]) {
+    if (attribute["key"] == key) return attribute["value"];
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
+  auto session = spool_.openSession(
+      {{fern::kSessionInfoSessionID, 42}, {fern::kSessionInfoHierarchyToken, "t-1"}},
+      {{fern::kUserInfoServiceName, "telephony_session"}, {fern::kUserInfoClientName, "c"}},
+      SXValue::array());
+  std::optional<FernError> error;
+  SXValue payload = {
+      {"n", 7}, {"x", 1.5}, {"on", true}, {"list", {1, "a"}}, {"d", {{"k", nullptr}}}};
+  ASSERT_TRUE(session->sendMessage(9, 2, payload, error));
+  Standalone({{"big", uint64_t(1) << 63}}, 0xFFFF);
+
+  auto exporter = Make();
+  EXPECT_EQ(exporter->backlog(), 0u);  // unknown before the first pass opens the spool
+  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  auto request = http_->requests().at(0);
+  EXPECT_EQ(request.url, "http://collector.test:4318/v1/logs");
+  EXPECT_EQ(request.headers["Content-Type"], "application/json");
+  EXPECT_EQ(request.headers["Authorization"], "Bearer token");
+
+  SXValue body = SXValue::parse(request.body);
+  const SXValue& resource = body["resourceLogs"][0]["resource"];
+  EXPECT_EQ(resource["attributes"],
+            (SXValue{{{"key", "service.name"}, {"value", {{"stringValue", "sxreportingd"}}}},
+                     {{"key", "host.name"}, {"value", {{"stringValue", "box"}}}}}));
+  const SXValue& scope = body["resourceLogs"][0]["scopeLogs"][0];
+  EXPECT_EQ(scope["scope"]["name"], "sxreporting");
+  ASSERT_EQ(scope["logRecords"].size(), 2u);
+
+  const SXValue& inSession = scope["logRecords"][0];
+  auto stored = SXTestQuery(db_, "SELECT time FROM messages ORDER BY id");
+  double nanos = std::stod(inSession["timeUnixNano"].get<std::string>());
+  EXPECT_NEAR(nanos / 1e9, stored[0]["time"].get<double>(), 1e-3);
+  EXPECT_EQ(inSession["observedTimeUnixNano"], "1800000000000000000");  // from the clock
+  EXPECT_EQ(inSession["severityText"], "INFO");
+  EXPECT_EQ(inSession["body"]["kvlistValue"]["values"], SXValue::parse(R"([
+      {"key": "d", "value": {"kvlistValue": {"values": [{"key": "k", "value": {}}]}}},
+      {"key": "list", "value": {"arrayValue": {"values": [{"intValue": "1"},
+                                                          {"stringValue": "a"}]}}},
+      {"key": "n", "value": {"intValue": "7"}},
+      {"key": "on", "value": {"boolValue": true}},
+      {"key": "x", "value": {"doubleValue": 1.5}}])"));
+  EXPECT_EQ(Attribute(inSession, "sxr.message.kind"), (SXValue{{"stringValue", "session"}}));
+  EXPECT_EQ(Attribute(inSession, "sxr.category"), (SXValue{{"intValue", "9"}}));
+  EXPECT_EQ(Attribute(inSession, "sxr.type"), (SXValue{{"intValue", "2"}}));
+  EXPECT_EQ(Attribute(inSession, "sxr.reporter_id"), (SXValue{{"intValue", "42"}}));
+  EXPECT_EQ(Attribute(inSession, "sxr.service_name"),
+            (SXValue{{"stringValue", "telephony_session"}}));
+  EXPECT_EQ(Attribute(inSession, "sxr.session.token"), (SXValue{{"stringValue", "t-1"}}));
+
+  const SXValue& single = scope["logRecords"][1];
+  EXPECT_EQ(Attribute(single, "sxr.message.kind"), (SXValue{{"stringValue", "standalone"}}));
+  EXPECT_EQ(Attribute(single, "sxr.reporter_id"), (SXValue{{"intValue", "-1"}}));
+  EXPECT_EQ(Attribute(single, "sxr.service_name"), (SXValue{{"stringValue", "standalone"}}));
+  EXPECT_EQ(Attribute(single, "sxr.category"), (SXValue{{"intValue", "65535"}}));
+  EXPECT_TRUE(Attribute(single, "sxr.session.token").is_null());
+  // Beyond int64 a number keeps its digits as a string.
+  EXPECT_EQ(single["body"]["kvlistValue"]["values"][0]["value"],
+            (SXValue{{"stringValue", "9223372036854775808"}}));
+}
+
+TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
+  for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
+  auto exporter = Make();
+  std::vector<std::vector<int64_t>> batches;
+  std::vector<std::chrono::milliseconds> delays;
+  for (int pass = 0; pass < 3; ++pass) {
+    auto done = exporter->exportOnce();
+    EXPECT_EQ(done.outcome, Outcome::kExported);
+    batches.push_back(LastIds());
+    delays.push_back(exporter->delayAfter(done));
+  }
+  EXPECT_EQ(batches, (std::vector<std::vector<int64_t>>{{1, 2}, {3, 4}, {5}}));
+  // Full batches go on at once; a short one means the backlog is drained.
+  EXPECT_EQ(delays, (std::vector<std::chrono::milliseconds>{0ms, 0ms, 10ms}));
+  EXPECT_EQ(DurableCursor(), 5);
+  EXPECT_EQ(exporter->backlog(), 0u);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kIdle);
+
+  // A restarted exporter starts after the cursor.
+  exporter.reset();
+  Standalone({{"i", 6}});
+  auto restarted = Make();
+  EXPECT_EQ(restarted->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(LastIds(), std::vector<int64_t>{6});
+  EXPECT_EQ(http_->requests().size(), 4u);
+}
+
+TEST_F(OtlpHttpExporterTest, CursorMovesOnlyAfterA2xxAndFailuresBackOff) {
+  Standalone({{"i", 1}});
+  http_->fail("Connection refused");
+  http_->answer(503);
+  http_->answer(429);
+  http_->answer(404);
+  auto exporter = Make();
+  std::vector<std::chrono::milliseconds> delays;
+  for (int attempt = 0; attempt < 4; ++attempt) {
+    auto pass = exporter->exportOnce();
+    EXPECT_EQ(pass.outcome, Outcome::kFailed);
+    delays.push_back(exporter->delayAfter(pass));
+    EXPECT_EQ(DurableCursor(), 0);
+    EXPECT_EQ(exporter->backlog(), 1u);
+  }
+  // FixedRandom(0): the fixed half of 100, 200, 400, 800 ms.
+  EXPECT_EQ(delays, (std::vector<std::chrono::milliseconds>{50ms, 100ms, 200ms, 400ms}));
+  // One error line for the whole streak, naming the first cause.
+  ASSERT_EQ(log_->lines().size(), 1u);
+  EXPECT_EQ(log_->lines()[0].level, SXLogLevel::kError);
+  EXPECT_NE(log_->lines()[0].message.find("Connection refused"), std::string::npos);
+
+  Standalone({{"i", 2}});
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  for (const SXValue& body : http_->bodies()) EXPECT_EQ(Ids(body)[0], 1);  // the same batch
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
+  EXPECT_EQ(DurableCursor(), 2);
+  EXPECT_TRUE(
+      log_->contains("exporting to http://collector.test:4318/v1/logs again after 4 "
+                     "failed attempts"));
+}
+
+TEST_F(OtlpHttpExporterTest, BackOffIsCappedAndHalfOfItIsRandom) {
+  options_.initialBackoff = 300ms;
+  Standalone({{"i", 1}});
+  http_->answerTimes(6, 500);
+  auto exporter = Make(UINT32_MAX);  // the largest jitter
+  std::vector<std::chrono::milliseconds> delays;
+  for (int attempt = 0; attempt < 6; ++attempt) {
+    delays.push_back(exporter->delayAfter(exporter->exportOnce()));
+  }
+  EXPECT_EQ(delays,
+            (std::vector<std::chrono::milliseconds>{300ms, 600ms, 1000ms, 1000ms, 1000ms, 1000ms}));
+}
+
+TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
+  for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
+  options_.batchSize = 4;
+  http_->answer(413);
+  http_->answer(200);
+  http_->answer(400, "bad field");
+  auto exporter = Make();
+
+  auto pass = exporter->exportOnce();
+  EXPECT_EQ(pass.outcome, Outcome::kShrunk);
+  EXPECT_EQ(exporter->delayAfter(pass), 0ms);
+  EXPECT_EQ(DurableCursor(), 0);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
+
+  // The limit is back to 4 after the success; a 400 drops the batch for good.
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4, 5}));
+  EXPECT_EQ(DurableCursor(), 5);
+  EXPECT_TRUE(
+      log_->contains("dropping messages 3 to 5: the collector rejected them with 400 "
+                     "bad field"));
+
+  // A single message still too large is dropped too.
+  Standalone({{"i", 6}});
+  http_->answer(413);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
+  EXPECT_EQ(DurableCursor(), 6);
+}
+
+TEST_F(OtlpHttpExporterTest, PartialSuccessIsLoggedAndTheCursorMoves) {
+  Standalone({{"i", 1}});
+  http_->answer(200, R"({"partialSuccess": {"rejectedLogRecords": "1", "errorMessage": "x"}})");
+  auto exporter = Make();
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_TRUE(log_->contains("the collector rejected 1 of messages 1 to 1: x"));
+  EXPECT_EQ(DurableCursor(), 1);
+}
+
+TEST_F(OtlpHttpExporterTest, ASpoolThatCannotBeOpenedIsAFailedAttempt) {
+  auto exporter =
+      std::make_unique<SXOtlpHttpExporter>(dir_.file("missing/dir/spool.db"), options_, http_,
+                                           clock_, std::make_shared<FixedRandom>(0), log_);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kFailed);
+  EXPECT_EQ(exporter->backlog(), 0u);
+  EXPECT_TRUE(http_->requests().empty());
+  EXPECT_TRUE(log_->contains("cannot read the spool"));
+}
+
+TEST_F(OtlpHttpExporterTest, ThreadExportsUntilStoppedAndStopCancelsThePost) {
+  auto exporter = Make();
+  exporter->start();
+  for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
+  // The table exists once the thread has posted; the cursor follows the last 2xx.
+  ASSERT_TRUE(waitUntil([&] { return !http_->requests().empty() && LastIds().back() == 5; }));
+  EXPECT_TRUE(waitUntil([&] { return DurableCursor() == 5; }));
+  exporter->stop();
+  EXPECT_TRUE(http_->cancelled());
+  size_t posts = http_->requests().size();
+  EXPECT_GE(posts, 3u);
+  Standalone({{"i", 6}});
+  std::this_thread::sleep_for(50ms);  // a running exporter would have posted by now
+  EXPECT_EQ(http_->requests().size(), posts);
+}
+
+TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
+  std::string error;
+  auto defaults = SXOtlpExportOptions::fromJson(SXValue::object(), error);
+  ASSERT_TRUE(defaults);
+  EXPECT_EQ(defaults->endpoint, "http://127.0.0.1:4318/v1/logs");
+  EXPECT_EQ(defaults->batchSize, 256u);
+  EXPECT_EQ(defaults->maxBackoff, 60s);
+
+  auto options = SXOtlpExportOptions::fromJson({{"endpoint", "https://c:4318/v1/logs"},
+                                                {"batchSize", 10},
+                                                {"intervalMs", 50},
+                                                {"maxBackoffMs", 2000},
+                                                {"initialBackoffMs", 20},
+                                                {"headers", {{"X-Key", "v"}}}},
+                                               error);
+  ASSERT_TRUE(options) << error;
+  EXPECT_EQ(options->endpoint, "https://c:4318/v1/logs");
+  EXPECT_EQ(options->batchSize, 10u);
+  EXPECT_EQ(options->interval, 50ms);
+  EXPECT_EQ(options->initialBackoff, 20ms);
+  EXPECT_EQ(options->headers.at("X-Key"), "v");
+
+  for (const char* bad :
+       {R"([])", R"({"endpoint": "ftp://x"})", R"({"batchSize": 0})", R"({"batchSize": "5"})",
+        R"({"intervalMs": -1})", R"({"headers": {"A": 1}})", R"({"headers": {"A": "x\ny"}})",
+        R"({"batchsize": 5})", R"({"initialBackoffMs": 500, "maxBackoffMs": 100})"}) {
+    SCOPED_TRACE(bad);
+    error.clear();
+    EXPECT_FALSE(SXOtlpExportOptions::fromJson(SXValue::parse(bad), error));
+    EXPECT_FALSE(error.empty());
+  }
+}
+
+TEST(OtlpExportOptions, LoadsOnlyWhenTheBackendIsListed) {
+  SXTestTempDir dir;
+  std::string path = dir.file("fernreporting.json");
+  FakeLog log;
+  std::ofstream(path) << R"({"backends": ["otlp-http"], "otlp-http": {"batchSize": 3}})";
+  EXPECT_FALSE(SXOtlpExportOptions::load(path, {"spool"}, log));
+  auto options = SXOtlpExportOptions::load(path, {"otlp-http"}, log);
+  ASSERT_TRUE(options);
+  EXPECT_EQ(options->batchSize, 3u);
+  EXPECT_TRUE(log.lines().empty());
+
+  std::ofstream(path) << R"({"backends": ["otlp-http"], "otlp-http": {"batchSize": 0}})";
+  EXPECT_FALSE(SXOtlpExportOptions::load(path, {"otlp-http"}, log));
+  ASSERT_EQ(log.lines().size(), 1u);
+  EXPECT_NE(log.lines()[0].message.find("\"batchSize\" must be a whole number from 1"),
+            std::string::npos);
+  EXPECT_NE(log.lines()[0].message.find("not exporting (messages stay in the spool)"),
+            std::string::npos);
+}

@@ -1,0 +1,144 @@
+// The "otlp-http" backend of the real daemon: spooled messages reach a collector on loopback
+// as OTLP log records, survive a failing collector and a restart, and go exactly once.
+#include <gtest/gtest.h>
+#include <signal.h>
+
+#include <map>
+
+#include "support/Daemon.h"
+#include "support/OtlpReceiver.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+TestDaemon::Options Exporting(const OtlpReceiver& receiver) {
+  TestDaemon::Options options;
+  options.fernConfig = {{"backends", {"spool", "otlp-http"}},
+                        {"otlp-http",
+                         {{"endpoint", receiver.endpoint()},
+                          {"intervalMs", 50},
+                          {"initialBackoffMs", 20},
+                          {"maxBackoffMs", 100},
+                          {"headers", {{"X-Test", "yes"}}}}}};
+  return options;
+}
+
+// The accepted records by sxr.message.id, with how often each came.
+std::map<int64_t, int> Deliveries(const OtlpReceiver& receiver) {
+  std::map<int64_t, int> deliveries;
+  for (const SXValue& record : receiver.acceptedRecords()) {
+    ++deliveries[OtlpReceiver::intAttribute(record, "sxr.message.id").value_or(-1)];
+  }
+  return deliveries;
+}
+
+std::vector<int64_t> SpooledIds(const TestDaemon& daemon) {
+  std::vector<int64_t> ids;
+  for (const SXValue& row : daemon.rows("fernreporting.db", "SELECT id FROM messages")) {
+    ids.push_back(row["id"].get<int64_t>());
+  }
+  return ids;
+}
+
+// Sends `count` messages to session 7, created and never started: they go standalone.
+void SendStandalone(SXReportingClient& client, int first, int count) {
+  for (int i = first; i < first + count; ++i) {
+    EXPECT_FALSE(replied(client.sendMessage({{"n", i}}, 3, 1, std::vector<int64_t>{7})));
+  }
+}
+
+bool AllDeliveredOnce(const OtlpReceiver& receiver, const std::vector<int64_t>& ids) {
+  auto deliveries = Deliveries(receiver);
+  for (int64_t id : ids) {
+    if (deliveries[id] != 1) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
+  OtlpReceiver receiver;
+  TestDaemon daemon(Exporting(receiver));
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  ASSERT_TRUE(replied(client->setServiceType(2, 42)));
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+  auto start = client->startReportingSessionForID(42, kSXWaitForever);
+  EXPECT_FALSE(replied(client->sendMessage({{"peak level", 3}}, 3, 1, std::vector<int64_t>{42})));
+  SendStandalone(*client, 1, 1);
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
+  EXPECT_TRUE(start.get().value);
+
+  // The session's message, its summary and the standalone message.
+  daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 3);
+  ASSERT_TRUE(receiver.waitFor([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
+      << daemon.log();
+  auto request = receiver.requests().front();
+  EXPECT_EQ(request.method, "POST");
+  EXPECT_EQ(request.target, "/v1/logs");
+  EXPECT_EQ(request.headers["content-type"], "application/json");
+  EXPECT_EQ(request.headers["x-test"], "yes");
+
+  std::map<std::string, SXValue> byKind;  // "<kind> <category>" -> record
+  for (const SXValue& record : receiver.acceptedRecords()) {
+    byKind[OtlpReceiver::stringAttribute(record, "sxr.message.kind") + " " +
+           std::to_string(*OtlpReceiver::intAttribute(record, "sxr.category"))] = record;
+  }
+  ASSERT_TRUE(byKind.count("session 3")) << receiver.acceptedRecords().size();
+  const SXValue& inSession = byKind["session 3"];
+  EXPECT_EQ(OtlpReceiver::intAttribute(inSession, "sxr.reporter_id"), 42);
+  EXPECT_EQ(OtlpReceiver::stringAttribute(inSession, "sxr.service_name"), "telephony_session");
+  EXPECT_EQ(inSession["body"]["kvlistValue"]["values"][0],
+            (SXValue{{"key", "peak_level"}, {"value", {{"intValue", "3"}}}}));
+  EXPECT_TRUE(byKind.count("session 65535"));  // the summary
+  ASSERT_TRUE(byKind.count("standalone 3"));
+  EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.service_name"), "unknown");
+
+  auto cursor = daemon.rows("fernreporting.db", "SELECT last_message_id FROM otlp_export");
+  EXPECT_TRUE(waitUntil([&] {
+    cursor = daemon.rows("fernreporting.db", "SELECT last_message_id FROM otlp_export");
+    return !cursor.empty() && cursor[0]["last_message_id"] == SpooledIds(daemon).back();
+  }));
+  EXPECT_TRUE(daemon.waitForLog("exporting spooled messages to " + receiver.endpoint()));
+}
+
+TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) {
+  OtlpReceiver receiver;
+  TestDaemon first(Exporting(receiver));
+  auto client = first.client();
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+  SendStandalone(*client, 1, 3);
+  ASSERT_TRUE(receiver.waitFor([&] { return Deliveries(receiver).size() == 3; }));
+
+  // The collector fails: the new messages wait in the spool, retried with one error line.
+  receiver.failNext(1000000, 503);
+  size_t before = receiver.requests().size();
+  SendStandalone(*client, 4, 3);
+  ASSERT_TRUE(receiver.waitFor([&] { return receiver.requests().size() >= before + 3; }));
+  EXPECT_EQ(first.countInLog("cannot export to " + receiver.endpoint()), 1u) << first.log();
+  EXPECT_EQ(Deliveries(receiver).size(), 3u);
+
+  // A crash, then a restart on the same spool while the collector drops connections.
+  ::kill(first.pid(), SIGKILL);
+  first.waitForExit();
+  receiver.dropNext(2);
+  TestDaemon::Options options = Exporting(receiver);
+  options.extraArgs = {"--state-dir", first.dir("lib")};
+  TestDaemon second(options);
+  auto again = second.client();
+  ASSERT_TRUE(replied(again->createReportingSession(7)));
+  SendStandalone(*again, 7, 2);
+
+  auto ids = SpooledIds(first);
+  ASSERT_TRUE(receiver.waitFor([&] {
+    ids = SpooledIds(first);
+    return ids.size() == 8 && AllDeliveredOnce(receiver, ids);
+  })) << second.log();
+  EXPECT_EQ(Deliveries(receiver).size(), 8u);  // nothing else, nothing twice
+  size_t dropped = 0;
+  for (const auto& request : receiver.requests()) dropped += request.status == 0;
+  EXPECT_EQ(dropped, 2u);
+  EXPECT_TRUE(second.waitForLog("again after"));
+}

@@ -1,0 +1,48 @@
+#include "fakes/FakeHttpPost.h"
+
+SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
+  std::lock_guard lock(mutex_);
+  requests_.push_back(request);
+  if (cancelled_) return {std::nullopt, "", "cancelled"};
+  if (script_.empty()) return {200, "", ""};
+  SXHttpResult result = script_.front();
+  script_.pop_front();
+  return result;
+}
+
+void FakeHttpPost::cancel() {
+  std::lock_guard lock(mutex_);
+  cancelled_ = true;
+}
+
+void FakeHttpPost::answer(int status, std::string body) {
+  std::lock_guard lock(mutex_);
+  script_.push_back({status, std::move(body), ""});
+}
+
+void FakeHttpPost::answerTimes(size_t count, int status) {
+  for (size_t i = 0; i < count; ++i) answer(status);
+}
+
+void FakeHttpPost::fail(std::string error) {
+  std::lock_guard lock(mutex_);
+  script_.push_back({std::nullopt, "", std::move(error)});
+}
+
+std::vector<SXHttpRequest> FakeHttpPost::requests() const {
+  std::lock_guard lock(mutex_);
+  return requests_;
+}
+
+std::vector<SXValue> FakeHttpPost::bodies() const {
+  std::vector<SXValue> bodies;
+  for (const SXHttpRequest& request : requests()) {
+    bodies.push_back(SXValue::parse(request.body, nullptr, false));
+  }
+  return bodies;
+}
+
+bool FakeHttpPost::cancelled() const {
+  std::lock_guard lock(mutex_);
+  return cancelled_;
+}

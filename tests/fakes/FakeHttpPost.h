@@ -1,0 +1,35 @@
+// An HTTP client that answers from a script: each post() takes the next scripted answer (a
+// status, or a failure without response); when the script is empty it answers 200. Records
+// every request. May be called from any thread.
+#pragma once
+
+#include <deque>
+#include <mutex>
+#include <vector>
+
+#include "platform/HttpPost.h"
+#include "sxreporting/types.h"
+
+class FakeHttpPost final : public SXHttpPost {
+ public:
+  SXHttpResult post(const SXHttpRequest& request) override;
+  void cancel() override;
+
+  // Answers the next post with `status` (and `body`).
+  void answer(int status, std::string body = "");
+  // Answers the next `count` posts with `status`.
+  void answerTimes(size_t count, int status);
+  // The next post gets no response, with `error`.
+  void fail(std::string error = "connection refused");
+
+  std::vector<SXHttpRequest> requests() const;
+  // The bodies of the requests so far, parsed.
+  std::vector<SXValue> bodies() const;
+  bool cancelled() const;
+
+ private:
+  mutable std::mutex mutex_;
+  std::deque<SXHttpResult> script_;      // guarded by mutex_
+  std::vector<SXHttpRequest> requests_;  // guarded by mutex_
+  bool cancelled_ = false;               // guarded by mutex_
+};

@@ -1,0 +1,204 @@
+#include "support/OtlpReceiver.h"
+
+#include <algorithm>
+#include <cctype>
+#include <sstream>
+
+namespace {
+
+std::string Lower(std::string text) {
+  std::transform(text.begin(), text.end(), text.begin(),
+                 [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  return text;
+}
+
+std::string Trim(const std::string& text) {
+  size_t first = text.find_first_not_of(" \t\r");
+  size_t last = text.find_last_not_of(" \t\r");
+  return first == std::string::npos ? "" : text.substr(first, last - first + 1);
+}
+
+// The request line and headers of `head` (everything up to the blank line).
+OtlpReceiver::Request ParseHead(const std::string& head) {
+  OtlpReceiver::Request request;
+  std::istringstream lines(head);
+  std::string line;
+  std::getline(lines, line);
+  std::istringstream(line) >> request.method >> request.target;
+  while (std::getline(lines, line)) {
+    size_t colon = line.find(':');
+    if (colon == std::string::npos) continue;
+    request.headers[Lower(Trim(line.substr(0, colon)))] = Trim(line.substr(colon + 1));
+  }
+  return request;
+}
+
+std::string Response(int status) {
+  std::string body = status / 100 == 2 ? "{}" : "";
+  return "HTTP/1.1 " + std::to_string(status) + " Test\r\nContent-Type: application/json\r\n" +
+         "Content-Length: " + std::to_string(body.size()) + "\r\n\r\n" + body;
+}
+
+}  // namespace
+
+// One accepted connection: reads requests one after another until the peer closes it.
+class OtlpReceiver::Connection : public std::enable_shared_from_this<Connection> {
+ public:
+  Connection(OtlpReceiver& receiver, asio::ip::tcp::socket socket)
+      : receiver_(receiver), socket_(std::move(socket)) {}
+
+  void readHead() {
+    asio::async_read_until(socket_, buffer_, "\r\n\r\n",
+                           [self = shared_from_this()](std::error_code error, size_t bytes) {
+                             if (!error) self->onHead(bytes);
+                           });
+  }
+
+ private:
+  void onHead(size_t bytes) {
+    std::string head(asio::buffers_begin(buffer_.data()),
+                     asio::buffers_begin(buffer_.data()) + static_cast<std::ptrdiff_t>(bytes));
+    buffer_.consume(bytes);
+    request_ = ParseHead(head);
+    size_t length = std::strtoull(request_.headers["content-length"].c_str(), nullptr, 10);
+    size_t missing = length > buffer_.size() ? length - buffer_.size() : 0;
+    asio::async_read(socket_, buffer_, asio::transfer_exactly(missing),
+                     [self = shared_from_this(), length](std::error_code error, size_t) {
+                       if (!error) self->onBody(length);
+                     });
+  }
+
+  void onBody(size_t length) {
+    auto begin = asio::buffers_begin(buffer_.data());
+    request_.body.assign(begin, begin + static_cast<std::ptrdiff_t>(length));
+    buffer_.consume(length);
+    int status = receiver_.judge(request_);
+    if (status == 0) {
+      std::error_code ignored;
+      socket_.close(ignored);
+      return;
+    }
+    response_ = Response(status);
+    asio::async_write(socket_, asio::buffer(response_),
+                      [self = shared_from_this()](std::error_code error, size_t) {
+                        if (!error) self->readHead();
+                      });
+  }
+
+  OtlpReceiver& receiver_;
+  asio::ip::tcp::socket socket_;
+  asio::streambuf buffer_;
+  Request request_;
+  std::string response_;
+};
+
+OtlpReceiver::OtlpReceiver() {
+  asio::ip::tcp::endpoint endpoint(asio::ip::make_address("127.0.0.1"), 0);
+  acceptor_.open(endpoint.protocol());
+  acceptor_.set_option(asio::ip::tcp::acceptor::reuse_address(true));
+  acceptor_.bind(endpoint);
+  acceptor_.listen();
+  port_ = acceptor_.local_endpoint().port();
+  accept();
+  thread_ = std::thread([this] { io_.run(); });
+}
+
+OtlpReceiver::~OtlpReceiver() {
+  io_.stop();
+  thread_.join();
+}
+
+std::string OtlpReceiver::endpoint() const {
+  return "http://127.0.0.1:" + std::to_string(port_) + "/v1/logs";
+}
+
+void OtlpReceiver::accept() {
+  acceptor_.async_accept([this](std::error_code error, asio::ip::tcp::socket socket) {
+    if (error) return;
+    std::make_shared<Connection>(*this, std::move(socket))->readHead();
+    accept();
+  });
+}
+
+int OtlpReceiver::judge(Request request) {
+  std::lock_guard lock(mutex_);
+  request.status = 200;
+  if (faultsLeft_ > 0) {
+    --faultsLeft_;
+    request.status = faultStatus_;
+  }
+  requests_.push_back(std::move(request));
+  return requests_.back().status;
+}
+
+void OtlpReceiver::failNext(size_t count, int status) {
+  std::lock_guard lock(mutex_);
+  faultsLeft_ = count;
+  faultStatus_ = status;
+}
+
+void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
+
+void OtlpReceiver::succeed() { failNext(0, 0); }
+
+std::vector<OtlpReceiver::Request> OtlpReceiver::requests() const {
+  std::lock_guard lock(mutex_);
+  return requests_;
+}
+
+std::vector<SXValue> OtlpReceiver::acceptedRecords() const {
+  std::vector<SXValue> records;
+  for (const Request& request : requests()) {
+    if (request.status / 100 != 2) continue;
+    SXValue body = SXValue::parse(request.body, nullptr, false);
+    if (!body.is_object()) continue;
+    for (const SXValue& resource : body.value("resourceLogs", SXValue::array())) {
+      for (const SXValue& scope : resource.value("scopeLogs", SXValue::array())) {
+        for (const SXValue& record : scope.value("logRecords", SXValue::array())) {
+          records.push_back(record);
+        }
+      }
+    }
+  }
+  return records;
+}
+
+bool OtlpReceiver::waitFor(const std::function<bool()>& ready,
+                           std::chrono::milliseconds timeout) const {
+  auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!ready()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return true;
+}
+
+namespace {
+
+const SXValue* AttributeValue(const SXValue& record, const std::string& key) {
+  auto attributes = record.find("attributes");
+  if (attributes == record.end() || !attributes->is_array()) return nullptr;
+  for (const SXValue& attribute : *attributes) {
+    if (attribute.value("key", "") == key && attribute.contains("value")) {
+      return &attribute["value"];
+    }
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+std::optional<int64_t> OtlpReceiver::intAttribute(const SXValue& record, const std::string& key) {
+  const SXValue* value = AttributeValue(record, key);
+  if (!value || !value->contains("intValue")) return std::nullopt;
+  const SXValue& number = (*value)["intValue"];
+  if (number.is_string()) return std::strtoll(number.get<std::string>().c_str(), nullptr, 10);
+  if (number.is_number_integer()) return number.get<int64_t>();
+  return std::nullopt;
+}
+
+std::string OtlpReceiver::stringAttribute(const SXValue& record, const std::string& key) {
+  const SXValue* value = AttributeValue(record, key);
+  if (!value || !value->contains("stringValue")) return "";
+  return (*value)["stringValue"].get<std::string>();
+}

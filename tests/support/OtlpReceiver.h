@@ -1,0 +1,75 @@
+// A small OTLP/HTTP logs collector for tests: an HTTP/1.1 server (bodies by Content-Length,
+// keep-alive) on 127.0.0.1 at an ephemeral port, run by a thread of its own. It records every
+// request and answers 200 with "{}", unless told to answer the next requests with another
+// status or to drop their connections without an answer.
+//
+// All methods may be called from any thread.
+#pragma once
+
+#include <asio.hpp>
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "sxreporting/types.h"
+
+class OtlpReceiver {
+ public:
+  struct Request {
+    std::string method;
+    std::string target;
+    std::map<std::string, std::string> headers;  // names in lower case
+    std::string body;
+    int status = 0;  // the status it was answered with; 0 when its connection was dropped
+  };
+
+  OtlpReceiver();
+  ~OtlpReceiver();
+  OtlpReceiver(const OtlpReceiver&) = delete;
+  OtlpReceiver& operator=(const OtlpReceiver&) = delete;
+
+  uint16_t port() const { return port_; }
+  // "http://127.0.0.1:<port>/v1/logs"
+  std::string endpoint() const;
+
+  // The next `count` requests are answered with `status` instead of 200.
+  void failNext(size_t count, int status);
+  // The next `count` requests are read and then their connection is closed, unanswered.
+  void dropNext(size_t count);
+  // Every request from now on is answered 200 again.
+  void succeed();
+
+  std::vector<Request> requests() const;
+  // The log records of the requests answered 2xx, in the order they came.
+  std::vector<SXValue> acceptedRecords() const;
+  // Waits until `ready` holds (it is called under no lock); false after `timeout`.
+  bool waitFor(const std::function<bool()>& ready,
+               std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
+
+  // The int attribute `key` of a log record (e.g. "sxr.message.id"); none when absent.
+  static std::optional<int64_t> intAttribute(const SXValue& record, const std::string& key);
+  static std::string stringAttribute(const SXValue& record, const std::string& key);
+
+ private:
+  class Connection;
+  friend class Connection;
+
+  void accept();
+  // The status to answer `request` with (0: drop), recorded with it.
+  int judge(Request request);
+
+  asio::io_context io_;
+  asio::ip::tcp::acceptor acceptor_{io_};
+  uint16_t port_ = 0;
+  mutable std::mutex mutex_;
+  std::vector<Request> requests_;  // guarded by mutex_
+  size_t faultsLeft_ = 0;          // guarded by mutex_
+  int faultStatus_ = 0;            // guarded by mutex_; 0: drop
+  std::thread thread_;
+};
