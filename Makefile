@@ -2,7 +2,7 @@
 BUILD      ?= build
 ASAN_BUILD ?= build-asan
 JOBS       ?= $(shell nproc)
-DEB_PACKAGES = cmake g++ make pkg-config libasio-dev libmsgpack-cxx-dev nlohmann-json3-dev \
+DEB_PACKAGES = cmake g++ make pkg-config python3-msgpack libasio-dev libmsgpack-cxx-dev nlohmann-json3-dev \
                libsqlite3-dev sqlite3 systemtap-sdt-dev libgtest-dev libgmock-dev googletest
 
 .PHONY: deps build run test test-asan clean format
