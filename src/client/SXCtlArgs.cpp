@@ -78,6 +78,11 @@ bool parseIDList(const std::string& text, std::vector<int64_t>& ids, std::string
 
 bool buildNothing(const RawArgs&, SXCtlRequest&, std::string&) { return true; }
 
+bool buildStatus(const RawArgs& raw, SXCtlRequest& r, std::string&) {
+  r.metrics = raw.flags.contains("--metrics");
+  return true;
+}
+
 bool buildReporterID(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   return parseInt64(raw.positional.back(), "a reporter ID", r.reporterID, error);
 }
@@ -447,8 +452,12 @@ const std::vector<CommandSpec>& commandSpecs() {
        "The service exits with status 2 and never replies, so kill always ends with\n"
        "\"the service sent no reply\" and exit status 1.",
        0, 0, {}, {}, buildNothing},
-      {"status", "status", "show clients, sessions, the enable switch and the defaults",
-       "Read-only: changes nothing in the service.", 0, 0, {}, {}, buildNothing},
+      {"status", "status [--metrics]",
+       "show clients, sessions, the enable switch and the defaults",
+       "Read-only: changes nothing in the service. --metrics prints the service's counters and\n"
+       "gauges in the Prometheus text format (version 0.0.4) instead, for a metrics\n"
+       "collector; --json does not apply to it.",
+       0, 0, {}, {"--metrics"}, buildStatus},
       {"events", "events [--name NAME] [--limit N]", "print the stored analytics events",
        "Reads <state-dir>/tallyvane.db: id, time, name and payload of each event, oldest\n"
        "first. --name keeps one event name; --limit keeps the newest N.",

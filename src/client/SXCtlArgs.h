@@ -35,6 +35,7 @@ struct SXCtlRequest {
   std::optional<std::string> key;                   // defaults
   SXValue value;                                    // defaults write
   std::string notificationName;                     // notify
+  bool metrics = false;                             // status: Prometheus text, not prose
 };
 
 // Parses the arguments that follow the program name. On failure returns false and says what

@@ -3,6 +3,7 @@
 #include <cstdio>
 #include <iostream>
 
+#include "CtlMetrics.h"
 #include "CtlStatus.h"
 #include "client/SXServiceTypeNames.h"
 
@@ -130,5 +131,6 @@ int report(const SXCtlRequest& request, const Outcome& outcome) {
 }  // namespace
 
 int SXCtlRunRemote(const SXCtlRequest& request, SXReportingClient& client) {
+  if (request.metrics) return SXCtlRunMetrics(request, client);
   return report(request, perform(client, request));
 }

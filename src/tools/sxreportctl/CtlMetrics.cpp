@@ -1,0 +1,25 @@
+#include "CtlMetrics.h"
+
+#include <iostream>
+
+#include "client/SXCtlMetrics.h"
+
+int SXCtlRunMetrics(const SXCtlRequest& request, SXReportingClient& client) {
+  SXCallResult<SXValue> result = client.status(SXCtlTimeout(request)).get();
+  switch (result.status) {
+    case SXCallStatus::kReplied:
+      std::cout << SXCtlMetricsText(result.value) << std::flush;
+      return 0;
+    case SXCallStatus::kTimedOut:
+      std::cerr << "status: the service sent " << result.error << "\n";  // "no reply within 5 s"
+      return 1;
+    case SXCallStatus::kRemoteError:
+      std::cerr << "status: the service rejected the request: " << result.error << "\n";
+      return 2;
+    case SXCallStatus::kConnectionLost:
+    case SXCallStatus::kBadReply:
+      break;
+  }
+  std::cerr << "status: " << result.error << "\n";
+  return 2;
+}

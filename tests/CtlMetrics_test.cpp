@@ -1,0 +1,163 @@
+// `sxreportctl status --metrics`: the status reply as Prometheus text, and its flag.
+#include <gtest/gtest.h>
+
+#include <limits>
+#include <regex>
+#include <set>
+#include <sstream>
+
+#include "client/SXCtlArgs.h"
+#include "client/SXCtlMetrics.h"
+
+namespace {
+
+// Whether every line is a HELP, a TYPE or a sample of the text format 0.0.4, each family's
+// samples follow its TYPE line, no family appears twice, and the text ends with a newline.
+::testing::AssertionResult isExposition(const std::string& text) {
+  static const std::regex help(R"(# HELP ([a-zA-Z_:][a-zA-Z0-9_:]*) ([^\\\n]|\\\\|\\n)*)");
+  static const std::regex type(R"(# TYPE ([a-zA-Z_:][a-zA-Z0-9_:]*) (counter|gauge))");
+  static const std::regex sample(
+      R"(([a-zA-Z_:][a-zA-Z0-9_:]*)(\{[a-zA-Z_][a-zA-Z0-9_]*="([^"\\\n]|\\\\|\\"|\\n)*"\})? )"
+      R"((-?[0-9]+(\.[0-9]+)?(e[+-]?[0-9]+)?|NaN|[+-]Inf))");
+  if (text.empty() || text.back() != '\n') {
+    return ::testing::AssertionFailure() << "no final newline";
+  }
+  std::istringstream lines(text);
+  std::string line, family;
+  std::set<std::string> seen;
+  std::smatch m;
+  while (std::getline(lines, line)) {
+    if (std::regex_match(line, m, help)) {
+      if (!seen.insert(m[1]).second) return ::testing::AssertionFailure() << "twice: " << line;
+      family = m[1];
+    } else if (std::regex_match(line, m, type) || std::regex_match(line, m, sample)) {
+      if (m[1] != family) return ::testing::AssertionFailure() << "out of family: " << line;
+    } else {
+      return ::testing::AssertionFailure() << "not exposition: " << line;
+    }
+  }
+  return ::testing::AssertionSuccess();
+}
+
+TEST(CtlMetrics, TheFullStatusBecomesCountersWithLabelsAndGauges) {
+  SXValue status = SXValue::parse(R"({
+    "clients": [{"pid": 1, "sessions": []}], "reportingEnabled": true, "defaults": null,
+    "counters": {
+      "messages_received": 12,
+      "messages_delivered": {"tallyvane": 5, "joulebook": 0, "fernreporting": 7},
+      "guardrail_dropped": {"sessions_per_client": 1, "requests_backpressure": 2},
+      "store_write_errors": {"fernreporting": 3}
+    },
+    "gauges": {"sessions_live": 4, "clients_live": 2, "spool_backlog": 0}
+  })");
+  const std::string expected =
+      "# HELP sxreporting_up Whether the reporting service answered.\n"
+      "# TYPE sxreporting_up gauge\n"
+      "sxreporting_up 1\n"
+      "# HELP sxreporting_reporting_enabled Whether reporting is enabled (1) or disabled (0).\n"
+      "# TYPE sxreporting_reporting_enabled gauge\n"
+      "sxreporting_reporting_enabled 1\n"
+      "# HELP sxreporting_guardrail_dropped_total Sessions, entries or requests that each "
+      "guardrail refused.\n"
+      "# TYPE sxreporting_guardrail_dropped_total counter\n"
+      "sxreporting_guardrail_dropped_total{guardrail=\"requests_backpressure\"} 2\n"
+      "sxreporting_guardrail_dropped_total{guardrail=\"sessions_per_client\"} 1\n"
+      "# HELP sxreporting_messages_delivered_total Messages handed to each sink.\n"
+      "# TYPE sxreporting_messages_delivered_total counter\n"
+      "sxreporting_messages_delivered_total{sink=\"fernreporting\"} 7\n"
+      "sxreporting_messages_delivered_total{sink=\"joulebook\"} 0\n"
+      "sxreporting_messages_delivered_total{sink=\"tallyvane\"} 5\n"
+      "# HELP sxreporting_messages_received_total Messages that clients sent and the service "
+      "accepted.\n"
+      "# TYPE sxreporting_messages_received_total counter\n"
+      "sxreporting_messages_received_total 12\n"
+      "# HELP sxreporting_store_write_errors_total Writes to each durable store that failed.\n"
+      "# TYPE sxreporting_store_write_errors_total counter\n"
+      "sxreporting_store_write_errors_total{store=\"fernreporting\"} 3\n"
+      "# HELP sxreporting_clients_live Client connections open now.\n"
+      "# TYPE sxreporting_clients_live gauge\n"
+      "sxreporting_clients_live 2\n"
+      "# HELP sxreporting_sessions_live Reporting sessions that exist now.\n"
+      "# TYPE sxreporting_sessions_live gauge\n"
+      "sxreporting_sessions_live 4\n"
+      "# HELP sxreporting_spool_backlog Entries in the server-reporting spool waiting to be "
+      "flushed.\n"
+      "# TYPE sxreporting_spool_backlog gauge\n"
+      "sxreporting_spool_backlog 0\n";
+  const std::string text = SXCtlMetricsText(status);
+  EXPECT_EQ(text, expected);
+  EXPECT_TRUE(isExposition(text));
+}
+
+TEST(CtlMetrics, AbsentOrMistypedPartsLeaveOnlyWhatIsKnown) {
+  const std::string upOnly =
+      "# HELP sxreporting_up Whether the reporting service answered.\n"
+      "# TYPE sxreporting_up gauge\n"
+      "sxreporting_up 1\n";
+  EXPECT_EQ(SXCtlMetricsText(SXValue()), upOnly);
+  EXPECT_EQ(SXCtlMetricsText(SXValue::array({1, 2})), upOnly);
+  EXPECT_EQ(SXCtlMetricsText({{"counters", SXValue::object()}, {"reportingEnabled", "yes"}}),
+            upOnly);
+  EXPECT_EQ(SXCtlMetricsText({{"counters", 5}, {"gauges", {1, 2}}}), upOnly);
+  // Entries with no number in them have no family at all, not an empty one.
+  EXPECT_EQ(SXCtlMetricsText({{"counters", {{"a", "x"}, {"b", {{"c", nullptr}}}, {"d", {1}}}}}),
+            upOnly);
+
+  const std::string disabled = SXCtlMetricsText({{"reportingEnabled", false}});
+  EXPECT_NE(disabled.find("\nsxreporting_reporting_enabled 0\n"), std::string::npos);
+}
+
+TEST(CtlMetrics, UnknownKeysGetSafeNamesEscapedLabelsAndTheGenericLabel) {
+  SXValue status = {
+      {"counters",
+       {{"new-counter.x", 3},
+        {"bytes_total", 8},
+        {"by_queue", {{"a\"b\\c\nd", 1}, {"plain", 2.5}, {"skip", "text"}, {"deep", {{"x", 1}}}}},
+        {"odd", {{"neg", -4}, {"flag", true}}}}},
+      {"gauges", {{"up", 0}, {"temperature", 36.6}, {"per_pool", {{"io", 3}}}}}};
+  const std::string text = SXCtlMetricsText(status);
+  EXPECT_TRUE(isExposition(text)) << text;
+  EXPECT_NE(text.find("\nsxreporting_new_counter_x_total 3\n"), std::string::npos) << text;
+  EXPECT_NE(text.find("\nsxreporting_bytes_total 8\n"), std::string::npos);  // not _total_total
+  EXPECT_NE(text.find("\nsxreporting_by_queue_total{kind=\"a\\\"b\\\\c\\nd\"} 1\n"),
+            std::string::npos)
+      << text;
+  EXPECT_NE(text.find("\nsxreporting_by_queue_total{kind=\"plain\"} 2.5\n"), std::string::npos);
+  EXPECT_EQ(text.find("skip"), std::string::npos);
+  EXPECT_EQ(text.find("deep"), std::string::npos);
+  EXPECT_NE(text.find("{kind=\"neg\"} -4\n"), std::string::npos);
+  EXPECT_NE(text.find("{kind=\"flag\"} 1\n"), std::string::npos);
+  EXPECT_NE(text.find("# HELP sxreporting_by_queue_total The service's counter \"by_queue\".\n"),
+            std::string::npos);
+  EXPECT_NE(text.find("\nsxreporting_temperature 36.6\n"), std::string::npos);
+  EXPECT_NE(text.find("\nsxreporting_per_pool{kind=\"io\"} 3\n"), std::string::npos);
+  // A gauge named like one of the tool's own metrics cannot make a second family.
+  EXPECT_NE(text.find("\nsxreporting_up 1\n"), std::string::npos);
+  EXPECT_EQ(text.find("\nsxreporting_up 0\n"), std::string::npos);
+}
+
+TEST(CtlMetrics, NonFiniteValuesUseTheFormatsSpellings) {
+  SXValue gauges = {{"a", std::numeric_limits<double>::quiet_NaN()},
+                    {"b", std::numeric_limits<double>::infinity()},
+                    {"c", -std::numeric_limits<double>::infinity()}};
+  const std::string text = SXCtlMetricsText({{"gauges", gauges}});
+  EXPECT_TRUE(isExposition(text)) << text;
+  EXPECT_NE(text.find("sxreporting_a NaN\n"), std::string::npos);
+  EXPECT_NE(text.find("sxreporting_b +Inf\n"), std::string::npos);
+  EXPECT_NE(text.find("sxreporting_c -Inf\n"), std::string::npos);
+}
+
+TEST(CtlMetrics, OnlyStatusTakesTheMetricsFlag) {
+  std::vector<SXCtlRequest> requests;
+  std::string error;
+  ASSERT_TRUE(SXCtlParseChain({"status", "--metrics"}, requests, error)) << error;
+  EXPECT_TRUE(requests[0].metrics);
+  ASSERT_TRUE(SXCtlParseChain({"list", "then", "status"}, requests, error)) << error;
+  EXPECT_FALSE(requests[1].metrics);
+  EXPECT_FALSE(SXCtlParseChain({"list", "--metrics"}, requests, error));
+  EXPECT_EQ(error, "list has no option --metrics");
+  EXPECT_FALSE(SXCtlParseChain({"status", "--metrics=1"}, requests, error));
+  EXPECT_NE(SXCtlHelp("status").find("--metrics"), std::string::npos);
+}
+
+}  // namespace
