@@ -1,0 +1,33 @@
+// The command line of sxreport-bench.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+enum class ScenarioKind { kAddressed, kBroadcast, kStandalone, kLifecycle, kRpc, kIdle };
+
+struct BenchOptions {
+  std::string socketPath;  // a running daemon; empty with --spawn
+  std::string stateDir;    // its stores, for the row counts
+  bool spawn = false;
+  std::string daemonPath;  // for --spawn; default: sxreportingd beside this executable
+  bool keep = false;       // keep the spawned daemons' directories
+  bool baseline = false;
+  bool json = false;
+  std::vector<ScenarioKind> scenarios = {ScenarioKind::kAddressed};
+  size_t clients = 4;
+  uint64_t messages = 20'000;  // per client
+  size_t sessions = 1;         // per client, the active one included
+  size_t window = 32;
+  uint64_t stopEvery = 0;  // 0: never
+  size_t rssSamples = 10;
+  double drainTimeoutSeconds = 60;
+  double replyTimeoutSeconds = 30;
+};
+
+const char* ScenarioName(ScenarioKind kind);
+
+// Returns -1 to go on, else the exit status (0 after --help, 2 after a usage error, which it
+// has printed).
+int ParseBenchOptions(int argc, char** argv, BenchOptions& options);
