@@ -94,7 +94,7 @@ wait_for test -S "$socket"
 # Listening, but no daemon yet: the activator has not run it.
 grep -q 'ready' "$work/daemon.log" && fail "the daemon started before any connection"
 ctl="$stage/bin/sxreportctl --socket $socket"
-$ctl create 42 then valid 42 > "$work/ctl.log" 2>&1 || fail "create then valid"
+$ctl create 42 "then" valid 42 > "$work/ctl.log" 2>&1 || fail "create then valid"
 grep -q '^reporterID 42, serviceType' "$work/ctl.log" || fail "valid 42 did not find the session"
 grep -q '(socket activated)' "$work/daemon.log" || fail "the daemon did not adopt the socket"
 [ "$(cat /proc/$activator/comm)" = sxreportingd ] || fail "the daemon is not the activated process"
