@@ -4,9 +4,9 @@ ASAN_BUILD ?= build-asan
 JOBS       ?= $(shell nproc)
 DEB_PACKAGES = cmake g++ make pkg-config libasio-dev libmsgpack-cxx-dev nlohmann-json3-dev \
                libsqlite3-dev sqlite3 systemtap-sdt-dev libgtest-dev libgmock-dev googletest \
-               libcurl4-openssl-dev python3-msgpack
+               libcurl4-openssl-dev python3-msgpack help2man dpkg-dev
 
-.PHONY: deps build run test test-asan clean format
+.PHONY: deps build run test test-asan clean format install package
 
 deps:
 	@missing=$$(for p in $(DEB_PACKAGES); do dpkg-query -W -f='$${Status}\n' $$p 2>/dev/null | grep -q '^install ok installed' || echo $$p; done); \
@@ -45,6 +45,15 @@ $(ASAN_BUILD)/CMakeCache.txt:
 test-asan: deps $(ASAN_BUILD)/CMakeCache.txt
 	cmake --build $(ASAN_BUILD) -j $(JOBS)
 	cd $(ASAN_BUILD) && ASAN_OPTIONS=detect_leaks=1 UBSAN_OPTIONS=print_stacktrace=1 ctest --output-on-failure -j $(JOBS)
+
+# Installs under $(PREFIX) (or $(DESTDIR)$(PREFIX)); see README "Install as a service".
+PREFIX ?= /usr/local
+install: build
+	DESTDIR=$(DESTDIR) cmake --install $(BUILD) --prefix $(PREFIX)
+
+# The Debian package, $(BUILD)/sxreportingd_<version>_<arch>.deb.
+package: build
+	cd $(BUILD) && cpack -G DEB
 
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.h')

@@ -509,7 +509,7 @@ std::string SXCtlHelp(const std::string& command) {
            std::string(spec->details) + "\n\n" + std::string(kCommandOptionsHelp);
   }
   std::string text =
-      "usage: sxreportctl [options] COMMAND [ARGS]\n\n"
+      "Usage: sxreportctl [options] COMMAND [ARGS]\n\n"
       "Talks to the reporting service and reads its local stores.\n"
       "Commands joined by `then` run in order on one connection, stopping at the first that\n"
       "fails. A session lives as long as the connection that created it, so create and start\n"

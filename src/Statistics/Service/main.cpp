@@ -23,12 +23,14 @@
 namespace {
 
 constexpr const char* kUsage =
-    "usage: sxreportingd [options]\n"
+    "Usage: sxreportingd [options]\n"
     "\n"
     "The reporting service of the audio stack. Clients connect over a Unix socket and speak\n"
     "MessagePack-RPC (see sxreportctl(1) and docs/protocol.md).\n"
     "\n"
-    "options (each also read from its environment variable):\n"
+    "Each option can also be set by the environment variable named in parentheses.\n"
+    "\n"
+    "Options:\n"
     "  --socket PATH               socket path (SXREPORTING_SOCKET)\n"
     "                              default "
     "<runtime-dir>/com.vendra.audio.kitbench.reporting.service\n"
@@ -40,7 +42,8 @@ constexpr const char* kUsage =
     "  --diagnostic-logs-dir DIR   session summary files of internal builds\n"
     "                              (SXREPORTING_DIAGNOSTIC_LOGS_DIR)\n"
     "  --kestrel-root DIR          driver counters (SXREPORTING_KESTREL_ROOT)\n"
-    "  --log-scope SCOPE=LEVEL,... enable verbose lines, e.g. sxrs=5,sxrr=5,sxrd=5\n"
+    "  --log-scope SCOPE=LEVEL,...\n"
+    "                              enable verbose lines, e.g. sxrs=5,sxrr=5,sxrd=5\n"
     "                              (SXREPORTING_LOG_SCOPES)\n"
     "  --max-message-bytes N       largest request accepted (SXREPORTING_MAX_MESSAGE_BYTES,\n"
     "                              default 1048576)\n"

@@ -1,0 +1,129 @@
+#!/bin/sh
+# Installs the build into a staging root and uses it the way a system does: checks the installed
+# files and units, starts the staged daemon through socket activation, talks to it with the
+# staged sxreportctl, and builds small clients against the staged headers and library through
+# pkg-config and the CMake package. Those two builds are left out under the sanitizers, whose
+# runtime an outside compiler line does not link.
+# usage: install_test.sh BUILD_DIR SOURCE_DIR SANITIZED(0|1)
+set -eu
+build=$1 src=$2 sanitized=$3
+here=$src/tests/e2e/install
+work=$(mktemp -d /tmp/sxr-install.XXXXXX)
+stage=$work/stage/usr
+activator=""
+cleanup() {
+    [ -z "$activator" ] || kill "$activator" 2>/dev/null || true
+    rm -rf "$work"
+}
+trap cleanup EXIT
+trap 'exit 1' INT TERM
+
+fail() {
+    echo "FAIL: $*"
+    for log in "$work"/*.log; do [ -f "$log" ] && { echo "--- $log"; cat "$log"; }; done
+    exit 1
+}
+
+# Polls the command until it succeeds; fails after 15 s.
+wait_for() {
+    tries=0
+    until "$@"; do
+        tries=$((tries + 1))
+        [ "$tries" -lt 150 ] || fail "timed out waiting for: $*"
+        sleep 0.1
+    done
+}
+
+echo "== install into $stage"
+cmake --install "$build" --prefix "$stage" > "$work/install.log" 2>&1 || fail "cmake --install"
+
+echo "== installed files"
+for file in sbin/sxreportingd bin/sxreportctl include/sxreporting/client.h \
+        include/sxreporting/types.h lib/systemd/system/sxreportingd.socket \
+        lib/systemd/system/sxreportingd.service lib/sysusers.d/sxreportingd.conf; do
+    [ -e "$stage/$file" ] || fail "$file is not installed"
+done
+library=$(find "$stage" -name 'libsxreporting.so.*.*.*')
+[ -n "$library" ] || fail "libsxreporting.so.X.Y.Z is not installed"
+libdir=$(dirname "$library")
+[ -L "$libdir/libsxreporting.so" ] || fail "no libsxreporting.so development link"
+readelf -d "$library" | grep -q 'SONAME.*\[libsxreporting\.so\.0\]' || fail "SONAME is not libsxreporting.so.0"
+[ -f "$libdir/pkgconfig/sxreporting.pc" ] || fail "sxreporting.pc is not installed"
+[ -f "$libdir/cmake/SXReporting/SXReportingConfig.cmake" ] || fail "SXReportingConfig.cmake missing"
+if [ -f "$build/man/sxreportingd.8" ]; then
+    [ -f "$stage/share/man/man8/sxreportingd.8" ] || fail "sxreportingd.8 is not installed"
+    [ -f "$stage/share/man/man1/sxreportctl.1" ] || fail "sxreportctl.1 is not installed"
+fi
+grep -q "^ExecStart=$stage/sbin/sxreportingd " "$stage/lib/systemd/system/sxreportingd.service" ||
+    fail "the service does not start the installed daemon"
+
+if command -v systemd-analyze >/dev/null 2>&1; then
+    echo "== systemd-analyze verify"
+    # Only the units' own lines count: the machine may lack the user or a running manager.
+    (cd "$stage/lib/systemd/system" && systemd-analyze verify --man=no \
+        ./sxreportingd.socket ./sxreportingd.service) > "$work/verify.log" 2>&1 || true
+    if grep -E 'sxreportingd\.(socket|service):[0-9]+:' "$work/verify.log"; then
+        fail "systemd-analyze verify complains about the units"
+    fi
+fi
+if command -v systemd-sysusers >/dev/null 2>&1 && [ "$(id -u)" = 0 ]; then
+    echo "== systemd-sysusers --root"
+    mkdir -p "$work/root/etc"
+    systemd-sysusers --root="$work/root" "$stage/lib/sysusers.d/sxreportingd.conf" \
+        > "$work/sysusers.log" 2>&1 || fail "systemd-sysusers"
+    grep -q '^sxreportingd:' "$work/root/etc/passwd" || fail "no user sxreportingd"
+    grep -q '^sxreporting:' "$work/root/etc/group" || fail "no group sxreporting"
+fi
+
+echo "== socket activation"
+socket=$work/run/com.vendra.audio.kitbench.reporting.service
+mkdir -p "$work/run"
+daemon_args="--runtime-dir $work/run --state-dir $work/lib --config-dir $work/etc \
+    --diagnostic-logs-dir $work/logs --kestrel-root $work/kestrel"
+if command -v systemd-socket-activate >/dev/null 2>&1; then
+    # shellcheck disable=SC2086
+    systemd-socket-activate -l "$socket" "$stage/sbin/sxreportingd" $daemon_args \
+        > "$work/daemon.log" 2>&1 &
+else
+    # shellcheck disable=SC2086
+    python3 "$here/activate.py" "$socket" "$stage/sbin/sxreportingd" $daemon_args \
+        > "$work/daemon.log" 2>&1 &
+fi
+activator=$!
+wait_for test -S "$socket"
+# Listening, but no daemon yet: the activator has not run it.
+grep -q 'ready' "$work/daemon.log" && fail "the daemon started before any connection"
+ctl="$stage/bin/sxreportctl --socket $socket"
+$ctl create 42 "then" valid 42 > "$work/ctl.log" 2>&1 || fail "create then valid"
+grep -q '^reporterID 42, serviceType' "$work/ctl.log" || fail "valid 42 did not find the session"
+grep -q '(socket activated)' "$work/daemon.log" || fail "the daemon did not adopt the socket"
+[ "$(cat /proc/$activator/comm)" = sxreportingd ] || fail "the daemon is not the activated process"
+$ctl status > "$work/status.log" 2>&1 || fail "status"
+grep -q '^reporting enabled: yes' "$work/status.log" || fail "status did not answer"
+$ctl valid 42 > "$work/ctl.log" 2>&1 || fail "valid 42 on a new connection"
+grep -q '^reporterID 0, serviceType 65535' "$work/ctl.log" ||
+    fail "the session outlived the connection that made it"
+
+if [ "$sanitized" = 1 ]; then
+    echo "== sanitizer build: no client builds against the staged library"
+else
+    echo "== client built with pkg-config"
+    export PKG_CONFIG_PATH="$libdir/pkgconfig"
+    # shellcheck disable=SC2046
+    g++ -std=c++20 -o "$work/client" "$here/client.cpp" $(pkg-config --cflags --libs sxreporting) \
+        -Wl,-rpath,"$libdir" > "$work/compile.log" 2>&1 || fail "pkg-config build"
+    ldd "$work/client" | grep -q "$libdir/libsxreporting.so.0" ||
+        fail "the client does not load the staged library"
+    "$work/client" "$socket" > "$work/client.log" 2>&1 || fail "pkg-config client"
+    grep -q 'created true, valid reporterID 7 serviceType' "$work/client.log" ||
+        fail "pkg-config client answers"
+
+    echo "== client built with find_package(SXReporting)"
+    (cmake -S "$here/consumer" -B "$work/consumer" -DCMAKE_PREFIX_PATH="$stage" \
+        -DCMAKE_BUILD_RPATH="$libdir" && cmake --build "$work/consumer") \
+        > "$work/consumer.log" 2>&1 || fail "CMake package build"
+    "$work/consumer/consumer" "$socket" > "$work/client.log" 2>&1 || fail "CMake package client"
+    grep -q 'created true, valid reporterID 7 serviceType' "$work/client.log" ||
+        fail "CMake package client answers"
+fi
+echo "install test: all checks passed"
