@@ -6,7 +6,7 @@ DEB_PACKAGES = cmake g++ make pkg-config libasio-dev libmsgpack-cxx-dev nlohmann
                libsqlite3-dev sqlite3 systemtap-sdt-dev libgtest-dev libgmock-dev googletest \
                libcurl4-openssl-dev python3-msgpack help2man dpkg-dev
 
-.PHONY: deps build run test test-asan clean format install package
+.PHONY: deps build run test test-asan clean format install package fuzz
 
 deps:
 	@missing=$$(for p in $(DEB_PACKAGES); do dpkg-query -W -f='$${Status}\n' $$p 2>/dev/null | grep -q '^install ok installed' || echo $$p; done); \
@@ -55,8 +55,29 @@ install: build
 package: build
 	cd $(BUILD) && cpack -G DEB
 
+# libFuzzer targets (tests/fuzz), each run for FUZZ_SECONDS from its seed corpus; new inputs and
+# crashing ones stay in $(FUZZ_BUILD). Needs clang, so the build is a separate one; clang warns
+# where g++ does not, so warnings show there without stopping it (CI's -Werror is the g++ build).
+FUZZ_BUILD   ?= build-fuzz
+FUZZ_SECONDS ?= 30
+FUZZ_TARGETS  = fuzz_rpc_decoder fuzz_msgpack_value fuzz_payload
+fuzz: DEB_PACKAGES += clang libclang-rt-dev
+
+fuzz: deps
+	CC=clang CXX=clang++ cmake -S . -B $(FUZZ_BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DSXR_FUZZ=ON -DSXR_TESTS=OFF -DSXR_WERROR=OFF
+	cmake --build $(FUZZ_BUILD) -j $(JOBS) --target fuzz_targets
+	@set -e; for t in $(FUZZ_TARGETS); do \
+	  mkdir -p $(FUZZ_BUILD)/corpus/$$t $(FUZZ_BUILD)/artifacts; \
+	  dict=$$( [ -f tests/fuzz/$$t.dict ] && echo -dict=tests/fuzz/$$t.dict || true ); \
+	  $(FUZZ_BUILD)/$$t -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 -timeout=10 $$dict \
+	    -artifact_prefix=$(FUZZ_BUILD)/artifacts/$$t- $(FUZZ_BUILD)/corpus/$$t tests/fuzz/corpus/$$t \
+	    > $(FUZZ_BUILD)/$$t.log 2>&1 || { tail -n 60 $(FUZZ_BUILD)/$$t.log; exit 1; }; \
+	  echo "$$t: $$(sed -n 's/^stat::number_of_executed_units: *//p' $(FUZZ_BUILD)/$$t.log) executions in $(FUZZ_SECONDS) s, no crash"; \
+	done
+
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.h')
 
 clean:
-	rm -rf $(BUILD) $(ASAN_BUILD)
+	rm -rf $(BUILD) $(ASAN_BUILD) $(FUZZ_BUILD)

@@ -2,6 +2,7 @@
 
 #include <pthread.h>
 
+#include <atomic>
 #include <condition_variable>
 #include <deque>
 #include <exception>
@@ -32,6 +33,7 @@ struct SXSqliteBatchWriter::Core {
   uint64_t refused = 0;              // guarded by `mutex`: refused since the queue filled
   bool full = false;                 // guarded by `mutex`
   bool stopping = false;             // guarded by `mutex`
+  std::atomic<uint64_t> writeErrors{0};  // rows lost to a store that failed; any thread reads
 
   // Writer thread only. The statement is declared after the connection it belongs to, so it
   // is finalized first.
@@ -41,8 +43,10 @@ struct SXSqliteBatchWriter::Core {
 
 bool SXSqliteBatchWriter::Core::ensureOpen(std::string& error) {
   if (db) return true;
-  auto connection = SXSqliteConnection::open(options.path, SXSqliteConnection::Mode::kReadWrite,
-                                             options.busyTimeout, options.schema, error);
+  std::string recovered;
+  auto connection = SXSqliteConnection::openOrRecover(options.path, options.busyTimeout,
+                                                      options.schema, error, recovered);
+  if (!recovered.empty()) SXLOG(*log, nullptr, SXLogLevel::kError, "%s", recovered);
   if (!connection) return false;
   SXSqliteStatement statement;
   if (auto failed = connection->prepare(options.insertSql, statement)) {
@@ -91,11 +95,13 @@ void SXSqliteBatchWriter::Core::writeBatch(std::vector<RowProducer>& batch) {
   if (rows.empty()) return;
   std::string error;
   if (!ensureOpen(error)) {
+    writeErrors += rows.size();
     SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s", rows.size(), options.rowNoun,
           error);
     return;
   }
   if (auto failed = commit(rows)) {
+    writeErrors += rows.size();
     SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s: %s", rows.size(), options.rowNoun,
           options.path, *failed);
     // Start the next batch on a fresh connection, in case this one is what went wrong.
@@ -192,3 +198,5 @@ void SXSqliteBatchWriter::flush() {
   uint64_t target = core_->enqueued;
   core_->progress.wait(lock, [&] { return core_->done >= target; });
 }
+
+uint64_t SXSqliteBatchWriter::writeErrors() const { return core_->writeErrors.load(); }

@@ -8,7 +8,9 @@
 // enqueue() and flush() may be called from any thread, but flush() not from a row producer.
 // Failures never reach the caller: a store that cannot be opened or a write that fails (full
 // disk, a lock held too long) logs one error line on the default log of `log` and drops that
-// batch; the next batch tries again, reopening the store if needed. When more than
+// batch; the next batch tries again, reopening the store if needed. A store file that is no
+// usable database is moved aside and a new one created (SXSqliteConnection::openOrRecover),
+// with an error line. When more than
 // `maxQueued` rows wait, enqueue() refuses new ones (one error line when refusing starts, one
 // line saying how many were refused when there is room again).
 #pragma once
@@ -51,6 +53,10 @@ class SXSqliteBatchWriter {
 
   // Returns once every row enqueued before the call has been committed or dropped.
   void flush();
+
+  // Rows that were accepted but could not be stored (the store could not be opened or a commit
+  // failed); refused rows are not counted. Any thread.
+  uint64_t writeErrors() const;
 
  private:
   struct Core;

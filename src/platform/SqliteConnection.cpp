@@ -1,5 +1,15 @@
 #include "platform/SqliteConnection.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <ctime>
+#include <filesystem>
+
+#include "platform/FileSystem.h"
+
 namespace {
 
 std::string Describe(sqlite3* db, const std::string& context) {
@@ -90,12 +100,19 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::open(const std::string& 
                                                              std::chrono::milliseconds busyTimeout,
                                                              const std::string& schema,
                                                              std::string& error) {
+  int code = SQLITE_OK;
+  return openWithCode(path, mode, busyTimeout, schema, error, code);
+}
+
+std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
+    const std::string& path, Mode mode, std::chrono::milliseconds busyTimeout,
+    const std::string& schema, std::string& error, int& code) {
   sqlite3* db = nullptr;
   int flags =
       mode == Mode::kReadOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
   // The owner serialises calls, so SQLite's own per-connection mutex is not needed.
-  int rc = sqlite3_open_v2(path.c_str(), &db, flags | SQLITE_OPEN_NOMUTEX, nullptr);
-  if (rc != SQLITE_OK) {
+  code = sqlite3_open_v2(path.c_str(), &db, flags | SQLITE_OPEN_NOMUTEX, nullptr);
+  if (code != SQLITE_OK) {
     error = Describe(db, "cannot open " + path);
     sqlite3_close_v2(db);
     return nullptr;
@@ -106,11 +123,81 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::open(const std::string& 
   for (const std::string& sql :
        {std::string("PRAGMA journal_mode=WAL"), std::string("PRAGMA synchronous=NORMAL"), schema}) {
     if (auto failed = connection->exec(sql)) {
+      code = sqlite3_errcode(db);
       error = "cannot open " + path + ": " + *failed;
       return nullptr;
     }
   }
   return connection;
+}
+
+namespace {
+
+// Failures that say the file itself is unusable; anything else (busy, full, out of memory, a
+// missing directory) may pass, and moving the store aside would lose it for nothing.
+bool IsDamaged(const std::string& path, int code) {
+  switch (code & 0xff) {
+    case SQLITE_NOTADB:
+    case SQLITE_CORRUPT:
+      return true;
+    case SQLITE_CANTOPEN: {
+      // Only when the file is what is wrong: not a regular file, or one we may not open. Out of
+      // descriptors or memory, the same code comes back for a healthy store.
+      struct stat st {};
+      if (::stat(path.c_str(), &st) != 0) return false;
+      if (!S_ISREG(st.st_mode)) return true;
+      SXScopedFd fd(::open(path.c_str(), O_RDWR | O_CLOEXEC));
+      return fd.get() < 0 && (errno == EACCES || errno == EPERM);
+    }
+    default:
+      return false;
+  }
+}
+
+std::string DamagedSuffix() {
+  std::time_t now = std::time(nullptr);
+  std::tm utc{};
+  gmtime_r(&now, &utc);
+  char stamp[32];
+  std::strftime(stamp, sizeof stamp, "%Y%m%d-%H%M%S", &utc);
+  return std::string(".damaged-") + stamp;
+}
+
+// Renames `path` and its -wal and -shm files with the same new suffix; the database's own name.
+std::optional<std::string> MoveAside(const std::string& path, std::string& aside) {
+  std::string suffix = DamagedSuffix();
+  std::error_code ec;
+  for (int n = 2; std::filesystem::exists(path + suffix, ec); ++n) {
+    suffix = DamagedSuffix() + "-" + std::to_string(n);
+  }
+  aside = path + suffix;
+  if (::rename(path.c_str(), aside.c_str()) != 0) return SXPosixError("rename " + path, errno);
+  for (const char* extra : {"-wal", "-shm"}) {
+    // A stale log of the old file must not be replayed into the new one.
+    std::string from = path + extra;
+    if (::rename(from.c_str(), (aside + extra).c_str()) != 0 && errno != ENOENT) {
+      ::unlink(from.c_str());
+    }
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openOrRecover(
+    const std::string& path, std::chrono::milliseconds busyTimeout, const std::string& schema,
+    std::string& error, std::string& recovered) {
+  int code = SQLITE_OK;
+  auto connection = openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
+  if (connection || !IsDamaged(path, code)) return connection;
+  std::string aside;
+  if (auto failed = MoveAside(path, aside)) {
+    error += "; cannot move it aside: " + *failed;
+    return nullptr;
+  }
+  recovered = error + "; moved it to " + aside + " and started a new store";
+  error.clear();
+  return openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
 }
 
 SXSqliteConnection::~SXSqliteConnection() {

@@ -67,6 +67,18 @@ class SXSqliteConnection {
                                                   std::chrono::milliseconds busyTimeout,
                                                   const std::string& schema, std::string& error);
 
+  // Opens `path` read-write like open(). When the file is there but is no usable database (not
+  // a database, damaged, or a file SQLite cannot open at all), it and its -wal and -shm files
+  // are renamed with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created;
+  // `recovered` then says what was moved where, for the owner's error line. A store that is
+  // busy, or a disk that is full, is never moved aside. On failure returns nullptr and sets
+  // `error`.
+  static std::unique_ptr<SXSqliteConnection> openOrRecover(const std::string& path,
+                                                           std::chrono::milliseconds busyTimeout,
+                                                           const std::string& schema,
+                                                           std::string& error,
+                                                           std::string& recovered);
+
   struct Key {  // only open() makes connections
    private:
     friend class SXSqliteConnection;
@@ -83,6 +95,12 @@ class SXSqliteConnection {
   int64_t lastInsertRowId() const;
 
  private:
+  // open(), also saying which SQLite result code made it fail (SQLITE_OK on success).
+  static std::unique_ptr<SXSqliteConnection> openWithCode(const std::string& path, Mode mode,
+                                                          std::chrono::milliseconds busyTimeout,
+                                                          const std::string& schema,
+                                                          std::string& error, int& code);
+
   sqlite3* db_;
 };
 

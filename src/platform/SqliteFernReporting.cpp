@@ -55,8 +55,12 @@ class SXSqliteFernReporting::Spool {
   std::optional<std::string> insert(Kind kind, const SXSqliteRow& row, int64_t* rowId = nullptr) {
     std::lock_guard lock(mutex_);
     std::string error;
-    if (!ensureOpen(error)) return error;
+    if (!ensureOpen(error)) {
+      ++writeErrors_;
+      return error;
+    }
     if (auto failed = insert_[kind].run(row)) {
+      ++writeErrors_;
       close();  // the next call starts on a fresh connection
       return path_ + ": " + *failed;
     }
@@ -75,13 +79,15 @@ class SXSqliteFernReporting::Spool {
 
   void post(std::function<void()> task) { completions_.post(std::move(task)); }
   const std::vector<std::string>& backends() const { return backends_; }
+  uint64_t writeErrors() const { return writeErrors_.load(); }
   const std::shared_ptr<SXLogFacility>& log() const { return log_; }
 
   // REQUIRES: mutex_ held, or no other thread knows this spool yet.
   bool ensureOpen(std::string& error) {
     if (db_) return true;
-    db_ = SXSqliteConnection::open(path_, SXSqliteConnection::Mode::kReadWrite, busyTimeout_,
-                                   kSchema, error);
+    std::string recovered;
+    db_ = SXSqliteConnection::openOrRecover(path_, busyTimeout_, kSchema, error, recovered);
+    if (!recovered.empty()) SXLOG(*log_, nullptr, SXLogLevel::kError, "%s", recovered);
     for (int kind = 0; db_ && kind < kKinds; ++kind) {
       if (auto failed = db_->prepare(kInsert[kind], insert_[kind])) {
         error = path_ + ": " + *failed;
@@ -105,6 +111,7 @@ class SXSqliteFernReporting::Spool {
   std::mutex mutex_;
   std::unique_ptr<SXSqliteConnection> db_;  // guarded by mutex_
   SXSqliteStatement insert_[kKinds];        // guarded by mutex_
+  std::atomic<uint64_t> writeErrors_{0};    // rows not stored; any thread reads
   SXCompletionThread completions_;          // declared last: joined before the rest goes
 };
 
@@ -172,6 +179,8 @@ SXSqliteFernReporting::~SXSqliteFernReporting() = default;
 const std::vector<std::string>& SXSqliteFernReporting::backends() const {
   return spool_->backends();
 }
+
+uint64_t SXSqliteFernReporting::writeErrors() const { return spool_->writeErrors(); }
 
 std::shared_ptr<FernSecureHierarchyToken> SXSqliteFernReporting::newHierarchyToken(
     const std::shared_ptr<FernSecureHierarchyToken>& parent) {

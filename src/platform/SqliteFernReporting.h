@@ -20,7 +20,8 @@
 // process; a flush checkpoints the WAL, which makes everything before it survive a power loss
 // too). On failure a send returns false with a FernError saying why, openSession() returns
 // nullptr after an error line on the default log of `log`, and a flush completes with an
-// error. A store that cannot be opened is opened again at the next call.
+// error. A store that cannot be opened is opened again at the next call; a store file that is
+// no usable database is moved aside and a new one created, with an error line.
 //
 // Sessions share the spool: it stays open, and completions keep coming, while any session
 // lives, even after this object is gone.
@@ -55,6 +56,10 @@ class SXSqliteFernReporting final : public FernReporting {
 
   // The configured backends; empty when there are none.
   const std::vector<std::string>& backends() const;
+
+  // Sessions, messages and flushes that could not be stored since start (the store failed to
+  // open or the insert failed). Any thread.
+  uint64_t writeErrors() const;
 
   // Reads the backends file as described above.
   static std::vector<std::string> loadBackends(const std::string& configPath, SXLogFacility* log);

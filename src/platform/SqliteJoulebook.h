@@ -32,6 +32,9 @@ class SXSqliteJoulebook final : public SXJoulebook {
   // Returns once every entry logged before the call is committed (or dropped on failure).
   void flush();
 
+  // Entries that could not be stored since start (the store failed to open or to commit).
+  uint64_t writeErrors() const { return writer_.writeErrors(); }
+
  private:
   SXSqliteBatchWriter writer_;
 };

@@ -34,6 +34,9 @@ class SXSqliteTallyvane final : public SXTallyvane {
   // Not from a payload provider.
   void flush();
 
+  // Events that could not be stored since start (the store failed to open or to commit).
+  uint64_t writeErrors() const { return writer_.writeErrors(); }
+
   // The last `limit` events (all when `limit` <= 0) whose name matches the GLOB pattern
   // `nameFilter` (an exact name matches itself), oldest first, as objects {"id", "time",
   // "name", "payload"}; "payload" is the stored JSON parsed (its text when it does not parse).

@@ -15,12 +15,34 @@ constexpr SXReportingServiceType kTelephony = 2;
 constexpr SXReportingServiceType kLongFormAudio = 7;
 constexpr int64_t kDeviceClassWithoutOrientation = 6;
 
-// A name as it may stand inside a file name: no directory separators, no NULs.
-std::string fileNameComponent(std::string name) {
-  for (char& c : name) {
-    if (c == '/' || c == '\0') c = '_';
+// Longest piece of a summary file name taken from a client's configuration, in bytes; the whole
+// name stays far below the usual 255-byte limit.
+constexpr size_t kMaxFileNameComponent = 64;
+
+// A name as it may stand inside a file name. The host application name comes from the client,
+// so nothing in it may reach outside the directory or hide the file: directory separators,
+// NULs and other control characters become "_", as do runs of dots and a leading dot; the name
+// is cut at 64 bytes (never inside a UTF-8 sequence); an empty name becomes "unknown".
+std::string fileNameComponent(const std::string& name) {
+  std::string safe;
+  for (size_t i = 0; i < name.size(); ++i) {
+    auto c = static_cast<unsigned char>(name[i]);
+    if (c == '.' && (safe.empty() || (i + 1 < name.size() && name[i + 1] == '.'))) {
+      while (i + 1 < name.size() && name[i + 1] == '.') ++i;
+      safe += '_';
+    } else if (c == '/' || c == '\\' || c < 0x20 || c == 0x7f) {
+      safe += '_';
+    } else {
+      safe += static_cast<char>(c);
+    }
   }
-  return name;
+  if (safe.size() > kMaxFileNameComponent) {
+    size_t cut = kMaxFileNameComponent;
+    // Back up over continuation bytes so that a multi-byte character is kept whole or dropped.
+    while (cut > 0 && (static_cast<unsigned char>(safe[cut]) & 0xC0) == 0x80) --cut;
+    safe.resize(cut);
+  }
+  return safe.empty() ? "unknown" : safe;
 }
 
 // "yyyyMMdd-HHmmssZ" in the device's time zone, for example 20261116-185803+0000.

@@ -1,0 +1,215 @@
+// The fuzz targets' bodies, shared by the libFuzzer entry points (fuzz_*.cpp, clang only) and
+// by the regression test that replays the seed corpus and every input that once failed
+// (tests/FuzzCorpus_test.cpp), so both run exactly the same checks.
+//
+// A broken property calls SXR_FUZZ_FAILED(what): a trap for the fuzzer, a test failure in the
+// regression test.
+#pragma once
+
+#include <algorithm>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <msgpack.hpp>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "SXReportingBlockThrottle.h"
+#include "SXReportingSession.h"
+#include "common/MsgpackValue.h"
+#include "common/RpcCodec.h"
+#include "platform/DiscardLog.h"
+#include "support/TestEnvironment.h"
+
+#ifndef SXR_FUZZ_FAILED
+#define SXR_FUZZ_FAILED(what) __builtin_trap()
+#endif
+#define SXR_FUZZ_CHECK(condition) \
+  do {                            \
+    if (!(condition)) SXR_FUZZ_FAILED(#condition); \
+  } while (0)
+
+// Reads fixed-size numbers from the front of the fuzz input; zeros once it runs out.
+class SXFuzzInput {
+ public:
+  SXFuzzInput(const uint8_t* data, size_t size) : data_(data), size_(size) {}
+  template <typename T>
+  T take() {
+    T value{};
+    size_t n = std::min(sizeof(T), size_);
+    std::memcpy(&value, data_, n);
+    data_ += n;
+    size_ -= n;
+    return value;
+  }
+  const uint8_t* data() const { return data_; }
+  size_t size() const { return size_; }
+
+ private:
+  const uint8_t* data_;
+  size_t size_;
+};
+
+// A value from arbitrary bytes: MessagePack when the first byte is even, JSON text when it is
+// odd. Nothing when the bytes are neither; never throws.
+inline std::optional<SXValue> SXFuzzValue(const uint8_t* data, size_t size) {
+  if (size == 0) return std::nullopt;
+  const char* bytes = reinterpret_cast<const char*>(data + 1);
+  size_t length = size - 1;
+  if (data[0] % 2 == 1) {
+    SXValue value = SXValue::parse(bytes, bytes + length, nullptr, false);
+    if (value.is_discarded()) return std::nullopt;
+    return value;
+  }
+  RpcLimits limits;
+  try {
+    size_t offset = 0;
+    msgpack::object_handle handle = msgpack::unpack(
+        bytes, length, offset, nullptr, nullptr,
+        msgpack::unpack_limit(limits.maxContainerEntries, limits.maxContainerEntries,
+                              limits.maxMessageBytes, limits.maxMessageBytes,
+                              limits.maxMessageBytes, limits.maxPayloadDepth + 1));
+    return SXValueFromMsgpack(handle.get(), limits.maxPayloadDepth);
+  } catch (const std::exception&) {
+    return std::nullopt;
+  }
+}
+
+// ---- The wire decoder: never crashes, and the messages it yields do not depend on where the
+// reads happened to split the stream.
+
+struct SXFuzzDecoded {
+  std::vector<std::string> messages;  // compact JSON, so that NaN compares equal
+  RpcStreamDecoder::Status last = RpcStreamDecoder::Status::kNeedMore;
+};
+
+// Drains every whole message; returns false once the stream is broken.
+inline bool SXFuzzDrain(RpcStreamDecoder& decoder, SXFuzzDecoded& out) {
+  SXValue message;
+  for (;;) {
+    out.last = decoder.next(message);
+    if (out.last != RpcStreamDecoder::Status::kMessage) {
+      if (out.last == RpcStreamDecoder::Status::kBroken) SXR_FUZZ_CHECK(!decoder.error().empty());
+      return out.last != RpcStreamDecoder::Status::kBroken;
+    }
+    std::string why;
+    std::optional<uint32_t> msgid;
+    if (!RpcParseRequest(message, why, msgid)) SXR_FUZZ_CHECK(!why.empty());
+    RpcParseResponse(message);
+    out.messages.push_back(message.dump(-1, ' ', false, SXValue::error_handler_t::replace));
+  }
+}
+
+inline SXFuzzDecoded SXFuzzDecode(const RpcLimits& limits, const std::string& stream,
+                                  const std::vector<size_t>& chunks) {
+  RpcStreamDecoder decoder(limits);
+  SXFuzzDecoded out;
+  size_t at = 0;
+  for (size_t i = 0; at < stream.size(); ++i) {
+    size_t n = chunks.empty() ? stream.size() : chunks[i % chunks.size()];
+    n = std::min(n, stream.size() - at);
+    std::memcpy(decoder.prepare(n), stream.data() + at, n);
+    decoder.commit(n);
+    at += n;
+    if (!SXFuzzDrain(decoder, out)) break;
+  }
+  return out;
+}
+
+// Input: one byte choosing tight or default limits, one byte giving 1-8 chunk sizes, the
+// sizes (1-64 bytes each), then the stream.
+inline void SXFuzzRpcDecoder(const uint8_t* data, size_t size) {
+  SXFuzzInput input(data, size);
+  RpcLimits limits;
+  if (input.take<uint8_t>() % 2) {
+    limits = {.maxMessageBytes = 512, .maxPayloadDepth = 4, .maxContainerEntries = 16};
+  }
+  std::vector<size_t> chunks(input.take<uint8_t>() % 8 + 1);
+  for (size_t& chunk : chunks) chunk = input.take<uint8_t>() % 64 + 1;
+  std::string stream(reinterpret_cast<const char*>(input.data()), input.size());
+  SXFuzzDecoded whole = SXFuzzDecode(limits, stream, {});
+  SXFuzzDecoded cut = SXFuzzDecode(limits, stream, chunks);
+  SXR_FUZZ_CHECK(whole.last == cut.last);
+  SXR_FUZZ_CHECK(whole.messages == cut.messages);
+}
+
+// ---- MessagePack objects into the value model and back: conversion never crashes, and a value
+// packs to the same bytes after a round trip.
+
+inline std::string SXFuzzPack(const SXValue& value) {
+  msgpack::sbuffer buffer;
+  msgpack::packer<msgpack::sbuffer> packer(buffer);
+  SXPackValue(packer, value);
+  return std::string(buffer.data(), buffer.size());
+}
+
+inline void SXFuzzMsgpackValue(const uint8_t* data, size_t size) {
+  std::vector<uint8_t> framed(size + 1, 0);  // an even first byte: MessagePack
+  if (size) std::memcpy(framed.data() + 1, data, size);
+  std::optional<SXValue> value = SXFuzzValue(framed.data(), framed.size());
+  if (!value) return;
+  std::string first = SXFuzzPack(*value);
+  std::vector<uint8_t> again(first.size() + 1, 0);
+  std::memcpy(again.data() + 1, first.data(), first.size());
+  std::optional<SXValue> back = SXFuzzValue(again.data(), again.size());
+  SXR_FUZZ_CHECK(back.has_value());
+  if (back) SXR_FUZZ_CHECK(SXFuzzPack(*back) == first);
+}
+
+// ---- What the service does with a client's payload: the key rewrite, the throttle's message
+// key and hold-back time, and a session's summary event and file on an internal build.
+
+inline void SXFuzzRewrite(const SXValue& payload) {
+  SXValue rewritten = SXReportingSessionUnderscoreKeys(payload);
+  SXR_FUZZ_CHECK(rewritten.is_object());
+  if (payload.is_object()) SXR_FUZZ_CHECK(rewritten.size() <= payload.size());
+  for (const auto& [key, value] : rewritten.items()) {
+    SXR_FUZZ_CHECK(key.find(' ') == std::string::npos);
+  }
+}
+
+inline void SXFuzzThrottle(const SXValue& payload, int64_t reporterID, uint32_t category,
+                           uint16_t type) {
+  SXDiscardLog log;
+  std::string key = SXReportingBlockThrottle::buildMessageKey(payload, reporterID, category, type);
+  SXValue copy = payload;
+  SXR_FUZZ_CHECK(SXReportingBlockThrottle::buildMessageKey(copy, reporterID, category, type) ==
+                 key);
+  SXReportingBlockThrottle::determineSleepTime(payload, log);
+}
+
+// The summary file's name must stay one name inside the diagnostic-logs directory.
+inline void SXFuzzSummary(const SXValue& payload, int64_t reporterID, uint32_t category,
+                          uint16_t type) {
+  TestEnvironment t(SXValue{{"InternalBuild", true}}, {});
+  auto session = SXReportingSession::initWithID(t.environment, reporterID, SXValue::array());
+  session->setServiceType(type);
+  if (payload.is_object()) session->setConfiguration(&payload);
+  session->start();
+  session->sendMessage(payload, category, type, nullptr);
+  session->createSummaryEventForSession();
+  t.drain();
+  std::lock_guard lock(t.fileSystem->mutex_);
+  for (const auto& [path, contents] : t.fileSystem->files) {
+    SXR_FUZZ_CHECK(path.rfind("/diag/", 0) == 0);
+    std::string name = path.substr(std::min(path.size(), std::string("/diag/").size()));
+    SXR_FUZZ_CHECK(name.find('/') == std::string::npos);
+    SXR_FUZZ_CHECK(name.find('\0') == std::string::npos);
+    SXR_FUZZ_CHECK(name.find("..") == std::string::npos);
+    SXR_FUZZ_CHECK(name.size() <= 255);
+  }
+}
+
+// Input: reporter ID (8 bytes), category (4), type (2), then the value (see SXFuzzValue).
+inline void SXFuzzPayload(const uint8_t* data, size_t size) {
+  SXFuzzInput input(data, size);
+  auto reporterID = input.take<int64_t>();
+  auto category = input.take<uint32_t>();
+  auto type = input.take<uint16_t>();
+  std::optional<SXValue> payload = SXFuzzValue(input.data(), input.size());
+  if (!payload) return;
+  SXFuzzRewrite(*payload);
+  SXFuzzThrottle(*payload, reporterID, category, type);
+  SXFuzzSummary(*payload, reporterID, category, type);
+}
