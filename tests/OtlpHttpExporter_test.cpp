@@ -86,7 +86,8 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
 
   auto exporter = Make();
   EXPECT_EQ(exporter->backlog(), 0u);  // unknown before the first pass opens the spool
-  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported)
+      << testing::PrintToString(log_->messages());
   auto request = http_->requests().at(0);
   EXPECT_EQ(request.url, "http://collector.test:4318/v1/logs");
   EXPECT_EQ(request.headers["Content-Type"], "application/json");
@@ -158,6 +159,17 @@ TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
   EXPECT_EQ(restarted->exportOnce().outcome, Outcome::kExported);
   EXPECT_EQ(LastIds(), std::vector<int64_t>{6});
   EXPECT_EQ(http_->requests().size(), 4u);
+}
+
+TEST_F(OtlpHttpExporterTest, LargePayloadsCutTheBatchShort) {
+  options_.batchSize = 10;
+  options_.maxBatchBytes = 250;
+  Standalone({{"s", std::string(400, 'x')}});  // too large alone: goes alone
+  for (int i = 0; i < 3; ++i) Standalone({{"s", std::string(100, 'y')}});
+  auto exporter = Make();
+  std::vector<std::vector<int64_t>> batches;
+  while (exporter->exportOnce().outcome == Outcome::kExported) batches.push_back(LastIds());
+  EXPECT_EQ(batches, (std::vector<std::vector<int64_t>>{{1}, {2, 3}, {4}}));
 }
 
 TEST_F(OtlpHttpExporterTest, CursorMovesOnlyAfterA2xxAndFailuresBackOff) {
