@@ -9,6 +9,7 @@
 #include "fakes/FakeLog.h"
 #include "platform/SqliteFernReporting.h"
 #include "support/Daemon.h"
+#include "support/OtlpReceiver.h"
 #include "support/SqliteTestSupport.h"
 #include "support/TestEnvironment.h"
 
@@ -333,4 +334,34 @@ TEST(OtlpExportOptions, LoadsOnlyWhenTheBackendIsListed) {
             std::string::npos);
   EXPECT_NE(log.lines()[0].message.find("not exporting (messages stay in the spool)"),
             std::string::npos);
+}
+
+TEST(CurlHttpPost, ReportsStatusesAndFailuresWithoutAResponse) {
+  OtlpReceiver receiver;
+  SXCurlHttpPost http;
+  SXHttpRequest request{receiver.endpoint(), {{"X-Key", "v"}}, std::string(5000, 'b'), 5s};
+  SXHttpResult ok = http.post(request);
+  EXPECT_EQ(ok.status, 200) << ok.error;
+  EXPECT_EQ(ok.body, "{}");
+  auto seen = receiver.requests().at(0);
+  EXPECT_EQ(seen.body.size(), 5000u);
+  EXPECT_EQ(seen.headers["x-key"], "v");
+  EXPECT_EQ(seen.headers.count("expect"), 0u);  // no 100-continue round trip
+
+  receiver.failNext(1, 503);
+  EXPECT_EQ(http.post(request).status, 503);
+  // A kept-alive connection that dies unanswered is tried once more on a fresh one.
+  receiver.dropNext(2);
+  SXHttpResult dropped = http.post(request);
+  EXPECT_FALSE(dropped.status);
+  EXPECT_FALSE(dropped.error.empty());
+  EXPECT_EQ(http.post(request).status, 200);  // a fresh connection after the drop
+
+  request.url = "ftp://127.0.0.1/x";
+  EXPECT_FALSE(http.post(request).status);
+  request.url = receiver.endpoint();
+  http.cancel();
+  SXHttpResult cancelled = http.post(request);
+  EXPECT_FALSE(cancelled.status);
+  EXPECT_EQ(cancelled.error, "cancelled");
 }
