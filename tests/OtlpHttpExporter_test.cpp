@@ -223,7 +223,7 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   options_.batchSize = 4;
   http_->answer(413);
   http_->answer(200);
-  http_->answer(400, "bad field");
+  http_->answer(400, "bad\nfield");
   auto exporter = Make();
 
   auto pass = exporter->exportOnce();
@@ -233,19 +233,26 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
   EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
 
-  // The limit is back to 4 after the success; a 400 drops the batch for good.
+  // Batches stay halved while the backlog lasts; a 400 drops the batch for good.
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
-  EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4, 5}));
-  EXPECT_EQ(DurableCursor(), 5);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4}));
+  EXPECT_EQ(DurableCursor(), 4);
   EXPECT_TRUE(
-      log_->contains("dropping messages 3 to 5: the collector rejected them with 400 "
+      log_->contains("dropping messages 3 to 4: the collector rejected them with 400 "
                      "bad field"));
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kIdle);
 
   // A single message still too large is dropped too.
   Standalone({{"i", 6}});
   http_->answer(413);
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
   EXPECT_EQ(DurableCursor(), 6);
+
+  // Once drained, whole batches again.
+  for (int i = 7; i <= 10; ++i) Standalone({{"i", i}});
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{7, 8, 9, 10}));
 }
 
 TEST_F(OtlpHttpExporterTest, PartialSuccessIsLoggedAndTheCursorMoves) {
