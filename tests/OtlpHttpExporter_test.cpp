@@ -9,6 +9,7 @@
 #include "fakes/FakeLog.h"
 #include "platform/SqliteFernReporting.h"
 #include "support/Daemon.h"
+#include "support/OtlpReceiver.h"
 #include "support/SqliteTestSupport.h"
 #include "support/TestEnvironment.h"
 
@@ -86,7 +87,8 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
 
   auto exporter = Make();
   EXPECT_EQ(exporter->backlog(), 0u);  // unknown before the first pass opens the spool
-  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported)
+      << testing::PrintToString(log_->messages());
   auto request = http_->requests().at(0);
   EXPECT_EQ(request.url, "http://collector.test:4318/v1/logs");
   EXPECT_EQ(request.headers["Content-Type"], "application/json");
@@ -160,6 +162,17 @@ TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
   EXPECT_EQ(http_->requests().size(), 4u);
 }
 
+TEST_F(OtlpHttpExporterTest, LargePayloadsCutTheBatchShort) {
+  options_.batchSize = 10;
+  options_.maxBatchBytes = 250;
+  Standalone({{"s", std::string(400, 'x')}});  // too large alone: goes alone
+  for (int i = 0; i < 3; ++i) Standalone({{"s", std::string(100, 'y')}});
+  auto exporter = Make();
+  std::vector<std::vector<int64_t>> batches;
+  while (exporter->exportOnce().outcome == Outcome::kExported) batches.push_back(LastIds());
+  EXPECT_EQ(batches, (std::vector<std::vector<int64_t>>{{1}, {2, 3}, {4}}));
+}
+
 TEST_F(OtlpHttpExporterTest, CursorMovesOnlyAfterA2xxAndFailuresBackOff) {
   Standalone({{"i", 1}});
   http_->fail("Connection refused");
@@ -210,7 +223,7 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   options_.batchSize = 4;
   http_->answer(413);
   http_->answer(200);
-  http_->answer(400, "bad field");
+  http_->answer(400, "bad\nfield");
   auto exporter = Make();
 
   auto pass = exporter->exportOnce();
@@ -220,19 +233,26 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
   EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
 
-  // The limit is back to 4 after the success; a 400 drops the batch for good.
+  // Batches stay halved while the backlog lasts; a 400 drops the batch for good.
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
-  EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4, 5}));
-  EXPECT_EQ(DurableCursor(), 5);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{3, 4}));
+  EXPECT_EQ(DurableCursor(), 4);
   EXPECT_TRUE(
-      log_->contains("dropping messages 3 to 5: the collector rejected them with 400 "
+      log_->contains("dropping messages 3 to 4: the collector rejected them with 400 "
                      "bad field"));
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kIdle);
 
   // A single message still too large is dropped too.
   Standalone({{"i", 6}});
   http_->answer(413);
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kDropped);
   EXPECT_EQ(DurableCursor(), 6);
+
+  // Once drained, whole batches again.
+  for (int i = 7; i <= 10; ++i) Standalone({{"i", i}});
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(LastIds(), (std::vector<int64_t>{7, 8, 9, 10}));
 }
 
 TEST_F(OtlpHttpExporterTest, PartialSuccessIsLoggedAndTheCursorMoves) {
@@ -321,4 +341,34 @@ TEST(OtlpExportOptions, LoadsOnlyWhenTheBackendIsListed) {
             std::string::npos);
   EXPECT_NE(log.lines()[0].message.find("not exporting (messages stay in the spool)"),
             std::string::npos);
+}
+
+TEST(CurlHttpPost, ReportsStatusesAndFailuresWithoutAResponse) {
+  OtlpReceiver receiver;
+  SXCurlHttpPost http;
+  SXHttpRequest request{receiver.endpoint(), {{"X-Key", "v"}}, std::string(5000, 'b'), 5s};
+  SXHttpResult ok = http.post(request);
+  EXPECT_EQ(ok.status, 200) << ok.error;
+  EXPECT_EQ(ok.body, "{}");
+  auto seen = receiver.requests().at(0);
+  EXPECT_EQ(seen.body.size(), 5000u);
+  EXPECT_EQ(seen.headers["x-key"], "v");
+  EXPECT_EQ(seen.headers.count("expect"), 0u);  // no 100-continue round trip
+
+  receiver.failNext(1, 503);
+  EXPECT_EQ(http.post(request).status, 503);
+  // A kept-alive connection that dies unanswered is tried once more on a fresh one.
+  receiver.dropNext(2);
+  SXHttpResult dropped = http.post(request);
+  EXPECT_FALSE(dropped.status);
+  EXPECT_FALSE(dropped.error.empty());
+  EXPECT_EQ(http.post(request).status, 200);  // a fresh connection after the drop
+
+  request.url = "ftp://127.0.0.1/x";
+  EXPECT_FALSE(http.post(request).status);
+  request.url = receiver.endpoint();
+  http.cancel();
+  SXHttpResult cancelled = http.post(request);
+  EXPECT_FALSE(cancelled.status);
+  EXPECT_EQ(cancelled.error, "cancelled");
 }

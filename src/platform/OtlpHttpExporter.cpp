@@ -67,6 +67,13 @@ bool IsRetried(int status) {
   return status == 401 || status == 403 || status == 404 || status == 408 || status == 429;
 }
 
+// A response body fit for one log line.
+std::string OneLine(std::string text) {
+  std::replace_if(
+      text.begin(), text.end(), [](char c) { return c == '\n' || c == '\r'; }, ' ');
+  return text;
+}
+
 int64_t RowId(const SXValue& row) {
   auto it = row.find("id");
   return it != row.end() && it->is_number_integer() ? it->get<int64_t>() : 0;
@@ -165,7 +172,10 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::exportOnce() {
   if (auto failed = spool_.read(batchLimit_, options_.maxBatchBytes, rows)) {
     return this->failed("cannot read the spool: " + *failed);
   }
-  if (rows.empty()) return {Outcome::kIdle, 0};
+  if (rows.empty()) {
+    batchLimit_ = options_.batchSize;  // the backlog that met a size limit is gone
+    return {Outcome::kIdle, 0};
+  }
   return post(rows);
 }
 
@@ -181,7 +191,7 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& ro
   if (status >= 200 && status < 300) {
     LogPartialSuccess(*log_, result.body, first, last);
   } else if (IsRetried(status)) {
-    return failed(SXFormat("the collector answered %i %@", status, result.body));
+    return failed(SXFormat("the collector answered %i %@", status, OneLine(result.body)));
   } else if (status == 413 && rows.size() > 1) {
     batchLimit_ = rows.size() / 2;
     SXLOG(*log_, nullptr, SXLogLevel::kInfo,
@@ -191,7 +201,7 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& ro
   } else {
     SXLOG(*log_, nullptr, SXLogLevel::kError,
           "dropping messages %lli to %lli: the collector rejected them with %i %@", first, last,
-          status, result.body);
+          status, OneLine(result.body));
   }
   Outcome outcome = status < 300 ? Outcome::kExported : Outcome::kDropped;
   if (auto failedWrite = spool_.advance(last)) {
@@ -215,7 +225,6 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::failed(const std::string& why) {
 }
 
 void SXOtlpHttpExporter::succeeded() {
-  batchLimit_ = options_.batchSize;
   if (failures_ == 0) return;
   SXLOG(*log_, nullptr, SXLogLevel::kDefault, "exporting to %@ again after %u failed attempts",
         options_.endpoint, failures_);

@@ -19,8 +19,9 @@
 //                           per failure streak and one line when exports go through again.
 //                           Unauthorised or missing endpoints are configuration faults that an
 //                           operator fixes; the messages wait in the spool meanwhile.
-//   413                     the batch is halved and retried at once; a single message that is
-//                           still too large is dropped as below.
+//   413                     the batch is halved and retried at once, and batches keep that
+//                           size until the backlog is drained; a single message that is still
+//                           too large is dropped as below.
 //   other 4xx               the collector rejects this body and would reject it again: the
 //                           batch is dropped with an error line naming its row ids and the
 //                           cursor moves on, so that one bad message cannot hold up the rest.

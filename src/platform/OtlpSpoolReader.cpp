@@ -14,16 +14,28 @@ constexpr const char* kSelectBatch =
     "COALESCE(m.session_info_json, s.session_info_json) AS session_info_json, "
     "COALESCE(m.user_info_json, s.user_info_json) AS user_info_json, s.token AS token "
     "FROM messages m LEFT JOIN sessions s ON s.id = m.session_id "
-    "WHERE m.id > ?1 ORDER BY m.id LIMIT ?2";
+    "WHERE m.id > ?1 AND m.id <= ?2 ORDER BY m.id";
+// Sizes first, so that a batch is cut to size before its payloads are loaded.
+constexpr const char* kSelectSizes =
+    "SELECT id, LENGTH(CAST(payload_json AS BLOB)) AS bytes FROM messages WHERE id > ?1 "
+    "ORDER BY id LIMIT ?2";
 constexpr const char* kSelectCursor = "SELECT last_message_id FROM otlp_export WHERE id = 1";
 constexpr const char* kStoreCursor =
     "INSERT INTO otlp_export(id, last_message_id) VALUES (1, ?1) "
     "ON CONFLICT(id) DO UPDATE SET last_message_id = excluded.last_message_id";
 constexpr const char* kCountBeyond = "SELECT COUNT(*) AS n FROM messages WHERE id > ?1";
 
-size_t PayloadBytes(const SXValue& row) {
-  auto it = row.find("payload_json");
-  return it != row.end() && it->is_string() ? it->get_ref<const std::string&>().size() : 0;
+// The id of the last of `sizes` (rows of id and bytes) that fit in `maxBytes`, one at least.
+int64_t LastThatFits(const std::vector<SXValue>& sizes, size_t maxBytes) {
+  int64_t last = 0;
+  size_t total = 0;
+  for (const SXValue& row : sizes) {
+    size_t bytes = row["bytes"].is_number_integer() ? row["bytes"].get<size_t>() : 0;
+    if (last != 0 && total + bytes > maxBytes) break;
+    total += bytes;
+    last = row["id"].get<int64_t>();
+  }
+  return last;
 }
 
 }  // namespace
@@ -31,7 +43,7 @@ size_t PayloadBytes(const SXValue& row) {
 struct SXOtlpSpoolReader::Db {
   // Statements go before the connection they belong to.
   std::unique_ptr<SXSqliteConnection> connection;
-  SXSqliteStatement selectBatch, selectCursor, storeCursor, countBeyond;
+  SXSqliteStatement selectSizes, selectBatch, selectCursor, storeCursor, countBeyond;
 };
 
 SXOtlpSpoolReader::SXOtlpSpoolReader(std::string dbPath, std::chrono::milliseconds busyTimeout)
@@ -52,7 +64,8 @@ std::optional<std::string> SXOtlpSpoolReader::ensureOpen() {
   if (!connection) return error;
   db_ = std::make_unique<Db>();
   db_->connection = std::move(connection);
-  std::pair<const char*, SXSqliteStatement*> statements[] = {{kSelectBatch, &db_->selectBatch},
+  std::pair<const char*, SXSqliteStatement*> statements[] = {{kSelectSizes, &db_->selectSizes},
+                                                             {kSelectBatch, &db_->selectBatch},
                                                              {kSelectCursor, &db_->selectCursor},
                                                              {kStoreCursor, &db_->storeCursor},
                                                              {kCountBeyond, &db_->countBeyond}};
@@ -82,15 +95,13 @@ std::optional<std::string> SXOtlpSpoolReader::read(size_t limit, size_t maxBytes
   std::lock_guard lock(mutex_);
   if (auto failed = ensureOpen()) return failed;
   if (auto failed = persistCursor()) return failed;
-  std::vector<SXValue> batch;
-  if (auto failed = db_->selectBatch.query({cursor_, static_cast<int64_t>(limit)}, batch)) {
+  std::vector<SXValue> sizes;
+  if (auto failed = db_->selectSizes.query({cursor_, static_cast<int64_t>(limit)}, sizes)) {
     return fail(*failed);
   }
-  size_t bytes = 0;
-  for (SXValue& row : batch) {
-    if (!rows.empty() && bytes + PayloadBytes(row) > maxBytes) break;
-    bytes += PayloadBytes(row);
-    rows.push_back(std::move(row));
+  if (sizes.empty()) return std::nullopt;
+  if (auto failed = db_->selectBatch.query({cursor_, LastThatFits(sizes, maxBytes)}, rows)) {
+    return fail(*failed);
   }
   return std::nullopt;
 }
