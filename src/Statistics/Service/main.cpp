@@ -196,7 +196,22 @@ int parseOptions(int argc, char** argv, Options& options) {
   return 0;
 }
 
-SXPlatform productionPlatform(const Options& options, std::shared_ptr<SXLogFacility> log) {
+// The SQLite stores, kept by their own types so that status can read their write-error counts.
+struct Stores {
+  std::shared_ptr<SXSqliteTallyvane> tallyvane;
+  std::shared_ptr<SXSqliteJoulebook> joulebook;
+  std::shared_ptr<SXSqliteFernReporting> fernReporting;
+};
+
+Stores openStores(const SXPaths& p, const std::shared_ptr<SXLogFacility>& log) {
+  return {std::make_shared<SXSqliteTallyvane>(p.stateDir + "/tallyvane.db", log),
+          std::make_shared<SXSqliteJoulebook>(p.stateDir + "/joulebook.db", log),
+          std::make_shared<SXSqliteFernReporting>(p.stateDir + "/fernreporting.db",
+                                                  p.configDir + "/fernreporting.json", log)};
+}
+
+SXPlatform productionPlatform(const Options& options, const Stores& stores,
+                              std::shared_ptr<SXLogFacility> log) {
   const SXPaths& p = options.paths;
   SXPlatform platform;
   platform.log = log;
@@ -207,10 +222,9 @@ SXPlatform productionPlatform(const Options& options, std::shared_ptr<SXLogFacil
   platform.process = std::make_shared<SXProcProcessInfo>();
   platform.device = std::make_shared<SXJsonDeviceProperties>(p.configDir + "/device.json");
   platform.fileSystem = std::make_shared<SXPosixFileSystem>();
-  platform.tallyvane = std::make_shared<SXSqliteTallyvane>(p.stateDir + "/tallyvane.db", log);
-  platform.joulebook = std::make_shared<SXSqliteJoulebook>(p.stateDir + "/joulebook.db", log);
-  platform.fernReporting = std::make_shared<SXSqliteFernReporting>(
-      p.stateDir + "/fernreporting.db", p.configDir + "/fernreporting.json", log);
+  platform.tallyvane = stores.tallyvane;
+  platform.joulebook = stores.joulebook;
+  platform.fernReporting = stores.fernReporting;
   platform.kestrel = std::make_shared<SXFileKestrel>(p.kestrelRoot, log);
   platform.orientation = std::make_shared<SXNoSensorOrientationService>();
   platform.preferences = std::make_shared<SXJsonPreferences>(p.configDir, log);
@@ -251,10 +265,19 @@ int main(int argc, char** argv) {
     }
   }
 
-  auto environment =
-      std::make_shared<SXReportingEnvironment>(productionPlatform(options, log), options.limits);
+  Stores stores = openStores(options.paths, log);
+  auto environment = std::make_shared<SXReportingEnvironment>(
+      productionPlatform(options, stores, log), options.limits);
   auto delegate = SXReportingServiceDelegate::init(environment);
-  auto exporter = otlpExporter(options, environment->platform(), log);
+  std::shared_ptr<SXOtlpHttpExporter> exporter =
+      otlpExporter(options, environment->platform(), log);
+  delegate->setStatusProviders(
+      {.tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
+       .joulebookWriteErrors = [j = stores.joulebook] { return j->writeErrors(); },
+       .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
+       .spoolBacklog = exporter
+                           ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
+                           : std::function<uint64_t()>()});
 
   RpcLimits limits;
   limits.maxMessageBytes = options.maxMessageBytes;
