@@ -188,7 +188,7 @@ TEST_F(SqliteFernReportingTest, SessionsKeepTheSpoolAfterTheAdapterIsGone) {
 }
 
 TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
-  std::filesystem::create_directory(db_);
+  db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
   auto fern = Make();
   EXPECT_TRUE(log_->contains("cannot open"));
   EXPECT_EQ(fern->openSession(SessionInfo("t"), UserInfo("s"), {}), nullptr);
@@ -196,11 +196,11 @@ TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
   std::optional<FernError> error;
   EXPECT_FALSE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
   ASSERT_TRUE(error.has_value());
-  EXPECT_NE(error->localizedDescription.find("fernreporting.db"), std::string::npos)
+  EXPECT_NE(error->localizedDescription.find("store.db"), std::string::npos)
       << error->localizedDescription;
 
   // The store is opened again on the next call once it can be.
-  std::filesystem::remove(db_);
+  std::filesystem::create_directory(dir_.file("missing"));
   error.reset();
   EXPECT_TRUE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
   EXPECT_EQ(SXTestQuery(db_, "SELECT * FROM messages").size(), 1u);

@@ -63,7 +63,7 @@ TEST_F(SqliteJoulebookTest, ClosingWritesWhatIsQueuedAndReopeningKeepsIt) {
 }
 
 TEST_F(SqliteJoulebookTest, FailingStoresLogAndKeepWorking) {
-  std::filesystem::create_directory(db_);  // a directory where the file should be
+  db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
   SXSqliteJoulebook joulebook(db_, log_, 20ms);
   EXPECT_TRUE(log_->contains("cannot open"));
   joulebook.logRegisteredEvent(28, "lost", SXValue::object(), std::nullopt);
@@ -71,7 +71,7 @@ TEST_F(SqliteJoulebookTest, FailingStoresLogAndKeepWorking) {
   EXPECT_TRUE(log_->contains("dropped 1 power-log entries"));
 
   // Once the store can be opened, entries are written again.
-  std::filesystem::remove(db_);
+  std::filesystem::create_directory(dir_.file("missing"));
   joulebook.logRegisteredEvent(28, "kept", SXValue::object(), std::nullopt);
   joulebook.flush();
   {

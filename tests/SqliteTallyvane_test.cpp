@@ -148,7 +148,7 @@ TEST_F(SqliteTallyvaneTest, ReadEventsFiltersByNameAndKeepsTheNewest) {
 }
 
 TEST_F(SqliteTallyvaneTest, AStoreThatCannotBeOpenedLogsAndDropsEvents) {
-  std::filesystem::create_directory(db_);  // a directory where the file should be
+  db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
   SXSqliteTallyvane tallyvane(db_, log_);
   EXPECT_TRUE(log_->contains("cannot open"));
   EXPECT_TRUE(tallyvane.sendEventLazy("lost", Returning(1)));
