@@ -58,9 +58,11 @@ class SXReportingClient:
         self.timeout = timeout
         self._sock = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
         self._sock.connect(self.socket_path)
-        self._unpacker = msgpack.Unpacker(raw=False, strict_map_key=False)
+        self._unpacker = msgpack.Unpacker(raw=False, strict_map_key=False,
+                                          unicode_errors="replace")
         self._next_msgid = 0
-        self._early_replies = {}
+        self._early_replies = {}  # msgid -> (error, result) of replies not yet asked for
+        self._abandoned = set()  # msgids whose calls timed out: their late replies are dropped
 
     def close(self):
         self._sock.close()
@@ -86,18 +88,24 @@ class SXReportingClient:
         while msgid not in self._early_replies:
             left = deadline - time.monotonic()
             if left <= 0:
+                self._abandoned.add(msgid)
                 raise SXReportingTimeout(f"no reply within {timeout:g} s")
             self._sock.settimeout(left)
             try:
                 data = self._sock.recv(65536)
             except socket.timeout:
                 continue
+            except ConnectionError as e:
+                raise SXReportingConnectionLost(f"the connection ended: {e}") from e
             if not data:
                 raise SXReportingConnectionLost("the service closed the connection")
             self._unpacker.feed(data)
             for message in self._unpacker:
                 if isinstance(message, list) and len(message) == 4 and message[0] == RESPONSE:
-                    self._early_replies[message[1]] = (message[2], message[3])
+                    if message[1] in self._abandoned:
+                        self._abandoned.discard(message[1])
+                    else:
+                        self._early_replies[message[1]] = (message[2], message[3])
         return self._early_replies.pop(msgid)
 
     # --- The operations. Reporter IDs are signed 64-bit; service types 0..65535.

@@ -73,7 +73,7 @@ void sxr_client_close(sxr_client* client);
 
 /* Why the calling thread's last call on `client` did not return SXR_OK; "" after a call that
  * did. The text stays valid until this thread's next call on the client, or its close. With a
- * NULL client: the text for a failed allocation in sxr_client_connect. */
+ * NULL client: why sxr_client_connect could not make a client. */
 const char* sxr_client_last_error(const sxr_client* client);
 
 /* The socket path the client connects to (the default resolved). */

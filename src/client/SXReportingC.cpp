@@ -28,6 +28,7 @@ namespace {
 constexpr int kMaxJsonDepth = 32;
 
 const char kOutOfMemory[] = "out of memory";
+const char kNoClient[] = "no client (memory or threads ran out)";
 
 std::string* errorSlot(sxr_client* c) {
   std::lock_guard<std::mutex> lock(c->mutex);
@@ -172,7 +173,7 @@ void sxr_client_close(sxr_client* client) {
 }
 
 const char* sxr_client_last_error(const sxr_client* client) {
-  if (client == nullptr) return kOutOfMemory;
+  if (client == nullptr) return kNoClient;
   try {
     return errorSlot(const_cast<sxr_client*>(client))->c_str();
   } catch (...) {
