@@ -41,8 +41,8 @@ def median(results, *path):
     return statistics.median(values) if values else None
 
 
-def fmt(value, spec):
-    return "-" if value is None else format(value, spec)
+def fmt(value, pattern):
+    return "-" if value is None else format(value, pattern)
 
 
 def missing(results):

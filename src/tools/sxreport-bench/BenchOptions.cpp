@@ -68,9 +68,9 @@ bool parseSeconds(const char* text, double& out) {
 }
 
 bool parseScenarios(const std::string& text, std::vector<ScenarioKind>& out) {
-  const std::vector<ScenarioKind> all = {ScenarioKind::kAddressed, ScenarioKind::kBroadcast,
+  const std::vector<ScenarioKind> all = {ScenarioKind::kAddressed,  ScenarioKind::kBroadcast,
                                          ScenarioKind::kStandalone, ScenarioKind::kLifecycle,
-                                         ScenarioKind::kRpc,       ScenarioKind::kIdle};
+                                         ScenarioKind::kRpc,        ScenarioKind::kIdle};
   out.clear();
   std::stringstream list(text);
   std::string name;

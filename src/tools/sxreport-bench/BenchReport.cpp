@@ -42,10 +42,10 @@ SXValue rowsJson(const TargetFigures& figures) {
                    {"found", found},
                    {"missing", expected > found ? expected - found : 0}};
   };
-  return {{"tallyvane", store(figures.expectedRows.tallyvane, figures.foundRows.tallyvane)},
-          {"fernreporting",
-           store(figures.expectedRows.fernReporting, figures.foundRows.fernReporting)},
-          {"drainSeconds", rounded(figures.drainSeconds)}};
+  return {
+      {"tallyvane", store(figures.expectedRows.tallyvane, figures.foundRows.tallyvane)},
+      {"fernreporting", store(figures.expectedRows.fernReporting, figures.foundRows.fernReporting)},
+      {"drainSeconds", rounded(figures.drainSeconds)}};
 }
 
 SXValue idleJson(const TargetFigures& figures) {
@@ -61,7 +61,8 @@ SXValue idleJson(const TargetFigures& figures) {
   if (figures.idleRssKiB && figures.rssWithSessionsKiB) {
     long added = *figures.rssWithSessionsKiB - *figures.idleRssKiB;
     json["addedKiB"] = added;
-    if (figures.sessions > 0) json["addedKiBPerSession"] = rounded(double(added) / figures.sessions);
+    if (figures.sessions > 0)
+      json["addedKiBPerSession"] = rounded(double(added) / figures.sessions);
   }
   return json;
 }
@@ -97,8 +98,9 @@ SXValue ratioJson(const TargetFigures& daemon, const TargetFigures& baseline) {
   double baselineRate = perSecond(baseline.messages, baseline.seconds);
   double daemonP99 = static_cast<double>(daemon.latency.percentileNanoseconds(0.99));
   double baselineP99 = static_cast<double>(baseline.latency.percentileNanoseconds(0.99));
-  return {{"throughput", baselineRate > 0 ? SXValue(rounded(daemonRate / baselineRate)) : SXValue()},
-          {"p99", baselineP99 > 0 ? SXValue(rounded(daemonP99 / baselineP99)) : SXValue()}};
+  return {
+      {"throughput", baselineRate > 0 ? SXValue(rounded(daemonRate / baselineRate)) : SXValue()},
+      {"p99", baselineP99 > 0 ? SXValue(rounded(daemonP99 / baselineP99)) : SXValue()}};
 }
 
 std::string optionalText(const std::optional<double>& value, const char* format) {
@@ -164,13 +166,14 @@ std::string idleText(const TargetFigures& figures) {
 }
 
 std::string figuresText(const TargetFigures& daemon, const TargetFigures* baseline) {
-  auto both = [&](const std::string& label, const std::function<std::string(const TargetFigures&)>& f) {
+  auto both = [&](const std::string& label,
+                  const std::function<std::string(const TargetFigures&)>& f) {
     return row(label, f(daemon), baseline ? f(*baseline) : "");
   };
   auto latency = [](double fraction) {
     return [fraction](const TargetFigures& f) {
-      uint64_t ns = fraction > 1 ? f.latency.maxNanoseconds()
-                                 : f.latency.percentileNanoseconds(fraction);
+      uint64_t ns =
+          fraction > 1 ? f.latency.maxNanoseconds() : f.latency.percentileNanoseconds(fraction);
       return SXFormat("%.1f us", micros(ns));
     };
   };
@@ -200,8 +203,11 @@ std::string figuresText(const TargetFigures& daemon, const TargetFigures* baseli
   if (baseline && baseline->seconds > 0 && daemon.seconds > 0) {
     SXValue ratio = ratioJson(daemon, *baseline);
     text += row("daemon / baseline", "", "");
-    text += row("  throughput", ratio["throughput"].is_null() ? "-" : SXFormat("%.3f", ratio["throughput"].get<double>()));
-    text += row("  p99 latency", ratio["p99"].is_null() ? "-" : SXFormat("%.2f", ratio["p99"].get<double>()));
+    text += row("  throughput", ratio["throughput"].is_null()
+                                    ? "-"
+                                    : SXFormat("%.3f", ratio["throughput"].get<double>()));
+    text += row("  p99 latency",
+                ratio["p99"].is_null() ? "-" : SXFormat("%.2f", ratio["p99"].get<double>()));
   }
   return text;
 }
@@ -211,8 +217,7 @@ std::string figuresText(const TargetFigures& daemon, const TargetFigures* baseli
 std::string ScenarioResultText(const ScenarioResult& result, const BenchOptions& options) {
   std::string text = SXFormat(
       "%s: %llu clients x %llu messages, window %llu, %llu session(s) per client%s\n",
-      ScenarioName(result.kind), options.clients, options.messages, result.window,
-      options.sessions,
+      ScenarioName(result.kind), options.clients, options.messages, result.window, options.sessions,
       options.stopEvery ? SXFormat(", stop every %llu", options.stopEvery) : std::string());
   if (result.kind == ScenarioKind::kIdle) {
     text += idleText(result.daemon);

@@ -35,8 +35,8 @@ std::optional<long> rssKiB(const BenchTarget& target, pid_t pid, const char* fie
 std::optional<std::string> connectPool(ClientPool& pool, const BenchScenario& scenario,
                                        const BenchOptions& options, const BenchTarget& target,
                                        pid_t& pid) {
-  if (auto failed =
-          pool.connect(target.socketPath, options.clients, scenario.window(), target.checkResults)) {
+  if (auto failed = pool.connect(target.socketPath, options.clients, scenario.window(),
+                                 target.checkResults)) {
     return failed;
   }
   pid = target.pid > 0 ? target.pid : pool.peerPid();
@@ -75,7 +75,8 @@ void checkRows(const StoreRows& rows, const BenchOptions& options, TargetFigures
   std::string error;
   auto drainStart = Clock::now();
   figures.rowsCounted = true;
-  figures.foundRows = rows.waitFor(figures.expectedRows, millis(options.drainTimeoutSeconds), error);
+  figures.foundRows =
+      rows.waitFor(figures.expectedRows, millis(options.drainTimeoutSeconds), error);
   figures.drainSeconds = secondsSince(drainStart);
   if (!error.empty()) figures.errors.push_back("cannot count the rows: " + error);
   auto missing = [&](const char* store, int64_t expected, int64_t found) {

@@ -17,10 +17,10 @@
 #include "StoreRows.h"
 
 struct BenchTarget {
-  std::string name;        // "daemon" or "baseline"
+  std::string name;  // "daemon" or "baseline"
   std::string socketPath;
-  std::string stateDir;    // the daemon's stores; empty: rows are not counted
-  pid_t pid = -1;          // the process measured; -1: the one at the other end of the socket
+  std::string stateDir;  // the daemon's stores; empty: rows are not counted
+  pid_t pid = -1;        // the process measured; -1: the one at the other end of the socket
   // The baseline serves inside the benchmark's own process: its CPU is this reading, and it
   // has no RSS of its own.
   std::function<std::optional<double>()> inProcessCpuSeconds;
@@ -35,7 +35,7 @@ struct TargetFigures {
   LatencyHistogram latency;
   std::optional<double> cpuSeconds;  // from the measure phase to the end of the drain
   std::optional<long> peakRssKiB;
-  std::optional<long> rssKiB;  // at the end
+  std::optional<long> rssKiB;                         // at the end
   std::vector<std::pair<uint64_t, long>> rssSamples;  // (messages replied, KiB)
   bool rowsCounted = false;
   StoreCounts expectedRows;

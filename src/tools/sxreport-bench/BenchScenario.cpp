@@ -63,8 +63,8 @@ void packStep(const Step& step, BenchRequest& request, const std::string& runID,
     case Op::kStop:
     case Op::kDestroy:
     case Op::kValid: {
-      static const std::string* const kMethods[] = {&kCreate, nullptr, nullptr, &kStart, nullptr,
-                                                    nullptr, &kStop,  &kDestroy, &kValid};
+      static const std::string* const kMethods[] = {&kCreate, nullptr, nullptr,   &kStart, nullptr,
+                                                    nullptr,  &kStop,  &kDestroy, &kValid};
       request.method = kMethods[static_cast<int>(step.op)];
       packer.pack_array(1);
       packer.pack_int64(step.id);

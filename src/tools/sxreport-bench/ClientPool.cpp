@@ -70,9 +70,10 @@ uint64_t ClientPool::measuredReplies() const {
   return total;
 }
 
-std::optional<std::string> ClientPool::runPhase(
-    const std::function<RequestSource(size_t)>& sources, bool awaitAll,
-    std::chrono::milliseconds replyTimeout, const std::function<void()>& tick) {
+std::optional<std::string> ClientPool::runPhase(const std::function<RequestSource(size_t)>& sources,
+                                                bool awaitAll,
+                                                std::chrono::milliseconds replyTimeout,
+                                                const std::function<void()>& tick) {
   auto latch = std::make_shared<Latch>(clients_.size());
   for (size_t i = 0; i < clients_.size(); ++i) {
     asio::post(io_, [client = clients_[i].get(), source = sources(i), awaitAll, latch]() mutable {

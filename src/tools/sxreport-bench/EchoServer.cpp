@@ -98,8 +98,7 @@ bool EchoServer::start(const std::string& socketPath, std::string& error) {
 std::optional<double> EchoServer::cpuSeconds() const {
   clockid_t clock;
   timespec used{};
-  if (!thread_.joinable() ||
-      ::pthread_getcpuclockid(nativeThread_, &clock) != 0 ||
+  if (!thread_.joinable() || ::pthread_getcpuclockid(nativeThread_, &clock) != 0 ||
       ::clock_gettime(clock, &used) != 0) {
     return std::nullopt;
   }
@@ -114,10 +113,10 @@ void EchoServer::stop() {
 }
 
 void EchoServer::accept() {
-  acceptor_.async_accept([this](const asio::error_code& ec,
-                                asio::local::stream_protocol::socket socket) {
-    if (ec) return;
-    std::make_shared<Connection>(std::move(socket))->readSome();
-    accept();
-  });
+  acceptor_.async_accept(
+      [this](const asio::error_code& ec, asio::local::stream_protocol::socket socket) {
+        if (ec) return;
+        std::make_shared<Connection>(std::move(socket))->readSome();
+        accept();
+      });
 }

@@ -45,8 +45,7 @@ pid_t PipelinedRpcClient::peerPid() {
   return credentials.pid;
 }
 
-void PipelinedRpcClient::runPhase(RequestSource source, bool awaitAll,
-                                  std::function<void()> done) {
+void PipelinedRpcClient::runPhase(RequestSource source, bool awaitAll, std::function<void()> done) {
   source_ = std::move(source);
   awaitAll_ = awaitAll;
   done_ = std::move(done);
@@ -164,16 +163,15 @@ void PipelinedRpcClient::flush() {
   writing_.swap(out_.bytes);
   out_.bytes.clear();
   writeActive_ = true;
-  asio::async_write(socket_, asio::buffer(writing_),
-                    [this](const asio::error_code& ec, size_t) {
-                      writeActive_ = false;
-                      writing_.clear();
-                      if (ec) {
-                        if (ec != asio::error::operation_aborted) fail(ec.message());
-                        return;
-                      }
-                      pump();
-                    });
+  asio::async_write(socket_, asio::buffer(writing_), [this](const asio::error_code& ec, size_t) {
+    writeActive_ = false;
+    writing_.clear();
+    if (ec) {
+      if (ec != asio::error::operation_aborted) fail(ec.message());
+      return;
+    }
+    pump();
+  });
 }
 
 void PipelinedRpcClient::checkDone() {

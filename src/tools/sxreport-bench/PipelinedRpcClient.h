@@ -33,9 +33,9 @@ enum class BenchExpect { kAnything, kNil, kTrue };
 
 struct BenchRequest {
   const std::string* method = nullptr;
-  ByteSink params;         // the packed params array
-  bool windowed = true;    // counts against the window; false for a reply held until later
-  bool measured = false;   // its latency and count go into the figures
+  ByteSink params;        // the packed params array
+  bool windowed = true;   // counts against the window; false for a reply held until later
+  bool measured = false;  // its latency and count go into the figures
   BenchExpect expect = BenchExpect::kAnything;
 };
 

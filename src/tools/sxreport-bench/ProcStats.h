@@ -1,5 +1,5 @@
-// What /proc says about a process: CPU time used and resident memory. Each call reads the file afresh; on failure (the process is gone, /proc is not
-// readable) it returns nothing.
+// What /proc says about a process: CPU time used and resident memory. Each call reads the file
+// afresh; on failure (the process is gone, /proc is not readable) it returns nothing.
 #pragma once
 
 #include <sys/types.h>

@@ -45,9 +45,9 @@ bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory, std
     std::filesystem::create_directories(dir_ + "/" + sub);
   }
   socket_ = dir_ + "/run/sxr.sock";
-  std::vector<std::string> args = {daemonPath,      "--socket",       socket_,
-                                   "--state-dir",   dir_ + "/lib",    "--config-dir",
-                                   dir_ + "/etc",   "--runtime-dir",  dir_ + "/run",
+  std::vector<std::string> args = {daemonPath,       "--socket",        socket_,
+                                   "--state-dir",    dir_ + "/lib",     "--config-dir",
+                                   dir_ + "/etc",    "--runtime-dir",   dir_ + "/run",
                                    "--kestrel-root", dir_ + "/kestrel", "--diagnostic-logs-dir",
                                    dir_ + "/diag"};
   std::string logPath = dir_ + "/daemon.log";

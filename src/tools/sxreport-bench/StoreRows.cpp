@@ -30,8 +30,8 @@ std::optional<std::string> StoreRows::query(const std::string& db, const std::st
 }
 
 std::optional<std::string> StoreRows::mark() {
-  if (auto failed = query("tallyvane.db", "SELECT coalesce(max(id), 0) AS n FROM events",
-                          mark_.tallyvane)) {
+  if (auto failed =
+          query("tallyvane.db", "SELECT coalesce(max(id), 0) AS n FROM events", mark_.tallyvane)) {
     return failed;
   }
   return query("fernreporting.db", "SELECT coalesce(max(id), 0) AS n FROM messages",
@@ -43,10 +43,9 @@ std::optional<std::string> StoreRows::count(StoreCounts& counts) const {
   std::string events = "SELECT count(*) AS n FROM events WHERE id > " +
                        std::to_string(mark_.tallyvane) + " AND name = '" + eventName_ + "'";
   if (auto failed = query("tallyvane.db", events, counts.tallyvane)) return failed;
-  std::string messages = "SELECT count(*) AS n FROM messages WHERE id > " +
-                         std::to_string(mark_.fernReporting) +
-                         " AND category = " + std::to_string(category_) +
-                         " AND type = " + std::to_string(type_);
+  std::string messages =
+      "SELECT count(*) AS n FROM messages WHERE id > " + std::to_string(mark_.fernReporting) +
+      " AND category = " + std::to_string(category_) + " AND type = " + std::to_string(type_);
   return query("fernreporting.db", messages, counts.fernReporting);
 }
 
@@ -72,7 +71,7 @@ StoreCounts StoreRows::waitFor(const StoreCounts& expected, std::chrono::millise
     // Counting a large store is work the daemon's disk and CPU feel, so poll no more than a
     // fifth of the time.
     auto took = std::chrono::steady_clock::now() - started;
-    std::this_thread::sleep_for(std::max<std::chrono::steady_clock::duration>(
-        std::chrono::milliseconds(50), 4 * took));
+    std::this_thread::sleep_for(
+        std::max<std::chrono::steady_clock::duration>(std::chrono::milliseconds(50), 4 * took));
   }
 }
