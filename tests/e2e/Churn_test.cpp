@@ -23,16 +23,6 @@ using namespace std::chrono_literals;
 constexpr int kClients = 1000;
 constexpr int kBatch = 50;  // clients alive at once: half processes, half raw sockets
 
-// The daemon's resident set, in KiB.
-long residentKiB(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
-}
-
 // A client speaking the wire protocol itself, so that it can leave in the middle of things.
 class RawClient {
  public:

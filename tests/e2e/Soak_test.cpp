@@ -21,15 +21,6 @@ double soakSeconds() {
   return seconds > 0 ? seconds : 30;
 }
 
-long residentKiB(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
-}
-
 SXValue payloadOf(int64_t sequence) {
   return {{"seq", sequence},
           {"client", sequence % kClients},

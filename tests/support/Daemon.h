@@ -67,6 +67,9 @@ class TestDaemon {
 };
 
 // Polls `ready` until it holds or `timeout` passes.
+// A process's resident set in KiB (VmRSS), or -1 when it cannot be read.
+long residentKiB(pid_t pid);
+
 bool waitUntil(const std::function<bool()>& ready,
                std::chrono::milliseconds timeout = std::chrono::seconds(15));
 
