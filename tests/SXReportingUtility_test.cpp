@@ -39,6 +39,19 @@ TEST(SXReportingUtilityNames, MessageTypes) {
   EXPECT_EQ(SXReportingUtilityTypeName(65535), "Unknown");
 }
 
+TEST(SXReportingUtilityNames, MessageKindsStayRightBeyondTheCache) {
+  EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
+  EXPECT_EQ(SXReportingUtilityMessageKind(0xFFFFFFFF, 65535), "Undefined_Unknown");
+  // Far more pairs than the cache keeps: every answer is still built right.
+  for (uint32_t round = 0; round < 2; ++round) {
+    for (uint32_t category = 0; category < 600; ++category) {
+      ASSERT_EQ(SXReportingUtilityMessageKind(category, 2),
+                SXReportingUtilityCategoryName(category) + "_Stop");
+    }
+  }
+  EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
+}
+
 TEST(SXReportingUtilityNames, HostApplicationName) {
   SXValue config = {{"HostApplicationDisplayID", "player"}};
   EXPECT_EQ(SXReportingUtilityHostApplicationName(&config), "player");

@@ -155,6 +155,45 @@ TEST_F(SqliteFernReportingTest, SendsAreCommittedWhenTheyReturn) {
   EXPECT_EQ(rows[1]["type"], 7);
 }
 
+TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommittedOnReturn) {
+  auto fern = Make();
+  constexpr int kSessions = 6;
+  constexpr int kPerSession = 150;
+  std::vector<std::shared_ptr<FernReportingSession>> sessions;
+  for (int i = 0; i < kSessions; ++i) {
+    sessions.push_back(fern->openSession(SessionInfo("t"), UserInfo("s"), {}));
+    ASSERT_NE(sessions.back(), nullptr);
+  }
+  std::atomic<int> failures{0};
+  std::vector<std::thread> senders;
+  for (int s = 0; s < kSessions; ++s) {
+    senders.emplace_back([&, s] {
+      std::optional<FernError> error;
+      for (int i = 0; i < kPerSession; ++i) {
+        if (!sessions[s]->sendMessage(uint16_t(s), 1, {{"i", i}}, error)) ++failures;
+        // Acknowledged means committed: another connection sees the row at once.
+        if (i % 50 == 49) {
+          auto rows = SXTestQuery(
+              db_, "SELECT COUNT(*) AS n FROM messages WHERE category = " + std::to_string(s));
+          if (rows.empty() || rows[0]["n"] != i + 1) ++failures;
+        }
+      }
+    });
+  }
+  for (auto& sender : senders) sender.join();
+  EXPECT_EQ(failures, 0);
+  // Each session's rows are stored in the order it sent them.
+  for (int s = 0; s < kSessions; ++s) {
+    auto rows =
+        SXTestQuery(db_, "SELECT payload_json FROM messages WHERE category = " + std::to_string(s) +
+                             " ORDER BY id");
+    ASSERT_EQ(rows.size(), size_t{kPerSession});
+    for (int i = 0; i < kPerSession; ++i) {
+      EXPECT_EQ(rows[i]["payload_json"], "{\"i\":" + std::to_string(i) + "}");
+    }
+  }
+}
+
 TEST_F(SqliteFernReportingTest, FlushIsRecordedAfterItsMessagesAndCompletesElsewhere) {
   auto fern = Make();
   auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});

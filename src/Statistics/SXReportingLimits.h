@@ -18,6 +18,12 @@ struct SXReportingLimits {
   // Standalone sends of one client waiting for their delay (alarms wait up to 59 s). Beyond
   // it a send goes out at once, without its delay.
   uint64_t maxPendingStandalone = 1024;
+  // Requests of one connection read but not yet handled; beyond it the daemon stops reading
+  // that connection until the server queue catches up (back-pressure, nothing is dropped).
+  uint64_t maxQueuedRequests = 1024;
+  // Reply bytes of one connection waiting to be written; beyond it the daemon stops reading
+  // that connection, so a client that never reads its replies cannot grow the daemon.
+  uint64_t maxPendingReplyBytes = 4 << 20;
 };
 
 // One client's count of standalone sends waiting for their delay.

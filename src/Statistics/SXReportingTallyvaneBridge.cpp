@@ -16,6 +16,7 @@ void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment
   // The provider may run later on another thread, so it owns its own copy.
   auto copy = std::make_shared<SXValue>(payload.is_object() ? payload : SXValue::object());
   (*copy)["HostApplicationDisplayID"] = session.hostApplicationName();
-  environment.platform().tallyvane->sendEventLazy(eventName(category, type),
-                                                  [copy] { return *copy; });
+  thread_local SXReportingPairNameCache names;
+  const std::string& name = names.get(category, type, [&] { return eventName(category, type); });
+  environment.platform().tallyvane->sendEventLazy(name, [copy] { return *copy; });
 }

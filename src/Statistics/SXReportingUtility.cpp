@@ -74,6 +74,14 @@ const std::string& SXReportingUtilityTypeName(SXReportingMessageType type) {
   return type == 0xFFFF ? kUnknown : kUndefined;
 }
 
+const std::string& SXReportingUtilityMessageKind(SXReportingCategory category,
+                                                 SXReportingMessageType type) {
+  thread_local SXReportingPairNameCache cache;
+  return cache.get(category, type, [&] {
+    return SXReportingUtilityCategoryName(category) + "_" + SXReportingUtilityTypeName(type);
+  });
+}
+
 SXValue SXReportingUtilityHostApplicationName(const SXValue* configuration) {
   if (configuration && configuration->is_object()) {
     auto it = configuration->find("HostApplicationDisplayID");

@@ -114,3 +114,4 @@ void SXPackValue(msgpack::packer<Stream>& p, const SXValue& v) {
 }
 
 template void SXPackValue(msgpack::packer<msgpack::sbuffer>&, const SXValue&);
+template void SXPackValue(msgpack::packer<SXStringSink>&, const SXValue&);

@@ -3,6 +3,7 @@
 
 #include <msgpack.hpp>
 #include <stdexcept>
+#include <string>
 
 #include "sxreporting/types.h"
 
@@ -17,8 +18,16 @@ class SXValueConversionError : public std::runtime_error {
 // values (ext keeps its type as subtype); float32 widens to double.
 SXValue SXValueFromMsgpack(const msgpack::object& object, int maxDepth = 32);
 
+// A packer stream that appends to a string, so that encoded replies can go straight into a
+// connection's output without an intermediate buffer.
+struct SXStringSink {
+  std::string* out;
+  void write(const char* data, size_t size) { out->append(data, size); }
+};
+
 // Packs a value. Binary values pack as bin (or ext when they carry a subtype).
 template <typename Stream>
 void SXPackValue(msgpack::packer<Stream>& packer, const SXValue& value);
 
 extern template void SXPackValue(msgpack::packer<msgpack::sbuffer>&, const SXValue&);
+extern template void SXPackValue(msgpack::packer<SXStringSink>&, const SXValue&);

@@ -30,10 +30,11 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
         error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
         return Status::kBroken;
       }
-      msgpack::object_handle handle(unpacker_.data(),
-                                    msgpack::unique_ptr<msgpack::zone>(unpacker_.release_zone()));
+      // Converted in place: the unpacker keeps its zone (strings are copied into it, never
+      // referenced from the buffer) and reuses it, instead of a fresh zone per message.
+      message = SXValueFromMsgpack(unpacker_.data(), limits_.maxPayloadDepth + kEnvelopeDepth);
+      unpacker_.reset_zone();
       unpacker_.reset();
-      message = SXValueFromMsgpack(handle.get(), limits_.maxPayloadDepth + kEnvelopeDepth);
       return Status::kMessage;
     }
     if (unpacker_.parsed_size() + unpacker_.nonparsed_size() > limits_.maxMessageBytes) {
@@ -100,12 +101,25 @@ void RpcEncodeRequest(msgpack::sbuffer& out, uint32_t msgid, std::string_view me
   }
 }
 
-void RpcEncodeResponse(msgpack::sbuffer& out, uint32_t msgid, const SXValue& error,
-                       const SXValue& result) {
-  msgpack::packer<msgpack::sbuffer> p(out);
+namespace {
+template <typename Stream>
+void encodeResponse(Stream& out, uint32_t msgid, const SXValue& error, const SXValue& result) {
+  msgpack::packer<Stream> p(out);
   p.pack_array(4);
   p.pack_uint32(1);
   p.pack_uint32(msgid);
   SXPackValue(p, error);
   SXPackValue(p, result);
+}
+}  // namespace
+
+void RpcEncodeResponse(msgpack::sbuffer& out, uint32_t msgid, const SXValue& error,
+                       const SXValue& result) {
+  encodeResponse(out, msgid, error, result);
+}
+
+void RpcEncodeResponse(std::string& out, uint32_t msgid, const SXValue& error,
+                       const SXValue& result) {
+  SXStringSink sink{&out};
+  encodeResponse(sink, msgid, error, result);
 }

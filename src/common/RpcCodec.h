@@ -61,3 +61,6 @@ void RpcEncodeRequest(msgpack::sbuffer& out, uint32_t msgid, std::string_view me
                       const SXValue& params);
 void RpcEncodeResponse(msgpack::sbuffer& out, uint32_t msgid, const SXValue& error,
                        const SXValue& result);
+// Appends the response to `out`.
+void RpcEncodeResponse(std::string& out, uint32_t msgid, const SXValue& error,
+                       const SXValue& result);

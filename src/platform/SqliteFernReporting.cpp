@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <condition_variable>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -41,6 +42,11 @@ const std::vector<std::string> kDefaultBackends = {"spool"};
 
 // The connection, its statements and the completion thread, shared by the adapter and the
 // sessions it opened.
+//
+// Rows are group-committed: a caller queues its row and either waits while another caller
+// commits, or becomes that committer itself and writes everything queued so far (its own row
+// and those of other sessions' threads) in one transaction. Each caller returns only once the
+// transaction holding its row has committed or failed.
 class SXSqliteFernReporting::Spool {
  public:
   Spool(std::string path, std::vector<std::string> backends, std::shared_ptr<SXLogFacility> log,
@@ -53,24 +59,27 @@ class SXSqliteFernReporting::Spool {
 
   // Stores one row; sets `rowId` to its id. On failure returns why.
   std::optional<std::string> insert(Kind kind, const SXSqliteRow& row, int64_t* rowId = nullptr) {
-    std::lock_guard lock(mutex_);
-    std::string error;
-    if (!ensureOpen(error)) {
-      ++writeErrors_;
-      return error;
-    }
-    if (auto failed = insert_[kind].run(row)) {
-      ++writeErrors_;
-      close();  // the next call starts on a fresh connection
-      return path_ + ": " + *failed;
-    }
-    if (rowId) *rowId = db_->lastInsertRowId();
-    return std::nullopt;
+    PendingRow mine{kind, &row, rowId, std::nullopt, false};
+    std::unique_lock lock(mutex_);
+    queued_.push_back(&mine);
+    idle_.wait(lock, [&] { return mine.done || !busy_; });
+    if (mine.done) return mine.result;
+    busy_ = true;
+    std::vector<PendingRow*> batch;
+    batch.swap(queued_);
+    lock.unlock();
+    commitBatch(batch);
+    lock.lock();
+    for (PendingRow* pending : batch) pending->done = true;
+    busy_ = false;
+    lock.unlock();
+    idle_.notify_all();
+    return mine.result;
   }
 
   // Copies the WAL into the database; SQLite syncs the WAL before it does.
   std::optional<std::string> checkpoint() {
-    std::lock_guard lock(mutex_);
+    Exclusive exclusive(*this);
     std::string error;
     if (!ensureOpen(error)) return error;
     if (auto failed = db_->exec("PRAGMA wal_checkpoint(PASSIVE)")) return path_ + ": " + *failed;
@@ -82,7 +91,7 @@ class SXSqliteFernReporting::Spool {
   uint64_t writeErrors() const { return writeErrors_.load(); }
   const std::shared_ptr<SXLogFacility>& log() const { return log_; }
 
-  // REQUIRES: mutex_ held, or no other thread knows this spool yet.
+  // REQUIRES: the connection is ours (busy_ set by us), or no other thread knows this spool.
   bool ensureOpen(std::string& error) {
     if (db_) return true;
     std::string recovered;
@@ -98,7 +107,71 @@ class SXSqliteFernReporting::Spool {
   }
 
  private:
-  // REQUIRES: mutex_ held. Statements go before the connection they belong to.
+  // One caller's row, on that caller's stack while it waits.
+  struct PendingRow {
+    Kind kind;
+    const SXSqliteRow* row;
+    int64_t* rowId;
+    std::optional<std::string> result;  // written by the committer before `done`
+    bool done = false;                  // guarded by mutex_
+  };
+
+  // Holds the connection for one caller that is not committing rows.
+  class Exclusive {
+   public:
+    explicit Exclusive(Spool& spool) : spool_(spool) {
+      std::unique_lock lock(spool_.mutex_);
+      spool_.idle_.wait(lock, [&] { return !spool_.busy_; });
+      spool_.busy_ = true;
+    }
+    ~Exclusive() {
+      {
+        std::lock_guard lock(spool_.mutex_);
+        spool_.busy_ = false;
+      }
+      spool_.idle_.notify_all();
+    }
+
+   private:
+    Spool& spool_;
+  };
+
+  // REQUIRES: busy_ set by this thread. Writes `batch` in one transaction; every row gets the
+  // transaction's outcome.
+  void commitBatch(const std::vector<PendingRow*>& batch) {
+    std::string error;
+    std::optional<std::string> failed;
+    if (!ensureOpen(error)) {
+      failed = error;
+    } else {
+      failed = writeRows(batch);
+      if (failed) {
+        if (batch.size() > 1) db_->exec("ROLLBACK");
+        close();  // the next batch starts on a fresh connection
+        failed = path_ + ": " + *failed;
+      }
+    }
+    if (failed) writeErrors_ += batch.size();
+    for (PendingRow* pending : batch) pending->result = failed;
+  }
+
+  // REQUIRES: busy_ set by this thread and the connection open.
+  std::optional<std::string> writeRows(const std::vector<PendingRow*>& batch) {
+    if (batch.size() == 1) return writeRow(*batch.front());  // its own transaction
+    if (auto failed = db_->exec("BEGIN IMMEDIATE")) return failed;
+    for (PendingRow* pending : batch) {
+      if (auto failed = writeRow(*pending)) return failed;
+    }
+    return db_->exec("COMMIT");
+  }
+
+  std::optional<std::string> writeRow(PendingRow& pending) {
+    if (auto failed = insert_[pending.kind].run(*pending.row)) return failed;
+    if (pending.rowId) *pending.rowId = db_->lastInsertRowId();
+    return std::nullopt;
+  }
+
+  // REQUIRES: busy_ set by this thread. Statements go before the connection they belong to.
   void close() {
     for (auto& statement : insert_) statement = SXSqliteStatement();
     db_.reset();
@@ -109,10 +182,14 @@ class SXSqliteFernReporting::Spool {
   const std::shared_ptr<SXLogFacility> log_;
   const std::chrono::milliseconds busyTimeout_;
   std::mutex mutex_;
-  std::unique_ptr<SXSqliteConnection> db_;  // guarded by mutex_
-  SXSqliteStatement insert_[kKinds];        // guarded by mutex_
-  std::atomic<uint64_t> writeErrors_{0};    // rows not stored; any thread reads
-  SXCompletionThread completions_;          // declared last: joined before the rest goes
+  std::condition_variable idle_;     // busy_ cleared or rows done; guarded by mutex_
+  std::vector<PendingRow*> queued_;  // guarded by mutex_: rows waiting for a transaction
+  bool busy_ = false;                // guarded by mutex_: a thread owns the connection
+  // Owned by the thread that set busy_ (or the constructor, before the spool is shared).
+  std::unique_ptr<SXSqliteConnection> db_;
+  SXSqliteStatement insert_[kKinds];
+  std::atomic<uint64_t> writeErrors_{0};  // rows not stored; any thread reads
+  SXCompletionThread completions_;        // declared last: joined before the rest goes
 };
 
 class SXSqliteFernReporting::Session final : public FernReportingSession {

@@ -18,9 +18,11 @@
 // never on the caller's, in the order they were asked for. Sends are stored synchronously: a
 // send that returns true is committed (WAL, synchronous=NORMAL: it survives a crash of this
 // process; a flush checkpoints the WAL, which makes everything before it survive a power loss
-// too). On failure a send returns false with a FernError saying why, openSession() returns
-// nullptr after an error line on the default log of `log`, and a flush completes with an
-// error. A store that cannot be opened is opened again at the next call; a store file that is
+// too). Rows that several threads store at once are group-committed: one transaction holds
+// them all, and each caller returns once it has committed (a failed transaction fails every
+// row in it). On failure a send returns false with a FernError saying why, openSession()
+// returns nullptr after an error line on the default log of `log`, and a flush completes with
+// an error. A store that cannot be opened is opened again at the next call; a store file that is
 // no usable database is moved aside and a new one created, with an error line.
 //
 // Sessions share the spool: it stays open, and completions keep coming, while any session

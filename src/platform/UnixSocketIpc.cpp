@@ -15,9 +15,16 @@
 class SXUnixSocketConnection final : public SXIpcConnection,
                                      public std::enable_shared_from_this<SXUnixSocketConnection> {
  public:
-  SXUnixSocketConnection(asio::local::stream_protocol::socket socket, RpcLimits limits,
+  SXUnixSocketConnection(asio::local::stream_protocol::socket socket,
+                         const SXUnixSocketListener::Options& options,
                          SXUnixSocketListener& listener, std::shared_ptr<SXLogFacility> log)
-      : socket_(std::move(socket)), decoder_(limits), listener_(listener), log_(std::move(log)) {
+      : socket_(std::move(socket)),
+        decoder_(options.limits),
+        maxQueuedRequests_(options.maxQueuedRequests),
+        maxPendingReplyBytes_(options.maxPendingReplyBytes),
+        requestQueue_(options.requestQueue),
+        listener_(listener),
+        log_(std::move(log)) {
     struct ucred cred {};
     socklen_t len = sizeof cred;
     if (::getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &cred, &len) == 0) {
@@ -41,15 +48,16 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   }
   void resume() override { read(); }
 
-  // Any thread.
+  // Any thread. Encodes straight into the pending output; the I/O thread writes whatever has
+  // gathered there in one go.
   void send(uint32_t msgid, const SXValue& error, const SXValue& result) {
-    msgpack::sbuffer encoded;
-    RpcEncodeResponse(encoded, msgid, error, result);
     bool startWriting = false;
     {
       std::lock_guard lock(outMutex_);
       if (closed_) return;
-      outPending_.append(encoded.data(), encoded.size());
+      size_t before = outPending_.size();
+      RpcEncodeResponse(outPending_, msgid, error, result);
+      pendingReplyBytes_.fetch_add(outPending_.size() - before);
       startWriting = !writing_;
       writing_ = true;
     }
@@ -85,31 +93,61 @@ class SXUnixSocketConnection final : public SXIpcConnection,
                                 return;
                               }
                               self->decoder_.commit(n);
-                              if (self->dispatchMessages()) self->read();
+                              self->serve();
                             });
   }
 
-  // Hands every whole message to the exported object. Returns false when the stream broke.
+  // I/O thread: hands on the requests already buffered, then reads more unless back-pressure
+  // says to wait.
+  void serve() {
+    for (;;) {
+      if (!dispatchMessages()) return;
+      if (!mustWait()) {
+        read();
+        return;
+      }
+      // Room may have been made between the test and the flag: look again after raising it,
+      // so that a wake-up is never missed.
+      paused_.store(true);
+      if (mustWait()) {
+        listener_.connectionPaused();
+        return;
+      }
+      paused_.store(false);
+    }
+  }
+
+  bool mustWait() const {
+    return queued_.load() >= maxQueuedRequests_ ||
+           pendingReplyBytes_.load() > maxPendingReplyBytes_;
+  }
+
+  // I/O thread, after a marker ran or a write finished.
+  void resumeIfAllowed() {
+    if (ended_ || !paused_.load() || mustWait()) return;
+    paused_.store(false);
+    serve();
+  }
+
+  // Hands every whole message to the exported object, stopping early when back-pressure
+  // says wait. Returns false when the stream broke.
   bool dispatchMessages() {
     SXValue message;
-    for (;;) {
-      if (ended_) return false;
-      switch (decoder_.next(message)) {
-        case RpcStreamDecoder::Status::kNeedMore:
-          return true;
-        case RpcStreamDecoder::Status::kBroken:
-          SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(),
-                decoder_.error());
-          end(true);
-          return false;
-        case RpcStreamDecoder::Status::kMessage:
-          if (!dispatch(message)) {
-            end(true);
-            return false;
-          }
-          break;
+    bool ok = true;
+    while (ok && !ended_ && !mustWait()) {
+      auto status = decoder_.next(message);
+      if (status == RpcStreamDecoder::Status::kNeedMore) break;
+      if (status == RpcStreamDecoder::Status::kBroken) {
+        SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(),
+              decoder_.error());
+        ok = false;
+      } else {
+        ok = dispatch(message);
       }
     }
+    coverDispatched();
+    if (!ok) end(true);
+    return ok && !ended_;
   }
 
   bool dispatch(const SXValue& message) {
@@ -128,6 +166,10 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       send(request->msgid, "no object is exported on this connection", nullptr);
       return true;
     }
+    if (requestQueue_) {
+      queued_.fetch_add(1);
+      uncovered_.fetch_add(1);
+    }
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
     uint32_t id = request->msgid;
     exported_->handleRequest(request->method, request->params,
@@ -135,6 +177,27 @@ class SXUnixSocketConnection final : public SXIpcConnection,
                                if (auto self = weak.lock()) self->send(id, error, result);
                              });
     return true;
+  }
+
+  // Any thread: posts a marker behind the requests handed on since the last one, unless a
+  // marker is already on its way (it posts the next one when it runs).
+  void coverDispatched() {
+    if (!requestQueue_ || uncovered_.load() == 0 || markerPending_.exchange(true)) return;
+    uint64_t covered = uncovered_.exchange(0);
+    std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
+    requestQueue_->async([weak, covered] {
+      if (auto self = weak.lock()) self->requestsHandled(covered);
+    });
+  }
+
+  // On the request queue: every request covered by this marker has been handled.
+  void requestsHandled(uint64_t covered) {
+    queued_.fetch_sub(covered);
+    markerPending_.store(false);
+    coverDispatched();
+    if (paused_.load()) {
+      asio::post(socket_.get_executor(), [self = shared_from_this()] { self->resumeIfAllowed(); });
+    }
   }
 
   void write() {
@@ -148,12 +211,14 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     }
     asio::async_write(socket_, asio::buffer(outFlight_),
                       [self = shared_from_this()](const std::error_code& ec, size_t) {
+                        self->pendingReplyBytes_.fetch_sub(self->outFlight_.size());
                         self->outFlight_.clear();
                         if (ec) {
                           self->end(true);
                           return;
                         }
                         self->write();
+                        self->resumeIfAllowed();
                       });
   }
 
@@ -161,6 +226,9 @@ class SXUnixSocketConnection final : public SXIpcConnection,
 
   asio::local::stream_protocol::socket socket_;
   RpcStreamDecoder decoder_;  // I/O thread only
+  const size_t maxQueuedRequests_;
+  const size_t maxPendingReplyBytes_;
+  const std::shared_ptr<SXWorkQueue> requestQueue_;
   SXUnixSocketListener& listener_;
   std::shared_ptr<SXLogFacility> log_;
   int32_t pid_ = 0;
@@ -169,6 +237,12 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   std::function<void()> interruption_;             // I/O thread only
   std::function<void()> invalidation_;             // I/O thread only
   bool ended_ = false;                             // I/O thread only
+  // Back-pressure. Handed on but not yet handled; written by the I/O thread and the markers.
+  std::atomic<uint64_t> queued_{0};
+  std::atomic<uint64_t> uncovered_{0};        // handed on, no marker posted behind them yet
+  std::atomic<bool> markerPending_{false};    // a marker is on the request queue
+  std::atomic<bool> paused_{false};           // set by the I/O thread, read by markers
+  std::atomic<size_t> pendingReplyBytes_{0};  // outPending_ plus outFlight_
   std::mutex outMutex_;
   std::string outPending_;  // GUARDED_BY(outMutex_)
   bool writing_ = false;    // GUARDED_BY(outMutex_)
@@ -237,23 +311,23 @@ void SXUnixSocketListener::connectionClosed(
 }
 
 void SXUnixSocketListener::accept() {
-  acceptor_.async_accept([this](const std::error_code& ec,
-                                asio::local::stream_protocol::socket socket) {
-    if (ec == asio::error::operation_aborted || !acceptor_.is_open()) return;
-    if (!ec) {
-      auto connection =
-          std::make_shared<SXUnixSocketConnection>(std::move(socket), options_.limits, *this, log_);
-      connections_.insert(connection);
-      if (!delegate_ || !delegate_->shouldAcceptNewConnection(connection)) {
-        connection->end(false);
-      }
-    } else {
-      // Out of descriptors or memory: accepting again at once would spin, so pause first.
-      SXLOG(*log_, nullptr, SXLogLevel::kError, "accept: %@", ec.message());
-      auto pause = std::make_shared<asio::steady_timer>(io_, std::chrono::milliseconds(100));
-      pause->async_wait([this, pause](const std::error_code&) { accept(); });
-      return;
-    }
-    accept();
-  });
+  acceptor_.async_accept(
+      [this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
+        if (ec == asio::error::operation_aborted || !acceptor_.is_open()) return;
+        if (!ec) {
+          auto connection =
+              std::make_shared<SXUnixSocketConnection>(std::move(socket), options_, *this, log_);
+          connections_.insert(connection);
+          if (!delegate_ || !delegate_->shouldAcceptNewConnection(connection)) {
+            connection->end(false);
+          }
+        } else {
+          // Out of descriptors or memory: accepting again at once would spin, so pause first.
+          SXLOG(*log_, nullptr, SXLogLevel::kError, "accept: %@", ec.message());
+          auto pause = std::make_shared<asio::steady_timer>(io_, std::chrono::milliseconds(100));
+          pause->async_wait([this, pause](const std::error_code&) { accept(); });
+          return;
+        }
+        accept();
+      });
 }

@@ -12,9 +12,7 @@ constexpr uint32_t kAlarmsMaxDelaySeconds = 60;
 
 std::string SXReportingSession::messageIdForCategory(SXReportingCategory category,
                                                      SXReportingMessageType type) {
-  std::string kind = SXReportingUtilityCategoryName(category);
-  kind += '_';
-  kind += SXReportingUtilityTypeName(type);
+  const std::string& kind = SXReportingUtilityMessageKind(category, type);
   int64_t count = ++messageTypeCounts_[kind];
   return kind + "_" + std::to_string(count);
 }

@@ -61,6 +61,12 @@ constexpr const char* kUsage =
     "  --max-pending-standalone N  standalone sends of one client waiting for their delay;\n"
     "                              beyond it they go out at once\n"
     "                              (SXREPORTING_MAX_PENDING_STANDALONE, default 1024)\n"
+    "  --max-queued-requests N     requests of one connection read but not yet handled before\n"
+    "                              the daemon stops reading it (SXREPORTING_MAX_QUEUED_REQUESTS,\n"
+    "                              default 1024)\n"
+    "  --max-pending-reply-bytes N replies of one connection waiting to be written before the\n"
+    "                              daemon stops reading it (SXREPORTING_MAX_PENDING_REPLY_BYTES,\n"
+    "                              default 4194304)\n"
     "  -h, --help                  this text\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
@@ -87,6 +93,10 @@ constexpr LimitFlag kLimitFlags[] = {
      &SXReportingLimits::maxAggregateEntries},
     {"--max-pending-standalone", "SXREPORTING_MAX_PENDING_STANDALONE",
      &SXReportingLimits::maxPendingStandalone},
+    {"--max-queued-requests", "SXREPORTING_MAX_QUEUED_REQUESTS",
+     &SXReportingLimits::maxQueuedRequests},
+    {"--max-pending-reply-bytes", "SXREPORTING_MAX_PENDING_REPLY_BYTES",
+     &SXReportingLimits::maxPendingReplyBytes},
 };
 
 const char* envOr(const char* name, const char* fallback) {
@@ -271,17 +281,25 @@ int main(int argc, char** argv) {
   auto delegate = SXReportingServiceDelegate::init(environment);
   std::shared_ptr<SXOtlpHttpExporter> exporter =
       otlpExporter(options, environment->platform(), log);
+  RpcLimits limits;
+  limits.maxMessageBytes = options.maxMessageBytes;
+  // Requests are handed to the server queue, so that queue tells when they have been handled.
+  SXUnixSocketListener listener({.socketPath = options.paths.socketPath,
+                                 .socketMode = options.socketMode,
+                                 .limits = limits,
+                                 .maxQueuedRequests = options.limits.maxQueuedRequests,
+                                 .maxPendingReplyBytes = options.limits.maxPendingReplyBytes,
+                                 .requestQueue = environment->serverQueue()},
+                                log);
   delegate->setStatusProviders(
       {.tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
        .joulebookWriteErrors = [j = stores.joulebook] { return j->writeErrors(); },
        .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
+       .requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
        .spoolBacklog = exporter
                            ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
                            : std::function<uint64_t()>()});
 
-  RpcLimits limits;
-  limits.maxMessageBytes = options.maxMessageBytes;
-  SXUnixSocketListener listener({options.paths.socketPath, options.socketMode, limits}, log);
   std::string error;
   if (!listener.open(error)) {
     SXLOG(*log, nullptr, SXLogLevel::kError, "cannot listen: %@", error);
@@ -291,11 +309,13 @@ int main(int argc, char** argv) {
   const SXReportingLimits& l = options.limits;
   SXLOG(*log, nullptr, SXLogLevel::kDefault,
         "limits: %llu sessions per client, %llu sessions, %llu aggregate entries, %llu pending "
-        "standalone sends per client",
+        "standalone sends per client, %llu queued requests and %llu reply bytes per connection",
         static_cast<unsigned long long>(l.maxSessionsPerClient),
         static_cast<unsigned long long>(l.maxSessions),
         static_cast<unsigned long long>(l.maxAggregateEntries),
-        static_cast<unsigned long long>(l.maxPendingStandalone));
+        static_cast<unsigned long long>(l.maxPendingStandalone),
+        static_cast<unsigned long long>(l.maxQueuedRequests),
+        static_cast<unsigned long long>(l.maxPendingReplyBytes));
   SXLOG(
       *log, nullptr, SXLogLevel::kDefault,
       "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",

@@ -1,0 +1,174 @@
+// Back-pressure through the real daemon: a client that pipelines far more than a connection
+// may queue, and a client that stops reading its replies, get every reply in order, and the
+// daemon's memory stays bounded meanwhile.
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <thread>
+
+#include "common/RpcCodec.h"
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+int connectTo(const std::string& path) {
+  int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  EXPECT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  return fd;
+}
+
+// Writes requests built by `encode(i)` for i in [0, count) in chunks, counting bytes written.
+void writeRequests(int fd, int count, const std::function<void(msgpack::sbuffer&, int)>& encode,
+                   std::atomic<size_t>& written) {
+  msgpack::sbuffer out;
+  for (int i = 0; i < count; ++i) {
+    encode(out, i);
+    if (out.size() < 16 * 1024 && i + 1 < count) continue;
+    const char* data = out.data();
+    size_t left = out.size();
+    while (left > 0) {
+      ssize_t n = ::write(fd, data, left);
+      if (n <= 0) return;
+      data += n;
+      left -= static_cast<size_t>(n);
+      written += static_cast<size_t>(n);
+    }
+    out.clear();
+  }
+}
+
+// Reads `count` responses; their msgids in arrival order.
+std::vector<int64_t> readResponseIds(int fd, int count) {
+  RpcLimits limits;
+  limits.maxMessageBytes = 64 << 20;
+  RpcStreamDecoder decoder(limits);
+  std::vector<int64_t> ids;
+  SXValue message;
+  while (static_cast<int>(ids.size()) < count) {
+    auto status = decoder.next(message);
+    if (status == RpcStreamDecoder::Status::kMessage) {
+      auto response = RpcParseResponse(message);
+      ids.push_back(response && response->error.is_null() ? int64_t(response->msgid) : -1);
+      continue;
+    }
+    if (status == RpcStreamDecoder::Status::kBroken) break;
+    char* buffer = decoder.prepare(256 * 1024);
+    ssize_t n = ::read(fd, buffer, 256 * 1024);
+    if (n <= 0) break;
+    decoder.commit(static_cast<size_t>(n));
+  }
+  return ids;
+}
+
+std::vector<int64_t> range(int from, int count) {
+  std::vector<int64_t> ids(count);
+  for (int i = 0; i < count; ++i) ids[i] = from + i;
+  return ids;
+}
+
+// Resident memory of `pid` in KiB.
+int64_t residentKiB(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmRSS:", 0) == 0) return std::stoll(line.substr(6));
+  }
+  return -1;
+}
+
+TestDaemon::Options withArgs(std::vector<std::string> args) {
+  TestDaemon::Options options;
+  options.extraArgs = std::move(args);
+  return options;
+}
+
+bool underSanitizer() {
+#if defined(__SANITIZE_ADDRESS__)
+  return true;  // the sanitizer's quarantine keeps freed memory resident
+#else
+  return false;
+#endif
+}
+
+}  // namespace
+
+TEST(BackpressureEndToEnd, PipelinedFarBeyondTheQueueLimitEveryReplyComesInOrder) {
+  TestDaemon daemon(withArgs({"--max-queued-requests", "32"}));
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+
+  constexpr int kRequests = 20'000;
+  int fd = connectTo(daemon.socket());
+  std::atomic<size_t> written{0};
+  std::thread writer([&] {
+    writeRequests(
+        fd, kRequests,
+        [](msgpack::sbuffer& out, int i) {
+          RpcEncodeRequest(out, static_cast<uint32_t>(i), sxr::method::kSendMessage,
+                           SXValue::array({SXValue{{"index", i}, {"route name", "speaker"}}, 3, 1,
+                                           SXValue::array({7})}));
+        },
+        written);
+  });
+  EXPECT_EQ(readResponseIds(fd, kRequests), range(0, kRequests));
+  writer.join();
+  ::close(fd);
+  // Every message reached the session, in order.
+  auto rows =
+      daemon.waitForRows("tallyvane.db", "SELECT payload_json FROM events ORDER BY id", kRequests);
+  ASSERT_EQ(rows.size(), size_t{kRequests});
+  EXPECT_EQ(SXValue::parse(rows.back()["payload_json"].get<std::string>())["index"], kRequests - 1);
+}
+
+TEST(BackpressureEndToEnd, AClientThatStopsReadingKeepsTheDaemonsMemoryBounded) {
+  TestDaemon daemon(withArgs({"--max-pending-reply-bytes", "1048576"}));
+  auto client = daemon.client();
+  // Many sessions make every getAllReporters reply a few KiB: 20,000 of them are ~90 MB.
+  constexpr int kSessions = 500;
+  constexpr int64_t kFirstID = 1'000'000'000'000;
+  for (int i = 0; i < kSessions; ++i) client->createReportingSession(kFirstID + i);
+  ASSERT_EQ(replied(client->getAllReporters()).size(), size_t{kSessions});
+  int64_t before = residentKiB(daemon.pid());
+
+  constexpr int kRequests = 20'000;
+  int fd = connectTo(daemon.socket());
+  std::atomic<size_t> written{0};
+  std::thread writer([&] {
+    writeRequests(
+        fd, kRequests,
+        [](msgpack::sbuffer& out, int i) {
+          RpcEncodeRequest(out, static_cast<uint32_t>(i), sxr::method::kGetAllReporters,
+                           SXValue::array());
+        },
+        written);
+  });
+  // The daemon stops reading: the writer makes no progress for a while.
+  size_t last = 0;
+  ASSERT_TRUE(waitUntil(
+      [&] {
+        size_t now = written.load();
+        bool stalled = now > 0 && now == last;
+        last = now;
+        std::this_thread::sleep_for(300ms);
+        return stalled && written.load() == now;
+      },
+      60s));
+  EXPECT_LT(written.load(), size_t{kRequests} * 20);  // not everything could be sent
+  int64_t paused = residentKiB(daemon.pid());
+  if (!underSanitizer()) {
+    EXPECT_LT(paused - before, 40 * 1024) << before << " KiB before";
+  }
+
+  EXPECT_EQ(readResponseIds(fd, kRequests), range(0, kRequests));
+  writer.join();
+  ::close(fd);
+}
