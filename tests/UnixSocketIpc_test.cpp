@@ -193,10 +193,15 @@ TEST(UnixSocketBackpressure, AClientThatDoesNotReadStopsBeingReadAndLaterGetsEve
   int fd = connectTo(served.path());
   std::thread writer([fd] { writeRequests(fd, kRequests); });
   ASSERT_TRUE(waitFor([&] { return served.listener().backpressurePauses() >= 1; }));
-  // Paused: nothing more is taken while the client does not read.
-  int64_t taken = object->handedOn();
-  std::this_thread::sleep_for(200ms);
-  EXPECT_EQ(object->handedOn(), taken);
+  // Once the socket buffers are full the connection stays paused: nothing more is taken while
+  // the client does not read.
+  int64_t taken = -1;
+  ASSERT_TRUE(waitFor([&] {
+    int64_t before = object->handedOn();
+    std::this_thread::sleep_for(300ms);
+    taken = object->handedOn();
+    return taken == before;
+  }));
   EXPECT_LT(taken, kRequests / 2);
 
   EXPECT_EQ(readResponses(fd, kRequests), range(kRequests));
@@ -222,5 +227,28 @@ TEST(UnixSocketBackpressure, WithoutPressureNothingPauses) {
     ASSERT_EQ(readResponses(fd, 1), std::vector<int64_t>{round});
   }
   EXPECT_EQ(served.listener().backpressurePauses(), 0u);
+  ::close(fd);
+}
+
+TEST(UnixSocketBackpressure, ABlockedQueueStopsReadingAtTheLimitAndEverythingFlowsOnceItRuns) {
+  SXAsioDispatch dispatch;
+  auto queue = dispatch.createSerialQueue("test", SXQualityOfService::kUserInteractive);
+  auto object = std::make_shared<QueueingObject>(queue);  // its queue waits for open()
+  SXUnixSocketListener::Options options;
+  options.requestQueue = queue;
+  options.maxQueuedRequests = 16;
+  ServedListener served(options, object);
+
+  constexpr int kRequests = 20'000;
+  int fd = connectTo(served.path());
+  std::thread writer([fd] { writeRequests(fd, kRequests); });
+  ASSERT_TRUE(waitFor([&] { return served.listener().backpressurePauses() >= 1; }));
+  std::this_thread::sleep_for(100ms);
+  EXPECT_EQ(object->handedOn(), 16);  // stopped reading exactly at the limit
+
+  object->open();
+  EXPECT_EQ(readResponses(fd, kRequests), range(kRequests));
+  writer.join();
+  EXPECT_LE(object->maxWaiting(), 16);
   ::close(fd);
 }

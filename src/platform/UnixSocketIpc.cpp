@@ -97,14 +97,20 @@ class SXUnixSocketConnection final : public SXIpcConnection,
                             });
   }
 
-  // I/O thread: hands on the requests already buffered, then reads more unless back-pressure
-  // says to wait.
+  // I/O thread: hands on the requests already buffered, then reads more once they are all
+  // handed on, unless back-pressure says to wait.
   void serve() {
     for (;;) {
-      if (!dispatchMessages()) return;
+      Dispatched dispatched = dispatchMessages();
+      if (dispatched == Dispatched::kEnded) return;
       if (!mustWait()) {
-        read();
-        return;
+        // Room was made while dispatching stopped: whole requests may still be buffered, and
+        // the client may have nothing more to send, so those go first.
+        if (dispatched == Dispatched::kDrained) {
+          read();
+          return;
+        }
+        continue;
       }
       // Room may have been made between the test and the flag: look again after raising it,
       // so that a wake-up is never missed.
@@ -129,14 +135,21 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     serve();
   }
 
+  enum class Dispatched { kDrained, kStopped, kEnded };
+
   // Hands every whole message to the exported object, stopping early when back-pressure
-  // says wait. Returns false when the stream broke.
-  bool dispatchMessages() {
+  // says wait. kDrained: no whole message is left; kStopped: back-pressure stopped it with
+  // messages left; kEnded: the stream broke or the connection ended.
+  Dispatched dispatchMessages() {
     SXValue message;
     bool ok = true;
+    bool drained = false;
     while (ok && !ended_ && !mustWait()) {
       auto status = decoder_.next(message);
-      if (status == RpcStreamDecoder::Status::kNeedMore) break;
+      if (status == RpcStreamDecoder::Status::kNeedMore) {
+        drained = true;
+        break;
+      }
       if (status == RpcStreamDecoder::Status::kBroken) {
         SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(),
               decoder_.error());
@@ -147,7 +160,8 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     }
     coverDispatched();
     if (!ok) end(true);
-    return ok && !ended_;
+    if (!ok || ended_) return Dispatched::kEnded;
+    return drained ? Dispatched::kDrained : Dispatched::kStopped;
   }
 
   bool dispatch(const SXValue& message) {
@@ -166,16 +180,16 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       send(request->msgid, "no object is exported on this connection", nullptr);
       return true;
     }
-    if (requestQueue_) {
-      queued_.fetch_add(1);
-      uncovered_.fetch_add(1);
-    }
+    if (requestQueue_) queued_.fetch_add(1);
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
     uint32_t id = request->msgid;
     exported_->handleRequest(request->method, request->params,
                              [weak, id](const SXValue& error, const SXValue& result) {
                                if (auto self = weak.lock()) self->send(id, error, result);
                              });
+    // Counted as uncovered only now that its work is on the queue: a marker posted from the
+    // queue thread at this moment must not overtake it.
+    if (requestQueue_) uncovered_.fetch_add(1);
     return true;
   }
 

@@ -292,10 +292,10 @@ int main(int argc, char** argv) {
                                  .requestQueue = environment->serverQueue()},
                                 log);
   delegate->setStatusProviders(
-      {.tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
+      {.requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
+       .tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
        .joulebookWriteErrors = [j = stores.joulebook] { return j->writeErrors(); },
        .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
-       .requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
        .spoolBacklog = exporter
                            ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
                            : std::function<uint64_t()>()});
