@@ -30,25 +30,21 @@ size_t openDescriptors(pid_t pid) {
   return n;
 }
 
-// Sets environment variables for the daemons started while it lives (they inherit them).
-class ScopedEnv {
- public:
-  explicit ScopedEnv(std::vector<std::pair<std::string, std::string>> vars) : vars_(std::move(vars)) {
-    for (const auto& [name, value] : vars_) ::setenv(name.c_str(), value.c_str(), 1);
-  }
-  ~ScopedEnv() {
-    for (const auto& [name, value] : vars_) ::unsetenv(name.c_str());
-  }
-
- private:
-  std::vector<std::pair<std::string, std::string>> vars_;
-};
-
 std::string asanOptions() {
   // The shim comes before the sanitizer runtime in the load order, which ASan refuses unless
   // told not to check; a daemon built without ASan ignores this.
   const char* own = ::getenv("ASAN_OPTIONS");
   return std::string(own ? own : "") + (own && *own ? ":" : "") + "verify_asan_link_order=0";
+}
+
+// A message that reaches all three stores.
+SXValue payload(int n) { return {{"EngineOnTime", 1.5}, {"n", n}}; }
+
+// The stores' write-error counters from the status request.
+SXValue writeErrors(SXReportingClient& client) {
+  SXValue status = replied(client.status());
+  if (!status.is_object() || !status["counters"].contains("store_write_errors")) return {};
+  return status["counters"]["store_write_errors"];
 }
 
 bool hasSummaryFile(const std::string& dir) {
@@ -77,27 +73,44 @@ int connectTo(const std::string& path) {
 TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
   SXTestTempDir faults;
   std::string trigger = faults.file("disk-full");
-  std::filesystem::create_directories(faults.file("lib"));
-  ScopedEnv env({{"LD_PRELOAD", SXR_FAULTS_LIB},
-                 {"SXR_FAULT_DIR", faults.file("lib")},
-                 {"SXR_FAULT_TRIGGER", trigger},
-                 {"ASAN_OPTIONS", asanOptions()}});
   TestDaemon::Options options;
   options.device = {{"InternalBuild", true}};
-  options.extraArgs = {"--state-dir", faults.file("lib")};
+  options.stateDir = faults.file("lib");
+  std::filesystem::create_directories(options.stateDir);
+  options.environment = {{"LD_PRELOAD", SXR_FAULTS_LIB},
+                         {"SXR_FAULT_DIR", options.stateDir},
+                         {"SXR_FAULT_TRIGGER", trigger},
+                         {"ASAN_OPTIONS", asanOptions()}};
   TestDaemon daemon(options);
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(1)));
-  EXPECT_FALSE(replied(client->sendMessage({{"k", 0}}, 3, 1, std::vector<int64_t>{1})));
-  ASSERT_TRUE(waitUntil([&] { return countRows(daemon, "tallyvane.db", "events") > 0; }));
+  EXPECT_FALSE(replied(client->sendMessage(payload(0), 3, 1, std::vector<int64_t>{1})));
+  ASSERT_TRUE(waitUntil([&] {
+    return countRows(daemon, "tallyvane.db", "events") > 0 &&
+           countRows(daemon, "joulebook.db", "entries") > 0 &&
+           countRows(daemon, "fernreporting.db", "messages") > 0;
+  })) << daemon.log();
+  SXValue errorsBefore = writeErrors(*client);
+  for (const char* store : {"tallyvane", "joulebook", "fernreporting"}) {
+    EXPECT_EQ(errorsBefore[store], 0) << store;
+  }
 
   std::ofstream(trigger) << "full";
   int64_t eventsBefore = countRows(daemon, "tallyvane.db", "events");
+  int64_t entriesBefore = countRows(daemon, "joulebook.db", "entries");
   int64_t messagesBefore = countRows(daemon, "fernreporting.db", "messages");
   for (int i = 1; i <= 20; ++i) {
-    EXPECT_FALSE(replied(client->sendMessage({{"k", i}}, 3, 1, std::vector<int64_t>{1})));
+    EXPECT_FALSE(replied(client->sendMessage(payload(i), 3, 1, std::vector<int64_t>{1})));
   }
+  // Every store counts what it could not write, and says so at error level.
+  EXPECT_TRUE(waitUntil([&] {
+    SXValue errors = writeErrors(*client);
+    return errors["tallyvane"] > 0 && errors["joulebook"] > 0 && errors["fernreporting"] > 0;
+  })) << writeErrors(*client)
+      << "\n"
+      << daemon.log();
   EXPECT_TRUE(daemon.waitForLog("dropped ")) << daemon.log();
+  EXPECT_TRUE(daemon.waitForLog("cannot store the message")) << daemon.log();
   // The daemon keeps answering, and the summary file, on another disk, is still written.
   ASSERT_TRUE(replied(client->createReportingSession(2)));
   auto start = client->startReportingSessionForID(2, kSXWaitForever);
@@ -106,14 +119,19 @@ TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
   EXPECT_TRUE(start.get().value);
   EXPECT_TRUE(waitUntil([&] { return hasSummaryFile(daemon.dir("diag")); }));
   EXPECT_EQ(countRows(daemon, "tallyvane.db", "events"), eventsBefore);
+  EXPECT_EQ(countRows(daemon, "joulebook.db", "entries"), entriesBefore);
 
   std::filesystem::remove(trigger);
-  EXPECT_FALSE(replied(client->sendMessage({{"k", 99}}, 3, 1, std::vector<int64_t>{1})));
+  EXPECT_FALSE(replied(client->sendMessage(payload(99), 3, 1, std::vector<int64_t>{1})));
   EXPECT_TRUE(waitUntil([&] {
     return countRows(daemon, "tallyvane.db", "events") > eventsBefore &&
+           countRows(daemon, "joulebook.db", "entries") > entriesBefore &&
            countRows(daemon, "fernreporting.db", "messages") > messagesBefore;
-  }));
+  })) << daemon.log();
   EXPECT_EQ(daemon.countInLog("moved it to"), 0u);  // a full disk is no damaged store
+  for (const char* db : {"tallyvane.db", "joulebook.db", "fernreporting.db"}) {
+    EXPECT_EQ(daemon.rows(db, "PRAGMA integrity_check")[0]["integrity_check"], "ok") << db;
+  }
 }
 
 TEST(FaultsEndToEnd, UnusableDiagnosticLogsLeaveTheStoresWorking) {
@@ -132,15 +150,26 @@ TEST(FaultsEndToEnd, UnusableDiagnosticLogsLeaveTheStoresWorking) {
     EXPECT_TRUE(start.get().value);
   }
   EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: ", 3));
-  EXPECT_EQ(daemon.waitForRows("tallyvane.db", "SELECT id FROM events WHERE name LIKE "
-                               "'com.vendra.sonex.Playback.Start'", 3).size(), 3u);
+  EXPECT_EQ(daemon
+                .waitForRows("tallyvane.db",
+                             "SELECT id FROM events WHERE name LIKE "
+                             "'com.vendra.sonex.Playback.Start'",
+                             3)
+                .size(),
+            3u);
   EXPECT_EQ(replied(client->getAllReporters()).size(), 3u);
 }
 
 TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
   TestDaemon daemon;
-  { daemon.client(); }  // let every lazily opened descriptor open once
-  ASSERT_TRUE(waitUntil([&] { return openDescriptors(daemon.pid()) > 0; }));
+  size_t initial = openDescriptors(daemon.pid());
+  ASSERT_GT(initial, 0u);
+  {
+    // Let every lazily opened descriptor open once; then wait for this connection's to close.
+    auto client = daemon.client();
+    EXPECT_TRUE(replied(client->getAllReporters()).empty());
+  }
+  waitUntil([&] { return openDescriptors(daemon.pid()) <= initial; }, 2s);
   size_t baseline = openDescriptors(daemon.pid());
 
   msgpack::sbuffer request;
