@@ -40,8 +40,9 @@ RowsById readRows(SXSqliteConnection& db, const Store& store) {
   }
   if (auto failed = select.query({}, rows)) ADD_FAILURE() << *failed;
   RowsById out;
-  for (const auto& row : rows)
+  for (const auto& row : rows) {
     out[row["id"].get<int64_t>()] = row["payload_json"].get<std::string>();
+  }
   return out;
 }
 

@@ -5,6 +5,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <array>
 #include <filesystem>
 #include <fstream>
 
@@ -35,6 +36,16 @@ std::string asanOptions() {
   // told not to check; a daemon built without ASan ignores this.
   const char* own = ::getenv("ASAN_OPTIONS");
   return std::string(own ? own : "") + (own && *own ? ":" : "") + "verify_asan_link_order=0";
+}
+
+// Rows in each store's table that a message reaches: events, power-log entries, spooled messages.
+using RowCounts = std::array<int64_t, 3>;
+RowCounts rowCounts(const TestDaemon& daemon) {
+  return {countRows(daemon, "tallyvane.db", "events"), countRows(daemon, "joulebook.db", "entries"),
+          countRows(daemon, "fernreporting.db", "messages")};
+}
+bool allGrew(const RowCounts& now, const RowCounts& before) {
+  return now[0] > before[0] && now[1] > before[1] && now[2] > before[2];
 }
 
 // A message that reaches all three stores.
@@ -85,20 +96,14 @@ TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(1)));
   EXPECT_FALSE(replied(client->sendMessage(payload(0), 3, 1, std::vector<int64_t>{1})));
-  ASSERT_TRUE(waitUntil([&] {
-    return countRows(daemon, "tallyvane.db", "events") > 0 &&
-           countRows(daemon, "joulebook.db", "entries") > 0 &&
-           countRows(daemon, "fernreporting.db", "messages") > 0;
-  })) << daemon.log();
+  ASSERT_TRUE(waitUntil([&] { return allGrew(rowCounts(daemon), {0, 0, 0}); })) << daemon.log();
   SXValue errorsBefore = writeErrors(*client);
   for (const char* store : {"tallyvane", "joulebook", "fernreporting"}) {
     EXPECT_EQ(errorsBefore[store], 0) << store;
   }
 
   std::ofstream(trigger) << "full";
-  int64_t eventsBefore = countRows(daemon, "tallyvane.db", "events");
-  int64_t entriesBefore = countRows(daemon, "joulebook.db", "entries");
-  int64_t messagesBefore = countRows(daemon, "fernreporting.db", "messages");
+  RowCounts before = rowCounts(daemon);
   for (int i = 1; i <= 20; ++i) {
     EXPECT_FALSE(replied(client->sendMessage(payload(i), 3, 1, std::vector<int64_t>{1})));
   }
@@ -118,16 +123,11 @@ TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
   EXPECT_TRUE(replied(client->stopReportingSessionForID(2)));
   EXPECT_TRUE(start.get().value);
   EXPECT_TRUE(waitUntil([&] { return hasSummaryFile(daemon.dir("diag")); }));
-  EXPECT_EQ(countRows(daemon, "tallyvane.db", "events"), eventsBefore);
-  EXPECT_EQ(countRows(daemon, "joulebook.db", "entries"), entriesBefore);
+  EXPECT_EQ(rowCounts(daemon), before);
 
   std::filesystem::remove(trigger);
   EXPECT_FALSE(replied(client->sendMessage(payload(99), 3, 1, std::vector<int64_t>{1})));
-  EXPECT_TRUE(waitUntil([&] {
-    return countRows(daemon, "tallyvane.db", "events") > eventsBefore &&
-           countRows(daemon, "joulebook.db", "entries") > entriesBefore &&
-           countRows(daemon, "fernreporting.db", "messages") > messagesBefore;
-  })) << daemon.log();
+  EXPECT_TRUE(waitUntil([&] { return allGrew(rowCounts(daemon), before); })) << daemon.log();
   EXPECT_EQ(daemon.countInLog("moved it to"), 0u);  // a full disk is no damaged store
   for (const char* db : {"tallyvane.db", "joulebook.db", "fernreporting.db"}) {
     EXPECT_EQ(daemon.rows(db, "PRAGMA integrity_check")[0]["integrity_check"], "ok") << db;
