@@ -25,6 +25,25 @@ void writeJson(const std::string& path, const SXValue& value) {
   std::ofstream(path) << value.dump();
 }
 
+// The test's environment with `extra` set over it, as "NAME=value" strings; built before the
+// fork, since the child of a threaded process may not allocate.
+std::vector<std::string> childEnvironment(const std::map<std::string, std::string>& extra) {
+  std::vector<std::string> out;
+  for (char** entry = environ; *entry; ++entry) {
+    std::string text = *entry;
+    if (!extra.count(text.substr(0, text.find('=')))) out.push_back(std::move(text));
+  }
+  for (const auto& [name, value] : extra) out.push_back(name + "=" + value);
+  return out;
+}
+
+std::vector<char*> pointersTo(std::vector<std::string>& words) {
+  std::vector<char*> out;
+  for (auto& word : words) out.push_back(word.data());
+  out.push_back(nullptr);
+  return out;
+}
+
 }  // namespace
 
 TestDaemon::TestDaemon() : TestDaemon(Options{}) {}
@@ -38,23 +57,32 @@ TestDaemon::TestDaemon(Options options) {
     writeJson(dir_.file("etc/fernreporting.json"), options.fernConfig);
   }
   for (const auto& [path, value] : options.counters) setCounter(path, value);
+  stateDir_ = options.stateDir.empty() ? dir_.file("lib") : options.stateDir;
   socket_ = dir_.file("run/sxr.sock");
-  std::vector<std::string> args = {SXR_DAEMON_PATH,  "--socket",           socket_,
-                                   "--state-dir",    dir_.file("lib"),     "--config-dir",
-                                   dir_.file("etc"), "--runtime-dir",      dir_.file("run"),
-                                   "--kestrel-root", dir_.file("kestrel"), "--diagnostic-logs-dir",
+  std::vector<std::string> args = {SXR_DAEMON_PATH,
+                                   "--socket",
+                                   socket_,
+                                   "--state-dir",
+                                   stateDir_,
+                                   "--config-dir",
+                                   dir_.file("etc"),
+                                   "--runtime-dir",
+                                   dir_.file("run"),
+                                   "--kestrel-root",
+                                   dir_.file("kestrel"),
+                                   "--diagnostic-logs-dir",
                                    dir_.file("diag")};
   args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
   std::string logPath = dir_.file("daemon.log");
+  std::vector<char*> argv = pointersTo(args);
+  std::vector<std::string> environment = childEnvironment(options.environment);
+  std::vector<char*> envp = pointersTo(environment);
   pid_ = ::fork();
   if (pid_ == 0) {
     int fd = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     ::dup2(fd, STDERR_FILENO);
     ::dup2(fd, STDOUT_FILENO);
-    std::vector<char*> argv;
-    for (auto& a : args) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    ::execv(argv[0], argv.data());
+    ::execve(argv[0], argv.data(), envp.data());
     ::_exit(127);
   }
   if (!waitForLog("ready, listening on")) ADD_FAILURE() << "daemon did not start:\n" << log();
@@ -139,8 +167,8 @@ std::vector<SXValue> TestDaemon::waitForRows(const std::string& db, const std::s
 }
 
 int TestDaemon::ctl(const std::vector<std::string>& args, std::string* output) const {
-  std::vector<std::string> words = {"--socket",      socket_,          "--state-dir",
-                                    dir_.file("lib"), "--config-dir",  dir_.file("etc"),
+  std::vector<std::string> words = {"--socket",      socket_,         "--state-dir",
+                                    stateDir_,       "--config-dir",  dir_.file("etc"),
                                     "--runtime-dir", dir_.file("run")};
   words.insert(words.end(), args.begin(), args.end());
   std::string command = SXR_CTL_PATH;

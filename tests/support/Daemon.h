@@ -22,6 +22,11 @@ class TestDaemon {
     SXValue fernConfig;                  // fernreporting.json, when not null
     // Driver counters present at start-up: "<group>/<subgroup>/<channel>" -> value.
     std::map<std::string, int64_t> counters;
+    // The stores' directory, when not the daemon's own temporary one: a second daemon started
+    // on the same directory finds the first one's stores.
+    std::string stateDir = {};
+    // Variables set for the daemon process alone (LD_PRELOAD, say), beside the test's own.
+    std::map<std::string, std::string> environment = {};
   };
 
   // Writes a driver counter file under the kestrel root.
@@ -32,7 +37,7 @@ class TestDaemon {
   ~TestDaemon();  // kills the daemon if it still runs
 
   const std::string& socket() const { return socket_; }
-  std::string stateFile(const std::string& name) const { return dir_.file("lib/" + name); }
+  std::string stateFile(const std::string& name) const { return stateDir_ + "/" + name; }
   std::string dir(const std::string& name) const { return dir_.file(name); }
 
   // A connected client; fails the test when it cannot connect.
@@ -61,6 +66,7 @@ class TestDaemon {
 
  private:
   SXTestTempDir dir_;
+  std::string stateDir_;
   std::string socket_;
   pid_t pid_ = -1;
   std::optional<int> exitStatus_;

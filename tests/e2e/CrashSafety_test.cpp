@@ -1,0 +1,223 @@
+// The daemon's stores across crashes: kill -9 under load loses no committed row, and a store
+// file that is no database is moved aside and replaced rather than stopping the daemon.
+#include <gtest/gtest.h>
+#include <signal.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <thread>
+
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+// Each store and the table a message reaches in it.
+struct Store {
+  const char* db;
+  const char* table;
+};
+constexpr Store kStores[] = {
+    {"tallyvane.db", "events"}, {"joulebook.db", "entries"}, {"fernreporting.db", "messages"}};
+
+int64_t countRows(const TestDaemon& daemon, const Store& store) {
+  auto rows = daemon.rows(store.db, std::string("SELECT count(*) AS n FROM ") + store.table);
+  return rows.empty() ? 0 : rows[0]["n"].get<int64_t>();
+}
+
+using RowsById = std::map<int64_t, std::string>;  // id -> payload_json
+
+RowsById readRows(SXSqliteConnection& db, const Store& store) {
+  SXSqliteStatement select;
+  std::vector<SXValue> rows;
+  std::string sql = std::string("SELECT id, payload_json FROM ") + store.table;
+  if (auto failed = db.prepare(sql, select)) {
+    ADD_FAILURE() << *failed;
+    return {};
+  }
+  if (auto failed = select.query({}, rows)) ADD_FAILURE() << *failed;
+  RowsById out;
+  for (const auto& row : rows) {
+    out[row["id"].get<int64_t>()] = row["payload_json"].get<std::string>();
+  }
+  return out;
+}
+
+// Read-only connections of their own to the three stores, as another process would hold them:
+// they see committed rows only. Remembers every row it has seen.
+class CommittedRows {
+ public:
+  explicit CommittedRows(const TestDaemon& daemon) {
+    for (const Store& store : kStores) {
+      std::string error;
+      auto db = SXSqliteConnection::open(daemon.stateFile(store.db),
+                                         SXSqliteConnection::Mode::kReadOnly, 5s, "", error);
+      EXPECT_TRUE(db) << error;
+      connections_.push_back(std::move(db));
+    }
+  }
+
+  void poll() {
+    for (size_t i = 0; i < connections_.size(); ++i) {
+      if (!connections_[i]) continue;
+      for (auto& [id, payload] : readRows(*connections_[i], kStores[i])) seen_[i][id] = payload;
+    }
+  }
+  size_t fewest() const { return std::min({seen_[0].size(), seen_[1].size(), seen_[2].size()}); }
+  const RowsById& seen(size_t store) const { return seen_[store]; }
+
+ private:
+  std::vector<std::unique_ptr<SXSqliteConnection>> connections_;
+  RowsById seen_[3];
+};
+
+// Clients that each start a session and send to it, one message after another, until stopped
+// or until the daemon is gone. Every message reaches all three stores.
+class Load {
+ public:
+  Load(const TestDaemon& daemon, int clients) {
+    for (int k = 0; k < clients; ++k) {
+      auto client = daemon.client();
+      int64_t reporter = 70 + k;
+      EXPECT_TRUE(replied(client->createReportingSession(reporter)));
+      starts_.push_back(client->startReportingSessionForID(reporter, kSXWaitForever));
+      threads_.emplace_back([this, k, reporter, client = std::move(client)] {
+        for (int64_t i = 0; !stop_; ++i) {
+          SXValue payload = {{"EngineOnTime", 1.5}, {"client", k}, {"n", i}};
+          auto result =
+              client->sendMessage(payload, 3, 1, std::vector<int64_t>{reporter}, 5s).get();
+          if (result.status != SXCallStatus::kReplied) break;
+        }
+      });
+    }
+  }
+  ~Load() {
+    stop_ = true;
+    for (auto& thread : threads_) thread.join();
+  }
+
+ private:
+  std::atomic<bool> stop_{false};
+  std::vector<std::future<SXCallResult<bool>>> starts_;  // never answered: the daemon dies
+  std::vector<std::thread> threads_;
+};
+
+std::vector<std::string> filesStartingWith(const std::string& dir, const std::string& prefix) {
+  std::vector<std::string> names;
+  for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+    std::string name = entry.path().filename().string();
+    if (name.rfind(prefix, 0) == 0) names.push_back(name);
+  }
+  return names;
+}
+
+// Sends one message to a started session of a new client and waits until each store holds
+// more rows than `before`.
+void expectNewRowsLand(const TestDaemon& daemon, const int64_t (&before)[3]) {
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(900)));
+  auto start = client->startReportingSessionForID(900, kSXWaitForever);
+  EXPECT_FALSE(
+      replied(client->sendMessage({{"EngineOnTime", 2.0}}, 3, 1, std::vector<int64_t>{900})));
+  for (size_t i = 0; i < 3; ++i) {
+    EXPECT_TRUE(waitUntil([&] { return countRows(daemon, kStores[i]) > before[i]; }))
+        << kStores[i].db << " has " << countRows(daemon, kStores[i]) << " rows\n"
+        << daemon.log();
+  }
+}
+
+}  // namespace
+
+TEST(CrashSafetyEndToEnd, StoresUseWriteAheadLogging) {
+  TestDaemon daemon;
+  for (const Store& store : kStores) {
+    auto mode = daemon.rows(store.db, "PRAGMA journal_mode");
+    ASSERT_EQ(mode.size(), 1u) << store.db;
+    EXPECT_EQ(mode[0]["journal_mode"], "wal") << store.db;
+  }
+}
+
+TEST(CrashSafetyEndToEnd, KillNineUnderLoadLosesNoCommittedRow) {
+  SXTestTempDir state;
+  TestDaemon::Options options;
+  options.stateDir = state.file("lib");
+  std::filesystem::create_directories(options.stateDir);
+  std::optional<CommittedRows> committed;
+  {
+    TestDaemon daemon(options);
+    committed.emplace(daemon);
+    Load load(daemon, 3);
+    ASSERT_TRUE(waitUntil(
+        [&] {
+          committed->poll();
+          return committed->fewest() >= 200;
+        },
+        30s))
+        << "rows seen: " << committed->fewest() << "\n"
+        << daemon.log();
+    committed->poll();  // the last look before the kill, with the writers still busy
+    ASSERT_EQ(::kill(daemon.pid(), SIGKILL), 0);
+    EXPECT_EQ(daemon.waitForExit(), 128 + SIGKILL);
+  }
+
+  TestDaemon restarted(options);
+  int64_t after[3];
+  for (size_t i = 0; i < 3; ++i) {
+    const Store& store = kStores[i];
+    std::string error;
+    auto db = SXSqliteConnection::open(restarted.stateFile(store.db),
+                                       SXSqliteConnection::Mode::kReadOnly, 5s, "", error);
+    ASSERT_TRUE(db) << error;
+    RowsById now = readRows(*db, store);
+    size_t missing = 0;
+    for (const auto& [id, payload] : committed->seen(i)) {
+      auto found = now.find(id);
+      if (found == now.end() || found->second != payload) ++missing;
+    }
+    EXPECT_EQ(missing, 0u) << store.db << ": of " << committed->seen(i).size() << " rows seen";
+    after[i] = static_cast<int64_t>(now.size());
+    auto check = restarted.rows(store.db, "PRAGMA integrity_check");
+    ASSERT_EQ(check.size(), 1u) << store.db;
+    EXPECT_EQ(check[0]["integrity_check"], "ok") << store.db;
+    EXPECT_EQ(restarted.rows(store.db, "PRAGMA journal_mode")[0]["journal_mode"], "wal");
+  }
+  committed.reset();
+  EXPECT_EQ(restarted.countInLog("moved it to"), 0u) << restarted.log();
+  expectNewRowsLand(restarted, after);
+}
+
+TEST(CrashSafetyEndToEnd, DamagedStoresAreMovedAsideAndRecreated) {
+  SXTestTempDir state;
+  const std::string garbage(8192, '\x5a');
+  std::ofstream(state.file("tallyvane.db"), std::ios::binary) << garbage;
+  std::ofstream(state.file("fernreporting.db"), std::ios::binary) << "not a database at all";
+  // A directory where the file should be: SQLite cannot open it, whoever we run as.
+  std::filesystem::create_directories(state.file("joulebook.db/x"));
+
+  TestDaemon::Options options;
+  options.stateDir = state.file("");
+  auto first = std::make_unique<TestDaemon>(options);
+  TestDaemon& daemon = *first;
+  EXPECT_TRUE(daemon.waitForLog("moved it to", 3)) << daemon.log();
+  EXPECT_GE(daemon.countInLog("<3>"), 3u);  // error level
+  for (const Store& store : kStores) {
+    auto aside = filesStartingWith(state.file(""), std::string(store.db) + ".damaged-");
+    ASSERT_EQ(aside.size(), 1u) << store.db;
+  }
+  std::ifstream kept(state.file(filesStartingWith(state.file(""), "tallyvane.db.damaged-")[0]),
+                     std::ios::binary);
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(kept), {}), garbage);
+
+  // It serves and stores; a kill and a second start find healthy stores and move nothing.
+  expectNewRowsLand(daemon, {0, 0, 0});
+  first.reset();
+  TestDaemon again(options);
+  EXPECT_EQ(again.countInLog("moved it to"), 0u) << again.log();
+  int64_t before[3];
+  for (size_t i = 0; i < 3; ++i) before[i] = countRows(again, kStores[i]);
+  EXPECT_GT(before[0], 0);
+  expectNewRowsLand(again, before);
+}

@@ -1,0 +1,192 @@
+// Resource faults with the real daemon: a full disk under the stores, an unusable
+// diagnostic-logs directory, and many connections that come and go.
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <array>
+#include <filesystem>
+#include <fstream>
+
+#include "common/RpcCodec.h"
+#include "support/Daemon.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+int64_t countRows(const TestDaemon& daemon, const std::string& db, const std::string& table) {
+  auto rows = daemon.rows(db, "SELECT count(*) AS n FROM " + table);
+  return rows.empty() ? 0 : rows[0]["n"].get<int64_t>();
+}
+
+size_t openDescriptors(pid_t pid) {
+  size_t n = 0;
+  std::error_code ec;
+  for (auto it = std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/fd", ec);
+       !ec && it != std::filesystem::directory_iterator(); it.increment(ec)) {
+    ++n;
+  }
+  return n;
+}
+
+std::string asanOptions() {
+  // The shim comes before the sanitizer runtime in the load order, which ASan refuses unless
+  // told not to check; a daemon built without ASan ignores this.
+  const char* own = ::getenv("ASAN_OPTIONS");
+  return std::string(own ? own : "") + (own && *own ? ":" : "") + "verify_asan_link_order=0";
+}
+
+// Rows in each store's table that a message reaches: events, power-log entries, spooled messages.
+using RowCounts = std::array<int64_t, 3>;
+RowCounts rowCounts(const TestDaemon& daemon) {
+  return {countRows(daemon, "tallyvane.db", "events"), countRows(daemon, "joulebook.db", "entries"),
+          countRows(daemon, "fernreporting.db", "messages")};
+}
+bool allGrew(const RowCounts& now, const RowCounts& before) {
+  return now[0] > before[0] && now[1] > before[1] && now[2] > before[2];
+}
+
+// A message that reaches all three stores.
+SXValue payload(int n) { return {{"EngineOnTime", 1.5}, {"n", n}}; }
+
+// The stores' write-error counters from the status request.
+SXValue writeErrors(SXReportingClient& client) {
+  SXValue status = replied(client.status());
+  if (!status.is_object() || !status["counters"].contains("store_write_errors")) return {};
+  return status["counters"]["store_write_errors"];
+}
+
+bool hasSummaryFile(const std::string& dir) {
+  std::error_code ec;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ec)) {
+    if (entry.path().extension() == ".json") return true;
+  }
+  return false;
+}
+
+// A raw connection, so that thousands of them cost little.
+int connectTo(const std::string& path) {
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+}  // namespace
+
+TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
+  SXTestTempDir faults;
+  std::string trigger = faults.file("disk-full");
+  TestDaemon::Options options;
+  options.device = {{"InternalBuild", true}};
+  options.stateDir = faults.file("lib");
+  std::filesystem::create_directories(options.stateDir);
+  options.environment = {{"LD_PRELOAD", SXR_FAULTS_LIB},
+                         {"SXR_FAULT_DIR", options.stateDir},
+                         {"SXR_FAULT_TRIGGER", trigger},
+                         {"ASAN_OPTIONS", asanOptions()}};
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(1)));
+  EXPECT_FALSE(replied(client->sendMessage(payload(0), 3, 1, std::vector<int64_t>{1})));
+  ASSERT_TRUE(waitUntil([&] { return allGrew(rowCounts(daemon), {0, 0, 0}); })) << daemon.log();
+  SXValue errorsBefore = writeErrors(*client);
+  for (const char* store : {"tallyvane", "joulebook", "fernreporting"}) {
+    EXPECT_EQ(errorsBefore[store], 0) << store;
+  }
+
+  std::ofstream(trigger) << "full";
+  RowCounts before = rowCounts(daemon);
+  for (int i = 1; i <= 20; ++i) {
+    EXPECT_FALSE(replied(client->sendMessage(payload(i), 3, 1, std::vector<int64_t>{1})));
+  }
+  // Every store counts what it could not write, and says so at error level.
+  EXPECT_TRUE(waitUntil([&] {
+    SXValue errors = writeErrors(*client);
+    return errors["tallyvane"] > 0 && errors["joulebook"] > 0 && errors["fernreporting"] > 0;
+  })) << writeErrors(*client)
+      << "\n"
+      << daemon.log();
+  EXPECT_TRUE(daemon.waitForLog("dropped ")) << daemon.log();
+  EXPECT_TRUE(daemon.waitForLog("cannot store the message")) << daemon.log();
+  // The daemon keeps answering, and the summary file, on another disk, is still written.
+  ASSERT_TRUE(replied(client->createReportingSession(2)));
+  auto start = client->startReportingSessionForID(2, kSXWaitForever);
+  EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{2})));
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(2)));
+  EXPECT_TRUE(start.get().value);
+  EXPECT_TRUE(waitUntil([&] { return hasSummaryFile(daemon.dir("diag")); }));
+  EXPECT_EQ(rowCounts(daemon), before);
+
+  std::filesystem::remove(trigger);
+  EXPECT_FALSE(replied(client->sendMessage(payload(99), 3, 1, std::vector<int64_t>{1})));
+  EXPECT_TRUE(waitUntil([&] { return allGrew(rowCounts(daemon), before); })) << daemon.log();
+  EXPECT_EQ(daemon.countInLog("moved it to"), 0u);  // a full disk is no damaged store
+  for (const char* db : {"tallyvane.db", "joulebook.db", "fernreporting.db"}) {
+    EXPECT_EQ(daemon.rows(db, "PRAGMA integrity_check")[0]["integrity_check"], "ok") << db;
+  }
+}
+
+TEST(FaultsEndToEnd, UnusableDiagnosticLogsLeaveTheStoresWorking) {
+  SXTestTempDir other;
+  std::ofstream(other.file("file")) << "x";
+  TestDaemon::Options options;
+  options.device = {{"InternalBuild", true}};
+  options.extraArgs = {"--diagnostic-logs-dir", other.file("file/Reporting")};
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  for (int64_t id = 1; id <= 3; ++id) {
+    ASSERT_TRUE(replied(client->createReportingSession(id)));
+    auto start = client->startReportingSessionForID(id, kSXWaitForever);
+    EXPECT_FALSE(replied(client->sendMessage({{"k", id}}, 3, 1, std::vector<int64_t>{id})));
+    EXPECT_TRUE(replied(client->stopReportingSessionForID(id)));
+    EXPECT_TRUE(start.get().value);
+  }
+  EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: ", 3));
+  EXPECT_EQ(daemon
+                .waitForRows("tallyvane.db",
+                             "SELECT id FROM events WHERE name LIKE "
+                             "'com.vendra.sonex.Playback.Start'",
+                             3)
+                .size(),
+            3u);
+  EXPECT_EQ(replied(client->getAllReporters()).size(), 3u);
+}
+
+TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
+  TestDaemon daemon;
+  size_t initial = openDescriptors(daemon.pid());
+  ASSERT_GT(initial, 0u);
+  {
+    // Let every lazily opened descriptor open once; then wait for this connection's to close.
+    auto client = daemon.client();
+    EXPECT_TRUE(replied(client->getAllReporters()).empty());
+  }
+  waitUntil([&] { return openDescriptors(daemon.pid()) <= initial; }, 2s);
+  size_t baseline = openDescriptors(daemon.pid());
+
+  msgpack::sbuffer request;
+  RpcEncodeRequest(request, 1, "getAllReporters:", SXValue::array());
+  for (int i = 0; i < 10'000; ++i) {
+    int fd = connectTo(daemon.socket());
+    ASSERT_GE(fd, 0) << "connection " << i;
+    if (i % 3 == 1) {
+      // A request in flight: the reply may find the connection gone.
+      ASSERT_EQ(::write(fd, request.data(), request.size()), ssize_t(request.size()));
+    } else if (i % 3 == 2) {
+      ASSERT_EQ(::write(fd, request.data(), request.size() / 2), ssize_t(request.size() / 2));
+    }
+    ::close(fd);
+  }
+  EXPECT_TRUE(waitUntil([&] { return openDescriptors(daemon.pid()) <= baseline; }, 30s))
+      << openDescriptors(daemon.pid()) << " descriptors open, " << baseline << " before";
+  auto client = daemon.client();
+  EXPECT_TRUE(replied(client->getAllReporters()).empty());
+}
