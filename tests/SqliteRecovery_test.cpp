@@ -73,10 +73,10 @@ class UnwritableFile {
 TEST(SqliteRecovery, OnlyDamageIsMovedAsidePermissionsProblemsAreNot) {
   using F = SXSqliteOpenFailure;
   const SXSqliteFileProbe missing{};
-  const SXSqliteFileProbe healthy{.exists = true, .regularFile = true, .openErrno = 0};
-  const SXSqliteFileProbe directory{.exists = true, .regularFile = false, .openErrno = 0};
+  const SXSqliteFileProbe healthy{.exists = true, .regularFile = true, .accessErrno = 0};
+  const SXSqliteFileProbe directory{.exists = true, .regularFile = false, .accessErrno = 0};
   auto failedWith = [](int errnum) {
-    return SXSqliteFileProbe{.exists = true, .regularFile = true, .openErrno = errnum};
+    return SXSqliteFileProbe{.exists = true, .regularFile = true, .accessErrno = errnum};
   };
   EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_NOTADB, healthy), F::kDamaged);
   EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CORRUPT, healthy), F::kDamaged);

@@ -174,8 +174,8 @@ bool IsPermissionErrno(int errnum) {
 
 // The error of a store left in place because this user may not write it.
 std::string NotWritable(const std::string& path, const SXSqliteFileProbe& probe, int code) {
-  const char* why =
-      IsPermissionErrno(probe.openErrno) ? std::strerror(probe.openErrno) : sqlite3_errstr(code);
+  const char* why = IsPermissionErrno(probe.accessErrno) ? std::strerror(probe.accessErrno)
+                                                         : sqlite3_errstr(code);
   return "cannot open " + path + ": not writable by this user (" + why +
          "); left as it is, nothing is stored until its owner or mode is fixed";
 }
@@ -189,14 +189,15 @@ SXSqliteFileProbe SXSqliteProbeFile(const std::string& path) {
   probe.exists = true;
   probe.regularFile = S_ISREG(st.st_mode);
   if (!probe.regularFile) return probe;
-  // O_NONBLOCK: nothing to wait for on a regular file, but the check must never block.
-  SXScopedFd fd(::open(path.c_str(), O_RDWR | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-  probe.openErrno = fd.get() < 0 ? errno : 0;
+  // access(2), not open(2): closing a descriptor of the file would drop the POSIX locks that
+  // another SQLite connection of this process holds on it. It reports an immutable file and a
+  // read-only mount too, also to root.
+  probe.accessErrno = ::faccessat(AT_FDCWD, path.c_str(), R_OK | W_OK, AT_EACCESS) == 0 ? 0 : errno;
   return probe;
 }
 
 SXSqliteOpenFailure SXSqliteClassifyOpenFailure(int code, const SXSqliteFileProbe& probe) {
-  if (probe.exists && probe.regularFile && IsPermissionErrno(probe.openErrno)) {
+  if (probe.exists && probe.regularFile && IsPermissionErrno(probe.accessErrno)) {
     return SXSqliteOpenFailure::kNotWritable;
   }
   switch (code & 0xff) {

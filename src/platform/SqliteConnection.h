@@ -117,10 +117,10 @@ enum class SXSqliteOpenFailure {
 struct SXSqliteFileProbe {
   bool exists = false;
   bool regularFile = false;
-  int openErrno = 0;  // errno of opening it for reading and writing; 0 when that works
+  int accessErrno = 0;  // errno of access(2) for reading and writing; 0 when that is allowed
 };
 
-// Looks at `path` with stat(2) and open(2) O_RDWR (as this process's user).
+// Looks at `path` with stat(2) and access(2) (with the effective user and group).
 SXSqliteFileProbe SXSqliteProbeFile(const std::string& path);
 
 // `code` is the SQLite result of the failed open. A file this user cannot open for writing
