@@ -56,8 +56,9 @@ package: build
 	cd $(BUILD) && cpack -G DEB
 
 # libFuzzer targets (tests/fuzz), each run for FUZZ_SECONDS from its seed corpus; new inputs and
-# crashing ones stay in $(FUZZ_BUILD). Needs clang, so the build is a separate one; clang warns
-# where g++ does not, so warnings show there without stopping it (CI's -Werror is the g++ build).
+# crashing ones stay in $(FUZZ_BUILD). Needs clang, so the build is a separate one; it stops on
+# warnings like every other build (SXR_WERROR=ON is explicit so that a build directory
+# configured earlier with it OFF is switched back).
 FUZZ_BUILD   ?= build-fuzz
 FUZZ_SECONDS ?= 30
 FUZZ_TARGETS  = fuzz_rpc_decoder fuzz_msgpack_value fuzz_payload
@@ -65,7 +66,7 @@ fuzz: DEB_PACKAGES += clang libclang-rt-dev
 
 fuzz: deps
 	CC=clang CXX=clang++ cmake -S . -B $(FUZZ_BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-	  -DSXR_FUZZ=ON -DSXR_TESTS=OFF -DSXR_WERROR=OFF
+	  -DSXR_FUZZ=ON -DSXR_TESTS=OFF -DSXR_WERROR=ON
 	cmake --build $(FUZZ_BUILD) -j $(JOBS) --target fuzz_targets
 	@set -e; for t in $(FUZZ_TARGETS); do \
 	  mkdir -p $(FUZZ_BUILD)/corpus/$$t $(FUZZ_BUILD)/artifacts; \

@@ -1,6 +1,12 @@
 // Stores that cannot be opened: what is moved aside, what never is, and the write-error counts.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <filesystem>
 #include <fstream>
 
@@ -30,7 +36,92 @@ std::string contents(const std::string& path) {
   return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
+// Sets or clears the immutable attribute; false where the file system or our privileges lack it.
+bool setImmutable(const std::string& path, bool on) {
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  int flags = 0;
+  bool ok = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
+  flags = on ? flags | FS_IMMUTABLE_FL : flags & ~FS_IMMUTABLE_FL;
+  ok = ok && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+  ::close(fd);
+  return ok;
+}
+
+// Makes a file this process cannot write, undone when it goes out of scope (the temporary
+// directory cannot be removed around an immutable file). Root writes any mode, so as root the
+// file is made immutable instead of read-only.
+class UnwritableFile {
+ public:
+  explicit UnwritableFile(std::string path) : path_(std::move(path)) {
+    immutable_ = ::geteuid() == 0;
+    ok_ = immutable_ ? setImmutable(path_, true) : ::chmod(path_.c_str(), 0444) == 0;
+  }
+  ~UnwritableFile() {
+    if (ok_ && immutable_) setImmutable(path_, false);
+  }
+  bool ok() const { return ok_; }
+
+ private:
+  std::string path_;
+  bool immutable_ = false;
+  bool ok_ = false;
+};
+
 }  // namespace
+
+TEST(SqliteRecovery, OnlyDamageIsMovedAsidePermissionsProblemsAreNot) {
+  using F = SXSqliteOpenFailure;
+  const SXSqliteFileProbe missing{};
+  const SXSqliteFileProbe healthy{.exists = true, .regularFile = true, .accessErrno = 0};
+  const SXSqliteFileProbe directory{.exists = true, .regularFile = false, .accessErrno = 0};
+  auto failedWith = [](int errnum) {
+    return SXSqliteFileProbe{.exists = true, .regularFile = true, .accessErrno = errnum};
+  };
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_NOTADB, healthy), F::kDamaged);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CORRUPT, healthy), F::kDamaged);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CANTOPEN, directory), F::kDamaged);
+  // Another user's file, a read-only or immutable one, one on a read-only mount.
+  for (int errnum : {EACCES, EPERM, EROFS}) {
+    EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CANTOPEN, failedWith(errnum)), F::kNotWritable);
+    EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_NOTADB, failedWith(errnum)), F::kNotWritable);
+  }
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_READONLY, healthy), F::kNotWritable);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_READONLY_DIRECTORY, healthy), F::kNotWritable);
+  // Failures that say nothing about the file.
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CANTOPEN, healthy), F::kOther);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CANTOPEN, missing), F::kOther);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_CANTOPEN, failedWith(EMFILE)), F::kOther);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_BUSY, healthy), F::kOther);
+  EXPECT_EQ(SXSqliteClassifyOpenFailure(SQLITE_FULL, healthy), F::kOther);
+}
+
+TEST(SqliteRecovery, AStoreThisUserCannotWriteIsLeftInPlaceAndItsRowsCounted) {
+  SXTestTempDir dir;
+  std::string path = dir.file("tallyvane.db");
+  std::string error, recovered;
+  ASSERT_TRUE(SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered)) << error;
+  for (const char* extra : {"-wal", "-shm"}) std::filesystem::remove(path + extra);
+  UnwritableFile unwritable(path);
+  if (!unwritable.ok()) GTEST_SKIP() << "cannot make a file unwritable here";
+
+  EXPECT_FALSE(SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered));
+  EXPECT_TRUE(recovered.empty()) << recovered;
+  EXPECT_NE(error.find("cannot open " + path + ": not writable by this user"), std::string::npos)
+      << error;
+  EXPECT_EQ(entries(dir.file("")), std::vector<std::string>{"tallyvane.db"});
+
+  auto log = std::make_shared<FakeLog>();
+  {
+    SXSqliteTallyvane events(path, log);
+    for (int i = 0; i < 2; ++i) events.sendEventLazy("e", [] { return SXValue{{"k", 1}}; });
+    events.flush();
+    EXPECT_EQ(events.writeErrors(), 2u);
+  }
+  EXPECT_TRUE(log->contains("not writable by this user"));
+  EXPECT_FALSE(log->contains("moved it to"));
+  EXPECT_EQ(entries(dir.file("")), std::vector<std::string>{"tallyvane.db"});
+}
 
 TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
   SXTestTempDir dir;

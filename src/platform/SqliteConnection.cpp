@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <ctime>
 #include <filesystem>
 
@@ -120,6 +121,12 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
   auto connection = std::make_unique<SXSqliteConnection>(Key(), db);
   sqlite3_busy_timeout(db, static_cast<int>(busyTimeout.count()));
   if (mode == Mode::kReadOnly) return connection;
+  // SQLite quietly falls back to reading a file it may not write; a store must be writable.
+  if (sqlite3_db_readonly(db, "main") == 1) {
+    code = SQLITE_READONLY;
+    error = "cannot open " + path + ": " + sqlite3_errstr(SQLITE_READONLY);
+    return nullptr;
+  }
   for (const std::string& sql :
        {std::string("PRAGMA journal_mode=WAL"), std::string("PRAGMA synchronous=NORMAL"), schema}) {
     if (auto failed = connection->exec(sql)) {
@@ -132,27 +139,6 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
 }
 
 namespace {
-
-// Failures that say the file itself is unusable; anything else (busy, full, out of memory, a
-// missing directory) may pass, and moving the store aside would lose it for nothing.
-bool IsDamaged(const std::string& path, int code) {
-  switch (code & 0xff) {
-    case SQLITE_NOTADB:
-    case SQLITE_CORRUPT:
-      return true;
-    case SQLITE_CANTOPEN: {
-      // Only when the file is what is wrong: not a regular file, or one we may not open. Out of
-      // descriptors or memory, the same code comes back for a healthy store.
-      struct stat st {};
-      if (::stat(path.c_str(), &st) != 0) return false;
-      if (!S_ISREG(st.st_mode)) return true;
-      SXScopedFd fd(::open(path.c_str(), O_RDWR | O_CLOEXEC));
-      return fd.get() < 0 && (errno == EACCES || errno == EPERM);
-    }
-    default:
-      return false;
-  }
-}
 
 std::string DamagedSuffix() {
   std::time_t now = std::time(nullptr);
@@ -182,14 +168,70 @@ std::optional<std::string> MoveAside(const std::string& path, std::string& aside
   return std::nullopt;
 }
 
+bool IsPermissionErrno(int errnum) {
+  return errnum == EACCES || errnum == EPERM || errnum == EROFS;
+}
+
+// The error of a store left in place because this user may not write it.
+std::string NotWritable(const std::string& path, const SXSqliteFileProbe& probe, int code) {
+  const char* why = IsPermissionErrno(probe.accessErrno) ? std::strerror(probe.accessErrno)
+                                                         : sqlite3_errstr(code);
+  return "cannot open " + path + ": not writable by this user (" + why +
+         "); left as it is, nothing is stored until its owner or mode is fixed";
+}
+
 }  // namespace
+
+SXSqliteFileProbe SXSqliteProbeFile(const std::string& path) {
+  SXSqliteFileProbe probe;
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0) return probe;
+  probe.exists = true;
+  probe.regularFile = S_ISREG(st.st_mode);
+  if (!probe.regularFile) return probe;
+  // access(2), not open(2): closing a descriptor of the file would drop the POSIX locks that
+  // another SQLite connection of this process holds on it. It reports an immutable file and a
+  // read-only mount too, also to root.
+  probe.accessErrno = ::faccessat(AT_FDCWD, path.c_str(), R_OK | W_OK, AT_EACCESS) == 0 ? 0 : errno;
+  return probe;
+}
+
+SXSqliteOpenFailure SXSqliteClassifyOpenFailure(int code, const SXSqliteFileProbe& probe) {
+  if (probe.exists && probe.regularFile && IsPermissionErrno(probe.accessErrno)) {
+    return SXSqliteOpenFailure::kNotWritable;
+  }
+  switch (code & 0xff) {
+    case SQLITE_READONLY:
+      return SXSqliteOpenFailure::kNotWritable;
+    case SQLITE_NOTADB:
+    case SQLITE_CORRUPT:
+      return SXSqliteOpenFailure::kDamaged;
+    case SQLITE_CANTOPEN:
+      // Out of descriptors or memory, the same code comes back for a healthy store, so only a
+      // path that is no regular file counts as damage.
+      return probe.exists && !probe.regularFile ? SXSqliteOpenFailure::kDamaged
+                                                : SXSqliteOpenFailure::kOther;
+    default:
+      return SXSqliteOpenFailure::kOther;
+  }
+}
 
 std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openOrRecover(
     const std::string& path, std::chrono::milliseconds busyTimeout, const std::string& schema,
     std::string& error, std::string& recovered) {
   int code = SQLITE_OK;
   auto connection = openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
-  if (connection || !IsDamaged(path, code)) return connection;
+  if (connection) return connection;
+  SXSqliteFileProbe probe = SXSqliteProbeFile(path);
+  switch (SXSqliteClassifyOpenFailure(code, probe)) {
+    case SXSqliteOpenFailure::kNotWritable:
+      error = NotWritable(path, probe, code);
+      return nullptr;
+    case SXSqliteOpenFailure::kOther:
+      return nullptr;
+    case SXSqliteOpenFailure::kDamaged:
+      break;
+  }
   std::string aside;
   if (auto failed = MoveAside(path, aside)) {
     error += "; cannot move it aside: " + *failed;

@@ -60,7 +60,8 @@ class SXSqliteConnection {
   enum class Mode { kReadWrite, kReadOnly };
 
   // Opens `path`. Read-write creates the file, switches it to WAL with synchronous=NORMAL
-  // (committed rows survive a crash of this process, not a power loss) and runs `schema`.
+  // (committed rows survive a crash of this process, not a power loss) and runs `schema`; a
+  // file that can only be opened for reading is a failure (SQLITE_READONLY).
   // Both modes wait up to `busyTimeout` for another connection's lock. On failure returns
   // nullptr and sets `error`.
   static std::unique_ptr<SXSqliteConnection> open(const std::string& path, Mode mode,
@@ -68,11 +69,12 @@ class SXSqliteConnection {
                                                   const std::string& schema, std::string& error);
 
   // Opens `path` read-write like open(). When the file is there but is no usable database (not
-  // a database, damaged, or a file SQLite cannot open at all), it and its -wal and -shm files
-  // are renamed with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created;
-  // `recovered` then says what was moved where, for the owner's error line. A store that is
-  // busy, or a disk that is full, is never moved aside. On failure returns nullptr and sets
-  // `error`.
+  // a database, damaged, or not a regular file), it and its -wal and -shm files are renamed
+  // with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created; `recovered` then
+  // says what was moved where, for the owner's error line. A store this user may not write
+  // (see SXSqliteClassifyOpenFailure), a busy store or a full disk is never moved aside. On
+  // failure returns nullptr and sets `error` ("... not writable by this user ..." for the
+  // permissions problem).
   static std::unique_ptr<SXSqliteConnection> openOrRecover(const std::string& path,
                                                            std::chrono::milliseconds busyTimeout,
                                                            const std::string& schema,
@@ -103,6 +105,29 @@ class SXSqliteConnection {
 
   sqlite3* db_;
 };
+
+// Why a store could not be opened read-write, which decides whether it is moved aside.
+enum class SXSqliteOpenFailure {
+  kDamaged,      // not a database, damaged, or not a regular file: moved aside and replaced
+  kNotWritable,  // a permissions problem (owner, mode, immutable, read-only mount): kept
+  kOther,        // busy, disk full, out of descriptors, a missing directory: kept
+};
+
+// What the file at a store's path is, as far as telling damage from permissions needs.
+struct SXSqliteFileProbe {
+  bool exists = false;
+  bool regularFile = false;
+  int accessErrno = 0;  // errno of access(2) for reading and writing; 0 when that is allowed
+};
+
+// Looks at `path` with stat(2) and access(2) (with the effective user and group).
+SXSqliteFileProbe SXSqliteProbeFile(const std::string& path);
+
+// `code` is the SQLite result of the failed open. A file this user cannot open for writing
+// (EACCES, EPERM, EROFS, or SQLITE_READONLY) is kNotWritable even when it is also damaged:
+// moving it aside would hide the permissions problem, and the next start after it is fixed
+// still recovers it.
+SXSqliteOpenFailure SXSqliteClassifyOpenFailure(int code, const SXSqliteFileProbe& probe);
 
 // Seconds since the Unix epoch, the unit of every `time` column.
 double SXSqliteNow();

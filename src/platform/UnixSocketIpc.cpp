@@ -287,12 +287,24 @@ bool SXUnixSocketListener::open(std::string& error) {
   ::unlink(options_.socketPath.c_str());  // a stale socket of an earlier run
   asio::local::stream_protocol::endpoint endpoint(options_.socketPath);
   acceptor_.open(endpoint.protocol(), ec);
-  if (!ec) acceptor_.bind(endpoint, ec);
+  if (!ec) {
+    // bind() creates the socket file with 0777 minus the umask. Adding the bits the configured
+    // mode lacks to the process's own umask means the socket is never more open than asked,
+    // not even until the chmod below; files other threads create meanwhile get the narrower
+    // mask (for the instant between the two umask calls, the socket's mask alone).
+    const mode_t refused = ~static_cast<mode_t>(options_.socketMode) & 0777;
+    const mode_t processMask = ::umask(refused);
+    ::umask(processMask | refused);
+    acceptor_.bind(endpoint, ec);
+    ::umask(processMask);
+  }
   if (!ec) acceptor_.listen(asio::socket_base::max_listen_connections, ec);
   if (ec) {
     error = options_.socketPath + ": " + ec.message();
     return false;
   }
+  // The umask can only take bits away, so the exact mode (perhaps wider than the umask) is set
+  // here; until then the socket is at most as open as the mode.
   if (::chmod(options_.socketPath.c_str(), static_cast<mode_t>(options_.socketMode)) != 0) {
     error = SXPosixError(options_.socketPath, errno);
     return false;

@@ -157,7 +157,7 @@ void SXReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
 void SXReportingServerInstance::setConfiguration(std::optional<SXValue> configuration,
                                                  int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("setting configuration");
-  enqueue([fn = __func__, configuration = std::move(configuration), reporterID,
+  enqueue([configuration = std::move(configuration), reporterID,
            reply = std::move(reply)](SXReportingServerInstance& self) {
     if (auto session = self.findReportingSessionForID(reporterID)) {
       session->setConfiguration(configuration ? &*configuration : nullptr);
@@ -181,7 +181,7 @@ void SXReportingServerInstance::reporterID(int64_t reporterID, Reply<SXValue> va
 }
 
 void SXReportingServerInstance::getAllReporters(Reply<std::vector<int64_t>> reply) {
-  enqueue([fn = __func__, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([reply = std::move(reply)](SXReportingServerInstance& self) {
     std::vector<int64_t> reporters;
     if (auto delegate = self.delegate_.lock()) {
       for (const auto& client : delegate->getAllClients()) {
@@ -199,8 +199,7 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
   environment_->counters().messageReceived();
-  enqueue([fn = __func__, message = std::move(message), category, type,
-           reporterIDs = std::move(reporterIDs),
+  enqueue([message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceSend);
     auto delegate = self.delegate_.lock();
@@ -265,7 +264,7 @@ void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReporti
 
 void SXReportingServerInstance::startReportingSessionForID(int64_t reporterID, Reply<bool> reply) {
   SXR_REQUEST_LINE("starting session for reporter %lli", reporterID);
-  enqueue([fn = __func__, reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
+  enqueue([reporterID, reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceStart);
     if (reporterID == 0) return;
     auto session = self.findReportingSessionForID(reporterID);

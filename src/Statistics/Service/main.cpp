@@ -265,11 +265,15 @@ int main(int argc, char** argv) {
   Options options;
   if (int status = parseOptions(argc, argv, options)) return status < 0 ? 0 : status;
 
+  // Stores, preferences and notification files hold client payloads: no access for others.
+  ::umask(0027);
   auto log = std::make_shared<SXStderrLog>(options.logScopes);
   SXPosixFileSystem fs;
+  // The runtime directory has the group of the socket the daemon binds in it, so 0750 still
+  // lets that group reach the socket and the notify directory.
   for (const auto& dir :
        {options.paths.stateDir, options.paths.configDir, options.paths.runtimeDir}) {
-    if (auto error = fs.createDirectory(dir, 0755)) {
+    if (auto error = fs.createDirectory(dir, 0750)) {
       SXLOG(*log, nullptr, SXLogLevel::kError, "cannot create %@: %@", dir, *error);
       return 1;
     }
