@@ -1,5 +1,6 @@
-// A steady stream of messages for a while (SXR_SOAK_SECONDS, 30 s unless set), then a row by
-// row check that every message reached the analytics store and the spool with its payload.
+// A steady stream of messages for a while (SXR_SOAK_SECONDS, one minute unless set), then a
+// row by row check that every message reached the analytics store and the spool with its
+// payload.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
@@ -18,7 +19,7 @@ constexpr int kMessagesPerSecond = 200;
 double soakSeconds() {
   const char* text = std::getenv("SXR_SOAK_SECONDS");
   double seconds = text ? std::atof(text) : 0;
-  return seconds > 0 ? seconds : 30;
+  return seconds > 0 ? seconds : 60;
 }
 
 SXValue payloadOf(int64_t sequence) {
