@@ -166,8 +166,8 @@ TEST(SqliteRecovery, WhatIsNotTheFilesFaultIsNeverMovedAside) {
   SXTestTempDir dir;
   std::string error, recovered;
   // A missing directory: nothing to move, the open just fails.
-  EXPECT_FALSE(SXSqliteConnection::openOrRecover(dir.file("none/store.db"), 1s, kSchema, error,
-                                                 recovered));
+  EXPECT_FALSE(
+      SXSqliteConnection::openOrRecover(dir.file("none/store.db"), 1s, kSchema, error, recovered));
   EXPECT_TRUE(recovered.empty());
   EXPECT_NE(error.find("cannot open"), std::string::npos);
 

@@ -57,8 +57,8 @@ TEST(SoakEndToEnd, EveryMessageOfASteadyStreamIsStored) {
   for (int k = 0; k < kClients; ++k) {
     clients.push_back(daemon.client());
     ASSERT_TRUE(replied(clients[k]->createReportingSession(100 + k)));
-    ASSERT_TRUE(replied(clients[k]->setConfiguration(SXValue{{"HostApplicationDisplayID", "soak"}},
-                                                     100 + k)));
+    ASSERT_TRUE(replied(
+        clients[k]->setConfiguration(SXValue{{"HostApplicationDisplayID", "soak"}}, 100 + k)));
     starts.push_back(clients[k]->startReportingSessionForID(100 + k, kSXWaitForever));
   }
   long before = residentKiB(daemon.pid());
@@ -108,12 +108,11 @@ TEST(SoakEndToEnd, EveryMessageOfASteadyStreamIsStored) {
   EXPECT_TRUE(waitUntil([&] {
     counters = replied(clients[0]->status())["counters"];
     return counters["messages_delivered"]["fernreporting"] == total + kClients;
-  }))
-      << counters.dump();
+  })) << counters.dump();
   EXPECT_EQ(counters["messages_received"], total);
   EXPECT_EQ(counters["messages_delivered"]["tallyvane"], total);
-  std::printf("soak: %lld messages in %.1f s (%d/s over %d clients); daemon RSS %ld KiB before, "
-              "%ld KiB peak, %ld KiB after\n",
-              static_cast<long long>(total), elapsed, kMessagesPerSecond, kClients, before, peak,
-              after);
+  std::printf(
+      "soak: %lld messages in %.1f s (%d/s over %d clients); daemon RSS %ld KiB before, "
+      "%ld KiB peak, %ld KiB after\n",
+      static_cast<long long>(total), elapsed, kMessagesPerSecond, kClients, before, peak, after);
 }

@@ -85,10 +85,9 @@ void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply
       reply(true);
       return;
     }
-    auto session =
-        SXReportingSession::initWithID(self.environment_, reporterID,
-                                       SXValue::array({self.processIdentifier_}),
-                                       self.standaloneBudget_);
+    auto session = SXReportingSession::initWithID(self.environment_, reporterID,
+                                                  SXValue::array({self.processIdentifier_}),
+                                                  self.standaloneBudget_);
     if (session) {
       auto [it, added] = self.sessions_.insert_or_assign(reporterID, std::move(session));
       if (added) self.environment_->counters().sessionsAdded(1);
