@@ -98,6 +98,19 @@ TEST(MsgpackValue, NonStringKeysAreRefused) {
   EXPECT_THROW(SXValueFromMsgpack(handle.get()), SXValueConversionError);
 }
 
+TEST(SXValueText, WithMemberIsTheTextOfTheMergedCopy) {
+  const SXValue host = "player";
+  for (const SXValue& payload : {SXValue::object(), SXValue{{"a", 1}},
+                                 SXValue{{"zz", {1, 2}}, {"HostApplicationDisplayID", "x"}},
+                                 SXValue{{"Host", 1}, {"Hz", 2.5}, {"b", {{"c", "\xff\n"}}}},
+                                 SXValue::array({1}), SXValue()}) {
+    SXValue merged = payload.is_object() ? payload : SXValue::object();
+    merged["HostApplicationDisplayID"] = host;
+    EXPECT_EQ(SXValueTextWithMember(payload, "HostApplicationDisplayID", host), SXValueText(merged))
+        << payload.dump();
+  }
+}
+
 TEST(SXValueText, EveryKind) {
   EXPECT_EQ(SXValueText(SXValue("a b")), "a b");
   EXPECT_EQ(SXValueText(SXValue(-3)), "-3");

@@ -217,6 +217,64 @@ TEST(SXReportingSessionLifecycle, SecondStartKeepsEverythingAndRestartContinuesN
   EXPECT_EQ(t.fern->events(Kind::kToken).size(), 2u);
 }
 
+TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAndStop) {
+  TestEnvironment t;
+  auto session = makeSession(t);
+  // Nothing runs on the session's queue until drain(): every task below waits there together.
+  session->sendMessage({{"n", 0}}, 3, 1, nullptr);  // not started: standalone
+  session->start();
+  session->sendMessage({{"n", 1}}, 3, 1, nullptr);
+  session->sendMessage({{"n 2", 2}}, 3, 1, nullptr);
+  session->stop();
+  session->sendMessage({{"n", 3}}, 3, 1, nullptr);  // stopped: standalone
+  session->start();
+  session->sendMessage({{"n", 4}}, 3, 1, nullptr);
+  session->stop();
+  t.drain();
+  ASSERT_TRUE(t.fern->waitFor(
+      [](const auto& events) {
+        auto count = [&](Kind kind) {
+          return std::count_if(events.begin(), events.end(),
+                               [&](const auto& e) { return e.kind == kind; });
+        };
+        return count(Kind::kFlush) == 2 && count(Kind::kSingleMessage) == 2;
+      },
+      std::chrono::seconds(5)))
+      << SXValue(t.log->messages()).dump(1);
+
+  auto payloads = [&](int fernSession) {
+    std::vector<SXValue> out;
+    for (const auto& e : t.fern->messages(fernSession)) out.push_back(e.payload);
+    return out;
+  };
+  // Each run of messages reached the session that was open when it was accepted, rewritten,
+  // in order, with that run's summary last.
+  auto first = payloads(1);
+  ASSERT_EQ(first.size(), 3u);
+  EXPECT_EQ(first[0], (SXValue{{"n", 1}}));
+  EXPECT_EQ(first[1], (SXValue{{"n_2", 2}}));
+  EXPECT_EQ(first[2]["Playback_Start_3"], R"({"n_2":2})");
+  auto second = payloads(2);
+  ASSERT_EQ(second.size(), 2u);
+  EXPECT_EQ(second[0], (SXValue{{"n", 4}}));
+  EXPECT_EQ(second[1]["Playback_Start_5"], R"({"n":4})");
+  std::vector<SXValue> singles;
+  for (const auto& e : t.fern->events(Kind::kSingleMessage)) singles.push_back(e.payload);
+  EXPECT_EQ(singles.size(), 2u);
+  // Each session's flush follows its own messages.
+  std::vector<std::pair<Kind, int>> order;
+  for (const auto& e : t.fern->events()) {
+    if (e.kind == Kind::kMessage || e.kind == Kind::kFlush) order.push_back({e.kind, e.session});
+  }
+  EXPECT_EQ(order, (std::vector<std::pair<Kind, int>>{{Kind::kMessage, 1},
+                                                      {Kind::kMessage, 1},
+                                                      {Kind::kMessage, 1},
+                                                      {Kind::kFlush, 1},
+                                                      {Kind::kMessage, 2},
+                                                      {Kind::kMessage, 2},
+                                                      {Kind::kFlush, 2}}));
+}
+
 TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
   TestEnvironment t;
   auto session = makeSession(t);

@@ -64,6 +64,23 @@ TEST_F(SqliteTallyvaneTest, PayloadsThatAreNotPlainJsonAreStillStored) {
   EXPECT_TRUE(log_->contains("boom"));
 }
 
+TEST_F(SqliteTallyvaneTest, ATextProviderIsStoredAsItIsAndTheDictionaryIsNeverBuilt) {
+  SXSqliteTallyvane tallyvane(db_, log_);
+  bool built = false;
+  tallyvane.sendEventLazy(
+      "e",
+      [&]() -> SXValue {
+        built = true;
+        return SXValue::object();
+      },
+      [] { return std::string(R"({"a":1})"); });
+  tallyvane.flush();
+  auto rows = SXTestQuery(db_, "SELECT payload_json FROM events");
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["payload_json"], R"({"a":1})");
+  EXPECT_FALSE(built);
+}
+
 TEST_F(SqliteTallyvaneTest, LazySendReturnsBeforeTheProviderRunsOnAnotherThread) {
   SXSqliteTallyvane tallyvane(db_, log_);
   std::promise<void> sent;

@@ -2,6 +2,11 @@
 
 #include "SXReportingSession.h"
 #include "SXReportingUtility.h"
+#include "common/SXValueText.h"
+
+namespace {
+const std::string kHostKey = "HostApplicationDisplayID";
+}  // namespace
 
 std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
                                                   SXReportingMessageType type) {
@@ -10,13 +15,20 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
 }
 
 void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment,
-                                             const SXValue& payload, SXReportingCategory category,
+                                             std::shared_ptr<const SXValue> payload,
+                                             SXReportingCategory category,
                                              SXReportingMessageType type,
                                              const SXReportingSession& session) {
-  // The provider may run later on another thread, so it owns its own copy.
-  auto copy = std::make_shared<SXValue>(payload.is_object() ? payload : SXValue::object());
-  (*copy)["HostApplicationDisplayID"] = session.hostApplicationName();
   thread_local SXReportingPairNameCache names;
   const std::string& name = names.get(category, type, [&] { return eventName(category, type); });
-  environment.platform().tallyvane->sendEventLazy(name, [copy] { return *copy; });
+  auto host = std::make_shared<const SXValue>(session.hostApplicationName());
+  environment.platform().tallyvane->sendEventLazy(
+      name,
+      [payload, host] {
+        SXValue copy = payload->is_object() ? *payload : SXValue::object();
+        copy[kHostKey] = *host;
+        return copy;
+      },
+      // A store of JSON text gets the same payload's text without the copy.
+      [payload, host] { return SXValueTextWithMember(*payload, kHostKey, *host); });
 }

@@ -9,8 +9,15 @@ class SXReportingSession;
 
 class SXReportingTallyvaneBridge {
  public:
+  // `payload` is never changed by anyone, so the event's copy of it (with the host name) is
+  // made when the analytics service asks for it, on the service's thread.
+  static void handleEvent(SXReportingEnvironment& environment,
+                          std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+                          SXReportingMessageType type, const SXReportingSession& session);
   static void handleEvent(SXReportingEnvironment& environment, const SXValue& payload,
                           SXReportingCategory category, SXReportingMessageType type,
-                          const SXReportingSession& session);
+                          const SXReportingSession& session) {
+    handleEvent(environment, std::make_shared<const SXValue>(payload), category, type, session);
+  }
   static std::string eventName(SXReportingCategory category, SXReportingMessageType type);
 };

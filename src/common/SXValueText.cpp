@@ -27,3 +27,35 @@ std::string SXValueText(const SXValue& value) {
       return value.dump(-1, ' ', false, SXValue::error_handler_t::replace);
   }
 }
+
+std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& key,
+                                  const SXValue& value) {
+  std::string text = "{";
+  // The serializer SXValue::dump uses, writing straight into `text`.
+  nlohmann::detail::serializer<SXValue> serializer(
+      nlohmann::detail::output_adapter<char, std::string>(text), ' ',
+      SXValue::error_handler_t::replace);
+  bool first = true;
+  auto member = [&](const std::string& name, const SXValue& member) {
+    if (!first) text += ',';
+    first = false;
+    serializer.dump(SXValue(name), false, false, 0);
+    text += ':';
+    serializer.dump(member, false, false, 0);
+  };
+  bool placed = false;
+  if (dictionary.is_object()) {
+    // Members come in key order, as in the dump of the merged dictionary.
+    for (const auto& [name, member_value] : dictionary.items()) {
+      if (!placed && !(name < key)) {
+        member(key, value);
+        placed = true;
+        if (name == key) continue;
+      }
+      member(name, member_value);
+    }
+  }
+  if (!placed) member(key, value);
+  text += '}';
+  return text;
+}

@@ -10,5 +10,10 @@
 // in ascending order), null as "(null)".
 std::string SXValueText(const SXValue& value);
 
+// SXValueText of a copy of `dictionary` (an empty one when it is not a dictionary) whose
+// member `key` is set to `value`, made without the copy.
+std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& key,
+                                  const SXValue& value);
+
 // Shortest decimal text of a double that reads back to the same double.
 std::string SXDoubleText(double value);

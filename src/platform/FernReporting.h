@@ -37,6 +37,21 @@ class FernSecureHierarchyToken {
   std::string identifier_;
 };
 
+// One message of FernReportingSession::sendMessages; what it points to outlives the call.
+struct FernMessage {
+  uint16_t category;
+  uint16_t type;
+  const SXValue* payload;
+  // The payload as compact JSON (SXValueText), when the caller already has it; a service that
+  // stores JSON may take it instead of serialising the payload again.
+  const std::string* payloadJson = nullptr;
+};
+
+struct FernSendOutcome {
+  bool sent = false;
+  std::optional<FernError> error;  // may be set when not sent
+};
+
 using FernBackendsCompletion = std::function<void(std::optional<std::vector<std::string>>)>;
 using FernFlushCompletion = std::function<void(std::optional<FernError>)>;
 
@@ -49,6 +64,16 @@ class FernReportingSession {
   // Sends one message. On failure returns false and may set `error`.
   virtual bool sendMessage(uint16_t category, uint16_t type, const SXValue& payload,
                            std::optional<FernError>& error) = 0;
+  // Sends several messages, in order, as sendMessage would one after another; a service may
+  // store them together. Returns one outcome per message, in the same order.
+  virtual std::vector<FernSendOutcome> sendMessages(const std::vector<FernMessage>& messages) {
+    std::vector<FernSendOutcome> outcomes(messages.size());
+    for (size_t i = 0; i < messages.size(); ++i) {
+      outcomes[i].sent = sendMessage(messages[i].category, messages[i].type, *messages[i].payload,
+                                     outcomes[i].error);
+    }
+    return outcomes;
+  }
   // Calls `completion` later with an error, or with nothing on success.
   virtual void flushMessages(FernFlushCompletion completion) = 0;
 };

@@ -38,6 +38,8 @@ class SXSqliteBatchWriter {
     std::string threadName;
     size_t maxQueued = 100'000;
     size_t maxBatch = 1'000;
+    // How long the writer waits for a batch to fill before it commits what it has.
+    std::chrono::milliseconds linger{2};
     std::chrono::milliseconds busyTimeout = kSXSqliteBusyTimeout;
   };
 

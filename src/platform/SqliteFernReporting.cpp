@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <span>
 
 #include "common/SXValueText.h"
 #include "platform/CompletionThread.h"
@@ -60,21 +61,23 @@ class SXSqliteFernReporting::Spool {
   // Stores one row; sets `rowId` to its id. On failure returns why.
   std::optional<std::string> insert(Kind kind, const SXSqliteRow& row, int64_t* rowId = nullptr) {
     PendingRow mine{kind, &row, rowId, std::nullopt, false};
-    std::unique_lock lock(mutex_);
-    queued_.push_back(&mine);
-    idle_.wait(lock, [&] { return mine.done || !busy_; });
-    if (mine.done) return mine.result;
-    busy_ = true;
-    std::vector<PendingRow*> batch;
-    batch.swap(queued_);
-    lock.unlock();
-    commitBatch(batch);
-    lock.lock();
-    for (PendingRow* pending : batch) pending->done = true;
-    busy_ = false;
-    lock.unlock();
-    idle_.notify_all();
+    PendingRow* rows[] = {&mine};
+    insertAll(rows);
     return mine.result;
+  }
+
+  // Stores `rows` in order, in one transaction; returns each row's outcome.
+  std::vector<std::optional<std::string>> insertAll(Kind kind,
+                                                    const std::vector<SXSqliteRow>& rows) {
+    std::vector<PendingRow> mine;
+    mine.reserve(rows.size());
+    for (const SXSqliteRow& row : rows) mine.push_back({kind, &row, nullptr, std::nullopt, false});
+    std::vector<PendingRow*> pointers;
+    for (PendingRow& pending : mine) pointers.push_back(&pending);
+    insertAll(pointers);
+    std::vector<std::optional<std::string>> results;
+    for (PendingRow& pending : mine) results.push_back(std::move(pending.result));
+    return results;
   }
 
   // Copies the WAL into the database; SQLite syncs the WAL before it does.
@@ -135,6 +138,28 @@ class SXSqliteFernReporting::Spool {
    private:
     Spool& spool_;
   };
+
+  // Queues `mine` together, then waits while another caller commits them, or commits
+  // everything queued so far itself. Returns once every row of `mine` is done.
+  void insertAll(std::span<PendingRow* const> mine) {
+    if (mine.empty()) return;
+    std::unique_lock lock(mutex_);
+    queued_.insert(queued_.end(), mine.begin(), mine.end());
+    // Rows queued in one go are taken by one committer, so the last tells of all of them.
+    PendingRow& last = *mine.back();
+    idle_.wait(lock, [&] { return last.done || !busy_; });
+    if (last.done) return;
+    busy_ = true;
+    std::vector<PendingRow*> batch;
+    batch.swap(queued_);
+    lock.unlock();
+    commitBatch(batch);
+    lock.lock();
+    for (PendingRow* pending : batch) pending->done = true;
+    busy_ = false;
+    lock.unlock();
+    idle_.notify_all();
+  }
 
   // REQUIRES: busy_ set by this thread. Writes `batch` in one transaction; every row gets the
   // transaction's outcome.
@@ -219,6 +244,23 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
     if (!failed) return true;
     error = FernError{"cannot store the message: " + *failed};
     return false;
+  }
+
+  std::vector<FernSendOutcome> sendMessages(const std::vector<FernMessage>& messages) override {
+    std::vector<SXSqliteRow> rows;
+    rows.reserve(messages.size());
+    SXSqliteField time = SXSqliteNow();
+    for (const FernMessage& message : messages) {
+      rows.push_back({time, id_, nullptr, nullptr, int64_t(message.category), int64_t(message.type),
+                      message.payloadJson ? *message.payloadJson : Json(*message.payload)});
+    }
+    auto results = spool_->insertAll(kMessageRow, rows);
+    std::vector<FernSendOutcome> outcomes(messages.size());
+    for (size_t i = 0; i < results.size(); ++i) {
+      outcomes[i].sent = !results[i];
+      if (results[i]) outcomes[i].error = FernError{"cannot store the message: " + *results[i]};
+    }
+    return outcomes;
   }
 
   void flushMessages(FernFlushCompletion completion) override {

@@ -31,6 +31,14 @@ bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider
   });
 }
 
+bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider provider,
+                                      SXPayloadTextProvider json) {
+  if (!json) return sendEventLazy(name, std::move(provider));
+  return writer_.enqueue([time = SXSqliteNow(), name, json = std::move(json)] {
+    return SXSqliteRow{time, name, json()};
+  });
+}
+
 void SXSqliteTallyvane::flush() { writer_.flush(); }
 
 std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,

@@ -29,6 +29,9 @@ class SXSqliteTallyvane final : public SXTallyvane {
   ~SXSqliteTallyvane() override = default;
 
   bool sendEventLazy(const std::string& name, SXPayloadProvider provider) override;
+  // Stores the text `json` returns; `provider` is not called.
+  bool sendEventLazy(const std::string& name, SXPayloadProvider provider,
+                     SXPayloadTextProvider json) override;
 
   // Returns once every event offered before the call is committed (or dropped on failure).
   // Not from a payload provider.

@@ -7,6 +7,7 @@
 #include "sxreporting/types.h"
 
 using SXPayloadProvider = std::function<SXValue()>;
+using SXPayloadTextProvider = std::function<std::string()>;
 
 class SXTallyvane {
  public:
@@ -15,4 +16,13 @@ class SXTallyvane {
   // of its own, when it records the event. Returns whether the event was accepted.
   // May be called from any thread.
   virtual bool sendEventLazy(const std::string& name, SXPayloadProvider provider) = 0;
+
+  // The same, for a service that records payloads as JSON: `json` returns exactly the
+  // compact JSON text (SXValueText) of what `provider` returns, built without the dictionary.
+  // A service calls one of the two; by default, `provider`.
+  virtual bool sendEventLazy(const std::string& name, SXPayloadProvider provider,
+                             SXPayloadTextProvider json) {
+    (void)json;
+    return sendEventLazy(name, std::move(provider));
+  }
 };

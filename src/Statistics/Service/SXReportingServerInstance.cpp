@@ -198,7 +198,9 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
   environment_->counters().messageReceived();
-  enqueue([message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
+  // Shared and never changed from here on: every sink reads this one copy.
+  enqueue([message = std::make_shared<const SXValue>(std::move(message)), category, type,
+           reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceSend);
     auto delegate = self.delegate_.lock();
@@ -215,7 +217,8 @@ void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory
   });
 }
 
-void SXReportingServerInstance::routeAddressed(const SXValue& message, SXReportingCategory category,
+void SXReportingServerInstance::routeAddressed(const std::shared_ptr<const SXValue>& message,
+                                               SXReportingCategory category,
                                                SXReportingMessageType type,
                                                const std::vector<int64_t>& reporterIDs) {
   for (int64_t reporterID : reporterIDs) {
@@ -224,12 +227,14 @@ void SXReportingServerInstance::routeAddressed(const SXValue& message, SXReporti
     if (!session) continue;
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
-    SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
+    SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
+                                             *session);
     session->sendMessage(message, category, type, nullptr);
   }
 }
 
-void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReportingCategory category,
+void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXValue>& message,
+                                               SXReportingCategory category,
                                                SXReportingMessageType type) {
   auto delegate = delegate_.lock();
   std::vector<std::shared_ptr<SXReportingSession>> active;
@@ -257,7 +262,8 @@ void SXReportingServerInstance::routeBroadcast(const SXValue& message, SXReporti
     session->sendMessage(message, category, type, nullptr);
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
-    SXReportingJoulebookUtility::handleEvent(*environment_, &message, category, type, *session);
+    SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
+                                             *session);
   }
 }
 

@@ -72,9 +72,9 @@ class SXReportingServerInstance final
   // Whether the session limits leave room for a new session under `reporterID` (replacing
   // one always does); logs and counts a refusal as the function `fn`.
   bool hasRoomForSession(int64_t reporterID, const char* fn) const;
-  void routeAddressed(const SXValue& message, SXReportingCategory category,
+  void routeAddressed(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
                       SXReportingMessageType type, const std::vector<int64_t>& reporterIDs);
-  void routeBroadcast(const SXValue& message, SXReportingCategory category,
+  void routeBroadcast(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
                       SXReportingMessageType type);
   void sendDriverDeltaAndStop(const std::shared_ptr<SXReportingSession>& session);
 

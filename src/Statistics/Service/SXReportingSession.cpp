@@ -52,6 +52,40 @@ SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   return rewritten;
 }
 
+std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
+  if (!rewritten_) {
+    // A payload without spaced keys is its own rewrite: shared, not copied.
+    rewritten_ = SXReportingSessionHasSpacedKeys(*caller_)
+                     ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*caller_))
+                     : caller_;
+  }
+  return rewritten_;
+}
+
+std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
+  std::lock_guard lock(mutex_);
+  if (text_ && !rewritten_) {
+    // Asked for after the dictionaries were released: the text is a dump, so it parses.
+    return std::make_shared<const SXValue>(SXValue::parse(*text_));
+  }
+  return rewrittenLocked();
+}
+
+std::string SXReportingMessagePayload::text() {
+  std::lock_guard lock(mutex_);
+  if (!text_) {
+    text_ = SXValueText(*rewrittenLocked());
+    caller_ = nullptr;
+    rewritten_ = nullptr;
+  }
+  return *text_;
+}
+
+SXValue SXReportingAggregateEntry::toValue() const {
+  if (dictionary_) return *dictionary_;
+  return SXValue{{messageId_, *payload_->rewritten()}};
+}
+
 std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(
     std::shared_ptr<SXReportingEnvironment> environment, int64_t reporterID,
     SXValue processIdentifiers, std::shared_ptr<SXReportingPendingBudget> standaloneBudget) {
@@ -114,9 +148,9 @@ void SXReportingSession::start() {
 
   auto setup = std::make_shared<SetupState>();
   setup->backendsFound = fernReportingSessionStarted();
-  fernReportingQueue_->async([self = shared_from_this(), userInfo = this->userInfo(),
-                              name = serviceName(),
-                              setup] { self->runSetupTask(userInfo, name, setup); });
+  queueTask([self = shared_from_this(), userInfo = this->userInfo(), name = serviceName(), setup] {
+    self->runSetupTask(userInfo, name, setup);
+  });
 }
 
 void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
@@ -181,7 +215,7 @@ void SXReportingSession::stop() {
           reporterID());
     sendMessage(*summary, kSummaryCategory, kSummaryType, true, nullptr);
   }
-  fernReportingQueue_->async([self = shared_from_this()] { self->runTeardownTask(); });
+  queueTask([self = shared_from_this()] { self->runTeardownTask(); });
   if (auto aggregate = aggregate_.load()) {
     std::lock_guard lock(aggregate->mutex);
     aggregate_.store(nullptr);
@@ -251,7 +285,7 @@ std::vector<SXValue> SXReportingSession::aggregatedPayloadEntries() const {
   auto aggregate = aggregate_.load();
   if (!aggregate) return out;
   std::lock_guard lock(aggregate->mutex);
-  for (const auto& entry : aggregate->entries) out.push_back(*entry);
+  for (const auto& entry : aggregate->entries) out.push_back(entry.toValue());
   return out;
 }
 

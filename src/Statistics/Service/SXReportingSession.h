@@ -16,16 +16,69 @@
 #include <vector>
 
 #include "SXReportingEnvironment.h"
+#include "common/SXValueText.h"
 #include "platform/FernReporting.h"
 
-// The payloads gathered since start. Every change of `entries` and every walk over it holds
-// `mutex`, the recursive lock keyed on the array itself. Entries never change once appended,
-// so a walk may copy the pointers and read them after unlocking.
-// Holds at most the environment's maxAggregateEntries; what did not fit is only counted.
+// A message's payload as a session's aggregate and its send task share it. The caller's
+// dictionary is never changed; the key rewrite and the text of the rewritten payload are made
+// at most once each, by whichever needs them first: normally the send task on the session's
+// queue, so that the server queue only hands the payload on. Once the text exists the
+// dictionaries are released, so that a started session's aggregate holds only text until
+// stop. Any thread.
+class SXReportingMessagePayload {
+ public:
+  explicit SXReportingMessagePayload(std::shared_ptr<const SXValue> callerPayload)
+      : caller_(std::move(callerPayload)) {}
+  // The payload with every space in its keys replaced by "_".
+  std::shared_ptr<const SXValue> rewritten();
+  // SXValueText of the rewritten payload (compact JSON).
+  std::string text();
+
+ private:
+  // REQUIRES: mutex_ held.
+  std::shared_ptr<const SXValue> rewrittenLocked();
+
+  std::mutex mutex_;
+  std::shared_ptr<const SXValue> caller_;     // GUARDED_BY(mutex_); released with the text
+  std::shared_ptr<const SXValue> rewritten_;  // GUARDED_BY(mutex_); released with the text
+  std::optional<std::string> text_;           // GUARDED_BY(mutex_)
+};
+
+// One entry of a session's aggregate: a message entry ({message id: rewritten payload}) or
+// any other dictionary (an orientation report, the configuration at the head).
+class SXReportingAggregateEntry {
+ public:
+  SXReportingAggregateEntry(std::string messageId,
+                            std::shared_ptr<SXReportingMessagePayload> payload)
+      : messageId_(std::move(messageId)), payload_(std::move(payload)) {}
+  explicit SXReportingAggregateEntry(SXValue dictionary)
+      : dictionary_(std::make_shared<const SXValue>(std::move(dictionary))) {}
+
+  // Calls `visit(key, text of the value)` for each of the entry's keys, in key order.
+  template <typename Visit>
+  void forEachText(Visit&& visit) const;
+  // The entry as a dictionary.
+  SXValue toValue() const;
+
+ private:
+  std::string messageId_;                               // message entries
+  std::shared_ptr<SXReportingMessagePayload> payload_;  // message entries
+  std::shared_ptr<const SXValue> dictionary_;           // every other entry
+};
+
+template <typename Visit>
+void SXReportingAggregateEntry::forEachText(Visit&& visit) const {
+  if (!dictionary_) {
+    visit(messageId_, payload_->text());
+    return;
+  }
+  for (const auto& [key, value] : dictionary_->items()) visit(key, SXValueText(value));
+}
+
 struct SXReportingAggregate {
   std::recursive_mutex mutex;
-  std::vector<std::shared_ptr<const SXValue>> entries;  // GUARDED_BY(mutex)
-  uint64_t dropped = 0;                                 // GUARDED_BY(mutex)
+  std::vector<SXReportingAggregateEntry> entries;  // GUARDED_BY(mutex)
+  uint64_t dropped = 0;                            // GUARDED_BY(mutex)
 };
 
 using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
@@ -61,8 +114,17 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   void stop();
 
   std::string messageIdForCategory(SXReportingCategory category, SXReportingMessageType type);
-  void sendMessage(const SXValue& payload, SXReportingCategory category,
+  // `payload` is never changed; the shared form lets the send task read it without a copy.
+  void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply);
+  void sendMessage(const SXValue& payload, SXReportingCategory category,
+                   SXReportingMessageType type, bool sync, SXReportingSendReply reply) {
+    sendMessage(std::make_shared<const SXValue>(payload), category, type, sync, std::move(reply));
+  }
+  void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+                   SXReportingMessageType type, SXReportingSendReply reply) {
+    sendMessage(std::move(payload), category, type, false, std::move(reply));
+  }
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, SXReportingSendReply reply) {
     sendMessage(payload, category, type, false, std::move(reply));
@@ -125,17 +187,37 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->sessionLogScope(); }
 
+  // One accepted message, waiting for its send task on the session's queue.
+  struct PendingSend {
+    std::shared_ptr<SXReportingMessagePayload> payload;
+    std::shared_ptr<const SXValue> callerPayload;  // as the caller gave it; only for verbose lines
+    SXReportingCategory category;
+    SXReportingMessageType type;
+    bool startedSnapshot;
+  };
+  // Messages accepted one after another with no other task of the session's queue between
+  // them. They share one task on that queue, so that the server-reporting session can store
+  // them together instead of one transaction each; the order of everything on the queue is
+  // the order of acceptance, as with one task per message.
+  struct SendBatch {
+    std::vector<PendingSend> sends;  // GUARDED_BY(SXReportingSession::batchMutex_)
+  };
+
   void runSetupTask(SXValue userInfo, std::string serviceName, std::shared_ptr<SetupState> setup);
-  void runSendTask(const std::shared_ptr<const SXValue>& entry,
-                   const std::shared_ptr<const SXValue>& callerPayload,
-                   SXReportingCategory category, SXReportingMessageType type, bool startedSnapshot);
+  // Queues the send task of one message, joining the batch still waiting on the queue if any.
+  void queueSend(PendingSend send);
+  // Queues any other task on the session's queue; messages accepted later go behind it.
+  void queueTask(SXTask task);
+  void runSendBatch(const std::shared_ptr<SendBatch>& batch);
+  // The send task of started messages in a row: all to the server-reporting session at once.
+  void sendToServerReporting(const std::vector<PendingSend>& sends);
   void runTeardownTask();
   void registerOrientationCallbacks();
   void unregisterOrientationCallbacks();
   void recordOrientation(const char* mode, const char* nameKey, const char* timeKey,
                          int32_t orientation);
   // Appends under the aggregate's lock, unless the session has no aggregate at that moment.
-  void appendToAggregate(std::shared_ptr<const SXValue> entry);
+  void appendToAggregate(SXReportingAggregateEntry entry);
   void writeSummaryFile(const std::shared_ptr<SXReportingAggregate>& aggregate,
                         const SXValue& userInfo);
 
@@ -149,6 +231,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;  // may be null
   std::atomic<std::shared_ptr<SXReportingAggregate>> aggregate_;
   std::map<std::string, int64_t> messageTypeCounts_;  // server queue only
+  std::mutex batchMutex_;
+  std::shared_ptr<SendBatch> openBatch_;  // GUARDED_BY(batchMutex_): its task has not run yet
 
   mutable std::mutex mutex_;
   std::string serviceName_ = "unknown";                                // GUARDED_BY(mutex_)

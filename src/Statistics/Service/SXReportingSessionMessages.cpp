@@ -17,7 +17,7 @@ std::string SXReportingSession::messageIdForCategory(SXReportingCategory categor
   return kind + "_" + std::to_string(count);
 }
 
-void SXReportingSession::appendToAggregate(std::shared_ptr<const SXValue> entry) {
+void SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry) {
   auto aggregate = aggregate_.load();
   if (!aggregate) return;
   std::lock_guard lock(aggregate->mutex);
@@ -38,67 +38,120 @@ void SXReportingSession::appendToAggregate(std::shared_ptr<const SXValue> entry)
   }
 }
 
-void SXReportingSession::sendMessage(const SXValue& payload, SXReportingCategory category,
-                                     SXReportingMessageType type, bool /*sync*/,
-                                     SXReportingSendReply reply) {
+void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
+                                     SXReportingCategory category, SXReportingMessageType type,
+                                     bool /*sync*/, SXReportingSendReply reply) {
   SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
         reporterID());
-  SXValue rewritten = SXReportingSessionUnderscoreKeys(payload);
+  // The key rewrite is made once, where it is first needed (normally by the send task).
+  auto rewritten = std::make_shared<SXReportingMessagePayload>(payload);
   std::string messageId = messageIdForCategory(category, type);
-  // The aggregate entry and the send task share one immutable copy of the rewritten payload.
-  auto entry = std::make_shared<const SXValue>(SXValue{{messageId, std::move(rewritten)}});
-  appendToAggregate(entry);
+  if (aggregate_.load()) {
+    appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten));
+  }
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
-  // The caller's own payload appears only in a verbose line; keep a copy only for that.
-  auto callerPayload = log().isEnabled(scope(), kSXLogVerboseLevel)
-                           ? std::make_shared<const SXValue>(payload)
-                           : nullptr;
-  fernReportingQueue_->async([self = shared_from_this(), entry,
-                              callerPayload = std::move(callerPayload), category, type,
-                              startedSnapshot] {
-    self->runSendTask(entry, callerPayload, category, type, startedSnapshot);
-  });
+  // The caller's own payload appears only in a verbose line; keep it only for that.
+  if (!log().isEnabled(scope(), kSXLogVerboseLevel)) payload = nullptr;
+  queueSend({std::move(rewritten), std::move(payload), category, type, startedSnapshot});
   if (reply) reply(std::nullopt);
 }
 
-void SXReportingSession::runSendTask(const std::shared_ptr<const SXValue>& entry,
-                                     const std::shared_ptr<const SXValue>& callerPayload,
-                                     SXReportingCategory category, SXReportingMessageType type,
-                                     bool startedSnapshot) {
-  const SXValue& rewritten = entry->begin().value();
-  if (!startedSnapshot) {
-    SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
-    // Shares the aggregate entry's payload instead of copying it.
-    std::shared_ptr<const SXValue> payload(entry, &rewritten);
-    // The session's configuration is not part of a standalone message, so none is copied.
-    sendSingleMessage(environment_, std::move(payload), category, type, serviceType(), nullptr,
-                      nullptr, standaloneBudget_);
-    return;
+void SXReportingSession::queueSend(PendingSend send) {
+  std::shared_ptr<SendBatch> fresh;
+  {
+    std::lock_guard lock(batchMutex_);
+    if (!openBatch_) openBatch_ = fresh = std::make_shared<SendBatch>();
+    openBatch_->sends.push_back(std::move(send));
   }
+  // Queued outside the lock: a queue may run the task before async() returns.
+  if (fresh) {
+    fernReportingQueue_->async([self = shared_from_this(), fresh] { self->runSendBatch(fresh); });
+  }
+}
+
+void SXReportingSession::queueTask(SXTask task) {
+  {
+    std::lock_guard lock(batchMutex_);
+    openBatch_ = nullptr;  // its task is ahead of this one; later sends start a new batch
+  }
+  fernReportingQueue_->async(std::move(task));
+}
+
+void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
+  std::vector<PendingSend> sends;
+  {
+    std::lock_guard lock(batchMutex_);
+    sends.swap(batch->sends);
+    if (openBatch_ == batch) openBatch_ = nullptr;
+  }
+  // Each message in acceptance order; started ones in a row go to the server-reporting
+  // session together.
+  std::vector<PendingSend> started;
+  for (PendingSend& send : sends) {
+    if (send.startedSnapshot) {
+      started.push_back(std::move(send));
+      continue;
+    }
+    sendToServerReporting(started);
+    started.clear();
+    SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
+    // The session's configuration is not part of a standalone message, so none is copied.
+    sendSingleMessage(environment_, send.payload->rewritten(), send.category, send.type,
+                      serviceType(), nullptr, nullptr, standaloneBudget_);
+  }
+  sendToServerReporting(started);
+}
+
+void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& sends) {
+  if (sends.empty()) return;
   if (serviceType() == kTestServiceType) {
-    SXLOG(log(), scope(), SXLogLevel::kInfo, "transactions aren't allowed on this platform");
+    for (size_t i = 0; i < sends.size(); ++i) {
+      SXLOG(log(), scope(), SXLogLevel::kInfo, "transactions aren't allowed on this platform");
+    }
     return;
   }
   auto fernSession = fernReportingSession();
   if (!fernSession) {
-    SXLOG(log(), scope(), SXLogLevel::kError, "%@", "No valid FernReportingSession");
-    return;
-  }
-  std::optional<FernError> error;
-  bool sent =
-      fernSession->sendMessage(static_cast<uint16_t>(category & 0xFFFF), type, rewritten, error);
-  if (!sent) {
-    if (error) {
-      SXLOG(log(), scope(), SXLogLevel::kError, "error sending message %@",
-            error->localizedDescription);
+    for (size_t i = 0; i < sends.size(); ++i) {
+      SXLOG(log(), scope(), SXLogLevel::kError, "%@", "No valid FernReportingSession");
     }
     return;
   }
-  environment_->counters().delivered(SXReportingSink::kFernReporting);
-  SXLOG(log(), scope(), SXLogLevel::kDebug,
-        "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
-        callerPayload ? *callerPayload : SXValue(), static_cast<int32_t>(category), type);
+  // The dictionaries are held here while the service reads them; the text is the one the
+  // aggregate keeps, made once for both.
+  std::vector<std::shared_ptr<const SXValue>> payloads;
+  std::vector<std::string> texts;
+  payloads.reserve(sends.size());
+  texts.reserve(sends.size());
+  for (const PendingSend& send : sends) {
+    payloads.push_back(send.payload->rewritten());
+    texts.push_back(send.payload->text());
+  }
+  std::vector<FernMessage> messages;
+  messages.reserve(sends.size());
+  for (size_t i = 0; i < sends.size(); ++i) {
+    messages.push_back({static_cast<uint16_t>(sends[i].category & 0xFFFF), sends[i].type,
+                        payloads[i].get(), &texts[i]});
+  }
+  std::vector<FernSendOutcome> outcomes = fernSession->sendMessages(messages);
+  // The verbose line's arguments cost a description per message; build them only when wanted.
+  bool verbose = log().isEnabled(scope(), kSXLogVerboseLevel);
+  for (size_t i = 0; i < sends.size(); ++i) {
+    if (!outcomes[i].sent) {
+      if (outcomes[i].error) {
+        SXLOG(log(), scope(), SXLogLevel::kError, "error sending message %@",
+              outcomes[i].error->localizedDescription);
+      }
+      continue;
+    }
+    environment_->counters().delivered(SXReportingSink::kFernReporting);
+    if (!verbose) continue;
+    SXLOG(log(), scope(), SXLogLevel::kDebug,
+          "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
+          sends[i].callerPayload ? *sends[i].callerPayload : SXValue(),
+          static_cast<int32_t>(sends[i].category), sends[i].type);
+  }
 }
 
 namespace {

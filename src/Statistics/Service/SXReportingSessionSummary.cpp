@@ -61,19 +61,18 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   auto aggregate = aggregate_.load();
   if (!aggregate) return std::nullopt;
 
-  std::vector<std::shared_ptr<const SXValue>> entries;
+  std::map<std::string, std::vector<std::string>> working;
   uint64_t dropped = 0;
   {
     std::lock_guard lock(aggregate->mutex);
-    entries = aggregate->entries;
+    if (aggregate->entries.empty()) return std::nullopt;
     dropped = aggregate->dropped;
-  }
-  if (entries.empty()) return std::nullopt;
-
-  std::map<std::string, std::vector<std::string>> working;
-  working[kSummaryKey].push_back(std::to_string(serviceType()));
-  for (const auto& entry : entries) {
-    for (const auto& [key, value] : entry->items()) working[key].push_back(SXValueText(value));
+    working[kSummaryKey].push_back(std::to_string(serviceType()));
+    for (const auto& entry : aggregate->entries) {
+      entry.forEachText([&](const std::string& key, std::string text) {
+        working[key].push_back(std::move(text));
+      });
+    }
   }
   SXValue event = SXValue::object();
   for (const auto& [key, texts] : working) {
@@ -89,7 +88,7 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   SXValue info = userInfo();
   {
     std::lock_guard lock(aggregate->mutex);
-    aggregate->entries.insert(aggregate->entries.begin(), std::make_shared<const SXValue>(info));
+    aggregate->entries.insert(aggregate->entries.begin(), SXReportingAggregateEntry(info));
   }
   if (SXReportingUtilityIsInternalBuild(*environment_)) writeSummaryFile(aggregate, info);
   return event;
@@ -100,7 +99,7 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
   SXValue list = SXValue::array();
   {
     std::lock_guard lock(aggregate->mutex);
-    for (const auto& entry : aggregate->entries) list.push_back(*entry);
+    for (const auto& entry : aggregate->entries) list.push_back(entry.toValue());
   }
   std::string json;
   try {
@@ -181,5 +180,5 @@ void SXReportingSession::recordOrientation(const char* mode, const char* nameKey
   SXLOG_IN(kOrientationFunction, log(), scope(), SXLogLevel::kDebug,
            "Orientation handler callback mode=%s orientation=\"%@\" app=\"%@\", time=%@, id=\"%@\"",
            mode, name, app != info.end() ? *app : SXValue(), time, orientationCallbackID());
-  appendToAggregate(std::make_shared<const SXValue>(SXValue{{nameKey, name}, {timeKey, time}}));
+  appendToAggregate(SXReportingAggregateEntry(SXValue{{nameKey, name}, {timeKey, time}}));
 }
