@@ -136,7 +136,9 @@ set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
 set(CPACK_STRIP_FILES ON)
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 set(CPACK_DEBIAN_PACKAGE_SECTION admin)
-# libc6, libstdc++6, libsqlite3-0, libcurl4, ... as dpkg-shlibdeps finds them in the binaries.
+# libc6, libstdc++6, libsqlite3-0, ... as dpkg-shlibdeps finds them in the binaries; libcurl4
+# is loaded at run time (by the otlp-http backend), so dpkg-shlibdeps cannot see it.
+set(CPACK_DEBIAN_PACKAGE_DEPENDS "libcurl4")
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_DEBIAN_PACKAGE_RECOMMENDS "systemd")

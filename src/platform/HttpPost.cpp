@@ -1,15 +1,67 @@
 #include "platform/HttpPost.h"
 
 #include <curl/curl.h>
+#include <dlfcn.h>
+
+#include <type_traits>
 
 namespace {
 
 constexpr size_t kKeptResponseBytes = 4096;
 
-// curl_global_init is not thread-safe, so it runs once, before the first handle.
-void InitCurlOnce() {
-  static const CURLcode initialised = curl_global_init(CURL_GLOBAL_DEFAULT);
-  (void)initialised;  // a failed init shows up as a failing curl_easy_init
+// libcurl, loaded when the first request is made rather than linked: only the otlp-http backend
+// posts anything, and libcurl's own libraries (TLS, Kerberos, ...) would add some 4 MiB to the
+// resident set of every daemon, exporting or not.
+struct CurlApi {
+  decltype(&curl_global_init) globalInit = nullptr;
+  decltype(&curl_easy_init) easyInit = nullptr;
+  decltype(&curl_easy_cleanup) easyCleanup = nullptr;
+  decltype(&curl_easy_reset) easyReset = nullptr;
+  decltype(&curl_easy_setopt) easySetopt = nullptr;
+  decltype(&curl_easy_perform) easyPerform = nullptr;
+  decltype(&curl_easy_getinfo) easyGetinfo = nullptr;
+  decltype(&curl_easy_strerror) easyStrerror = nullptr;
+  decltype(&curl_slist_append) slistAppend = nullptr;
+  decltype(&curl_slist_free_all) slistFreeAll = nullptr;
+};
+
+// The loaded library, or nullptr with `why`. Loads and initialises once (curl_global_init is
+// not thread-safe); the library stays loaded for the life of the process.
+const CurlApi* Curl(std::string& why) {
+  static std::string failure;
+  static const CurlApi* api = []() -> const CurlApi* {
+    void* library = ::dlopen("libcurl.so.4", RTLD_NOW | RTLD_LOCAL);
+    if (!library) {
+      failure = std::string("cannot load libcurl: ") + ::dlerror();
+      return nullptr;
+    }
+    static CurlApi loaded;
+    bool complete = true;
+    auto bind = [&](auto& function, const char* name) {
+      function =
+          reinterpret_cast<std::remove_reference_t<decltype(function)>>(::dlsym(library, name));
+      if (!function) {
+        failure = "libcurl has no ";
+        failure += name;
+        complete = false;
+      }
+    };
+    bind(loaded.globalInit, "curl_global_init");
+    bind(loaded.easyInit, "curl_easy_init");
+    bind(loaded.easyCleanup, "curl_easy_cleanup");
+    bind(loaded.easyReset, "curl_easy_reset");
+    bind(loaded.easySetopt, "curl_easy_setopt");
+    bind(loaded.easyPerform, "curl_easy_perform");
+    bind(loaded.easyGetinfo, "curl_easy_getinfo");
+    bind(loaded.easyStrerror, "curl_easy_strerror");
+    bind(loaded.slistAppend, "curl_slist_append");
+    bind(loaded.slistFreeAll, "curl_slist_free_all");
+    if (!complete) return nullptr;
+    loaded.globalInit(CURL_GLOBAL_DEFAULT);  // a failure shows up as a failing easyInit
+    return &loaded;
+  }();
+  if (!api) why = failure;
+  return api;
 }
 
 size_t KeepResponse(char* data, size_t size, size_t count, void* user) {
@@ -26,10 +78,11 @@ int AbortWhenCancelled(void* user, curl_off_t, curl_off_t, curl_off_t, curl_off_
 }
 
 struct HeaderList {
+  const CurlApi& curl;
   curl_slist* list = nullptr;
-  ~HeaderList() { curl_slist_free_all(list); }
+  ~HeaderList() { curl.slistFreeAll(list); }
   bool add(const std::string& line) {
-    curl_slist* grown = curl_slist_append(list, line.c_str());
+    curl_slist* grown = curl.slistAppend(list, line.c_str());
     if (grown) list = grown;
     return grown != nullptr;
   }
@@ -39,12 +92,15 @@ struct HeaderList {
 
 struct SXCurlHttpPost::Handle {
   struct Cleanup {
-    void operator()(CURL* curl) const { curl_easy_cleanup(curl); }
+    const CurlApi* api;
+    void operator()(CURL* curl) const { api->easyCleanup(curl); }
   };
+  explicit Handle(const CurlApi& api) : api(api), curl(nullptr, Cleanup{&api}) {}
+  const CurlApi& api;
   std::unique_ptr<CURL, Cleanup> curl;
 };
 
-SXCurlHttpPost::SXCurlHttpPost() { InitCurlOnce(); }
+SXCurlHttpPost::SXCurlHttpPost() = default;
 
 SXCurlHttpPost::~SXCurlHttpPost() = default;
 
@@ -55,16 +111,21 @@ SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
     result.error = "cancelled";
     return result;
   }
-  if (!handle_) handle_ = std::make_unique<Handle>();
-  if (!handle_->curl) handle_->curl.reset(curl_easy_init());
+  if (!handle_) {
+    const CurlApi* api = Curl(result.error);
+    if (!api) return result;
+    handle_ = std::make_unique<Handle>(*api);
+  }
+  const CurlApi& api = handle_->api;
+  if (!handle_->curl) handle_->curl.reset(api.easyInit());
   CURL* curl = handle_->curl.get();
   if (!curl) {
     result.error = "cannot make an HTTP handle";
     return result;
   }
-  curl_easy_reset(curl);  // keeps the open connection, forgets the last request's options
+  api.easyReset(curl);  // keeps the open connection, forgets the last request's options
 
-  HeaderList headers;
+  HeaderList headers{api};
   // No "Expect: 100-continue" round trip before larger bodies.
   bool headersMade = headers.add("Expect:");
   for (const auto& [name, value] : request.headers) headersMade &= headers.add(name + ": " + value);
@@ -73,35 +134,35 @@ SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
     return result;
   }
   char errorText[CURL_ERROR_SIZE] = "";
-  curl_easy_setopt(curl, CURLOPT_URL, request.url.c_str());
-  curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http,https");
-  curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-  curl_easy_setopt(curl, CURLOPT_POST, 1L);
-  curl_easy_setopt(curl, CURLOPT_POSTFIELDS, request.body.data());
-  curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(request.body.size()));
-  curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers.list);
-  curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, static_cast<long>(request.timeout.count()));
-  curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, KeepResponse);
-  curl_easy_setopt(curl, CURLOPT_WRITEDATA, &result.body);
-  curl_easy_setopt(curl, CURLOPT_NOPROGRESS, 0L);
-  curl_easy_setopt(curl, CURLOPT_XFERINFOFUNCTION, AbortWhenCancelled);
-  curl_easy_setopt(curl, CURLOPT_XFERINFODATA, &cancelled_);
-  curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText);
+  api.easySetopt(curl, CURLOPT_URL, request.url.c_str());
+  api.easySetopt(curl, CURLOPT_PROTOCOLS_STR, "http,https");
+  api.easySetopt(curl, CURLOPT_NOSIGNAL, 1L);
+  api.easySetopt(curl, CURLOPT_POST, 1L);
+  api.easySetopt(curl, CURLOPT_POSTFIELDS, request.body.data());
+  api.easySetopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(request.body.size()));
+  api.easySetopt(curl, CURLOPT_HTTPHEADER, headers.list);
+  api.easySetopt(curl, CURLOPT_TIMEOUT_MS, static_cast<long>(request.timeout.count()));
+  api.easySetopt(curl, CURLOPT_WRITEFUNCTION, KeepResponse);
+  api.easySetopt(curl, CURLOPT_WRITEDATA, &result.body);
+  api.easySetopt(curl, CURLOPT_NOPROGRESS, 0L);
+  api.easySetopt(curl, CURLOPT_XFERINFOFUNCTION, AbortWhenCancelled);
+  api.easySetopt(curl, CURLOPT_XFERINFODATA, &cancelled_);
+  api.easySetopt(curl, CURLOPT_ERRORBUFFER, errorText);
 
-  CURLcode code = curl_easy_perform(curl);
+  CURLcode code = api.easyPerform(curl);
   if (code != CURLE_OK) {
-    result.error = *errorText ? errorText : curl_easy_strerror(code);
+    result.error = *errorText ? errorText : api.easyStrerror(code);
     result.body.clear();
     handle_->curl.reset();  // a broken connection is not reused
   } else {
     long status = 0;
-    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+    api.easyGetinfo(curl, CURLINFO_RESPONSE_CODE, &status);
     result.status = static_cast<int>(status);
   }
   // The handle outlives this call; it must not point at our locals.
   if (handle_->curl) {
-    curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, nullptr);
-    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, nullptr);
+    api.easySetopt(curl, CURLOPT_ERRORBUFFER, nullptr);
+    api.easySetopt(curl, CURLOPT_HTTPHEADER, nullptr);
   }
   return result;
 }
