@@ -4,7 +4,7 @@ ASAN_BUILD ?= build-asan
 JOBS       ?= $(shell nproc)
 DEB_PACKAGES = cmake g++ make pkg-config libasio-dev libmsgpack-cxx-dev nlohmann-json3-dev \
                libsqlite3-dev sqlite3 systemtap-sdt-dev libgtest-dev libgmock-dev googletest \
-               libcurl4-openssl-dev python3-msgpack help2man dpkg-dev
+               libcurl4-openssl-dev python3-msgpack help2man dpkg-dev libjemalloc-dev
 
 .PHONY: deps build run test test-asan clean format install package fuzz
 

@@ -20,6 +20,13 @@
 #include "platform/StderrLog.h"
 #include "platform/UnixSocketIpc.h"
 
+#ifdef SXR_JEMALLOC
+// jemalloc's options, read when it starts: two arenas for our two cores, and freed pages
+// handed back to the system within a second of a burst rather than ten.
+extern "C" const char* malloc_conf;
+const char* malloc_conf = "narenas:2,dirty_decay_ms:1000,muzzy_decay_ms:0";
+#endif
+
 namespace {
 
 constexpr const char* kUsage =
