@@ -52,29 +52,45 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
   return Status::kBroken;
 }
 
-std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
-                                          std::optional<uint32_t>& msgid) {
+namespace {
+
+// Whether `message` is a request; on failure says why. Sets `msgid` whenever it is usable.
+bool IsRequest(const SXValue& message, std::string& why, std::optional<uint32_t>& msgid) {
   msgid.reset();
   if (!message.is_array() || message.size() != 4 || !message[0].is_number_integer() ||
       message[0].get<int64_t>() != 0) {
     why = "not a MessagePack-RPC request [0, msgid, method, params]";
-    return std::nullopt;
+    return false;
   }
   if (!message[1].is_number_integer() || message[1].get<int64_t>() < 0 ||
       message[1].get<uint64_t>() > UINT32_MAX) {
     why = "msgid is not an unsigned 32-bit integer";
-    return std::nullopt;
+    return false;
   }
   msgid = static_cast<uint32_t>(message[1].get<uint64_t>());
   if (!message[2].is_string()) {
     why = "method is not a string";
-    return std::nullopt;
+    return false;
   }
   if (!message[3].is_array()) {
     why = "params is not an array";
-    return std::nullopt;
+    return false;
   }
+  return true;
+}
+
+}  // namespace
+
+std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
+                                          std::optional<uint32_t>& msgid) {
+  if (!IsRequest(message, why, msgid)) return std::nullopt;
   return RpcRequest{*msgid, message[2].get<std::string>(), message[3]};
+}
+
+std::optional<RpcRequest> RpcParseRequest(SXValue&& message, std::string& why,
+                                          std::optional<uint32_t>& msgid) {
+  if (!IsRequest(message, why, msgid)) return std::nullopt;
+  return RpcRequest{*msgid, std::move(message[2].get_ref<std::string&>()), std::move(message[3])};
 }
 
 std::optional<RpcResponse> RpcParseResponse(const SXValue& message) {

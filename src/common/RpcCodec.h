@@ -55,6 +55,9 @@ struct RpcResponse {
 // `msgid` is set whenever the message carried a usable one, so the caller can still answer.
 std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
                                           std::optional<uint32_t>& msgid);
+// The same, moving the method and params out of `message`.
+std::optional<RpcRequest> RpcParseRequest(SXValue&& message, std::string& why,
+                                          std::optional<uint32_t>& msgid);
 std::optional<RpcResponse> RpcParseResponse(const SXValue& message);
 
 void RpcEncodeRequest(msgpack::sbuffer& out, uint32_t msgid, std::string_view method,

@@ -24,9 +24,9 @@ using SXIpcReplyFn = std::function<void(const SXValue& error, const SXValue& res
 class SXIpcExportedObject {
  public:
   virtual ~SXIpcExportedObject() = default;
-  // Called on the connection's thread for each request, in arrival order.
-  virtual void handleRequest(std::string_view method, const SXValue& params,
-                             SXIpcReplyFn reply) = 0;
+  // Called on the connection's thread for each request, in arrival order. `params` is the
+  // object's to keep or move from.
+  virtual void handleRequest(std::string_view method, SXValue params, SXIpcReplyFn reply) = 0;
 };
 
 class SXIpcConnection {

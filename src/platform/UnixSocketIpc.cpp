@@ -164,10 +164,11 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     return drained ? Dispatched::kDrained : Dispatched::kStopped;
   }
 
-  bool dispatch(const SXValue& message) {
+  // Moves the request out of `message`.
+  bool dispatch(SXValue& message) {
     std::string why;
     std::optional<uint32_t> msgid;
-    auto request = RpcParseRequest(message, why, msgid);
+    auto request = RpcParseRequest(std::move(message), why, msgid);
     if (!request) {
       if (!msgid) {
         SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(), why);
@@ -183,7 +184,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     if (requestQueue_) queued_.fetch_add(1);
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
     uint32_t id = request->msgid;
-    exported_->handleRequest(request->method, request->params,
+    exported_->handleRequest(request->method, std::move(request->params),
                              [weak, id](const SXValue& error, const SXValue& result) {
                                if (auto self = weak.lock()) self->send(id, error, result);
                              });

@@ -127,7 +127,7 @@ std::string SXReportingServiceExport::validate(std::string_view method, const SX
   return "unknown method '" + std::string(method) + "'";
 }
 
-void SXReportingServiceExport::handleRequest(std::string_view method, const SXValue& params,
+void SXReportingServiceExport::handleRequest(std::string_view method, SXValue params,
                                              SXIpcReplyFn reply) {
   std::string why = validate(method, params);
   if (!why.empty()) {
@@ -137,7 +137,8 @@ void SXReportingServiceExport::handleRequest(std::string_view method, const SXVa
   dispatch(method, params, std::move(reply));
 }
 
-void SXReportingServiceExport::dispatch(std::string_view method, const SXValue& params,
+// Moves what it hands on out of `params`.
+void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params,
                                         SXIpcReplyFn reply) {
   auto boolReply = [reply](bool value) { reply(nullptr, value); };
   auto& instance = *instance_;
@@ -151,7 +152,7 @@ void SXReportingServiceExport::dispatch(std::string_view method, const SXValue& 
         params[0].get<int64_t>(), [reply](SXReportingServiceType type) { reply(nullptr, type); });
   } else if (method == sxr::method::kSetConfiguration) {
     std::optional<SXValue> configuration;
-    if (!params[0].is_null()) configuration = params[0];
+    if (!params[0].is_null()) configuration = std::move(params[0]);
     instance.setConfiguration(std::move(configuration), params[1].get<int64_t>(), boolReply);
   } else if (method == sxr::method::kStart) {
     instance.startReportingSessionForID(params[0].get<int64_t>(), boolReply);
@@ -159,8 +160,8 @@ void SXReportingServiceExport::dispatch(std::string_view method, const SXValue& 
     std::optional<std::vector<int64_t>> ids;
     if (!params[3].is_null()) ids = params[3].get<std::vector<int64_t>>();
     instance.sendMessage(
-        params[0], params[1].get<SXReportingCategory>(), params[2].get<SXReportingMessageType>(),
-        std::move(ids),
+        std::move(params[0]), params[1].get<SXReportingCategory>(),
+        params[2].get<SXReportingMessageType>(), std::move(ids),
         [reply](std::optional<SXError> error) { reply(nullptr, errorValue(error)); });
   } else if (method == sxr::method::kStop) {
     instance.stopReportingSessionForID(params[0].get<int64_t>(), boolReply);

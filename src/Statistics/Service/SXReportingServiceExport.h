@@ -20,13 +20,13 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
                            std::weak_ptr<SXReportingServiceDelegate> delegate,
                            std::shared_ptr<SXReportingEnvironment> environment);
 
-  void handleRequest(std::string_view method, const SXValue& params, SXIpcReplyFn reply) override;
+  void handleRequest(std::string_view method, SXValue params, SXIpcReplyFn reply) override;
 
   // Checks a request without running it: an empty string when it is well formed, else why not.
   static std::string validate(std::string_view method, const SXValue& params);
 
  private:
-  void dispatch(std::string_view method, const SXValue& params, SXIpcReplyFn reply);
+  void dispatch(std::string_view method, SXValue& params, SXIpcReplyFn reply);
 
   const std::shared_ptr<SXReportingServerInstance> instance_;
   const std::weak_ptr<SXReportingServiceDelegate> delegate_;
