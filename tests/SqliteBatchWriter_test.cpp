@@ -30,7 +30,7 @@ class SqliteBatchWriterTest : public ::testing::Test {
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
 };
 
-TEST_F(SqliteBatchWriterTest, AFullQueueRefusesRowsAndSaysSoOnceEachWay) {
+TEST_F(SqliteBatchWriterTest, AFullQueueHoldsNewRowsUntilThereIsRoomAndLosesNone) {
   SXSqliteBatchWriter writer(Options(3, 1000), log_);
   std::promise<void> gate;
   std::promise<void> writerBusy;
@@ -43,19 +43,18 @@ TEST_F(SqliteBatchWriterTest, AFullQueueRefusesRowsAndSaysSoOnceEachWay) {
   }));
   ASSERT_EQ(writerBusy.get_future().wait_for(20s), std::future_status::ready);
   for (int v = 1; v <= 3; ++v) EXPECT_TRUE(writer.enqueue(Value(v)));
-  EXPECT_FALSE(writer.enqueue(Value(98)));
-  EXPECT_FALSE(writer.enqueue(Value(99)));
-  EXPECT_EQ(log_->lines().size(), 1u);
-  EXPECT_TRUE(log_->contains("3 rows wait to be written; refusing new ones"));
+  auto blocked = std::async(std::launch::async, [&] { return writer.enqueue(Value(4)); });
+  EXPECT_EQ(blocked.wait_for(200ms), std::future_status::timeout);
+  EXPECT_TRUE(log_->contains("3 rows wait to be written; new ones wait for room"));
 
   gate.set_value();
-  writer.flush();
-  EXPECT_TRUE(log_->contains("queue has room again; 2 rows were refused"));
-  EXPECT_TRUE(writer.enqueue(Value(4)));
+  EXPECT_TRUE(blocked.get());
+  EXPECT_TRUE(writer.enqueue(Value(5)));
   writer.flush();
   auto rows = SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id");
-  ASSERT_EQ(rows.size(), 5u);
-  for (int v = 0; v <= 4; ++v) EXPECT_EQ(rows[v]["v"], v);
+  ASSERT_EQ(rows.size(), 6u);
+  for (int v = 0; v <= 5; ++v) EXPECT_EQ(rows[v]["v"], v);
+  EXPECT_EQ(log_->lines().size(), 1u);
 }
 
 TEST_F(SqliteBatchWriterTest, EachBatchIsOneTransaction) {

@@ -27,11 +27,11 @@ struct SXSqliteBatchWriter::Core {
   std::mutex mutex;
   std::condition_variable wake;          // rows queued or stopping; guarded by `mutex`
   std::condition_variable progress;      // `done` advanced; guarded by `mutex`
+  std::condition_variable room;          // the queue has room again; guarded by `mutex`
   std::deque<RowProducer> queue;         // guarded by `mutex`
   uint64_t enqueued = 0;                 // guarded by `mutex`: rows ever accepted
   uint64_t done = 0;                     // guarded by `mutex`: rows committed or dropped
-  uint64_t refused = 0;                  // guarded by `mutex`: refused since the queue filled
-  bool full = false;                     // guarded by `mutex`
+  bool full = false;                     // guarded by `mutex`: a caller waits for room
   bool stopping = false;                 // guarded by `mutex`
   int flushWaiters = 0;                  // guarded by `mutex`: flush() calls waiting
   std::atomic<uint64_t> writeErrors{0};  // rows lost to a store that failed; any thread reads
@@ -114,7 +114,6 @@ void SXSqliteBatchWriter::Core::writeBatch(std::vector<RowProducer>& batch) {
 void SXSqliteBatchWriter::Core::run() {
   for (;;) {
     std::vector<RowProducer> batch;
-    uint64_t refusedBefore = 0;
     {
       std::unique_lock lock(mutex);
       wake.wait(lock, [&] { return stopping || !queue.empty(); });
@@ -130,12 +129,8 @@ void SXSqliteBatchWriter::Core::run() {
       queue.erase(queue.begin(), queue.begin() + static_cast<ptrdiff_t>(n));
       if (full && queue.size() < options.maxQueued) {
         full = false;
-        refusedBefore = std::exchange(refused, 0);
+        room.notify_all();
       }
-    }
-    if (refusedBefore > 0) {
-      SXLOG(*log, nullptr, SXLogLevel::kError, "%s: queue has room again; %llu %s were refused",
-            options.path, refusedBefore, options.rowNoun);
     }
     size_t n = batch.size();
     writeBatch(batch);
@@ -164,6 +159,7 @@ SXSqliteBatchWriter::~SXSqliteBatchWriter() {
     core_->stopping = true;
   }
   core_->wake.notify_all();
+  core_->room.notify_all();
   // A producer may hold the last reference to our owner, so the writer thread can end up here;
   // it cannot join itself, and it drains the queue on its own (it shares the core).
   if (thread_.get_id() == std::this_thread::get_id()) {
@@ -174,29 +170,26 @@ SXSqliteBatchWriter::~SXSqliteBatchWriter() {
 }
 
 bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
-  bool accepted = false;
-  bool startedRefusing = false;
+  Core& core = *core_;
   {
-    std::lock_guard lock(core_->mutex);
-    if (core_->stopping) return false;
-    if (core_->queue.size() < core_->options.maxQueued) {
-      core_->queue.push_back(std::move(producer));
-      ++core_->enqueued;
-      accepted = true;
-    } else {
-      startedRefusing = !core_->full;
-      core_->full = true;
-      ++core_->refused;
+    std::unique_lock lock(core.mutex);
+    if (!core.stopping && core.queue.size() >= core.options.maxQueued) {
+      // Back-pressure rather than loss: the caller waits until the writer has made room.
+      if (!core.full) {
+        core.full = true;
+        SXLOG(*core.log, nullptr, SXLogLevel::kError,
+              "%s: %zu %s wait to be written; new ones wait for room", core.options.path,
+              core.options.maxQueued, core.options.rowNoun);
+      }
+      core.room.wait(lock,
+                     [&] { return core.stopping || core.queue.size() < core.options.maxQueued; });
     }
+    if (core.stopping) return false;
+    core.queue.push_back(std::move(producer));
+    ++core.enqueued;
   }
-  if (accepted) {
-    core_->wake.notify_one();
-  } else if (startedRefusing) {
-    SXLOG(*core_->log, nullptr, SXLogLevel::kError,
-          "%s: %zu %s wait to be written; refusing new ones", core_->options.path,
-          core_->options.maxQueued, core_->options.rowNoun);
-  }
-  return accepted;
+  core.wake.notify_one();
+  return true;
 }
 
 void SXSqliteBatchWriter::flush() {

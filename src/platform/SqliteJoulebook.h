@@ -4,10 +4,10 @@
 // logged; `payload_json` is the entry as compact JSON (invalid UTF-8 replaced). Filters are
 // not stored: nothing here reads the log back by filter.
 //
-// logRegisteredEvent() may be called from any thread and never waits on the disk: a writer
+// logRegisteredEvent() may be called from any thread and does not wait on the disk: a writer
 // thread commits queued entries in batches. On failure (the store cannot be opened, a write
 // fails) one error line goes to the default log of `log` and that batch is lost; later entries
-// are written as usual. When 100,000 entries already wait, new ones are dropped.
+// are written as usual. While 100,000 entries already wait, a new one waits for room.
 #pragma once
 
 #include <memory>

@@ -3,11 +3,13 @@
 // (`<state-dir>/tallyvane.db`). `time` is seconds since the Unix epoch at the moment the event
 // was offered; `payload_json` is the provider's value as compact JSON (invalid UTF-8 replaced).
 //
-// sendEventLazy() may be called from any thread and never waits on the disk: it queues the
+// sendEventLazy() may be called from any thread and does not wait on the disk: it queues the
 // event and returns true. A writer thread calls the payload provider and commits queued events
 // in batches. On failure (the store cannot be opened, a write fails) one error line goes to
-// the default log of `log` and that batch is lost; later events are written as usual. When
-// 100,000 events already wait, sendEventLazy() drops the event and returns false.
+// the default log of `log` and that batch is lost; later events are written as usual. While
+// 100,000 events already wait, sendEventLazy() waits for room: a burst faster than the disk
+// slows its senders down (through the server queue and then the connections' back-pressure)
+// instead of losing events.
 #pragma once
 
 #include <memory>
