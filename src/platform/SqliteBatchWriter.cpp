@@ -187,6 +187,10 @@ bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
     if (core.stopping) return false;
     core.queue.push_back(std::move(producer));
     ++core.enqueued;
+    // The writer needs waking only when it waits for a first row or has a full batch; while
+    // it lingers for a batch to gather, waking it for every row would undo the gathering.
+    size_t queued = core.queue.size();
+    if (queued != 1 && queued != core.options.maxBatch) return true;
   }
   core.wake.notify_one();
   return true;
