@@ -239,11 +239,9 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
 
   bool sendMessage(uint16_t category, uint16_t type, const SXValue& payload,
                    std::optional<FernError>& error) override {
-    auto failed = spool_->insert(kMessageRow, {SXSqliteNow(), id_, nullptr, nullptr,
-                                               int64_t(category), int64_t(type), Json(payload)});
-    if (!failed) return true;
-    error = FernError{"cannot store the message: " + *failed};
-    return false;
+    FernSendOutcome outcome = std::move(sendMessages({{category, type, &payload}}).front());
+    error = std::move(outcome.error);
+    return outcome.sent;
   }
 
   std::vector<FernSendOutcome> sendMessages(const std::vector<FernMessage>& messages) override {

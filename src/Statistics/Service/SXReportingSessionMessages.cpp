@@ -120,19 +120,18 @@ void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& s
   }
   // The dictionaries are held here while the service reads them; the text is the one the
   // aggregate keeps, made once for both.
+  // (Reserved up front, so the messages' pointers into both stay valid.)
   std::vector<std::shared_ptr<const SXValue>> payloads;
   std::vector<std::string> texts;
+  std::vector<FernMessage> messages;
   payloads.reserve(sends.size());
   texts.reserve(sends.size());
+  messages.reserve(sends.size());
   for (const PendingSend& send : sends) {
     payloads.push_back(send.payload->rewritten());
     texts.push_back(send.payload->text());
-  }
-  std::vector<FernMessage> messages;
-  messages.reserve(sends.size());
-  for (size_t i = 0; i < sends.size(); ++i) {
-    messages.push_back({static_cast<uint16_t>(sends[i].category & 0xFFFF), sends[i].type,
-                        payloads[i].get(), &texts[i]});
+    messages.push_back({static_cast<uint16_t>(send.category & 0xFFFF), send.type,
+                        payloads.back().get(), &texts.back()});
   }
   std::vector<FernSendOutcome> outcomes = fernSession->sendMessages(messages);
   // The verbose line's arguments cost a description per message; build them only when wanted.
