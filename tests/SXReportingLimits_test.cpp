@@ -1,6 +1,6 @@
-// The guardrails: session limits, the aggregate cap and the standalone budget. Each must
-// leave every reply as it is, keep what it refuses visible (log line, counter, summary key)
-// and lose no message.
+// The guardrails: session limits, request sizes, the aggregate caps, the standalone budget and
+// the error-line budget. Each keeps what it refuses visible (error reply or log line, and a
+// counter), and none loses a message it accepted.
 #include "SXReportingLimits.h"
 
 #include <gtest/gtest.h>
@@ -66,15 +66,17 @@ TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing)
   auto b = s.connect(11);
   for (int64_t id : {1, 2, 3}) EXPECT_EQ(s.call(*a, sxr::method::kCreate, {id}), true) << id;
   EXPECT_EQ(s.call(*a, sxr::method::kGetAllReporters, SXValue::array()), SXValue({1, 2}));
-  EXPECT_TRUE(s.t.log->contains("session limit reached: client 10 already has 2 sessions "
-                                "(--max-sessions-per-client); reporter 3 not created"));
+  EXPECT_TRUE(
+      s.t.log->contains("session limit reached: client 10 already has 2 sessions "
+                        "(--max-sessions-per-client); reporter 3 not created"));
   EXPECT_EQ(s.call(*a, sxr::method::kCreate, {2}), true);  // replacing takes no new room
   EXPECT_EQ(s.dropped("sessions_per_client"), 1u);
 
   EXPECT_EQ(s.call(*b, sxr::method::kCreate, {4}), true);
   EXPECT_EQ(s.call(*b, sxr::method::kCreate, {5}), true);
-  EXPECT_TRUE(s.t.log->contains("session limit reached: the service already has 3 sessions "
-                                "(--max-sessions); reporter 5 of client 11 not created"));
+  EXPECT_TRUE(
+      s.t.log->contains("session limit reached: the service already has 3 sessions "
+                        "(--max-sessions); reporter 5 of client 11 not created"));
   EXPECT_EQ(s.dropped("sessions_total"), 1u);
   EXPECT_EQ(s.status()["gauges"]["sessions_live"], 3u);
   // A refused session really is absent: lookups miss it.
@@ -90,38 +92,53 @@ TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing)
   a->end(true);
   s.t.drain();
   a.reset();
-  EXPECT_EQ(s.status()["gauges"], (SXValue{{"sessions_live", 2}, {"clients_live", 1}}));
+  EXPECT_EQ(s.status()["gauges"]["sessions_live"], 2u);
+  EXPECT_EQ(s.status()["gauges"]["clients_live"], 1u);
 }
 
-TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndTheSummaryCountsTheRest) {
-  TestEnvironment t;
-  auto environment = limitedEnvironment(t, {.maxAggregateEntries = 3});
-  auto session = SXReportingSession::initWithID(environment, 42, SXValue::array({1}));
-  session->setServiceType(7);
-  session->start();
-  for (int i = 0; i < 5; ++i) session->sendMessage({{"i", i}}, 3, 1, nullptr);
-  EXPECT_EQ(session->aggregatedPayloadEntries().size(), 3u);
-  EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kAggregateEntries), 2u);
-  EXPECT_EQ(t.log->count("aggregate of reporter 42 is full (3 entries, --max-aggregate-entries); "
-                         "further entries are sent but not aggregated"),
-            1u);
-  t.drain();
-  EXPECT_EQ(t.fern->events(Kind::kMessage).size(), 5u);
+// Entries are refused by count at once, and by bytes once the texts of earlier entries have
+// been made on the session's queue; either way every message is still sent, and one error line
+// says the summary is incomplete.
+TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncomplete) {
+  struct Case {
+    SXReportingLimits limits;
+    SXReportingGuardrail guardrail;
+    size_t kept;  // of 1 + 4 messages
+  };
+  const Case cases[] = {
+      {{.maxAggregateEntries = 3}, SXReportingGuardrail::kAggregateEntries, 3},
+      {{.maxAggregateBytes = 1}, SXReportingGuardrail::kAggregateBytes, 1},
+      {{.maxAggregateBytesTotal = 1}, SXReportingGuardrail::kAggregateBytes, 1},
+  };
+  for (const Case& c : cases) {
+    TestEnvironment t;
+    auto environment = limitedEnvironment(t, c.limits);
+    auto session = SXReportingSession::initWithID(environment, 42, SXValue::array({1}));
+    session->setServiceType(7);
+    session->start();
+    session->sendMessage({{"i", 0}}, 3, 1, nullptr);
+    t.drain();
+    for (int i = 1; i < 5; ++i) session->sendMessage({{"i", i}}, 3, 1, nullptr);
+    EXPECT_EQ(session->aggregatedPayloadEntries().size(), c.kept);
+    EXPECT_EQ(environment->counters().droppedBy(c.guardrail), 5 - c.kept);
+    EXPECT_EQ(t.log->countContaining("aggregate of reporter 42 is full"), 1u);
+    EXPECT_TRUE(t.log->contains("further messages are sent but left out of its summary"));
+    t.drain();
+    EXPECT_EQ(t.fern->events(Kind::kMessage).size(), 5u);
 
-  auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary);
-  EXPECT_EQ((*summary)[SXReportingSession::kDroppedEntriesKey], "2");
-  EXPECT_EQ(summary->size(), 5u);  // service type, three ids, the dropped count
-  session->stop();
-  t.drain();
+    auto summary = session->createSummaryEventForSession();
+    ASSERT_TRUE(summary);
+    EXPECT_EQ(summary->size(), 1 + c.kept);  // the service type and the kept ids, nothing else
+    session->stop();
+    t.drain();
+    EXPECT_EQ(environment->counters().aggregateBytes(), 0u);  // the stopped aggregate is gone
 
-  // A fresh start has room again, and a summary without drops has no such key.
-  session->start();
-  session->sendMessage({{"i", 9}}, 3, 1, nullptr);
-  summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary);
-  EXPECT_FALSE(summary->contains(SXReportingSession::kDroppedEntriesKey));
-  session->stop();
+    // A fresh start has room again.
+    session->start();
+    session->sendMessage({{"i", 9}}, 3, 1, nullptr);
+    EXPECT_EQ(session->aggregatedPayloadEntries().size(), 1u);
+    session->stop();
+  }
 }
 
 TEST(SXReportingLimitsAggregate, NeverStartedSessionsAreCappedToo) {
@@ -135,24 +152,24 @@ TEST(SXReportingLimitsAggregate, NeverStartedSessionsAreCappedToo) {
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kAggregateEntries), 2u);
 }
 
-TEST(SXReportingLimitsStandalone, AFullBudgetSendsAtOnceAndLosesNothing) {
+TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
   TestEnvironment t;  // its random source always draws 59
-  auto environment = limitedEnvironment(t, {.maxPendingStandalone = 2});
-  auto budget = std::make_shared<SXReportingPendingBudget>(2, 10);
+  auto environment = limitedEnvironment(t, {});
+  // {"i": n} packs into 4 bytes: room for two delayed sends.
+  auto budget = std::make_shared<SXReportingPendingBudget>(8, 10);
   auto session = SXReportingSession::initWithID(environment, 7, SXValue::array({10}), budget);
   session->setServiceType(4);  // alarms wait before a standalone send
   for (int i = 0; i < 4; ++i) session->sendMessage({{"i", i}}, 3, 1, nullptr);
   t.drain();
 
   using std::chrono::seconds;
-  std::vector<std::chrono::nanoseconds> delays = t.dispatch->delays();
-  ASSERT_EQ(delays.size(), 4u);
-  EXPECT_EQ(delays, (std::vector<std::chrono::nanoseconds>{seconds(59), seconds(59), seconds(0),
-                                                           seconds(0)}));
-  EXPECT_EQ(t.fern->events(Kind::kSingleMessage).size(), 4u);
+  EXPECT_EQ(t.dispatch->delays(),
+            (std::vector<std::chrono::nanoseconds>{seconds(59), seconds(59)}));
+  EXPECT_EQ(t.fern->events(Kind::kSingleMessage).size(), 2u);
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kStandalonePending), 2u);
-  EXPECT_EQ(t.log->count("client 10 has 2 standalone sends waiting for their delay "
-                         "(--max-pending-standalone); sending further ones at once"),
+  EXPECT_EQ(t.log->count("client 10 has 8 bytes of standalone sends waiting for their delay "
+                         "(--max-pending-standalone-bytes 8); further ones are refused until "
+                         "they drain"),
             1u);
   EXPECT_EQ(budget->pending(), 0u);  // every slot came back once its send ran
 
@@ -171,7 +188,7 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&] {
       for (int j = 0; j < 1000; ++j) {
-        if (auto slot = budget->tryAcquire()) {
+        if (auto slot = budget->tryAcquire(1)) {
           ++granted;
           std::lock_guard lock(mutex);
           held.push_back(std::move(slot));
@@ -190,4 +207,67 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
   EXPECT_TRUE(budget->firstRefusal());  // half full: the next overflow is news again
   held.clear();
   EXPECT_EQ(budget->pending(), 0u);
+}
+
+// Requests over a size limit get an error reply naming the limit and change nothing; a list
+// that names a session several times reaches it once.
+TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliverOnce) {
+  LimitedService s({.maxPayloadBytes = 64, .maxConfigurationBytes = 64, .maxReporterIDs = 3});
+  auto c = s.connect(10);
+  ASSERT_EQ(s.call(*c, sxr::method::kCreate, {7}), true);
+  ASSERT_EQ(s.call(*c, sxr::method::kStart, {7}), "no reply");  // answered at stop
+  SXValue big = {{"k", std::string(100, 'x')}};
+  struct Case {
+    const char* method;
+    SXValue params;
+    const char* error;  // a part of the error reply
+    const char* guardrail;
+  };
+  const Case cases[] = {
+      {sxr::method::kSendMessage,
+       {big, 3, 1, {7}},
+       "payload of 105 bytes is larger than the limit "
+       "of 64 bytes (--max-payload-bytes)",
+       "payload_bytes"},
+      {sxr::method::kSetConfiguration,
+       {big, 7},
+       "configuration of 105 bytes is larger than the "
+       "limit of 64 bytes (--max-configuration-bytes)",
+       "configuration_bytes"},
+      {sxr::method::kSendMessage,
+       {{{"k", 1}}, 3, 1, {1, 2, 3, 7}},
+       "reporterIDs holds 4 reporter "
+       "IDs, more than the limit of 3 (--max-reporter-ids)",
+       "reporter_ids"},
+  };
+  for (const Case& k : cases) {
+    c->request(k.method, k.params);
+    s.t.drain();
+    auto error = c->responses().back().error;
+    ASSERT_TRUE(error.is_string()) << k.method;
+    EXPECT_NE(error.get<std::string>().find(k.error), std::string::npos) << error;
+    EXPECT_EQ(s.dropped(k.guardrail), 1u) << k.guardrail;
+  }
+  EXPECT_TRUE(s.t.fern->events(Kind::kMessage).empty());
+  EXPECT_EQ(s.call(*c, sxr::method::kSendMessage, {{{"k", 1}}, 3, 1, {7, 7, 7}}), nullptr);
+  s.t.drain();
+  EXPECT_EQ(s.t.fern->events(Kind::kMessage).size(), 1u);
+  EXPECT_EQ(s.t.tallyvane->events().size(), 1u);
+}
+
+// One client's unknown reporter IDs cost at most the per-minute number of error lines; the
+// rest are counted and summed up in one line once the minute is over.
+TEST(SXReportingLimitsErrorLines, ABadClientCostsAFewLinesAMinute) {
+  LimitedService s({.maxErrorLines = 2});
+  auto c = s.connect(10);
+  EXPECT_EQ(s.call(*c, sxr::method::kSendMessage, {{{"k", 1}}, 3, 1, {1, 2, 3, 4, 5}}), nullptr);
+  EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 2u);
+  EXPECT_EQ(s.dropped("error_lines"), 3u);
+  s.t.clock->advance(61);
+  EXPECT_EQ(s.call(*c, sxr::method::kValid, {6}),
+            (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
+  EXPECT_TRUE(
+      s.t.log->contains("client 10 caused 3 more error lines than the 2 a minute written "
+                        "(--max-error-lines); they were left out"));
+  EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 3u);
 }

@@ -41,7 +41,7 @@ class QueueingObject final : public SXIpcExportedObject {
       gate_.wait(lock, [this] { return open_; });
     });
   }
-  void handleRequest(std::string_view, SXValue params, SXIpcReplyFn reply) override {
+  void handleRequest(std::string_view, SXValue params, size_t, SXIpcReplyFn reply) override {
     int64_t waiting = ++handedOn_ - handled_.load();
     maxWaiting_ = std::max(maxWaiting_.load(), waiting);
     queue_->async([this, value = params.at(0), reply = std::move(reply)] {
@@ -73,7 +73,7 @@ class QueueingObject final : public SXIpcExportedObject {
 class BigReplyObject final : public SXIpcExportedObject {
  public:
   explicit BigReplyObject(size_t replyBytes) : text_(replyBytes, 'r') {}
-  void handleRequest(std::string_view, SXValue params, SXIpcReplyFn reply) override {
+  void handleRequest(std::string_view, SXValue params, size_t, SXIpcReplyFn reply) override {
     ++handedOn_;
     reply(nullptr, SXValue::array({params.at(0), text_}));
   }

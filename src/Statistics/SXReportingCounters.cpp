@@ -20,8 +20,20 @@ const char* SXReportingCounters::name(SXReportingGuardrail guardrail) {
       return "sessions_total";
     case SXReportingGuardrail::kAggregateEntries:
       return "aggregate_entries";
+    case SXReportingGuardrail::kAggregateBytes:
+      return "aggregate_bytes";
     case SXReportingGuardrail::kStandalonePending:
       return "standalone_pending";
+    case SXReportingGuardrail::kPayloadBytes:
+      return "payload_bytes";
+    case SXReportingGuardrail::kConfigurationBytes:
+      return "configuration_bytes";
+    case SXReportingGuardrail::kReporterIDs:
+      return "reporter_ids";
+    case SXReportingGuardrail::kErrorLines:
+      return "error_lines";
+    case SXReportingGuardrail::kCount:
+      break;
   }
   return "unknown";
 }
@@ -33,9 +45,8 @@ SXValue SXReportingCounters::toValue() const {
     delivered[name(sink)] = deliveredTo(sink);
   }
   SXValue dropped = SXValue::object();
-  for (auto guardrail :
-       {SXReportingGuardrail::kSessionsPerClient, SXReportingGuardrail::kSessionsTotal,
-        SXReportingGuardrail::kAggregateEntries, SXReportingGuardrail::kStandalonePending}) {
+  for (size_t i = 0; i < index(SXReportingGuardrail::kCount); ++i) {
+    auto guardrail = static_cast<SXReportingGuardrail>(i);
     dropped[name(guardrail)] = droppedBy(guardrail);
   }
   return {{"messages_received", messagesReceived()},

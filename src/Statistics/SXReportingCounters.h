@@ -19,7 +19,13 @@ enum class SXReportingGuardrail {
   kSessionsPerClient,
   kSessionsTotal,
   kAggregateEntries,
+  kAggregateBytes,
   kStandalonePending,
+  kPayloadBytes,
+  kConfigurationBytes,
+  kReporterIDs,
+  kErrorLines,
+  kCount,
 };
 
 class SXReportingCounters {
@@ -34,6 +40,10 @@ class SXReportingCounters {
   // The session registries report every session they take in and let go of.
   void sessionsAdded(uint64_t count) { sessionsLive_.fetch_add(count); }
   void sessionsRemoved(uint64_t count) { sessionsLive_.fetch_sub(count); }
+  // The aggregates report the bytes they hold.
+  void aggregateBytesAdded(uint64_t n) { aggregateBytes_.fetch_add(n); }
+  void aggregateBytesRemoved(uint64_t n) { aggregateBytes_.fetch_sub(n); }
+  uint64_t aggregateBytes() const { return aggregateBytes_.load(); }
 
   uint64_t messagesReceived() const { return received_.load(std::memory_order_relaxed); }
   uint64_t deliveredTo(SXReportingSink sink) const { return delivered_[index(sink)].load(); }
@@ -55,8 +65,9 @@ class SXReportingCounters {
 
   std::atomic<uint64_t> received_{0};
   std::array<std::atomic<uint64_t>, 3> delivered_{};
-  std::array<std::atomic<uint64_t>, 4> dropped_{};
+  std::array<std::atomic<uint64_t>, static_cast<size_t>(SXReportingGuardrail::kCount)> dropped_{};
   std::atomic<uint64_t> sessionsLive_{0};
+  std::atomic<uint64_t> aggregateBytes_{0};
 };
 
 // Forwards to the power log and counts each entry as a delivered message: only the power-log

@@ -115,3 +115,17 @@ void SXPackValue(msgpack::packer<Stream>& p, const SXValue& v) {
 
 template void SXPackValue(msgpack::packer<msgpack::sbuffer>&, const SXValue&);
 template void SXPackValue(msgpack::packer<SXStringSink>&, const SXValue&);
+
+namespace {
+struct SXCountingSink {
+  size_t bytes = 0;
+  void write(const char*, size_t size) { bytes += size; }
+};
+}  // namespace
+
+size_t SXPackedSize(const SXValue& value) {
+  SXCountingSink sink;
+  msgpack::packer<SXCountingSink> packer(sink);
+  SXPackValue(packer, value);
+  return sink.bytes;
+}

@@ -31,3 +31,6 @@ void SXPackValue(msgpack::packer<Stream>& packer, const SXValue& value);
 
 extern template void SXPackValue(msgpack::packer<msgpack::sbuffer>&, const SXValue&);
 extern template void SXPackValue(msgpack::packer<SXStringSink>&, const SXValue&);
+
+// The number of bytes `SXPackValue` writes for `value`.
+size_t SXPackedSize(const SXValue& value);

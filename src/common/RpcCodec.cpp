@@ -7,13 +7,29 @@ namespace {
 constexpr int kEnvelopeDepth = 2;
 }  // namespace
 
-RpcStreamDecoder::RpcStreamDecoder(RpcLimits limits)
-    : limits_(limits),
-      unpacker_(nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE,
-                msgpack::unpack_limit(
-                    limits.maxContainerEntries, limits.maxContainerEntries, limits.maxMessageBytes,
-                    limits.maxMessageBytes, limits.maxMessageBytes,
-                    static_cast<size_t>(limits.maxPayloadDepth + kEnvelopeDepth))) {}
+RpcStreamDecoder::RpcStreamDecoder(RpcLimits limits) : limits_(limits), unpacker_(makeUnpacker()) {}
+
+msgpack::v1::unpacker RpcStreamDecoder::makeUnpacker() const {
+  return msgpack::v1::unpacker(
+      nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE,
+      msgpack::unpack_limit(limits_.maxContainerEntries, limits_.maxContainerEntries,
+                            limits_.maxMessageBytes, limits_.maxMessageBytes,
+                            limits_.maxMessageBytes,
+                            static_cast<size_t>(limits_.maxPayloadDepth + kEnvelopeDepth)));
+}
+
+size_t RpcStreamDecoder::bufferedBytes() const {
+  return unpacker_.parsed_size() + unpacker_.nonparsed_size();
+}
+
+void RpcStreamDecoder::shrinkIfIdle() {
+  constexpr size_t kKeptBufferBytes = 4 * MSGPACK_UNPACKER_INIT_BUFFER_SIZE;
+  if (bufferedBytes() > kKeptBufferBytes) grown_ = true;
+  if (grown_ && bufferedBytes() == 0) {
+    unpacker_ = makeUnpacker();
+    grown_ = false;
+  }
+}
 
 char* RpcStreamDecoder::prepare(size_t size) {
   unpacker_.reserve_buffer(size);
@@ -32,6 +48,8 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
       }
       // Converted in place: the unpacker keeps its zone (strings are copied into it, never
       // referenced from the buffer) and reuses it, instead of a fresh zone per message.
+      lastMessageBytes_ = unpacker_.parsed_size();
+      if (lastMessageBytes_ > 4 * MSGPACK_UNPACKER_INIT_BUFFER_SIZE) grown_ = true;
       message = SXValueFromMsgpack(unpacker_.data(), limits_.maxPayloadDepth + kEnvelopeDepth);
       unpacker_.reset_zone();
       unpacker_.reset();

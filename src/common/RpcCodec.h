@@ -32,11 +32,22 @@ class RpcStreamDecoder {
   // message is larger than allowed, or it nests too deeply; the stream cannot go on then.
   Status next(SXValue& message);
   const std::string& error() const { return error_; }
+  // The MessagePack bytes of the message `next` returned last.
+  size_t lastMessageBytes() const { return lastMessageBytes_; }
+  // Bytes read but not yet returned as a message: the start of a message still being received.
+  size_t bufferedBytes() const;
+  // Frees a buffer that a large message grew, once nothing is buffered, so that one large
+  // request does not keep its memory for the rest of the connection.
+  void shrinkIfIdle();
 
  private:
   RpcLimits limits_;
+  msgpack::v1::unpacker makeUnpacker() const;
+
   msgpack::v1::unpacker unpacker_;  // v1: lets us see a whole message's size before reset
   std::string error_;
+  size_t lastMessageBytes_ = 0;
+  bool grown_ = false;  // a message or a partial one outgrew the initial buffer
 };
 
 struct RpcRequest {

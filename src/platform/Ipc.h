@@ -14,6 +14,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/ByteBudget.h"
 #include "sxreporting/types.h"
 
 // Sends the reply of one request: `error` null and `result` the value, or `error` a string
@@ -25,8 +26,9 @@ class SXIpcExportedObject {
  public:
   virtual ~SXIpcExportedObject() = default;
   // Called on the connection's thread for each request, in arrival order. `params` is the
-  // object's to keep or move from.
-  virtual void handleRequest(std::string_view method, SXValue params, SXIpcReplyFn reply) = 0;
+  // object's to keep or move from; `wireBytes` is the size of the whole request as received.
+  virtual void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
+                             SXIpcReplyFn reply) = 0;
 };
 
 class SXIpcConnection {
@@ -40,6 +42,9 @@ class SXIpcConnection {
   virtual void setInvalidationHandler(std::function<void()> handler) = 0;
   // Starts delivering requests.
   virtual void resume() = 0;
+  // What the client has made the service hold; the connection stops reading while it is over
+  // its limit. Null when the connection keeps no budget.
+  virtual std::shared_ptr<SXByteBudget> budget() const { return nullptr; }
 };
 
 class SXIpcListenerDelegate {

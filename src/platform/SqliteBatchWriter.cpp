@@ -27,11 +27,10 @@ struct SXSqliteBatchWriter::Core {
   std::mutex mutex;
   std::condition_variable wake;          // rows queued or stopping; guarded by `mutex`
   std::condition_variable progress;      // `done` advanced; guarded by `mutex`
-  std::condition_variable room;          // the queue has room again; guarded by `mutex`
   std::deque<RowProducer> queue;         // guarded by `mutex`
   uint64_t enqueued = 0;                 // guarded by `mutex`: rows ever accepted
   uint64_t done = 0;                     // guarded by `mutex`: rows committed or dropped
-  bool full = false;                     // guarded by `mutex`: a caller waits for room
+  bool full = false;                     // guarded by `mutex`: rows are being refused
   bool stopping = false;                 // guarded by `mutex`
   int flushWaiters = 0;                  // guarded by `mutex`: flush() calls waiting
   std::atomic<uint64_t> writeErrors{0};  // rows lost to a store that failed; any thread reads
@@ -127,10 +126,7 @@ void SXSqliteBatchWriter::Core::run() {
       batch.assign(std::make_move_iterator(queue.begin()),
                    std::make_move_iterator(queue.begin() + static_cast<ptrdiff_t>(n)));
       queue.erase(queue.begin(), queue.begin() + static_cast<ptrdiff_t>(n));
-      if (full && queue.size() < options.maxQueued) {
-        full = false;
-        room.notify_all();
-      }
+      if (full && queue.size() < options.maxQueued / 2) full = false;
     }
     size_t n = batch.size();
     writeBatch(batch);
@@ -159,7 +155,6 @@ SXSqliteBatchWriter::~SXSqliteBatchWriter() {
     core_->stopping = true;
   }
   core_->wake.notify_all();
-  core_->room.notify_all();
   // A producer may hold the last reference to our owner, so the writer thread can end up here;
   // it cannot join itself, and it drains the queue on its own (it shares the core).
   if (thread_.get_id() == std::this_thread::get_id()) {
@@ -173,18 +168,17 @@ bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
   Core& core = *core_;
   {
     std::unique_lock lock(core.mutex);
-    if (!core.stopping && core.queue.size() >= core.options.maxQueued) {
-      // Back-pressure rather than loss: the caller waits until the writer has made room.
+    if (core.stopping) return false;
+    if (core.queue.size() >= core.options.maxQueued) {
+      core.writeErrors++;
       if (!core.full) {
         core.full = true;
         SXLOG(*core.log, nullptr, SXLogLevel::kError,
-              "%s: %zu %s wait to be written; new ones wait for room", core.options.path,
-              core.options.maxQueued, core.options.rowNoun);
+              "%s: %zu %s wait to be written; dropping new ones until half of them are",
+              core.options.path, core.options.maxQueued, core.options.rowNoun);
       }
-      core.room.wait(lock,
-                     [&] { return core.stopping || core.queue.size() < core.options.maxQueued; });
+      return false;
     }
-    if (core.stopping) return false;
     core.queue.push_back(std::move(producer));
     ++core.enqueued;
     // The writer needs waking only when it waits for a first row or has a full batch; while

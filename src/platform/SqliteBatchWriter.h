@@ -1,19 +1,18 @@
 // A writer thread that appends rows to one SQLite table in batches, for stores whose callers
 // must never wait on the disk (analytics events, power log).
 //
-// enqueue() hands over a row producer and returns at once (unless the queue is full, below).
-// The writer thread calls the
-// producers (so lazy payloads are built there, not on the caller's thread) and commits
-// whatever is queued, up to `maxBatch` rows, in one transaction.
+// enqueue() hands over a row producer and returns at once, never waiting for the disk. The
+// writer thread calls the producers (so lazy payloads are built there, not on the caller's
+// thread) and commits whatever is queued, up to `maxBatch` rows, in one transaction.
 //
 // enqueue() and flush() may be called from any thread, but not from a row producer.
 // Failures never reach the caller: a store that cannot be opened or a write that fails (full
 // disk, a lock held too long) logs one error line on the default log of `log` and drops that
 // batch; the next batch tries again, reopening the store if needed. A store file that is no
 // usable database is moved aside and a new one created (SXSqliteConnection::openOrRecover),
-// with an error line. When more than
-// `maxQueued` rows wait, enqueue() waits until the writer has made room (back-pressure, not
-// loss; one error line each time the queue fills).
+// with an error line. The callers bound what they queue (the daemon holds back the clients
+// whose rows wait); `maxQueued` is a last line of defence: a row offered while that many wait
+// is dropped and counted as a write error, with one error line each time the queue fills.
 #pragma once
 
 #include <chrono>
@@ -51,15 +50,15 @@ class SXSqliteBatchWriter {
   SXSqliteBatchWriter(const SXSqliteBatchWriter&) = delete;
   SXSqliteBatchWriter& operator=(const SXSqliteBatchWriter&) = delete;
 
-  // Queues a row, first waiting for room while `maxQueued` rows wait. Returns false when the
-  // writer is shutting down. Not from a row producer.
+  // Queues a row. Returns false when the writer is shutting down or the queue is full (the row
+  // is then counted in writeErrors()). Not from a row producer.
   bool enqueue(RowProducer producer);
 
   // Returns once every row enqueued before the call has been committed or dropped.
   void flush();
 
-  // Rows that were accepted but could not be stored (the store could not be opened or a commit
-  // failed). Any thread.
+  // Rows that were offered but could not be stored (the queue was full, the store could not be
+  // opened or a commit failed). Any thread.
   uint64_t writeErrors() const;
 
  private:

@@ -22,7 +22,11 @@ class SXUnixSocketConnection final : public SXIpcConnection,
         decoder_(options.limits),
         maxQueuedRequests_(options.maxQueuedRequests),
         maxPendingReplyBytes_(options.maxPendingReplyBytes),
+        partialFrameTimeout_(options.partialFrameTimeout),
         requestQueue_(options.requestQueue),
+        budget_(std::make_shared<SXByteBudget>(options.maxConnectionBytes, listener.pool(),
+                                               SXUnixSocketListener::kConnectionFloorBytes)),
+        partialTimer_(socket_.get_executor()),
         listener_(listener),
         log_(std::move(log)) {
     struct ucred cred {};
@@ -46,7 +50,16 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   void setInvalidationHandler(std::function<void()> handler) override {
     invalidation_ = std::move(handler);
   }
-  void resume() override { read(); }
+  void resume() override {
+    std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
+    budget_->setWaker([weak] {
+      if (auto self = weak.lock()) {
+        asio::post(self->socket_.get_executor(), [self] { self->resumeIfAllowed(); });
+      }
+    });
+    serve();
+  }
+  std::shared_ptr<SXByteBudget> budget() const override { return budget_; }
 
   // Any thread. Encodes straight into the pending output; the I/O thread writes whatever has
   // gathered there in one go.
@@ -75,8 +88,10 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       closed_ = true;
     }
     std::error_code ignored;
+    partialTimer_.cancel();
     socket_.shutdown(asio::socket_base::shutdown_both, ignored);
     socket_.close(ignored);
+    chargeBuffered(0);
     if (interrupted && interruption_) std::exchange(interruption_, nullptr)();
     if (invalidation_) std::exchange(invalidation_, nullptr)();
     exported_.reset();
@@ -84,17 +99,37 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   }
 
  private:
-  void read() {
-    char* buffer = decoder_.prepare(kReadSize);
-    socket_.async_read_some(asio::buffer(buffer, kReadSize),
+  void read(size_t size) {
+    char* buffer = decoder_.prepare(size);
+    socket_.async_read_some(asio::buffer(buffer, size),
                             [self = shared_from_this()](const std::error_code& ec, size_t n) {
                               if (ec) {
                                 self->end(ec != asio::error::eof);
                                 return;
                               }
                               self->decoder_.commit(n);
+                              self->chargeBuffered(self->decoder_.bufferedBytes());
                               self->serve();
                             });
+  }
+
+  // How much may be read now. While the pool is full only a connection that holds less than
+  // the floor reads, and only up to it.
+  size_t readAllowance() const {
+    if (!budget_->poolOverLimit()) return kReadSize;
+    uint64_t held = budget_->held() + bufferedCharged_;
+    uint64_t floor = budget_->floor();
+    return held < floor ? static_cast<size_t>(floor - held) : 0;
+  }
+
+  // Keeps the pool's count of this connection's partly received request at `bytes`. Charged to
+  // the pool alone: a request must be able to complete whatever the connection holds.
+  void chargeBuffered(uint64_t bytes) {
+    const auto& pool = budget_->pool();
+    if (!pool) return;
+    if (bytes > bufferedCharged_) pool->add(bytes - bufferedCharged_);
+    if (bytes < bufferedCharged_) pool->release(bufferedCharged_ - bytes);
+    bufferedCharged_ = bytes;
   }
 
   // I/O thread: hands on the requests already buffered, then reads more once they are all
@@ -103,19 +138,22 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     for (;;) {
       Dispatched dispatched = dispatchMessages();
       if (dispatched == Dispatched::kEnded) return;
+      watchPartialFrame();
       if (!mustWait()) {
         // Room was made while dispatching stopped: whole requests may still be buffered, and
         // the client may have nothing more to send, so those go first.
-        if (dispatched == Dispatched::kDrained) {
-          read();
+        if (dispatched != Dispatched::kDrained) continue;
+        if (size_t allowance = readAllowance()) {
+          read(allowance);
           return;
         }
-        continue;
       }
       // Room may have been made between the test and the flag: look again after raising it,
       // so that a wake-up is never missed.
       paused_.store(true);
-      if (mustWait()) {
+      budget_->armWake();
+      if (const auto& pool = budget_->pool()) pool->armWake();
+      if (mustWait() || (dispatched == Dispatched::kDrained && readAllowance() == 0)) {
         listener_.connectionPaused();
         return;
       }
@@ -123,18 +161,49 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     }
   }
 
-  bool mustWait() const {
-    return queued_.load() >= maxQueuedRequests_ ||
-           pendingReplyBytes_.load() > maxPendingReplyBytes_;
+  // I/O thread: a request that has begun to arrive must be complete within the timeout. A
+  // request completed meanwhile, or back-pressure of the connection's own making, starts the
+  // wait again.
+  void watchPartialFrame() {
+    if (timerArmed_ || ended_ || partialFrameTimeout_.count() <= 0) return;
+    if (decoder_.bufferedBytes() == 0) return;
+    timerArmed_ = true;
+    timerMark_ = completedMessages_;
+    partialTimer_.expires_after(partialFrameTimeout_);
+    partialTimer_.async_wait(
+        [self = shared_from_this()](const std::error_code& ec) { self->partialFrameDue(ec); });
   }
 
-  // I/O thread, after a marker ran or a write finished.
+  void partialFrameDue(const std::error_code& ec) {
+    timerArmed_ = false;
+    if (ec || ended_ || decoder_.bufferedBytes() == 0) return;
+    if (completedMessages_ != timerMark_ || mustWait()) {
+      watchPartialFrame();
+      return;
+    }
+    SXLOG(*log_, nullptr, SXLogLevel::kError,
+          "closing %@: a request of which %llu bytes have arrived was not completed within "
+          "%lli ms",
+          description(), static_cast<unsigned long long>(decoder_.bufferedBytes()),
+          static_cast<int64_t>(partialFrameTimeout_.count()));
+    listener_.partialFrameTimedOut();
+    end(true);
+  }
+
+  bool mustWait() const {
+    return queued_.load() >= maxQueuedRequests_ ||
+           pendingReplyBytes_.load() > maxPendingReplyBytes_ || budget_->overLimit();
+  }
+
+ public:
+  // I/O thread, after a marker ran, a write finished or budget was released.
   void resumeIfAllowed() {
     if (ended_ || !paused_.load() || mustWait()) return;
     paused_.store(false);
     serve();
   }
 
+ private:
   enum class Dispatched { kDrained, kStopped, kEnded };
 
   // Hands every whole message to the exported object, stopping early when back-pressure
@@ -155,9 +224,12 @@ class SXUnixSocketConnection final : public SXIpcConnection,
               decoder_.error());
         ok = false;
       } else {
+        ++completedMessages_;
         ok = dispatch(message);
       }
     }
+    decoder_.shrinkIfIdle();
+    chargeBuffered(decoder_.bufferedBytes());
     coverDispatched();
     if (!ok) end(true);
     if (!ok || ended_) return Dispatched::kEnded;
@@ -181,16 +253,25 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       send(request->msgid, "no object is exported on this connection", nullptr);
       return true;
     }
+    // The request's decoded form is held until its work has run.
+    uint64_t cost = SXDecodedBytes(decoder_.lastMessageBytes());
+    budget_->add(cost);
     if (requestQueue_) queued_.fetch_add(1);
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
     uint32_t id = request->msgid;
     exported_->handleRequest(request->method, std::move(request->params),
+                             decoder_.lastMessageBytes(),
                              [weak, id](const SXValue& error, const SXValue& result) {
                                if (auto self = weak.lock()) self->send(id, error, result);
                              });
+    if (!requestQueue_) {
+      budget_->release(cost);
+      return true;
+    }
     // Counted as uncovered only now that its work is on the queue: a marker posted from the
     // queue thread at this moment must not overtake it.
-    if (requestQueue_) uncovered_.fetch_add(1);
+    uncoveredBytes_.fetch_add(cost);
+    uncovered_.fetch_add(1);
     return true;
   }
 
@@ -199,8 +280,11 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   void coverDispatched() {
     if (!requestQueue_ || uncovered_.load() == 0 || markerPending_.exchange(true)) return;
     uint64_t covered = uncovered_.exchange(0);
+    uint64_t bytes = uncoveredBytes_.exchange(0);
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
-    requestQueue_->async([weak, covered] {
+    // The budget is released even when the connection has gone, since the pool counts it too.
+    requestQueue_->async([weak, budget = budget_, covered, bytes] {
+      budget->release(bytes);
       if (auto self = weak.lock()) self->requestsHandled(covered);
     });
   }
@@ -243,7 +327,14 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   RpcStreamDecoder decoder_;  // I/O thread only
   const size_t maxQueuedRequests_;
   const size_t maxPendingReplyBytes_;
+  const std::chrono::milliseconds partialFrameTimeout_;
   const std::shared_ptr<SXWorkQueue> requestQueue_;
+  const std::shared_ptr<SXByteBudget> budget_;
+  asio::steady_timer partialTimer_;  // I/O thread only
+  bool timerArmed_ = false;          // I/O thread only
+  uint64_t completedMessages_ = 0;   // I/O thread only
+  uint64_t timerMark_ = 0;           // I/O thread only: completedMessages_ when the timer was set
+  uint64_t bufferedCharged_ = 0;     // I/O thread only: partly received bytes charged to the pool
   SXUnixSocketListener& listener_;
   std::shared_ptr<SXLogFacility> log_;
   int32_t pid_ = 0;
@@ -255,6 +346,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   // Back-pressure. Handed on but not yet handled; written by the I/O thread and the markers.
   std::atomic<uint64_t> queued_{0};
   std::atomic<uint64_t> uncovered_{0};        // handed on, no marker posted behind them yet
+  std::atomic<uint64_t> uncoveredBytes_{0};   // their budget charge
   std::atomic<bool> markerPending_{false};    // a marker is on the request queue
   std::atomic<bool> paused_{false};           // set by the I/O thread, read by markers
   std::atomic<size_t> pendingReplyBytes_{0};  // outPending_ plus outFlight_
@@ -266,9 +358,29 @@ class SXUnixSocketConnection final : public SXIpcConnection,
 };
 
 SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLogFacility> log)
-    : options_(std::move(options)), log_(std::move(log)), acceptor_(io_) {}
+    : options_(std::move(options)),
+      log_(std::move(log)),
+      acceptor_(io_),
+      pool_(std::make_shared<SXByteBudget>(options_.maxInflightBytes)),
+      wakeTarget_(std::make_shared<WakeTarget>()) {
+  wakeTarget_->listener = this;
+  pool_->setWaker([target = wakeTarget_] {
+    std::lock_guard lock(target->mutex);
+    if (auto* listener = target->listener) {
+      asio::post(listener->io_, [listener] { listener->resumePaused(); });
+    }
+  });
+}
 
-SXUnixSocketListener::~SXUnixSocketListener() = default;
+SXUnixSocketListener::~SXUnixSocketListener() {
+  std::lock_guard lock(wakeTarget_->mutex);
+  wakeTarget_->listener = nullptr;
+}
+
+void SXUnixSocketListener::resumePaused() {
+  auto live = connections_;
+  for (const auto& connection : live) connection->resumeIfAllowed();
+}
 
 bool SXUnixSocketListener::open(std::string& error) {
   std::error_code ec;

@@ -5,6 +5,7 @@
 #include <mutex>
 #include <vector>
 
+#include "common/MsgpackValue.h"
 #include "platform/Ipc.h"
 
 class FakeIpcConnection final : public SXIpcConnection {
@@ -25,9 +26,11 @@ class FakeIpcConnection final : public SXIpcConnection {
     SXValue error;
     SXValue result;
   };
-  // Sends a request; replies collect in `responses`.
+  // Sends a request; replies collect in `responses`. Its size is what its params pack into,
+  // plus an envelope.
   void request(std::string_view method, SXValue params) {
-    exported_->handleRequest(method, params, [this](const SXValue& e, const SXValue& r) {
+    size_t wireBytes = SXPackedSize(params) + method.size() + 8;
+    exported_->handleRequest(method, params, wireBytes, [this](const SXValue& e, const SXValue& r) {
       std::lock_guard lock(mutex_);
       responses_.push_back({e, r});
     });

@@ -46,13 +46,14 @@ size_t FakeLog::count(const std::string& message) const {
   return n;
 }
 
-bool FakeLog::contains(const std::string& fragment) const {
+size_t FakeLog::countContaining(const std::string& fragment) const {
   std::lock_guard lock(mutex_);
-  for (const auto& l : lines_) {
-    if (l.message.find(fragment) != std::string::npos) return true;
-  }
-  return false;
+  size_t n = 0;
+  for (const auto& l : lines_) n += l.message.find(fragment) != std::string::npos;
+  return n;
 }
+
+bool FakeLog::contains(const std::string& fragment) const { return countContaining(fragment) > 0; }
 
 void FakeLog::setVerbose(const std::string& scope, bool on) {
   std::lock_guard lock(mutex_);

@@ -29,7 +29,8 @@ class FakeLog final : public SXLogFacility {
   std::vector<SXLogScope> registrations() const;
   // Number of lines whose message equals `message`.
   size_t count(const std::string& message) const;
-  // Whether some line's message contains `fragment`.
+  // Number of lines whose message contains `fragment`, and whether there is one.
+  size_t countContaining(const std::string& fragment) const;
   bool contains(const std::string& fragment) const;
   void setVerbose(const std::string& scope, bool on);
 

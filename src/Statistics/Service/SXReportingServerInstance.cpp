@@ -43,12 +43,14 @@ SXReportingServerInstance::SXReportingServerInstance(
       processIdentifier_(processIdentifier),
       delegate_(std::move(delegate)),
       standaloneBudget_(std::make_shared<SXReportingPendingBudget>(
-          environment_->limits().maxPendingStandalone, processIdentifier)) {}
+          environment_->limits().maxPendingStandaloneBytes, processIdentifier)),
+      errorLines_(environment_->limits().maxErrorLines, processIdentifier) {}
 
 SXReportingServerInstance::~SXReportingServerInstance() {
   SXLOG(log(), scope(), SXLogLevel::kDefault, "dealloc %i from the server client list",
         processIdentifier_);
   environment_->counters().sessionsRemoved(sessions_.size());
+  errorLines_.reportSuppressed(*environment_);
 }
 
 void SXReportingServerInstance::enqueue(std::function<void(SXReportingServerInstance&)> work) {
@@ -66,7 +68,7 @@ std::shared_ptr<SXReportingSession> SXReportingServerInstance::findReportingSess
     int64_t reporterID) {
   if (auto session = ownSession(reporterID)) return session;
   auto delegate = delegate_.lock();
-  return delegate ? delegate->findReportingSessionForID(reporterID) : nullptr;
+  return delegate ? delegate->findReportingSessionForID(reporterID, &errorLines_) : nullptr;
 }
 
 // Request lines are verbose lines of the service scope, written on the connection's thread.
@@ -98,12 +100,13 @@ void SXReportingServerInstance::createReportingSession(int64_t reporterID, Reply
   });
 }
 
-bool SXReportingServerInstance::hasRoomForSession(int64_t reporterID, const char* fn) const {
+bool SXReportingServerInstance::hasRoomForSession(int64_t reporterID, const char* fn) {
   if (sessions_.count(reporterID)) return true;
   const SXReportingLimits& limits = environment_->limits();
   SXReportingCounters& counters = environment_->counters();
   if (sessions_.size() >= limits.maxSessionsPerClient) {
     counters.dropped(SXReportingGuardrail::kSessionsPerClient);
+    if (!errorLines_.allow(*environment_)) return false;
     SXLOG_IN(fn, log(), scope(), SXLogLevel::kError,
              "session limit reached: client %i already has %llu sessions "
              "(--max-sessions-per-client); reporter %lli not created",
@@ -112,6 +115,7 @@ bool SXReportingServerInstance::hasRoomForSession(int64_t reporterID, const char
   }
   if (counters.sessionsLive() >= limits.maxSessions) {
     counters.dropped(SXReportingGuardrail::kSessionsTotal);
+    if (!errorLines_.allow(*environment_)) return false;
     SXLOG_IN(fn, log(), scope(), SXLogLevel::kError,
              "session limit reached: the service already has %llu sessions (--max-sessions); "
              "reporter %lli of client %i not created",
@@ -191,16 +195,15 @@ void SXReportingServerInstance::getAllReporters(Reply<std::vector<int64_t>> repl
   });
 }
 
-void SXReportingServerInstance::sendMessage(SXValue message, SXReportingCategory category,
+void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXValue> message,
+                                            SXReportingCategory category,
                                             SXReportingMessageType type,
                                             std::optional<std::vector<int64_t>> reporterIDs,
                                             Reply<std::optional<SXError>> reply) {
   SXR_REQUEST_LINE("sending message for reporter %@",
                    reporterIDs ? SXValue(*reporterIDs) : SXValue());
   environment_->counters().messageReceived();
-  // Shared and never changed from here on: every sink reads this one copy.
-  enqueue([message = std::make_shared<const SXValue>(std::move(message)), category, type,
-           reporterIDs = std::move(reporterIDs),
+  enqueue([message = std::move(message), category, type, reporterIDs = std::move(reporterIDs),
            reply = std::move(reply)](SXReportingServerInstance& self) {
     self.environment_->tracer().trace(kTraceSend);
     auto delegate = self.delegate_.lock();

@@ -13,6 +13,7 @@
 #include <optional>
 
 #include "SXReportingEnvironment.h"
+#include "SXReportingErrorLines.h"
 #include "SXReportingServiceProtocol.h"
 #include "SXReportingSession.h"
 
@@ -36,8 +37,8 @@ class SXReportingServerInstance final
   void setConfiguration(std::optional<SXValue> configuration, int64_t reporterID,
                         Reply<bool> reply) override;
   void startReportingSessionForID(int64_t reporterID, Reply<bool> reply) override;
-  void sendMessage(SXValue message, SXReportingCategory category, SXReportingMessageType type,
-                   std::optional<std::vector<int64_t>> reporterIDs,
+  void sendMessage(std::shared_ptr<const SXValue> message, SXReportingCategory category,
+                   SXReportingMessageType type, std::optional<std::vector<int64_t>> reporterIDs,
                    Reply<std::optional<SXError>> reply) override;
   void stopReportingSessionForID(int64_t reporterID, Reply<bool> reply) override;
   void destroyReportingSession(int64_t reporterID, Reply<bool> reply) override;
@@ -71,7 +72,7 @@ class SXReportingServerInstance final
   std::shared_ptr<SXReportingSession> ownSession(int64_t reporterID) const;
   // Whether the session limits leave room for a new session under `reporterID` (replacing
   // one always does); logs and counts a refusal as the function `fn`.
-  bool hasRoomForSession(int64_t reporterID, const char* fn) const;
+  bool hasRoomForSession(int64_t reporterID, const char* fn);
   void routeAddressed(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
                       SXReportingMessageType type, const std::vector<int64_t>& reporterIDs);
   void routeBroadcast(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
@@ -84,6 +85,7 @@ class SXReportingServerInstance final
   SessionMap sessions_;  // server queue only; its size is counted in the environment's gauge
   // Standalone sends of this client's sessions waiting for their delay.
   const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;
+  SXReportingErrorLines errorLines_;  // server queue only
   mutable std::mutex mutex_;
   std::optional<SXDate> clientStartDate_;         // GUARDED_BY(mutex_)
   std::optional<std::string> clientProcessName_;  // GUARDED_BY(mutex_)

@@ -130,8 +130,8 @@ bool SXReportingServiceDelegate::shouldAcceptNewConnection(
   {
     std::lock_guard lock(mutex_);
     instance = SXReportingServerInstance::initWithPID(environment_, pid, weak_from_this());
-    connection->setExportedObject(
-        std::make_shared<SXReportingServiceExport>(instance, weak_from_this(), environment_));
+    connection->setExportedObject(std::make_shared<SXReportingServiceExport>(
+        instance, weak_from_this(), environment_, connection->budget()));
   }
   std::weak_ptr<SXReportingServerInstance> weakInstance = instance;
   instance.reset();  // the connection holds it from here on
@@ -163,7 +163,7 @@ void SXReportingServiceDelegate::registerClient(
 }
 
 std::shared_ptr<SXReportingSession> SXReportingServiceDelegate::findReportingSessionForID(
-    int64_t reporterID) {
+    int64_t reporterID, SXReportingErrorLines* errorLines) {
   std::lock_guard lock(mutex_);
   if (reporterID == 0 || !reportingEnabled_.load()) return nullptr;
   for (const auto& client : clients_) {
@@ -174,7 +174,9 @@ std::shared_ptr<SXReportingSession> SXReportingServiceDelegate::findReportingSes
       return it->second;
     }
   }
-  SXLOG(log(), scope(), SXLogLevel::kError, "failed to find reporting session %lli", reporterID);
+  if (!errorLines || errorLines->allow(*environment_)) {
+    SXLOG(log(), scope(), SXLogLevel::kError, "failed to find reporting session %lli", reporterID);
+  }
   return nullptr;
 }
 
@@ -222,6 +224,7 @@ SXValue SXReportingServiceDelegate::countersValue() const {
   const auto& p = providers_;
   counters["guardrail_dropped"]["requests_backpressure"] =
       p.requestsBackpressure ? p.requestsBackpressure() : 0;
+  counters["guardrail_dropped"]["partial_frames"] = p.partialFrames ? p.partialFrames() : 0;
   SXValue errors = SXValue::object();
   if (p.tallyvaneWriteErrors) errors["tallyvane"] = p.tallyvaneWriteErrors();
   if (p.joulebookWriteErrors) errors["joulebook"] = p.joulebookWriteErrors();
@@ -233,8 +236,10 @@ SXValue SXReportingServiceDelegate::countersValue() const {
 // Server queue: the client list is read here.
 SXValue SXReportingServiceDelegate::gaugesValue() const {
   SXValue gauges = {{"sessions_live", environment_->counters().sessionsLive()},
-                    {"clients_live", static_cast<uint64_t>(clients_.size())}};
+                    {"clients_live", static_cast<uint64_t>(clients_.size())},
+                    {"aggregate_bytes", environment_->counters().aggregateBytes()}};
   std::lock_guard lock(providersMutex_);
+  if (providers_.inflightBytes) gauges["inflight_bytes"] = providers_.inflightBytes();
   if (providers_.spoolBacklog) gauges["spool_backlog"] = providers_.spoolBacklog();
   return gauges;
 }

@@ -30,7 +30,9 @@ struct SXReportingStatusProviders {
   std::function<uint64_t()> tallyvaneWriteErrors{};
   std::function<uint64_t()> joulebookWriteErrors{};
   std::function<uint64_t()> fernReportingWriteErrors{};
-  std::function<uint64_t()> spoolBacklog{};  // spooled messages not yet uploaded
+  std::function<uint64_t()> spoolBacklog{};   // spooled messages not yet uploaded
+  std::function<uint64_t()> partialFrames{};  // connections ended by an unfinished request
+  std::function<uint64_t()> inflightBytes{};  // what the connections make the service hold
 };
 
 class SXReportingServiceDelegate final
@@ -47,7 +49,8 @@ class SXReportingServiceDelegate final
   std::optional<SXValue> getDefaults() override;
   const SXReportingClientList& getAllClients() override { return clients_; }
   bool isReportingEnabled() override { return reportingEnabled_.load(); }
-  std::shared_ptr<SXReportingSession> findReportingSessionForID(int64_t reporterID) override;
+  std::shared_ptr<SXReportingSession> findReportingSessionForID(
+      int64_t reporterID, SXReportingErrorLines* errorLines = nullptr) override;
   SXValue getSnapShot() override { return driverUtility_->getSnapShot(); }
   std::optional<SXValue> getDriverStatisticsRelativeToSnapShot(
       const std::optional<SXValue>& snapshot) override {

@@ -2,8 +2,10 @@
 
 #include <array>
 #include <limits>
+#include <unordered_set>
 
 #include "SXReportingServiceDelegate.h"
+#include "common/MsgpackValue.h"
 #include "common/SXValueText.h"
 
 namespace {
@@ -101,10 +103,54 @@ SXValue errorValue(const std::optional<SXError>& error) {
 SXReportingServiceExport::SXReportingServiceExport(
     std::shared_ptr<SXReportingServerInstance> instance,
     std::weak_ptr<SXReportingServiceDelegate> delegate,
-    std::shared_ptr<SXReportingEnvironment> environment)
+    std::shared_ptr<SXReportingEnvironment> environment, std::shared_ptr<SXByteBudget> budget)
     : instance_(std::move(instance)),
       delegate_(std::move(delegate)),
-      environment_(std::move(environment)) {}
+      environment_(std::move(environment)),
+      budget_(std::move(budget)) {}
+
+void SXReportingRemoveRepeatedIDs(std::vector<int64_t>& reporterIDs) {
+  if (reporterIDs.size() < 2) return;
+  std::unordered_set<int64_t> seen;
+  seen.reserve(reporterIDs.size());
+  std::erase_if(reporterIDs, [&seen](int64_t id) { return !seen.insert(id).second; });
+}
+
+std::string SXReportingServiceExport::checkLimits(std::string_view method, const SXValue& params,
+                                                  size_t wireBytes) {
+  const SXReportingLimits& limits = environment_->limits();
+  auto refuse = [&](SXReportingGuardrail guardrail, const std::string& why) {
+    environment_->counters().dropped(guardrail);
+    return std::string(method) + " " + why;
+  };
+  // A request no larger than a limit cannot hold a larger value, so only larger requests are
+  // measured.
+  auto checkSize = [&](const SXValue& value, uint64_t limit, const char* what, const char* flag,
+                       SXReportingGuardrail guardrail) -> std::string {
+    if (wireBytes <= limit) return "";
+    size_t size = SXPackedSize(value);
+    if (size <= limit) return "";
+    return refuse(guardrail, std::string(what) + " of " + std::to_string(size) +
+                                 " bytes is larger than the limit of " + std::to_string(limit) +
+                                 " bytes (" + flag + ")");
+  };
+  if (method == sxr::method::kSendMessage) {
+    const SXValue& ids = params[3];
+    if (ids.is_array() && ids.size() > limits.maxReporterIDs) {
+      return refuse(SXReportingGuardrail::kReporterIDs,
+                    "reporterIDs holds " + std::to_string(ids.size()) +
+                        " reporter IDs, more than the limit of " +
+                        std::to_string(limits.maxReporterIDs) + " (--max-reporter-ids)");
+    }
+    return checkSize(params[0], limits.maxPayloadBytes, "payload", "--max-payload-bytes",
+                     SXReportingGuardrail::kPayloadBytes);
+  }
+  if (method == sxr::method::kSetConfiguration) {
+    return checkSize(params[0], limits.maxConfigurationBytes, "configuration",
+                     "--max-configuration-bytes", SXReportingGuardrail::kConfigurationBytes);
+  }
+  return "";
+}
 
 std::string SXReportingServiceExport::validate(std::string_view method, const SXValue& params) {
   for (const auto& signature : kSignatures) {
@@ -128,17 +174,18 @@ std::string SXReportingServiceExport::validate(std::string_view method, const SX
 }
 
 void SXReportingServiceExport::handleRequest(std::string_view method, SXValue params,
-                                             SXIpcReplyFn reply) {
+                                             size_t wireBytes, SXIpcReplyFn reply) {
   std::string why = validate(method, params);
+  if (why.empty()) why = checkLimits(method, params, wireBytes);
   if (!why.empty()) {
     reply(why, nullptr);
     return;
   }
-  dispatch(method, params, std::move(reply));
+  dispatch(method, params, wireBytes, std::move(reply));
 }
 
 // Moves what it hands on out of `params`.
-void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params,
+void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params, size_t wireBytes,
                                         SXIpcReplyFn reply) {
   auto boolReply = [reply](bool value) { reply(nullptr, value); };
   auto& instance = *instance_;
@@ -158,9 +205,14 @@ void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params
     instance.startReportingSessionForID(params[0].get<int64_t>(), boolReply);
   } else if (method == sxr::method::kSendMessage) {
     std::optional<std::vector<int64_t>> ids;
-    if (!params[3].is_null()) ids = params[3].get<std::vector<int64_t>>();
+    if (!params[3].is_null()) {
+      ids = params[3].get<std::vector<int64_t>>();
+      SXReportingRemoveRepeatedIDs(*ids);
+    }
+    auto payload = SXChargedShared(std::move(params[0]),
+                                   SXByteBudget::charge(budget_, SXDecodedBytes(wireBytes)));
     instance.sendMessage(
-        std::move(params[0]), params[1].get<SXReportingCategory>(),
+        std::move(payload), params[1].get<SXReportingCategory>(),
         params[2].get<SXReportingMessageType>(), std::move(ids),
         [reply](std::optional<SXError> error) { reply(nullptr, errorValue(error)); });
   } else if (method == sxr::method::kStop) {

@@ -10,6 +10,7 @@
 
 class SXReportingServerInstance;
 class SXReportingSession;
+class SXReportingErrorLines;
 
 // The client protocol. Every operation is asynchronous and answers through its reply, which
 // some outcomes never call (reporter ID 0 for several operations, a repeated start,
@@ -25,7 +26,8 @@ class SXReportingServiceProtocol {
   virtual void setConfiguration(std::optional<SXValue> configuration, int64_t reporterID,
                                 Reply<bool> reply) = 0;
   virtual void startReportingSessionForID(int64_t reporterID, Reply<bool> reply) = 0;
-  virtual void sendMessage(SXValue message, SXReportingCategory category,
+  // The message is shared, never changed: every sink and session reads this one copy.
+  virtual void sendMessage(std::shared_ptr<const SXValue> message, SXReportingCategory category,
                            SXReportingMessageType type,
                            std::optional<std::vector<int64_t>> reporterIDs,
                            Reply<std::optional<SXError>> reply) = 0;
@@ -46,7 +48,9 @@ class SXReportingServiceDelegateProtocol {
   // The live list, not a copy.
   virtual const SXReportingClientList& getAllClients() = 0;
   virtual bool isReportingEnabled() = 0;
-  virtual std::shared_ptr<SXReportingSession> findReportingSessionForID(int64_t reporterID) = 0;
+  // A failed lookup's error line counts against `errorLines` when given.
+  virtual std::shared_ptr<SXReportingSession> findReportingSessionForID(
+      int64_t reporterID, SXReportingErrorLines* errorLines = nullptr) = 0;
   virtual SXValue getSnapShot() = 0;
   virtual std::optional<SXValue> getDriverStatisticsRelativeToSnapShot(
       const std::optional<SXValue>& snapshot) = 0;

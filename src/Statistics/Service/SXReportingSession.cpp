@@ -54,10 +54,20 @@ SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
 
 std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
   if (!rewritten_) {
-    // A payload without spaced keys is its own rewrite: shared, not copied.
-    rewritten_ = SXReportingSessionHasSpacedKeys(*caller_)
-                     ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*caller_))
-                     : caller_;
+    // A payload without spaced keys is its own rewrite: shared, not copied. A copy holds the
+    // caller's payload, so that whatever the caller's payload carries (its client's charge of
+    // bytes) lasts as long as either.
+    if (SXReportingSessionHasSpacedKeys(*caller_)) {
+      struct Rewrite {
+        SXValue value;
+        std::shared_ptr<const SXValue> caller;
+      };
+      auto rewrite = std::make_shared<const Rewrite>(
+          Rewrite{SXReportingSessionUnderscoreKeys(*caller_), caller_});
+      rewritten_ = std::shared_ptr<const SXValue>(rewrite, &rewrite->value);
+    } else {
+      rewritten_ = caller_;
+    }
   }
   return rewritten_;
 }
@@ -71,14 +81,23 @@ std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
   return rewrittenLocked();
 }
 
-std::string SXReportingMessagePayload::text() {
-  std::lock_guard lock(mutex_);
+const std::string& SXReportingMessagePayload::textLocked() {
   if (!text_) {
     text_ = SXValueText(*rewrittenLocked());
     caller_ = nullptr;
     rewritten_ = nullptr;
   }
   return *text_;
+}
+
+std::string SXReportingMessagePayload::text() {
+  std::lock_guard lock(mutex_);
+  return textLocked();
+}
+
+size_t SXReportingMessagePayload::makeText() {
+  std::lock_guard lock(mutex_);
+  return textLocked().size();
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {
@@ -108,7 +127,7 @@ SXReportingSession::SXReportingSession(std::shared_ptr<SXReportingEnvironment> e
       fernReportingQueue_(environment_->platform().dispatch->createSerialQueue(
           "com.vendra.sonex.session.fernreporting", SXQualityOfService::kUtility)),
       standaloneBudget_(std::move(standaloneBudget)),
-      aggregate_(std::make_shared<SXReportingAggregate>()) {}
+      aggregate_(newAggregate()) {}
 
 SXReportingSession::~SXReportingSession() {
   environment_->tracer().trace(kTraceDestroyed);
@@ -142,7 +161,7 @@ void SXReportingSession::start() {
     return;
   }
   setStarted(true);
-  aggregate_.store(std::make_shared<SXReportingAggregate>());
+  aggregate_.store(newAggregate());
   environment_->tracer().trace(kTraceStarted);
   if (shouldReportOrientation()) registerOrientationCallbacks();
 

@@ -33,10 +33,14 @@ class SXReportingMessagePayload {
   std::shared_ptr<const SXValue> rewritten();
   // SXValueText of the rewritten payload (compact JSON).
   std::string text();
+  // Makes the text, releasing the dictionaries, and returns its size in bytes.
+  size_t makeText();
 
  private:
   // REQUIRES: mutex_ held.
   std::shared_ptr<const SXValue> rewrittenLocked();
+  // REQUIRES: mutex_ held. Makes the text once and releases the dictionaries.
+  const std::string& textLocked();
 
   std::mutex mutex_;
   std::shared_ptr<const SXValue> caller_;     // GUARDED_BY(mutex_); released with the text
@@ -75,10 +79,26 @@ void SXReportingAggregateEntry::forEachText(Visit&& visit) const {
   for (const auto& [key, value] : dictionary_->items()) visit(key, SXValueText(value));
 }
 
+// A session's aggregate. Its size in bytes is the text of its message entries, counted as each
+// text is made (on the session's queue, after the entry was appended), and it is part of the
+// service-wide count of aggregate bytes for as long as it lives.
 struct SXReportingAggregate {
+  explicit SXReportingAggregate(SXReportingCounters* counters = nullptr) : counters(counters) {}
+  ~SXReportingAggregate() {
+    if (counters) counters->aggregateBytesRemoved(bytes.load());
+  }
+  SXReportingAggregate(const SXReportingAggregate&) = delete;
+  SXReportingAggregate& operator=(const SXReportingAggregate&) = delete;
+  void addBytes(uint64_t n) {
+    bytes.fetch_add(n);
+    if (counters) counters->aggregateBytesAdded(n);
+  }
+
   std::recursive_mutex mutex;
   std::vector<SXReportingAggregateEntry> entries;  // GUARDED_BY(mutex)
   uint64_t dropped = 0;                            // GUARDED_BY(mutex)
+  std::atomic<uint64_t> bytes{0};
+  SXReportingCounters* const counters;  // the environment's, which outlives every session
 };
 
 using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
@@ -93,8 +113,6 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   static constexpr SXReportingServiceType kTestServiceType = 11;
   static constexpr SXReportingCategory kSummaryCategory = 0xFFFFFFFF;
   static constexpr SXReportingMessageType kSummaryType = 0xFFFF;
-  // The summary event's count of entries the aggregate had no room for; present only then.
-  static constexpr const char* kDroppedEntriesKey = "SX_Session_Entries_Dropped";
 
   // Creation. Never fails on this platform; callers still test for none. `standaloneBudget`
   // is the owning client's: the session's delayed standalone sends wait within it.
@@ -135,7 +153,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
 
   // A server-reporting message without a session of its own. `userInfo` is accepted and not
   // sent: a standalone message carries only the client and service names. A delayed send
-  // waits within `budget` when one is given; when the budget is full it goes out at once.
+  // waits within `budget` when one is given; when the budget is full it is refused (logged
+  // and counted).
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
                                 std::shared_ptr<const SXValue> payload,
                                 SXReportingCategory category, SXReportingMessageType type,
@@ -194,6 +213,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
     SXReportingCategory category;
     SXReportingMessageType type;
     bool startedSnapshot;
+    std::shared_ptr<SXReportingAggregate> aggregate;  // the one its entry went into, if any
   };
   // Messages accepted one after another with no other task of the session's queue between
   // them. They share one task on that queue, so that the server-reporting session can store
@@ -211,13 +231,20 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   void runSendBatch(const std::shared_ptr<SendBatch>& batch);
   // The send task of started messages in a row: all to the server-reporting session at once.
   void sendToServerReporting(const std::vector<PendingSend>& sends);
+  // An aggregated message keeps only its text once sent, so that its payload (and the client's
+  // charge on it) is let go; its bytes count against the aggregate's limits from then on.
+  void keepOnlyText(const PendingSend& send);
   void runTeardownTask();
   void registerOrientationCallbacks();
   void unregisterOrientationCallbacks();
   void recordOrientation(const char* mode, const char* nameKey, const char* timeKey,
                          int32_t orientation);
-  // Appends under the aggregate's lock, unless the session has no aggregate at that moment.
-  void appendToAggregate(SXReportingAggregateEntry entry);
+  // Appends under the aggregate's lock, unless the session has no aggregate at that moment or
+  // it is full. Returns the aggregate it appended to.
+  std::shared_ptr<SXReportingAggregate> appendToAggregate(SXReportingAggregateEntry entry);
+  std::shared_ptr<SXReportingAggregate> newAggregate() const {
+    return std::make_shared<SXReportingAggregate>(&environment_->counters());
+  }
   void writeSummaryFile(const std::shared_ptr<SXReportingAggregate>& aggregate,
                         const SXValue& userInfo);
 

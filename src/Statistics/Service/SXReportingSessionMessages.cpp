@@ -1,6 +1,7 @@
 // A session's message path: numbering, aggregation, the send task, and standalone messages.
 #include "SXReportingSession.h"
 #include "SXReportingUtility.h"
+#include "common/MsgpackValue.h"
 
 namespace {
 
@@ -17,25 +18,38 @@ std::string SXReportingSession::messageIdForCategory(SXReportingCategory categor
   return kind + "_" + std::to_string(count);
 }
 
-void SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry) {
+std::shared_ptr<SXReportingAggregate> SXReportingSession::appendToAggregate(
+    SXReportingAggregateEntry entry) {
   auto aggregate = aggregate_.load();
-  if (!aggregate) return;
+  if (!aggregate) return nullptr;
   std::lock_guard lock(aggregate->mutex);
   // Stop may have dropped this array while we waited for its lock.
-  if (aggregate_.load() != aggregate) return;
-  uint64_t limit = environment_->limits().maxAggregateEntries;
-  if (aggregate->entries.size() < limit) {
-    aggregate->entries.push_back(std::move(entry));
-    return;
+  if (aggregate_.load() != aggregate) return nullptr;
+  const SXReportingLimits& limits = environment_->limits();
+  SXReportingCounters& counters = environment_->counters();
+  std::optional<SXReportingGuardrail> full;
+  if (aggregate->entries.size() >= limits.maxAggregateEntries) {
+    full = SXReportingGuardrail::kAggregateEntries;
+  } else if (aggregate->bytes.load() >= limits.maxAggregateBytes ||
+             counters.aggregateBytes() >= limits.maxAggregateBytesTotal) {
+    full = SXReportingGuardrail::kAggregateBytes;
   }
-  environment_->counters().dropped(SXReportingGuardrail::kAggregateEntries);
+  if (!full) {
+    aggregate->entries.push_back(std::move(entry));
+    return aggregate;
+  }
+  counters.dropped(*full);
   // One line per aggregate: a client that floods a session would otherwise flood the log.
   if (aggregate->dropped++ == 0) {
     SXLOG(log(), scope(), SXLogLevel::kError,
-          "aggregate of reporter %lli is full (%llu entries, --max-aggregate-entries); further "
-          "entries are sent but not aggregated",
-          reporterID(), static_cast<unsigned long long>(limit));
+          "aggregate of reporter %lli is full (%llu entries and %llu bytes; the service's "
+          "aggregates hold %llu bytes): further messages are sent but left out of its summary "
+          "(--max-aggregate-entries, --max-aggregate-bytes, --max-aggregate-bytes-total)",
+          reporterID(), static_cast<unsigned long long>(aggregate->entries.size()),
+          static_cast<unsigned long long>(aggregate->bytes.load()),
+          static_cast<unsigned long long>(counters.aggregateBytes()));
   }
+  return nullptr;
 }
 
 void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
@@ -46,14 +60,16 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   // The key rewrite is made once, where it is first needed (normally by the send task).
   auto rewritten = std::make_shared<SXReportingMessagePayload>(payload);
   std::string messageId = messageIdForCategory(category, type);
+  std::shared_ptr<SXReportingAggregate> aggregate;
   if (aggregate_.load()) {
-    appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten));
+    aggregate = appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten));
   }
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
   // The caller's own payload appears only in a verbose line; keep it only for that.
   if (!log().isEnabled(scope(), kSXLogVerboseLevel)) payload = nullptr;
-  queueSend({std::move(rewritten), std::move(payload), category, type, startedSnapshot});
+  queueSend({std::move(rewritten), std::move(payload), category, type, startedSnapshot,
+             std::move(aggregate)});
   if (reply) reply(std::nullopt);
 }
 
@@ -99,12 +115,27 @@ void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
     // The session's configuration is not part of a standalone message, so none is copied.
     sendSingleMessage(environment_, send.payload->rewritten(), send.category, send.type,
                       serviceType(), nullptr, nullptr, standaloneBudget_);
+    keepOnlyText(send);
   }
   sendToServerReporting(started);
 }
 
+void SXReportingSession::keepOnlyText(const PendingSend& send) {
+  // An entry costs about this much beside its text (its id, its holder, its slot).
+  constexpr uint64_t kEntryOverheadBytes = 256;
+  if (send.aggregate) send.aggregate->addBytes(send.payload->makeText() + kEntryOverheadBytes);
+}
+
 void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& sends) {
   if (sends.empty()) return;
+  // Whatever becomes of the sends, their aggregated entries keep only text afterwards.
+  struct KeepOnlyText {
+    SXReportingSession& session;
+    const std::vector<PendingSend>& sends;
+    ~KeepOnlyText() {
+      for (const PendingSend& send : sends) session.keepOnlyText(send);
+    }
+  } keepOnlyText{*this, sends};
   if (serviceType() == kTestServiceType) {
     for (size_t i = 0; i < sends.size(); ++i) {
       SXLOG(log(), scope(), SXLogLevel::kInfo, "transactions aren't allowed on this platform");
@@ -189,24 +220,25 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
   if (reply) reply(error);
 }
 
-// A place in `budget` for a send that waits `delay` seconds, or nothing when it need not wait
-// or has no budget. A full budget cancels the wait: the send goes out at once rather than being
-// dropped, and the overflow is logged and counted.
-std::shared_ptr<SXReportingPendingBudget::Slot> reserveWait(
-    SXReportingEnvironment& environment, const std::shared_ptr<SXReportingPendingBudget>& budget,
-    uint32_t& delay) {
-  if (delay == 0 || !budget) return nullptr;
-  if (auto slot = budget->tryAcquire()) return slot;
-  delay = 0;
+// A place in `budget` for a send that waits for its delay. False when the budget has no room:
+// the send is refused, logged (once per run of refusals) and counted, so that a client cannot
+// make the service hold an unbounded backlog of delayed sends.
+bool reserveWait(SXReportingEnvironment& environment,
+                 const std::shared_ptr<SXReportingPendingBudget>& budget, const SXValue& payload,
+                 std::shared_ptr<SXReportingPendingBudget::Slot>& slot) {
+  uint64_t bytes = SXPackedSize(payload);
+  slot = budget->tryAcquire(bytes);
+  if (slot) return true;
   environment.counters().dropped(SXReportingGuardrail::kStandalonePending);
   if (budget->firstRefusal()) {
     SXLOG_IN("sendSingleMessage", environment.log(), environment.sessionLogScope(),
              SXLogLevel::kError,
-             "client %i has %llu standalone sends waiting for their delay "
-             "(--max-pending-standalone); sending further ones at once",
-             budget->owner(), static_cast<unsigned long long>(budget->capacity()));
+             "client %i has %llu bytes of standalone sends waiting for their delay "
+             "(--max-pending-standalone-bytes %llu); further ones are refused until they drain",
+             budget->owner(), static_cast<unsigned long long>(budget->pending()),
+             static_cast<unsigned long long>(budget->capacity()));
   }
-  return nullptr;
+  return false;
 }
 
 }  // namespace
@@ -220,7 +252,8 @@ void SXReportingSession::sendSingleMessage(
   const SXPlatform& platform = environment->platform();
   uint32_t delay =
       serviceType == kAlarmsServiceType ? platform.random->uniform(kAlarmsMaxDelaySeconds) : 0;
-  auto slot = reserveWait(*environment, budget, delay);
+  std::shared_ptr<SXReportingPendingBudget::Slot> slot;
+  if (delay > 0 && budget && !reserveWait(*environment, budget, *payload, slot)) return;
   SXLOG(environment->log(), environment->sessionLogScope(), SXLogLevel::kDebug,
         "sending single message after delta %lli for service %i", static_cast<int64_t>(delay),
         serviceType);

@@ -62,11 +62,9 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   if (!aggregate) return std::nullopt;
 
   std::map<std::string, std::vector<std::string>> working;
-  uint64_t dropped = 0;
   {
     std::lock_guard lock(aggregate->mutex);
     if (aggregate->entries.empty()) return std::nullopt;
-    dropped = aggregate->dropped;
     working[kSummaryKey].push_back(std::to_string(serviceType()));
     for (const auto& entry : aggregate->entries) {
       entry.forEachText([&](const std::string& key, std::string text) {
@@ -83,7 +81,6 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
     }
     event[key] = std::move(joined);
   }
-  if (dropped) event[kDroppedEntriesKey] = std::to_string(dropped);
 
   SXValue info = userInfo();
   {

@@ -63,17 +63,43 @@ constexpr const char* kUsage =
     "  --max-sessions N            live sessions of all clients (SXREPORTING_MAX_SESSIONS,\n"
     "                              default 65536)\n"
     "  --max-aggregate-entries N   entries a session gathers for its summary; later messages\n"
-    "                              are sent but only counted (SXREPORTING_MAX_AGGREGATE_ENTRIES,\n"
+    "                              are sent but left out of it "
+    "(SXREPORTING_MAX_AGGREGATE_ENTRIES,\n"
     "                              default 100000)\n"
-    "  --max-pending-standalone N  standalone sends of one client waiting for their delay;\n"
-    "                              beyond it they go out at once\n"
-    "                              (SXREPORTING_MAX_PENDING_STANDALONE, default 1024)\n"
+    "  --max-aggregate-bytes N     the same in bytes (texts and 256 an entry), per session\n"
+    "                              (SXREPORTING_MAX_AGGREGATE_BYTES, default 1048576)\n"
+    "  --max-aggregate-bytes-total N\n"
+    "                              the same for all sessions together\n"
+    "                              (SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL, default 16777216)\n"
+    "  --max-pending-standalone-bytes N\n"
+    "                              payload bytes of one client's standalone sends waiting for\n"
+    "                              their delay; further ones are refused\n"
+    "                              (SXREPORTING_MAX_PENDING_STANDALONE_BYTES, default 1048576)\n"
+    "  --max-payload-bytes N       a message's payload, MessagePack bytes; larger ones get an\n"
+    "                              error reply (SXREPORTING_MAX_PAYLOAD_BYTES, default 65536)\n"
+    "  --max-configuration-bytes N a session's configuration, likewise\n"
+    "                              (SXREPORTING_MAX_CONFIGURATION_BYTES, default 65536)\n"
+    "  --max-reporter-ids N        reporter IDs in one send's list, likewise\n"
+    "                              (SXREPORTING_MAX_REPORTER_IDS, default 1024)\n"
     "  --max-queued-requests N     requests of one connection read but not yet handled before\n"
     "                              the daemon stops reading it (SXREPORTING_MAX_QUEUED_REQUESTS,\n"
     "                              default 1024)\n"
     "  --max-pending-reply-bytes N replies of one connection waiting to be written before the\n"
     "                              daemon stops reading it (SXREPORTING_MAX_PENDING_REPLY_BYTES,\n"
     "                              default 4194304)\n"
+    "  --max-connection-bytes N    bytes one connection may make the daemon hold (requests and\n"
+    "                              payloads not yet stored) before it stops reading it\n"
+    "                              (SXREPORTING_MAX_CONNECTION_BYTES, default 1048576)\n"
+    "  --max-inflight-bytes N      the same for all connections together; beyond it the\n"
+    "                              connections holding the most stop being read\n"
+    "                              (SXREPORTING_MAX_INFLIGHT_BYTES, default 16777216)\n"
+    "  --partial-frame-timeout-ms N\n"
+    "                              time a request that has begun to arrive may take to complete;\n"
+    "                              then its connection ends "
+    "(SXREPORTING_PARTIAL_FRAME_TIMEOUT_MS,\n"
+    "                              default 30000)\n"
+    "  --max-error-lines N         error lines one client may cause a minute; the rest are\n"
+    "                              counted in one line (SXREPORTING_MAX_ERROR_LINES, default 20)\n"
     "  -h, --help                  this text\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
@@ -98,8 +124,23 @@ constexpr LimitFlag kLimitFlags[] = {
     {"--max-sessions", "SXREPORTING_MAX_SESSIONS", &SXReportingLimits::maxSessions},
     {"--max-aggregate-entries", "SXREPORTING_MAX_AGGREGATE_ENTRIES",
      &SXReportingLimits::maxAggregateEntries},
-    {"--max-pending-standalone", "SXREPORTING_MAX_PENDING_STANDALONE",
-     &SXReportingLimits::maxPendingStandalone},
+    {"--max-aggregate-bytes", "SXREPORTING_MAX_AGGREGATE_BYTES",
+     &SXReportingLimits::maxAggregateBytes},
+    {"--max-aggregate-bytes-total", "SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL",
+     &SXReportingLimits::maxAggregateBytesTotal},
+    {"--max-pending-standalone-bytes", "SXREPORTING_MAX_PENDING_STANDALONE_BYTES",
+     &SXReportingLimits::maxPendingStandaloneBytes},
+    {"--max-payload-bytes", "SXREPORTING_MAX_PAYLOAD_BYTES", &SXReportingLimits::maxPayloadBytes},
+    {"--max-configuration-bytes", "SXREPORTING_MAX_CONFIGURATION_BYTES",
+     &SXReportingLimits::maxConfigurationBytes},
+    {"--max-reporter-ids", "SXREPORTING_MAX_REPORTER_IDS", &SXReportingLimits::maxReporterIDs},
+    {"--max-connection-bytes", "SXREPORTING_MAX_CONNECTION_BYTES",
+     &SXReportingLimits::maxConnectionBytes},
+    {"--max-inflight-bytes", "SXREPORTING_MAX_INFLIGHT_BYTES",
+     &SXReportingLimits::maxInflightBytes},
+    {"--partial-frame-timeout-ms", "SXREPORTING_PARTIAL_FRAME_TIMEOUT_MS",
+     &SXReportingLimits::partialFrameTimeoutMs},
+    {"--max-error-lines", "SXREPORTING_MAX_ERROR_LINES", &SXReportingLimits::maxErrorLines},
     {"--max-queued-requests", "SXREPORTING_MAX_QUEUED_REQUESTS",
      &SXReportingLimits::maxQueuedRequests},
     {"--max-pending-reply-bytes", "SXREPORTING_MAX_PENDING_REPLY_BYTES",
@@ -295,13 +336,17 @@ int main(int argc, char** argv) {
   RpcLimits limits;
   limits.maxMessageBytes = options.maxMessageBytes;
   // Requests are handed to the server queue, so that queue tells when they have been handled.
-  SXUnixSocketListener listener({.socketPath = options.paths.socketPath,
-                                 .socketMode = options.socketMode,
-                                 .limits = limits,
-                                 .maxQueuedRequests = options.limits.maxQueuedRequests,
-                                 .maxPendingReplyBytes = options.limits.maxPendingReplyBytes,
-                                 .requestQueue = environment->serverQueue()},
-                                log);
+  SXUnixSocketListener listener(
+      {.socketPath = options.paths.socketPath,
+       .socketMode = options.socketMode,
+       .limits = limits,
+       .maxQueuedRequests = options.limits.maxQueuedRequests,
+       .maxPendingReplyBytes = options.limits.maxPendingReplyBytes,
+       .maxConnectionBytes = options.limits.maxConnectionBytes,
+       .maxInflightBytes = options.limits.maxInflightBytes,
+       .partialFrameTimeout = std::chrono::milliseconds(options.limits.partialFrameTimeoutMs),
+       .requestQueue = environment->serverQueue()},
+      log);
   delegate->setStatusProviders(
       {.requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
        .tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
@@ -309,7 +354,9 @@ int main(int argc, char** argv) {
        .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
        .spoolBacklog = exporter
                            ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
-                           : std::function<uint64_t()>()});
+                           : std::function<uint64_t()>(),
+       .partialFrames = [&listener] { return listener.partialFrameTimeouts(); },
+       .inflightBytes = [&listener] { return listener.inflightBytes(); }});
 
   std::string error;
   if (!listener.open(error)) {
@@ -318,15 +365,18 @@ int main(int argc, char** argv) {
   }
   listener.setDelegate(delegate);
   const SXReportingLimits& l = options.limits;
+  using ull = unsigned long long;
   SXLOG(*log, nullptr, SXLogLevel::kDefault,
-        "limits: %llu sessions per client, %llu sessions, %llu aggregate entries, %llu pending "
-        "standalone sends per client, %llu queued requests and %llu reply bytes per connection",
-        static_cast<unsigned long long>(l.maxSessionsPerClient),
-        static_cast<unsigned long long>(l.maxSessions),
-        static_cast<unsigned long long>(l.maxAggregateEntries),
-        static_cast<unsigned long long>(l.maxPendingStandalone),
-        static_cast<unsigned long long>(l.maxQueuedRequests),
-        static_cast<unsigned long long>(l.maxPendingReplyBytes));
+        "limits: %llu sessions per client, %llu sessions, %llu aggregate entries and %llu bytes "
+        "per session, %llu aggregate bytes in all, %llu bytes of delayed standalone sends per "
+        "client; payloads %llu, configurations %llu bytes, %llu reporter IDs per send; %llu "
+        "queued requests, %llu reply bytes and %llu bytes in flight per connection, %llu in "
+        "all; partial requests end after %llu ms",
+        ull{l.maxSessionsPerClient}, ull{l.maxSessions}, ull{l.maxAggregateEntries},
+        ull{l.maxAggregateBytes}, ull{l.maxAggregateBytesTotal}, ull{l.maxPendingStandaloneBytes},
+        ull{l.maxPayloadBytes}, ull{l.maxConfigurationBytes}, ull{l.maxReporterIDs},
+        ull{l.maxQueuedRequests}, ull{l.maxPendingReplyBytes}, ull{l.maxConnectionBytes},
+        ull{l.maxInflightBytes}, ull{l.partialFrameTimeoutMs});
   SXLOG(
       *log, nullptr, SXLogLevel::kDefault,
       "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
