@@ -1,5 +1,6 @@
 #include "platform/FileKestrel.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -7,15 +8,13 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
-#include <filesystem>
+#include <initializer_list>
 #include <string_view>
 #include <vector>
 
 #include "platform/FileSystem.h"
 
 namespace {
-
-namespace fs = std::filesystem;
 
 // Stands for an absent group, subgroup or channel name in the file tree.
 constexpr std::string_view kAbsentName = "-";
@@ -64,36 +63,67 @@ void setError(std::optional<KestrelError>& error, int code) {
 
 enum class EntryKind { kDirectory, kFile };
 
-// The visible entries of `dir` of one kind. Nothing when `dir` is missing (no error) or cannot
-// be listed (error set).
-std::optional<std::vector<std::string>> listEntries(const fs::path& dir, EntryKind kind,
-                                                    std::optional<KestrelError>& error) {
-  std::error_code ec;
-  fs::directory_iterator it(dir, ec);
-  if (ec) {
-    if (ec != std::errc::no_such_file_or_directory && ec != std::errc::not_a_directory) {
-      setError(error, ec.value());
-    }
-    return std::nullopt;
+// `root`/`names...` opened one directory at a time without following a symlink, so nothing in
+// the tree can lead outside it. -1 with errno set when one is missing, no directory or a symlink.
+int openTreeDirectory(int root, std::initializer_list<std::string_view> names) {
+  int fd = ::fcntl(root, F_DUPFD_CLOEXEC, 0);
+  for (auto name : names) {
+    if (fd < 0) break;
+    int next =
+        ::openat(fd, std::string(name).c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    int err = errno;
+    ::close(fd);
+    fd = next;
+    errno = err;
   }
-  std::vector<std::string> names;
-  for (; !ec && it != fs::directory_iterator(); it.increment(ec)) {
-    std::string name = it->path().filename().string();
-    std::error_code typeError;
-    bool wanted = kind == EntryKind::kDirectory ? it->is_directory(typeError)
-                                                : it->is_regular_file(typeError);
-    if (wanted && !typeError && isTreeName(name)) names.push_back(std::move(name));
-  }
-  if (ec) setError(error, ec.value());
-  return names;
+  return fd;
 }
 
-// `wanted` alone when the caller names it, otherwise every visible directory in `parent`.
-std::vector<std::string> directoriesNamed(const std::optional<std::string>& wanted,
-                                          const fs::path& parent,
+// The root, which may itself be a symlink: it is configuration, not driver output.
+int openRoot(const std::string& root) {
+  return ::open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+}
+
+// Missing, not a directory, or a symlink (O_NOFOLLOW with O_DIRECTORY gives ENOTDIR).
+bool isAbsent(int err) { return err == ENOENT || err == ENOTDIR; }
+
+// The visible entries of one kind in the directory `names...` below `root`; symlinks are
+// neither. Nothing when the directory is absent (no error) or cannot be listed (error set).
+std::optional<std::vector<std::string>> listEntries(int root,
+                                                    std::initializer_list<std::string_view> names,
+                                                    EntryKind kind,
+                                                    std::optional<KestrelError>& error) {
+  int fd = openTreeDirectory(root, names);
+  DIR* dir = fd < 0 ? nullptr : ::fdopendir(fd);
+  if (!dir) {
+    int err = errno;
+    if (fd >= 0) ::close(fd);
+    if (!isAbsent(err)) setError(error, err);
+    return std::nullopt;
+  }
+  std::vector<std::string> found;
+  errno = 0;
+  while (const dirent* entry = ::readdir(dir)) {
+    struct stat st {};
+    if (isTreeName(entry->d_name) &&
+        ::fstatat(::dirfd(dir), entry->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+        (kind == EntryKind::kDirectory ? S_ISDIR(st.st_mode) : S_ISREG(st.st_mode))) {
+      found.emplace_back(entry->d_name);
+    }
+    errno = 0;
+  }
+  if (errno != 0) setError(error, errno);
+  ::closedir(dir);
+  return found;
+}
+
+// `wanted` alone when the caller names it, otherwise every visible directory in `names...`.
+std::vector<std::string> directoriesNamed(const std::optional<std::string>& wanted, int root,
+                                          std::initializer_list<std::string_view> names,
                                           std::optional<KestrelError>& error) {
   if (wanted) return {*wanted};
-  return listEntries(parent, EntryKind::kDirectory, error).value_or(std::vector<std::string>{});
+  return listEntries(root, names, EntryKind::kDirectory, error)
+      .value_or(std::vector<std::string>{});
 }
 
 std::optional<int64_t> parseCounter(std::string_view text) {
@@ -140,12 +170,16 @@ std::optional<SXValue> SXFileKestrel::copyChannelsInGroup(
     setError(error, EINVAL);
     return std::nullopt;
   }
-  const fs::path root(root_);
+  SXScopedFd root(openRoot(root_));
+  if (root.get() < 0) {
+    if (!isAbsent(errno)) setError(error, errno);
+    return std::nullopt;
+  }
   // A matching subgroup directory, even an empty one, makes a (possibly empty) dictionary.
   std::optional<SXValue> channels;
-  for (const auto& g : directoriesNamed(group, root, error)) {
-    for (const auto& s : directoriesNamed(subgroup, root / g, error)) {
-      auto files = listEntries(root / g / s, EntryKind::kFile, error);
+  for (const auto& g : directoriesNamed(group, root.get(), {}, error)) {
+    for (const auto& s : directoriesNamed(subgroup, root.get(), {g}, error)) {
+      auto files = listEntries(root.get(), {g, s}, EntryKind::kFile, error);
       if (!files) continue;
       if (!channels) channels = SXValue::object();
       for (const auto& f : *files) (*channels)[g + "/" + s + "/" + f] = channelEntry(g, s, f);
@@ -182,7 +216,7 @@ std::optional<SXValue> SXFileKestrel::createSamples(const KestrelSubscription* s
   for (const auto& [key, entry] : subscribedChannels.items()) {
     auto parts = splitKey(key);
     if (!parts) continue;
-    auto value = readCounter(key);
+    auto value = readCounter(key, *parts);
     if (!value) continue;
     SXValue sample = channelEntry((*parts)[0], (*parts)[1], (*parts)[2]);
     sample["value"] = *value;
@@ -228,10 +262,16 @@ void SXFileKestrel::iterate(const SXValue& samples,
   }
 }
 
-std::optional<int64_t> SXFileKestrel::readCounter(const std::string& key) const {
+std::optional<int64_t> SXFileKestrel::readCounter(
+    const std::string& key, const std::array<std::string_view, 3>& parts) const {
   const std::string path = root_ + "/" + key;
-  // Non-blocking, so that a FIFO put where a counter belongs cannot stall sampling.
-  SXScopedFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  SXScopedFd root(openRoot(root_));
+  SXScopedFd dir(root.get() < 0 ? -1 : openTreeDirectory(root.get(), {parts[0], parts[1]}));
+  // Non-blocking, so that a FIFO put where a counter belongs cannot stall sampling; a symlink
+  // is refused (ELOOP) like any unreadable counter.
+  SXScopedFd fd(dir.get() < 0 ? -1
+                              : ::openat(dir.get(), std::string(parts[2]).c_str(),
+                                         O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC));
   if (fd.get() < 0) {
     // A channel that went away since the subscription is simply not sampled.
     if (errno != ENOENT && errno != ENOTDIR) {

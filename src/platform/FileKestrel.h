@@ -3,7 +3,8 @@
 // Layout: `<root>/<group>/<subgroup>/<channel>`, each file holding one decimal integer
 // (surrounding white space allowed). A directory or file named "-" stands for an absent group,
 // subgroup or channel name; names starting with "." are ignored. A missing root means that no
-// driver publishes anything.
+// driver publishes anything. The root may be a symlink; nothing below it is reached through one:
+// symlinks are not listed, and a channel reached through one is not read.
 //
 // Values it hands out:
 //   channels / subscribed channels  {"<group>/<subgroup>/<channel>":
@@ -18,8 +19,10 @@
 // sample.
 #pragma once
 
+#include <array>
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "platform/Kestrel.h"
 #include "platform/Log.h"
@@ -45,9 +48,10 @@ class SXFileKestrel final : public Kestrel {
                const std::function<int(const KestrelChannelSample&)>& callback) override;
 
  private:
-  // Reads one counter file; nothing when it is gone, unreadable or not an integer (the last
-  // two logged).
-  std::optional<int64_t> readCounter(const std::string& key) const;
+  // Reads the counter file `key` (split into `parts`); nothing when it is missing or below a
+  // symlinked directory (quiet), or unreadable, a symlink or not an integer (logged).
+  std::optional<int64_t> readCounter(const std::string& key,
+                                     const std::array<std::string_view, 3>& parts) const;
 
   const std::string root_;
   const std::shared_ptr<SXLogFacility> log_;

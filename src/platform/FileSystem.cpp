@@ -1,11 +1,49 @@
 #include "platform/FileSystem.h"
 
 #include <fcntl.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
+#include <chrono>
+#include <cstdio>
 #include <cstring>
+
+namespace {
+
+// Attempts at a fresh temporary name before giving up; a clash needs someone creating names
+// in the directory, and each attempt draws 64 new random bits.
+constexpr int kTemporaryNameAttempts = 16;
+
+// 16 hex digits nobody can guess ahead. Should the kernel's pool not be ready yet (early boot),
+// the time, pid and a counter still keep names apart; O_EXCL keeps the open safe either way.
+std::string randomSuffix() {
+  static std::atomic<uint64_t> counter{0};
+  uint64_t bits = 0;
+  if (::getrandom(&bits, sizeof bits, GRND_NONBLOCK) != static_cast<ssize_t>(sizeof bits)) {
+    bits = static_cast<uint64_t>(std::chrono::steady_clock::now().time_since_epoch().count()) ^
+           (static_cast<uint64_t>(::getpid()) << 32) ^ (counter++ * 0x9E3779B97F4A7C15ull);
+  }
+  char text[17];
+  std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(bits));
+  return text;
+}
+
+// Writes all of `contents`; 0 or the errno of the failing write.
+int writeAll(int fd, const std::string& contents) {
+  size_t done = 0;
+  while (done < contents.size()) {
+    ssize_t n = ::write(fd, contents.data() + done, contents.size() - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return errno;
+    done += static_cast<size_t>(n);
+  }
+  return 0;
+}
+
+}  // namespace
 
 SXScopedFd::~SXScopedFd() {
   if (fd_ >= 0) ::close(fd_);
@@ -17,52 +55,73 @@ std::string SXPosixError(const std::string& context, int errnum) {
 
 std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string& path,
                                                               unsigned mode) {
-  std::string partial;
-  size_t pos = 0;
-  while (pos != std::string::npos) {
-    pos = path.find('/', pos + 1);
-    partial = path.substr(0, pos);
-    if (partial.empty()) continue;
-    if (::mkdir(partial.c_str(), static_cast<mode_t>(mode)) == 0) {
-      ::chmod(partial.c_str(), static_cast<mode_t>(mode));  // not narrowed by the umask
-      continue;
-    }
-    if (errno == EEXIST) {
-      struct stat st {};
-      if (::stat(partial.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) continue;
-      return SXPosixError(partial, ENOTDIR);
-    }
-    return SXPosixError(partial, errno);
+  if (path.empty()) return SXPosixError(path, ENOENT);
+  // Each component is made and opened relative to its parent's descriptor, so a directory made
+  // here and swapped for a symlink before its child is made is never followed.
+  SXScopedFd parent(::open(path[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (parent.get() < 0) return SXPosixError(path[0] == '/' ? "/" : ".", errno);
+  int dir = parent.get();
+  std::optional<SXScopedFd> child;
+  size_t start = 0;
+  while (start < path.size()) {
+    size_t end = path.find('/', start);
+    if (end == std::string::npos) end = path.size();
+    std::string name = path.substr(start, end - start);
+    std::string partial = path.substr(0, end);
+    start = end + 1;
+    if (name.empty() || name == ".") continue;
+    // The umask narrows `mode`: the daemon's directories are never more open than it allows.
+    bool made = ::mkdirat(dir, name.c_str(), static_cast<mode_t>(mode)) == 0;
+    if (!made && errno != EEXIST) return SXPosixError(partial, errno);
+    // A directory that was there already may be a symlink the administrator set up.
+    int next =
+        ::openat(dir, name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC | (made ? O_NOFOLLOW : 0));
+    if (next < 0) return SXPosixError(partial, errno);
+    child.emplace(next);
+    dir = child->get();
   }
   return std::nullopt;
 }
 
 std::optional<std::string> SXPosixFileSystem::writeFileAtomically(const std::string& path,
                                                                   const std::string& contents) {
-  std::string temp = path + ".tmp." + std::to_string(::getpid());
-  int fd = ::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-  if (fd < 0) return SXPosixError(temp, errno);
-  size_t done = 0;
-  while (done < contents.size()) {
-    ssize_t n = ::write(fd, contents.data() + done, contents.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) {
-      int err = errno;
-      ::close(fd);
-      ::unlink(temp.c_str());
-      return SXPosixError(temp, err);
+  size_t slash = path.rfind('/');
+  std::string directory = slash == std::string::npos ? "." : path.substr(0, slash ? slash : 1);
+  std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+  if (name.empty() || name == "." || name == "..") return SXPosixError(path, EINVAL);
+  // Everything below happens relative to this descriptor: a symlink put in the directory's
+  // place, before or during the write, cannot move the file elsewhere.
+  SXScopedFd dir(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (dir.get() < 0) {
+    int err = errno;
+    struct stat st {};
+    if (::lstat(directory.c_str(), &st) == 0 && S_ISLNK(st.st_mode)) {
+      return directory + ": is a symbolic link, not followed";
     }
-    done += static_cast<size_t>(n);
+    return SXPosixError(directory, err);
   }
-  int err = ::fsync(fd) == 0 ? 0 : errno;
+  // A fresh name that nobody can plant anything at ahead of time; O_EXCL refuses whatever is
+  // there all the same, a symlink included.
+  std::string temp;
+  int fd = -1;
+  for (int attempt = 0; fd < 0 && attempt < kTemporaryNameAttempts; ++attempt) {
+    temp = name + ".tmp." + randomSuffix();
+    fd = ::openat(dir.get(), temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
+                  0640);
+    if (fd < 0 && errno != EEXIST) break;
+  }
+  if (fd < 0) return SXPosixError(directory + "/" + temp, errno);
+  int err = writeAll(fd, contents);
+  if (err == 0 && ::fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && err == 0) err = errno;
   if (err != 0) {
-    ::unlink(temp.c_str());
-    return SXPosixError(temp, err);
+    ::unlinkat(dir.get(), temp.c_str(), 0);
+    return SXPosixError(directory + "/" + temp, err);
   }
-  if (::rename(temp.c_str(), path.c_str()) != 0) {
-    int err = errno;
-    ::unlink(temp.c_str());
+  // rename replaces a symlink at `name` instead of writing through it.
+  if (::renameat(dir.get(), temp.c_str(), dir.get(), name.c_str()) != 0) {
+    err = errno;
+    ::unlinkat(dir.get(), temp.c_str(), 0);
     return SXPosixError(path, err);
   }
   return std::nullopt;

@@ -7,11 +7,14 @@
 class SXFileSystem {
  public:
   virtual ~SXFileSystem() = default;
-  // Creates `path` with its missing parents and `mode`. An existing directory is no failure.
-  // On failure returns the failure's description.
+  // Creates `path` with its missing parents and `mode` less the process umask (never wider).
+  // An existing directory, or a symlink to one, is no failure; a directory made here that is
+  // swapped for a symlink is not followed. On failure returns the failure's description.
   virtual std::optional<std::string> createDirectory(const std::string& path, unsigned mode) = 0;
   // Writes `contents` so that a reader sees either no file or the whole file, replacing a file
-  // of the same name. On failure returns the failure's description.
+  // (or symlink) of the same name; the new file is 0640 less the umask. Nothing is written
+  // through a symlink: neither the directory named in `path` nor the file may be one. On
+  // failure returns the failure's description.
   virtual std::optional<std::string> writeFileAtomically(const std::string& path,
                                                          const std::string& contents) = 0;
 };

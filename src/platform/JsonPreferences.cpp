@@ -121,7 +121,7 @@ std::optional<std::string> SXJsonPreferences::setValue(const std::string& domain
   // the file; the lock file itself is never replaced, unlike the domain file.
   std::string path = domainPath(domain);
   std::string lockPath = path + ".lock";
-  SXScopedFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+  SXScopedFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0644));
   if (lock.get() < 0) return SXPosixError(lockPath, errno);
   if (int err = LockExclusive(lock.get())) return SXPosixError(lockPath, err);
 

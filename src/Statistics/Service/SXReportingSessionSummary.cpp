@@ -109,6 +109,8 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
 
   const std::string& directory = environment_->platform().diagnosticLogsDirectory;
   SXFileSystem& fs = *environment_->platform().fileSystem;
+  // The mode the platform asks for; the daemon's umask narrows it (0750). The write below
+  // refuses a directory that is a symlink.
   if (auto error = fs.createDirectory(directory, 0777)) {
     SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError,
              "can't create logging directory at %@: %@", directory, *error);
