@@ -23,6 +23,8 @@ constexpr const char* kUsage =
     "                         state directory\n"
     "  --daemon PATH          the daemon to spawn (default: sxreportingd beside this program)\n"
     "  --keep                 keep the spawned daemons' directories (and their logs)\n"
+    "  --daemon-flag NAME=VALUE\n"
+    "                         pass '--NAME VALUE' to every spawned daemon (repeatable)\n"
     "  --socket PATH          a running daemon (default: the service's socket, as sxreportctl)\n"
     "  --state-dir DIR        that daemon's state directory, for the row counts\n"
     "  --baseline             also run every scenario against the echo server\n"
@@ -35,6 +37,9 @@ constexpr const char* kUsage =
     "  lifecycle   loops of create / start / send x10 / stop / destroy\n"
     "  rpc         ping-pong reporterID:valid: (window 1)\n"
     "  idle        daemon RSS idle, after creating the sessions, and after they are gone\n"
+    "  abuse       (not in all) hostile clients, one attack after another, then all at once,\n"
+    "              while a well-behaved one times reporterID:valid:; checks the daemon's peak\n"
+    "              RSS, that latency and its log size against targets (exit 0 when missed)\n"
     "\n"
     "load:\n"
     "  --clients N            client connections (default 4)\n"
@@ -47,6 +52,9 @@ constexpr const char* kUsage =
     "  --rss-samples N        daemon RSS samples during the run (default 10)\n"
     "  --drain-timeout S      give up on missing rows after S seconds without a new one (60)\n"
     "  --reply-timeout S      give up after S seconds without any reply (30)\n"
+    "  --attack-seconds S     abuse: how long each attack runs (default 4)\n"
+    "  --partial-connections N\n"
+    "                         abuse: connections left mid-request (default 1000)\n"
     "\n"
     "output:\n"
     "  --json                 one JSON object on stdout\n"
@@ -68,10 +76,25 @@ bool parseSeconds(const char* text, double& out) {
   return errno == 0 && end != text && *end == '\0' && out > 0;
 }
 
+// "NAME=VALUE" or "--NAME=VALUE".
+bool parseDaemonFlag(const std::string& text, std::vector<DaemonFlag>& out) {
+  size_t equals = text.find('=');
+  if (equals == std::string::npos || equals == 0) return false;
+  std::string name = text.substr(0, equals);
+  if (name.rfind("--", 0) != 0) name = "--" + name;
+  if (name.size() <= 2) return false;
+  out.push_back({name, text.substr(equals + 1), false});
+  return true;
+}
+
 bool parseScenarios(const std::string& text, std::vector<ScenarioKind>& out) {
+  // abuse stays out of "all": it checks robustness against targets of its own rather than
+  // measuring speed, and takes about half a minute.
   const std::vector<ScenarioKind> all = {ScenarioKind::kAddressed,  ScenarioKind::kBroadcast,
                                          ScenarioKind::kStandalone, ScenarioKind::kLifecycle,
                                          ScenarioKind::kRpc,        ScenarioKind::kIdle};
+  std::vector<ScenarioKind> names = all;
+  names.push_back(ScenarioKind::kAbuse);
   out.clear();
   std::stringstream list(text);
   std::string name;
@@ -81,7 +104,7 @@ bool parseScenarios(const std::string& text, std::vector<ScenarioKind>& out) {
       continue;
     }
     bool known = false;
-    for (ScenarioKind kind : all) {
+    for (ScenarioKind kind : names) {
       if (name == ScenarioName(kind)) {
         out.push_back(kind);
         known = true;
@@ -112,6 +135,10 @@ bool applyValue(const std::string& arg, const char* value, BenchOptions& options
     return parseSeconds(value, options.drainTimeoutSeconds);
   } else if (arg == "--reply-timeout") {
     return parseSeconds(value, options.replyTimeoutSeconds);
+  } else if (arg == "--attack-seconds") {
+    return parseSeconds(value, options.attackSeconds) && options.attackSeconds <= 3600;
+  } else if (arg == "--daemon-flag") {
+    return parseDaemonFlag(value, options.daemonFlags);
   } else if (!parseCount(value, count)) {
     return false;
   } else if (arg == "--clients" && count >= 1 && count <= 4096) {
@@ -126,6 +153,8 @@ bool applyValue(const std::string& arg, const char* value, BenchOptions& options
     options.stopEvery = count;
   } else if (arg == "--rss-samples" && count >= 1 && count <= 10000) {
     options.rssSamples = count;
+  } else if (arg == "--partial-connections" && count <= 100'000) {
+    options.partialConnections = count;
   } else {
     return false;
   }
@@ -148,6 +177,8 @@ const char* ScenarioName(ScenarioKind kind) {
       return "rpc";
     case ScenarioKind::kIdle:
       return "idle";
+    case ScenarioKind::kAbuse:
+      return "abuse";
   }
   return "?";
 }

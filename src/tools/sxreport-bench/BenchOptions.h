@@ -5,7 +5,15 @@
 #include <string>
 #include <vector>
 
-enum class ScenarioKind { kAddressed, kBroadcast, kStandalone, kLifecycle, kRpc, kIdle };
+enum class ScenarioKind { kAddressed, kBroadcast, kStandalone, kLifecycle, kRpc, kIdle, kAbuse };
+
+// A flag given to a spawned daemon, as "--name value". An optional one is one the daemon may
+// not know yet: when the daemon refuses it, it is dropped and the daemon started again.
+struct DaemonFlag {
+  std::string name;
+  std::string value;
+  bool optional = false;
+};
 
 struct BenchOptions {
   std::string socketPath;  // a running daemon; empty with --spawn
@@ -24,6 +32,10 @@ struct BenchOptions {
   size_t rssSamples = 10;
   double drainTimeoutSeconds = 60;
   double replyTimeoutSeconds = 30;
+  std::vector<DaemonFlag> daemonFlags;  // --daemon-flag, for every spawned daemon
+  // The abuse scenario.
+  double attackSeconds = 4;          // each attack, and all of them at once
+  size_t partialConnections = 1000;  // bounded by the descriptors this process may open
 };
 
 const char* ScenarioName(ScenarioKind kind);

@@ -67,6 +67,141 @@ SXValue idleJson(const TargetFigures& figures) {
   return json;
 }
 
+// The abuse scenario's targets: what a daemon that defends itself keeps to under every attack.
+constexpr long kAbusePeakRssKiB = 128 * 1024;
+constexpr double kAbuseValidP99Millis = 50;
+constexpr uint64_t kAbuseLogBytes = 1'000'000;
+
+struct AbuseTarget {
+  const char* key;  // in the JSON
+  const char* name;
+  std::string goal;
+  SXValue limit;             // the goal as a number, in the unit of the JSON figure it judges
+  std::string measured;      // as text
+  std::optional<bool> pass;  // empty: not measured
+};
+
+double millis(uint64_t nanoseconds) { return static_cast<double>(nanoseconds) / 1e6; }
+
+std::vector<AbuseTarget> abuseTargets(const TargetFigures& figures) {
+  const AbuseFigures& abuse = *figures.abuse;
+  std::vector<AbuseTarget> targets;
+  AbuseTarget rss{
+      "peakRss",        "daemon peak RSS", SXFormat("<= %li MiB", kAbusePeakRssKiB / 1024),
+      kAbusePeakRssKiB, "not measured",    {}};
+  if (figures.peakRssKiB) {
+    rss.measured = SXFormat("%.1f MiB", static_cast<double>(*figures.peakRssKiB) / 1024.0);
+    rss.pass = *figures.peakRssKiB <= kAbusePeakRssKiB;
+  }
+  targets.push_back(rss);
+  double p99 = millis(abuse.probes.percentileNanoseconds(0.99));
+  targets.push_back({"validP99", "reporterID:valid: p99",
+                     SXFormat("< %.0f ms", kAbuseValidP99Millis), kAbuseValidP99Millis * 1000,
+                     abuse.probes.count() ? SXFormat("%.2f ms", p99) : std::string("no reply"),
+                     abuse.probes.count() > 0 && p99 < kAbuseValidP99Millis});
+  AbuseTarget log{"log",
+                  "daemon log",
+                  SXFormat("< %.0f MB", kAbuseLogBytes / 1e6),
+                  kAbuseLogBytes,
+                  "not measured (not spawned)",
+                  {}};
+  if (abuse.logBytes) {
+    log.measured = SXFormat("%.2f MB", static_cast<double>(*abuse.logBytes) / 1e6);
+    log.pass = *abuse.logBytes < kAbuseLogBytes;
+  }
+  targets.push_back(log);
+  bool answering = abuse.alive && abuse.finalRoundTripNanoseconds.has_value();
+  targets.push_back({"aliveAndAnswering", "alive and answering at the end", "", true,
+                     answering
+                         ? SXFormat("yes, in %.2f ms", millis(*abuse.finalRoundTripNanoseconds))
+                         : "no: " + abuse.finalRoundTripError,
+                     answering});
+  return targets;
+}
+
+bool abusePasses(const std::vector<AbuseTarget>& targets) {
+  return std::all_of(targets.begin(), targets.end(),
+                     [](const AbuseTarget& target) { return target.pass.value_or(true); });
+}
+
+SXValue latencyJson(const LatencyHistogram& latency) {
+  return {{"p50", micros(latency.percentileNanoseconds(0.50))},
+          {"p99", micros(latency.percentileNanoseconds(0.99))},
+          {"max", micros(latency.maxNanoseconds())}};
+}
+
+SXValue closeDelaysJson(std::vector<double> delays) {
+  if (delays.empty()) return nullptr;
+  std::sort(delays.begin(), delays.end());
+  return {{"min", rounded(delays.front())},
+          {"median", rounded(delays[delays.size() / 2])},
+          {"max", rounded(delays.back())}};
+}
+
+SXValue attacksJson(const AttackCounters& attacks) {
+  return {{"connections", attacks.connections},
+          {"connectFailures", attacks.connectFailures},
+          {"requests", attacks.requests},
+          {"bytesWritten", attacks.bytesWritten},
+          {"replies", attacks.replies},
+          {"errorReplies", attacks.errorReplies},
+          {"refused", attacks.refused},
+          {"closedByDaemon", attacks.closedByDaemon},
+          {"unanswered", attacks.unanswered},
+          {"partialConnections", attacks.partialConnections},
+          {"partialPrefixes", attacks.partialPrefixes},
+          {"partialPrefixBytes", attacks.partialPrefixBytes},
+          {"partialFrameBytes", attacks.partialFrameBytes},
+          {"closeDelaySeconds", closeDelaysJson(attacks.closeDelays)},
+          {"firstError", attacks.firstError.empty() ? SXValue() : SXValue(attacks.firstError)}};
+}
+
+SXValue abuseJson(const TargetFigures& figures) {
+  if (!figures.abuse) return {{"target", figures.target}, {"errors", figures.errors}};
+  const AbuseFigures& abuse = *figures.abuse;
+  SXValue phases = SXValue::array();
+  for (const auto& phase : abuse.phases) {
+    phases.push_back({{"name", phase.name},
+                      {"seconds", rounded(phase.seconds)},
+                      {"probes", phase.probes.count()},
+                      {"unansweredProbes", phase.unansweredProbes},
+                      {"latencyMicros", latencyJson(phase.probes)},
+                      {"maxRssKiB", orNull(phase.maxRssKiB)},
+                      {"endRssKiB", orNull(phase.endRssKiB)},
+                      {"braked", phase.braked},
+                      {"attacks", attacksJson(phase.attacks)}});
+  }
+  auto targets = abuseTargets(figures);
+  SXValue targetsJson = SXValue::object();
+  for (const auto& target : targets) {
+    targetsJson[target.key] = {{"goal", target.goal},
+                               {"limit", target.limit},
+                               {"measured", target.measured},
+                               {"pass", target.pass ? SXValue(*target.pass) : SXValue()}};
+  }
+  return {{"target", figures.target},
+          {"attackSeconds", abuse.attackSeconds},
+          {"partialConnections", abuse.partialConnections},
+          {"partialFrameTimeoutMs", abuse.partialFrameTimeoutMs},
+          {"rssBrakeKiB", abuse.rssBrakeKiB},
+          {"phases", phases},
+          {"probes", abuse.probes.count()},
+          {"unansweredProbes", abuse.unansweredProbes},
+          {"proberReconnects", abuse.proberReconnects},
+          {"latencyMicros", latencyJson(abuse.probes)},
+          {"peakRssKiB", orNull(figures.peakRssKiB)},
+          {"rssKiB", orNull(figures.rssKiB)},
+          {"logBytes", orNull(abuse.logBytes)},
+          {"alive", abuse.alive},
+          {"finalRoundTripMicros", abuse.finalRoundTripNanoseconds
+                                       ? SXValue(micros(*abuse.finalRoundTripNanoseconds))
+                                       : SXValue()},
+          {"targets", targetsJson},
+          {"pass", abusePasses(targets)},
+          {"notes", abuse.notes},
+          {"errors", figures.errors}};
+}
+
 SXValue figuresJson(const TargetFigures& figures) {
   SXValue samples = SXValue::array();
   for (const auto& [messages, rss] : figures.rssSamples) {
@@ -115,6 +250,12 @@ std::string mib(const std::optional<long>& kib) {
 
 SXValue ScenarioResultJson(const ScenarioResult& result, const BenchOptions& options) {
   bool idle = result.kind == ScenarioKind::kIdle;
+  if (result.kind == ScenarioKind::kAbuse) {
+    return {{"scenario", ScenarioName(result.kind)},
+            {"daemon", abuseJson(result.daemon)},
+            {"baseline", nullptr},
+            {"ok", result.ok()}};
+  }
   SXValue json = {{"scenario", ScenarioName(result.kind)},
                   {"clients", options.clients},
                   {"messagesPerClient", options.messages},
@@ -162,6 +303,107 @@ std::string idleText(const TargetFigures& figures) {
     text += row("per session", SXFormat("%.0f bytes", per));
   }
   text += row("RSS after close", mib(figures.rssAfterCloseKiB));
+  return text;
+}
+
+std::string padLeft(const std::string& text, size_t width) {
+  return text.size() < width ? std::string(width - text.size(), ' ') + text : text;
+}
+
+std::string padRight(std::string text, size_t width) {
+  if (text.size() < width) text.resize(width, ' ');
+  return text;
+}
+
+std::string count(uint64_t value) { return value ? SXFormat("%llu", value) : std::string("-"); }
+
+std::string abuseText(const TargetFigures& figures) {
+  if (!figures.abuse) return "";
+  const AbuseFigures& abuse = *figures.abuse;
+  // phase, then the prober's figures, the daemon's RSS, and what the attacks met.
+  const std::vector<std::pair<const char*, size_t>> columns = {
+      {"phase", 16}, {"s", 6},       {"probes", 8}, {"p50 ms", 9},   {"p99 ms", 9},
+      {"max ms", 9}, {"RSS MiB", 9}, {"conns", 7},  {"requests", 9}, {"replies", 8},
+      {"errors", 7}, {"refused", 8}, {"closed", 7}, {"no reply", 9}};
+  auto line = [&](const std::vector<std::string>& cells) {
+    std::string text = "  ";
+    for (size_t i = 0; i < cells.size(); ++i) {
+      text += i == 0 ? padRight(cells[i], columns[i].second) : padLeft(cells[i], columns[i].second);
+    }
+    while (!text.empty() && text.back() == ' ') text.pop_back();
+    return text + "\n";
+  };
+  std::vector<std::string> header;
+  for (const auto& [name, width] : columns) header.push_back(name);
+  std::string text = line(header);
+  for (const auto& phase : abuse.phases) {
+    const AttackCounters& a = phase.attacks;
+    auto ms = [&](uint64_t ns) {
+      return phase.probes.count() ? SXFormat("%.2f", millis(ns)) : std::string("-");
+    };
+    std::string probes = SXFormat("%llu", phase.probes.count());
+    if (phase.unansweredProbes) probes += SXFormat("+%llu", phase.unansweredProbes);
+    std::string rss = phase.maxRssKiB
+                          ? SXFormat("%.0f", static_cast<double>(*phase.maxRssKiB) / 1024.0)
+                          : std::string("-");
+    if (phase.braked) rss += "!";
+    text +=
+        line({phase.name, SXFormat("%.1f", phase.seconds), probes,
+              ms(phase.probes.percentileNanoseconds(0.5)),
+              ms(phase.probes.percentileNanoseconds(0.99)), ms(phase.probes.maxNanoseconds()), rss,
+              count(a.connections), count(a.requests), count(a.replies), count(a.errorReplies),
+              count(a.refused), count(a.closedByDaemon), count(a.unanswered)});
+  }
+  text +=
+      "  (probes: answered+unanswered; RSS: highest sample, ! = attacks stopped at the brake;\n"
+      "  requests, replies: each connection's setup included; errors: error replies; refused:\n"
+      "  false or an error result; closed: connections the daemon ended; no reply: in flight\n"
+      "  when the attack or its connection ended)\n";
+  for (const auto& phase : abuse.phases) {
+    const AttackCounters& a = phase.attacks;
+    if (a.partialPrefixBytes > 0) {
+      std::string closes = "none closed by the daemon";
+      if (!a.closeDelays.empty()) {
+        std::vector<double> delays = a.closeDelays;
+        std::sort(delays.begin(), delays.end());
+        closes = SXFormat("%llu closed by the daemon %.1f-%.1f s after their last byte",
+                          static_cast<uint64_t>(delays.size()), delays.front(), delays.back());
+      }
+      text += SXFormat(
+          "  %s: %llu connections left mid-request, %llu of them all but the last %llu bytes of a "
+          "%llu-byte request; %s\n",
+          phase.name, a.partialConnections, a.partialPrefixes,
+          a.partialFrameBytes - a.partialPrefixBytes, a.partialFrameBytes, closes);
+    }
+    if (a.connectFailures) {
+      text += SXFormat("  %s: %llu connection attempts failed\n", phase.name, a.connectFailures);
+    }
+    if (!a.firstError.empty()) {
+      text += SXFormat("  %s: first refusal: %s\n", phase.name, a.firstError);
+    }
+  }
+  text += SXFormat(
+      "  reporterID:valid: every %lli ms: p50 %.2f ms, p99 %.2f ms, max %.2f ms (%llu answered, "
+      "%llu unanswered, %llu reconnects)\n",
+      static_cast<int64_t>(Prober::kInterval.count()),
+      millis(abuse.probes.percentileNanoseconds(0.5)),
+      millis(abuse.probes.percentileNanoseconds(0.99)), millis(abuse.probes.maxNanoseconds()),
+      abuse.probes.count(), abuse.unansweredProbes, abuse.proberReconnects);
+  if (abuse.logBytes) text += SXFormat("  daemon log: %llu bytes\n", *abuse.logBytes);
+  for (const auto& note : abuse.notes) text += "  note: " + note + "\n";
+  auto targets = abuseTargets(figures);
+  size_t missed = 0;
+  text += "  targets:\n";
+  for (const auto& target : targets) {
+    std::string verdict = !target.pass ? "-" : *target.pass ? "PASS" : "FAIL";
+    if (target.pass && !*target.pass) ++missed;
+    std::string label = target.goal.empty() ? target.name : target.name + (" " + target.goal);
+    text += "    " + padRight(verdict, 6) + padRight(label, 34) + target.measured + "\n";
+  }
+  text += abusePasses(targets)
+              ? std::string("  abuse: PASS\n")
+              : SXFormat("  abuse: FAIL (%llu of %llu targets missed)\n",
+                         static_cast<uint64_t>(missed), static_cast<uint64_t>(targets.size()));
   return text;
 }
 
@@ -215,6 +457,17 @@ std::string figuresText(const TargetFigures& daemon, const TargetFigures* baseli
 }  // namespace
 
 std::string ScenarioResultText(const ScenarioResult& result, const BenchOptions& options) {
+  if (result.kind == ScenarioKind::kAbuse) {
+    std::string text = SXFormat(
+        "abuse: %.1f s per attack, one after another, then all at once; %llu partial-frame "
+        "connections\n",
+        options.attackSeconds, options.partialConnections);
+    text += abuseText(result.daemon);
+    for (const auto& error : result.daemon.errors) {
+      text += SXFormat("  ERROR (%s): %s\n", result.daemon.target, error);
+    }
+    return text;
+  }
   std::string text = SXFormat(
       "%s: %llu clients x %llu messages, window %llu, %llu session(s) per client%s\n",
       ScenarioName(result.kind), options.clients, options.messages, result.window, options.sessions,

@@ -12,6 +12,7 @@
 #include <utility>
 #include <vector>
 
+#include "AbuseAttacks.h"
 #include "BenchScenario.h"
 #include "LatencyHistogram.h"
 #include "StoreRows.h"
@@ -25,6 +26,37 @@ struct BenchTarget {
   // has no RSS of its own.
   std::function<std::optional<double>()> inProcessCpuSeconds;
   bool checkResults = true;  // whether replies must carry the values the daemon defines
+  // Bytes in the daemon's log so far; empty when the benchmark does not hold the log.
+  std::function<std::optional<uint64_t>()> logBytes;
+};
+
+// One phase of the abuse scenario: a quiet start, one attack, or all of them at once.
+struct AbusePhase {
+  std::string name;
+  double seconds = 0;
+  LatencyHistogram probes;  // the well-behaved client's reporterID:valid: round trips
+  uint64_t unansweredProbes = 0;
+  std::optional<long> maxRssKiB;  // sampled every 50 ms
+  std::optional<long> endRssKiB;
+  AttackCounters attacks;
+  bool braked = false;  // ended early: the daemon's RSS passed the brake
+};
+
+struct AbuseFigures {
+  double attackSeconds = 0;
+  size_t partialConnections = 0;
+  int partialFrameTimeoutMs = 0;
+  long rssBrakeKiB = 0;
+  std::vector<AbusePhase> phases;
+  LatencyHistogram probes;  // every phase
+  uint64_t unansweredProbes = 0;
+  uint64_t proberReconnects = 0;
+  std::optional<uint64_t> logBytes;
+  bool alive = false;
+  // A round trip on a fresh connection once the attacks are over: its latency, or why none.
+  std::optional<uint64_t> finalRoundTripNanoseconds;
+  std::string finalRoundTripError;
+  std::vector<std::string> notes;
 };
 
 struct TargetFigures {
@@ -47,6 +79,7 @@ struct TargetFigures {
   std::optional<long> rssWithSessionsKiB;
   std::optional<long> rssAfterCloseKiB;
   uint64_t sessions = 0;
+  std::optional<AbuseFigures> abuse;
 
   std::vector<std::string> errors;
 };
@@ -55,3 +88,7 @@ TargetFigures RunScenario(const BenchScenario& scenario, const BenchOptions& opt
                           const BenchTarget& target);
 TargetFigures RunIdle(const BenchScenario& scenario, const BenchOptions& options,
                       const BenchTarget& target);
+// The abuse scenario. Only a daemon that cannot be reached at the start is an error: what the
+// attacks do to it is the result.
+TargetFigures RunAbuse(const BenchScenario& scenario, const BenchOptions& options,
+                       const BenchTarget& target);

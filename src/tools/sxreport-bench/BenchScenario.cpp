@@ -143,7 +143,14 @@ uint64_t BenchScenario::messagesPerClient() const {
 }
 
 bool BenchScenario::landsRows() const {
-  return kind_ != ScenarioKind::kRpc && kind_ != ScenarioKind::kIdle;
+  return kind_ != ScenarioKind::kRpc && kind_ != ScenarioKind::kIdle &&
+         kind_ != ScenarioKind::kAbuse;
+}
+
+std::vector<DaemonFlag> BenchScenario::daemonFlags() const {
+  if (kind_ != ScenarioKind::kAbuse) return {};
+  // Optional: a daemon older than the flag refuses it, and then runs with its own default.
+  return {{"--partial-frame-timeout-ms", std::to_string(kAbusePartialFrameTimeoutMs), true}};
 }
 
 StoreCounts BenchScenario::expectedRows() const {

@@ -10,6 +10,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "BenchOptions.h"
 #include "PipelinedRpcClient.h"
@@ -21,6 +22,9 @@ class BenchScenario {
   static constexpr uint32_t kCategory = 0x80000003;  // "Kitbench_Playback"
   static constexpr uint16_t kType = 1;               // "Start"
   static const char* eventName() { return "com.vendra.sonex.Kitbench_Playback.Start"; }
+
+  // abuse: how long the spawned daemon is asked to wait for the rest of a request.
+  static constexpr int kAbusePartialFrameTimeoutMs = 2000;
 
   BenchScenario(ScenarioKind kind, const BenchOptions& options);
 
@@ -36,9 +40,13 @@ class BenchScenario {
   // Whether the scenario's messages land in the stores, and how many rows they should leave.
   bool landsRows() const;
   StoreCounts expectedRows() const;
+  // Flags a spawned daemon gets for this scenario (the user's --daemon-flag ones come after).
+  std::vector<DaemonFlag> daemonFlags() const;
+
+  // The reporter ID of a client's index-th session, within this process's own range.
+  int64_t sessionID(size_t client, uint64_t index) const;
 
  private:
-  int64_t sessionID(size_t client, uint64_t index) const;
   uint64_t lifecycleLoops() const;
 
   const ScenarioKind kind_;

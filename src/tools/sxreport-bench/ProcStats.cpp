@@ -50,3 +50,12 @@ std::optional<long> ProcStatusKiB(pid_t pid, const std::string& field) {
   }
   return std::nullopt;
 }
+
+bool ProcIsRunning(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  size_t close = text.rfind(')');
+  if (close == std::string::npos || close + 2 >= text.size()) return false;
+  char state = text[close + 2];
+  return state != 'Z' && state != 'X' && state != 'x';
+}

@@ -12,3 +12,6 @@ std::optional<double> ProcCpuSeconds(pid_t pid);
 
 // A field of /proc/<pid>/status in KiB: "VmRSS" (resident now) or "VmHWM" (peak resident).
 std::optional<long> ProcStatusKiB(pid_t pid, const std::string& field);
+
+// Whether process `pid` exists and has not exited (a zombie has).
+bool ProcIsRunning(pid_t pid);

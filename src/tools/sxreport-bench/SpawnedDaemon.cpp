@@ -5,6 +5,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
@@ -33,8 +34,10 @@ std::string SpawnedDaemon::besideExecutable() {
   return (self.parent_path() / "sxreportingd").string();
 }
 
-bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory, std::string& error) {
+bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory,
+                          const std::vector<DaemonFlag>& flags, std::string& error) {
   keep_ = keepDirectory;
+  daemonPath_ = daemonPath;
   std::string pattern = (std::filesystem::temp_directory_path() / "sxreport-bench-XXXXXX").string();
   if (::mkdtemp(pattern.data()) == nullptr) {
     error = "cannot create a temporary directory";
@@ -45,15 +48,37 @@ bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory, std
     std::filesystem::create_directories(dir_ + "/" + sub);
   }
   socket_ = dir_ + "/run/sxr.sock";
-  std::vector<std::string> args = {daemonPath,       "--socket",        socket_,
+  std::vector<DaemonFlag> remaining = flags;
+  // Each round either starts the daemon or drops one refused optional flag.
+  for (size_t round = 0; round <= flags.size(); ++round) {
+    if (launch(remaining, error)) return true;
+    if (pid_ > 0) return false;  // it started but never became ready
+    // It complains before its usage text, so the whole (short) log is searched.
+    std::string log = readFile(logPath());
+    auto refused = std::find_if(remaining.begin(), remaining.end(), [&](const DaemonFlag& flag) {
+      return flag.optional && log.find("bad option " + flag.name + " ") != std::string::npos;
+    });
+    if (refused == remaining.end()) return false;
+    refused_.push_back(*refused);
+    remaining.erase(refused);
+  }
+  return false;
+}
+
+bool SpawnedDaemon::launch(const std::vector<DaemonFlag>& flags, std::string& error) {
+  std::vector<std::string> args = {daemonPath_,      "--socket",        socket_,
                                    "--state-dir",    dir_ + "/lib",     "--config-dir",
                                    dir_ + "/etc",    "--runtime-dir",   dir_ + "/run",
                                    "--kestrel-root", dir_ + "/kestrel", "--diagnostic-logs-dir",
                                    dir_ + "/diag"};
-  std::string logPath = dir_ + "/daemon.log";
+  for (const auto& flag : flags) {
+    args.push_back(flag.name);
+    args.push_back(flag.value);
+  }
+  std::string log = logPath();
   pid_ = ::fork();
   if (pid_ == 0) {
-    int fd = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     ::dup2(fd, STDERR_FILENO);
     ::dup2(fd, STDOUT_FILENO);
     std::vector<char*> argv;
@@ -72,7 +97,7 @@ bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory, std
 bool SpawnedDaemon::waitForReady(std::string& error) {
   auto deadline = std::chrono::steady_clock::now() + 30s;
   while (std::chrono::steady_clock::now() < deadline) {
-    if (readFile(dir_ + "/daemon.log").find("ready, listening on") != std::string::npos) {
+    if (readFile(logPath()).find("ready, listening on") != std::string::npos) {
       return true;
     }
     int status = 0;
@@ -112,6 +137,21 @@ SpawnedDaemon::~SpawnedDaemon() {
 }
 
 std::string SpawnedDaemon::logTail(size_t bytes) const {
-  std::string text = readFile(dir_ + "/daemon.log");
-  return text.size() > bytes ? text.substr(text.size() - bytes) : text;
+  // Only the tail is read: a daemon under abuse may have written gigabytes.
+  std::ifstream in(logPath(), std::ios::binary | std::ios::ate);
+  if (!in) return "";
+  auto size = static_cast<size_t>(std::max<std::streamoff>(0, in.tellg()));
+  size_t from = size > bytes ? size - bytes : 0;
+  in.seekg(static_cast<std::streamoff>(from));
+  std::string text(size - from, '\0');
+  in.read(text.data(), static_cast<std::streamsize>(text.size()));
+  text.resize(static_cast<size_t>(std::max<std::streamsize>(0, in.gcount())));
+  return text;
+}
+
+std::optional<uint64_t> SpawnedDaemon::logBytes() const {
+  std::error_code ec;
+  auto size = std::filesystem::file_size(logPath(), ec);
+  if (ec) return std::nullopt;
+  return static_cast<uint64_t>(size);
 }

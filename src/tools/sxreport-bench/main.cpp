@@ -45,7 +45,9 @@ TargetFigures runOnDaemon(const BenchScenario& scenario, const BenchOptions& opt
     std::string error;
     std::string path =
         options.daemonPath.empty() ? SpawnedDaemon::besideExecutable() : options.daemonPath;
-    if (!daemon->start(path, options.keep, error)) {
+    std::vector<DaemonFlag> flags = scenario.daemonFlags();
+    flags.insert(flags.end(), options.daemonFlags.begin(), options.daemonFlags.end());
+    if (!daemon->start(path, options.keep, flags, error)) {
       TargetFigures figures;
       figures.target = target.name;
       figures.errors.push_back("cannot start " + path + ": " + error);
@@ -54,10 +56,18 @@ TargetFigures runOnDaemon(const BenchScenario& scenario, const BenchOptions& opt
     target.socketPath = daemon->socket();
     target.stateDir = daemon->stateDir();
     target.pid = daemon->pid();
+    target.logBytes = [&daemon] { return daemon->logBytes(); };
   }
-  TargetFigures figures = scenario.kind() == ScenarioKind::kIdle
-                              ? RunIdle(scenario, options, target)
-                              : RunScenario(scenario, options, target);
+  TargetFigures figures =
+      scenario.kind() == ScenarioKind::kIdle    ? RunIdle(scenario, options, target)
+      : scenario.kind() == ScenarioKind::kAbuse ? RunAbuse(scenario, options, target)
+                                                : RunScenario(scenario, options, target);
+  if (daemon && figures.abuse) {
+    for (const auto& flag : daemon->refusedFlags()) {
+      figures.abuse->notes.push_back("this daemon refuses " + flag.name + " " + flag.value +
+                                     ", so it ran with its own default");
+    }
+  }
   if (daemon && !figures.errors.empty()) {
     figures.errors.push_back("daemon log (" + daemon->directory() + "/daemon.log) ends:\n" +
                              daemon->logTail());
@@ -100,7 +110,8 @@ int main(int argc, char** argv) {
   for (ScenarioKind kind : options.scenarios) {
     BenchScenario scenario(kind, options);
     ScenarioResult result{kind, scenario.window(), runOnDaemon(scenario, options), std::nullopt};
-    if (options.baseline && kind != ScenarioKind::kIdle) {
+    // Neither the idle nor the abuse figures mean anything for the echo server.
+    if (options.baseline && kind != ScenarioKind::kIdle && kind != ScenarioKind::kAbuse) {
       result.baseline = runOnBaseline(scenario, options);
     }
     ok = ok && result.ok();
