@@ -56,6 +56,7 @@ TEST(SXReportingCounters, StatusHasTheSchemaWithEverythingAtZero) {
                                            {"configuration_bytes", 0},
                                            {"reporter_ids", 0},
                                            {"error_lines", 0},
+                       {"connections_per_client", 0},
                                            {"requests_backpressure", 0},
                                            {"partial_frames", 0}}}}));
   EXPECT_EQ(status["gauges"],

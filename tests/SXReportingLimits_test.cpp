@@ -271,3 +271,19 @@ TEST(SXReportingLimitsErrorLines, ABadClientCostsAFewLinesAMinute) {
                         "(--max-error-lines); they were left out"));
   EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 3u);
 }
+
+TEST(SXReportingLimitsConnections, AProcessBeyondItsConnectionLimitIsRefusedUntilOneEnds) {
+  LimitedService s({.maxConnectionsPerClient = 2});
+  auto first = s.connect(10);
+  auto second = s.connect(10);
+  auto other = s.connect(11);
+  EXPECT_TRUE(first->resumed() && second->resumed() && other->resumed());
+  auto refused = std::make_shared<FakeIpcConnection>(10);
+  EXPECT_FALSE(s.delegate->shouldAcceptNewConnection(refused));
+  EXPECT_TRUE(s.t.log->contains(
+      "refusing a connection of process 10: it already has 2 (--max-connections-per-client)"));
+  EXPECT_EQ(s.dropped("connections_per_client"), 1u);
+  first->end(false);
+  s.t.drain();
+  EXPECT_TRUE(s.connect(10)->resumed());
+}

@@ -32,6 +32,8 @@ const char* SXReportingCounters::name(SXReportingGuardrail guardrail) {
       return "reporter_ids";
     case SXReportingGuardrail::kErrorLines:
       return "error_lines";
+    case SXReportingGuardrail::kConnectionsPerClient:
+      return "connections_per_client";
     case SXReportingGuardrail::kCount:
       break;
   }

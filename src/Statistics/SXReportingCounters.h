@@ -25,6 +25,7 @@ enum class SXReportingGuardrail {
   kConfigurationBytes,
   kReporterIDs,
   kErrorLines,
+  kConnectionsPerClient,
   kCount,
 };
 

@@ -19,9 +19,9 @@ bool SXReportingErrorLines::allow(SXReportingEnvironment& environment) {
 void SXReportingErrorLines::reportSuppressed(SXReportingEnvironment& environment) {
   if (suppressed_ == 0) return;
   SXLOG(environment.log(), environment.serviceLogScope(), SXLogLevel::kError,
-        "client %i caused %llu more error lines than the %llu a minute written "
+        "%@ caused %llu more error lines than the %llu a minute written "
         "(--max-error-lines); they were left out",
-        client_, static_cast<unsigned long long>(suppressed_),
+        source_, static_cast<unsigned long long>(suppressed_),
         static_cast<unsigned long long>(perMinute_));
   suppressed_ = 0;
 }

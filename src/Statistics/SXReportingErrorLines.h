@@ -3,18 +3,20 @@
 // the client goes. A client that sends thousands of bad reporter IDs a second thus costs a
 // few lines, not megabytes of log.
 //
-// Threads: the server queue only (and the owner's destructor).
+// Threads: one at a time (a client's: the server queue, and its owner's destructor).
 #pragma once
 
 #include <cstdint>
 #include <optional>
+#include <string>
 
 #include "SXReportingEnvironment.h"
 
 class SXReportingErrorLines {
  public:
-  SXReportingErrorLines(uint64_t perMinute, int32_t client)
-      : perMinute_(perMinute), client_(client) {}
+  // `source` names who caused the lines in the summary line, e.g. "client 42".
+  SXReportingErrorLines(uint64_t perMinute, std::string source)
+      : perMinute_(perMinute), source_(std::move(source)) {}
 
   // Whether the next error line of this client may be written. Counts it when not.
   bool allow(SXReportingEnvironment& environment);
@@ -23,7 +25,7 @@ class SXReportingErrorLines {
 
  private:
   const uint64_t perMinute_;
-  const int32_t client_;
+  const std::string source_;
   std::optional<SXDate> minuteStart_;
   uint64_t written_ = 0;
   uint64_t suppressed_ = 0;

@@ -20,7 +20,7 @@ struct SXReportingLimits {
   // Bytes of one session's aggregate, and of all aggregates together (each entry's text and
   // about 256 bytes beside it); beyond either, messages are sent but not aggregated, as above.
   uint64_t maxAggregateBytes = 1 << 20;
-  uint64_t maxAggregateBytesTotal = 16 << 20;
+  uint64_t maxAggregateBytesTotal = 8 << 20;
   // Payload bytes of one client's standalone sends waiting for their delay (alarms wait up to
   // 59 s). A delayed send beyond it is refused.
   uint64_t maxPendingStandaloneBytes = 1 << 20;
@@ -39,9 +39,11 @@ struct SXReportingLimits {
   // until every store and send has them), and all connections together; beyond them the
   // connections that hold the most stop being read.
   uint64_t maxConnectionBytes = 1 << 20;
-  uint64_t maxInflightBytes = 16 << 20;
+  uint64_t maxInflightBytes = 8 << 20;
   // How long a request that has begun to arrive may take to complete.
   uint64_t partialFrameTimeoutMs = 30'000;
+  // Open connections of one process; a further one is closed at once (logged and counted).
+  uint64_t maxConnectionsPerClient = 256;
   // Error lines one client may cause a minute; the rest are counted in one summary line.
   uint64_t maxErrorLines = 20;
 };

@@ -76,6 +76,19 @@ class SXByteBudget {
 // dictionary's nodes take several times the bytes that encode them.
 inline uint64_t SXDecodedBytes(size_t wireBytes) { return 256 + 4 * uint64_t{wireBytes}; }
 
+// `value` itself, holding `charge` as well for as long as the returned pointer is held.
+template <typename T>
+std::shared_ptr<const T> SXChargedAlias(std::shared_ptr<const T> value,
+                                        SXByteBudget::Charge charge) {
+  struct Holder {
+    std::shared_ptr<const T> value;
+    SXByteBudget::Charge charge;
+  };
+  const T* raw = value.get();
+  auto holder = std::make_shared<Holder>(Holder{std::move(value), std::move(charge)});
+  return std::shared_ptr<const T>(holder, raw);
+}
+
 // A value that holds its bytes of a budget for as long as anyone holds the value: the shared
 // payload of a message carries its client's charge to every store and queue that keeps it.
 template <typename T>

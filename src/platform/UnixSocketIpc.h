@@ -50,7 +50,7 @@ class SXUnixSocketListener final : public SXIpcListener {
     size_t maxQueuedRequests = 1024;
     size_t maxPendingReplyBytes = 4 << 20;
     uint64_t maxConnectionBytes = 1 << 20;
-    uint64_t maxInflightBytes = 16 << 20;
+    uint64_t maxInflightBytes = 8 << 20;
     std::chrono::milliseconds partialFrameTimeout{30'000};
     std::shared_ptr<SXWorkQueue> requestQueue;
   };

@@ -5,6 +5,7 @@
 
 #include "SXReportingJoulebookUtility.h"
 #include "SXReportingTallyvaneBridge.h"
+#include "common/MsgpackValue.h"
 
 namespace {
 
@@ -29,22 +30,26 @@ std::string describe(const std::vector<std::shared_ptr<SXReportingSession>>& ses
 
 std::shared_ptr<SXReportingServerInstance> SXReportingServerInstance::initWithPID(
     std::shared_ptr<SXReportingEnvironment> environment, int32_t processIdentifier,
-    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate) {
+    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate,
+    std::shared_ptr<SXByteBudget> budget) {
   SXLOG(environment->log(), environment->serviceLogScope(), SXLogLevel::kDefault,
         "new client with pid %lu", static_cast<uint64_t>(static_cast<uint32_t>(processIdentifier)));
   return std::shared_ptr<SXReportingServerInstance>(new SXReportingServerInstance(
-      std::move(environment), processIdentifier, std::move(delegate)));
+      std::move(environment), processIdentifier, std::move(delegate), std::move(budget)));
 }
 
 SXReportingServerInstance::SXReportingServerInstance(
     std::shared_ptr<SXReportingEnvironment> environment, int32_t processIdentifier,
-    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate)
+    std::weak_ptr<SXReportingServiceDelegateProtocol> delegate,
+    std::shared_ptr<SXByteBudget> budget)
     : environment_(std::move(environment)),
       processIdentifier_(processIdentifier),
       delegate_(std::move(delegate)),
+      budget_(std::move(budget)),
       standaloneBudget_(std::make_shared<SXReportingPendingBudget>(
           environment_->limits().maxPendingStandaloneBytes, processIdentifier)),
-      errorLines_(environment_->limits().maxErrorLines, processIdentifier) {}
+      errorLines_(environment_->limits().maxErrorLines,
+                  "client " + std::to_string(processIdentifier)) {}
 
 SXReportingServerInstance::~SXReportingServerInstance() {
   SXLOG(log(), scope(), SXLogLevel::kDefault, "dealloc %i from the server client list",
@@ -220,14 +225,26 @@ void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXValue> messa
   });
 }
 
-void SXReportingServerInstance::routeAddressed(const std::shared_ptr<const SXValue>& message,
+std::shared_ptr<const SXValue> SXReportingServerInstance::chargeDeliveries(
+    std::shared_ptr<const SXValue> message, size_t deliveries) const {
+  if (!budget_ || deliveries < 2) return message;
+  uint64_t perDelivery = 512 + 2 * uint64_t{SXPackedSize(*message)};
+  return SXChargedAlias(std::move(message),
+                        SXByteBudget::charge(budget_, (deliveries - 1) * perDelivery));
+}
+
+void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> message,
                                                SXReportingCategory category,
                                                SXReportingMessageType type,
                                                const std::vector<int64_t>& reporterIDs) {
+  std::vector<std::shared_ptr<SXReportingSession>> sessions;
   for (int64_t reporterID : reporterIDs) {
     if (reporterID == 0) continue;
-    auto session = findReportingSessionForID(reporterID);
-    if (!session) continue;
+    if (auto session = findReportingSessionForID(reporterID))
+      sessions.push_back(std::move(session));
+  }
+  message = chargeDeliveries(std::move(message), sessions.size());
+  for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
@@ -261,9 +278,10 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
                                           nullptr);
     return;
   }
+  auto charged = chargeDeliveries(message, active.size());
   for (const auto& session : active) {
-    session->sendMessage(message, category, type, nullptr);
-    SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    session->sendMessage(charged, category, type, nullptr);
+    SXReportingTallyvaneBridge::handleEvent(*environment_, charged, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
                                              *session);

@@ -16,6 +16,7 @@
 #include "SXReportingErrorLines.h"
 #include "SXReportingServiceProtocol.h"
 #include "SXReportingSession.h"
+#include "platform/ByteBudget.h"
 
 class SXReportingServerInstance final
     : public SXReportingServiceProtocol,
@@ -25,7 +26,8 @@ class SXReportingServerInstance final
 
   static std::shared_ptr<SXReportingServerInstance> initWithPID(
       std::shared_ptr<SXReportingEnvironment> environment, int32_t processIdentifier,
-      std::weak_ptr<SXReportingServiceDelegateProtocol> delegate);
+      std::weak_ptr<SXReportingServiceDelegateProtocol> delegate,
+      std::shared_ptr<SXByteBudget> budget = nullptr);
   ~SXReportingServerInstance() override;
 
   // SXReportingServiceProtocol
@@ -63,7 +65,8 @@ class SXReportingServerInstance final
  private:
   SXReportingServerInstance(std::shared_ptr<SXReportingEnvironment> environment,
                             int32_t processIdentifier,
-                            std::weak_ptr<SXReportingServiceDelegateProtocol> delegate);
+                            std::weak_ptr<SXReportingServiceDelegateProtocol> delegate,
+                            std::shared_ptr<SXByteBudget> budget);
 
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->serviceLogScope(); }
@@ -73,8 +76,12 @@ class SXReportingServerInstance final
   // Whether the session limits leave room for a new session under `reporterID` (replacing
   // one always does); logs and counts a refusal as the function `fn`.
   bool hasRoomForSession(int64_t reporterID, const char* fn);
-  void routeAddressed(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
+  void routeAddressed(std::shared_ptr<const SXValue> message, SXReportingCategory category,
                       SXReportingMessageType type, const std::vector<int64_t>& reporterIDs);
+  // The message, charged with what its deliveries beyond the first make the service hold
+  // (each session's copy of its text, its queue entry, its aggregate entry, its analytics row).
+  std::shared_ptr<const SXValue> chargeDeliveries(std::shared_ptr<const SXValue> message,
+                                                  size_t deliveries) const;
   void routeBroadcast(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
                       SXReportingMessageType type);
   void sendDriverDeltaAndStop(const std::shared_ptr<SXReportingSession>& session);
@@ -82,6 +89,7 @@ class SXReportingServerInstance final
   const std::shared_ptr<SXReportingEnvironment> environment_;
   const int32_t processIdentifier_;
   const std::weak_ptr<SXReportingServiceDelegateProtocol> delegate_;
+  const std::shared_ptr<SXByteBudget> budget_;  // the connection's; may be null
   SessionMap sessions_;  // server queue only; its size is counted in the environment's gauge
   // Standalone sends of this client's sessions waiting for their delay.
   const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;

@@ -87,7 +87,8 @@ std::shared_ptr<SXReportingServiceDelegate> SXReportingServiceDelegate::init(
 
 SXReportingServiceDelegate::SXReportingServiceDelegate(
     std::shared_ptr<SXReportingEnvironment> environment)
-    : environment_(std::move(environment)) {}
+    : environment_(std::move(environment)),
+      refusalLines_(environment_->limits().maxErrorLines, "refused connections") {}
 
 void SXReportingServiceDelegate::listenForDefaultsNotification() {
   int token = -1;
@@ -122,14 +123,39 @@ std::optional<SXValue> SXReportingServiceDelegate::getDefaults() {
   return defaults_;
 }
 
+bool SXReportingServiceDelegate::admitConnection(int32_t pid) {
+  std::lock_guard lock(connectionsMutex_);
+  uint64_t& live = connectionsPerProcess_[pid];
+  uint64_t limit = environment_->limits().maxConnectionsPerClient;
+  if (live < limit) {
+    ++live;
+    return true;
+  }
+  environment_->counters().dropped(SXReportingGuardrail::kConnectionsPerClient);
+  if (refusalLines_.allow(*environment_)) {
+    SXLOG(log(), scope(), SXLogLevel::kError,
+          "refusing a connection of process %i: it already has %llu (--max-connections-per-client)",
+          pid, static_cast<unsigned long long>(limit));
+  }
+  return false;
+}
+
+void SXReportingServiceDelegate::connectionEnded(int32_t pid) {
+  std::lock_guard lock(connectionsMutex_);
+  auto it = connectionsPerProcess_.find(pid);
+  if (it != connectionsPerProcess_.end() && --it->second == 0) connectionsPerProcess_.erase(it);
+}
+
 bool SXReportingServiceDelegate::shouldAcceptNewConnection(
     const std::shared_ptr<SXIpcConnection>& connection) {
   int32_t pid = connection->processIdentifier();
+  if (!admitConnection(pid)) return false;
   SXLOG(log(), scope(), SXLogLevel::kDefault, "newConnection: %@", connection->description());
   std::shared_ptr<SXReportingServerInstance> instance;
   {
     std::lock_guard lock(mutex_);
-    instance = SXReportingServerInstance::initWithPID(environment_, pid, weak_from_this());
+    instance = SXReportingServerInstance::initWithPID(environment_, pid, weak_from_this(),
+                                                      connection->budget());
     connection->setExportedObject(std::make_shared<SXReportingServiceExport>(
         instance, weak_from_this(), environment_, connection->budget()));
   }
@@ -140,8 +166,10 @@ bool SXReportingServiceDelegate::shouldAcceptNewConnection(
   auto environment = environment_;
   connection->setInterruptionHandler(
       [environment, weakInstance] { connectionInterrupted(*environment, weakInstance); });
-  connection->setInvalidationHandler(
-      [environment, weakInstance, pid] { connectionInvalidated(*environment, weakInstance, pid); });
+  connection->setInvalidationHandler([environment, weakInstance, pid, weakSelf = weak_from_this()] {
+    connectionInvalidated(*environment, weakInstance, pid);
+    if (auto self = weakSelf.lock()) self->connectionEnded(pid);
+  });
   connection->resume();
   return true;
 }

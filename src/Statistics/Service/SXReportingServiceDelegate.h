@@ -10,6 +10,7 @@
 
 #include <atomic>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 
@@ -75,6 +76,10 @@ class SXReportingServiceDelegate final
  private:
   explicit SXReportingServiceDelegate(std::shared_ptr<SXReportingEnvironment> environment);
   void listenForDefaultsNotification();
+  // Counts a new connection of `pid`, or refuses it (logged and counted) when the process
+  // already has as many as allowed; `connectionEnded` gives its place back. Any thread.
+  bool admitConnection(int32_t pid);
+  void connectionEnded(int32_t pid);
   SXValue countersValue() const;
   SXValue gaugesValue() const;
   SXLogFacility& log() const { return environment_->log(); }
@@ -87,6 +92,9 @@ class SXReportingServiceDelegate final
   std::unique_ptr<SXReportingDriverUtility> driverUtility_;
   mutable std::mutex defaultsMutex_;
   std::optional<SXValue> defaults_;  // GUARDED_BY(defaultsMutex_)
+  std::mutex connectionsMutex_;
+  std::map<int32_t, uint64_t> connectionsPerProcess_;  // GUARDED_BY(connectionsMutex_)
+  SXReportingErrorLines refusalLines_;                 // GUARDED_BY(connectionsMutex_)
   mutable std::mutex providersMutex_;
   SXReportingStatusProviders providers_;  // GUARDED_BY(providersMutex_)
 };

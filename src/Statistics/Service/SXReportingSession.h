@@ -79,9 +79,9 @@ void SXReportingAggregateEntry::forEachText(Visit&& visit) const {
   for (const auto& [key, value] : dictionary_->items()) visit(key, SXValueText(value));
 }
 
-// A session's aggregate. Its size in bytes is the text of its message entries, counted as each
-// text is made (on the session's queue, after the entry was appended), and it is part of the
-// service-wide count of aggregate bytes for as long as it lives.
+// A session's aggregate. Its size in bytes is what its message entries are estimated to hold,
+// counted as they are appended, and it is part of the service-wide count of aggregate bytes for
+// as long as it lives.
 struct SXReportingAggregate {
   explicit SXReportingAggregate(SXReportingCounters* counters = nullptr) : counters(counters) {}
   ~SXReportingAggregate() {
@@ -213,7 +213,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
     SXReportingCategory category;
     SXReportingMessageType type;
     bool startedSnapshot;
-    std::shared_ptr<SXReportingAggregate> aggregate;  // the one its entry went into, if any
+    bool aggregated;  // whether an aggregate keeps an entry of it
   };
   // Messages accepted one after another with no other task of the session's queue between
   // them. They share one task on that queue, so that the server-reporting session can store
@@ -232,16 +232,16 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   // The send task of started messages in a row: all to the server-reporting session at once.
   void sendToServerReporting(const std::vector<PendingSend>& sends);
   // An aggregated message keeps only its text once sent, so that its payload (and the client's
-  // charge on it) is let go; its bytes count against the aggregate's limits from then on.
+  // charge on it) is let go.
   void keepOnlyText(const PendingSend& send);
   void runTeardownTask();
   void registerOrientationCallbacks();
   void unregisterOrientationCallbacks();
   void recordOrientation(const char* mode, const char* nameKey, const char* timeKey,
                          int32_t orientation);
-  // Appends under the aggregate's lock, unless the session has no aggregate at that moment or
-  // it is full. Returns the aggregate it appended to.
-  std::shared_ptr<SXReportingAggregate> appendToAggregate(SXReportingAggregateEntry entry);
+  // Appends under the aggregate's lock, counting `bytes`, unless the session has no aggregate
+  // at that moment or it is full. Returns whether it appended.
+  bool appendToAggregate(SXReportingAggregateEntry entry, uint64_t bytes = 0);
   std::shared_ptr<SXReportingAggregate> newAggregate() const {
     return std::make_shared<SXReportingAggregate>(&environment_->counters());
   }

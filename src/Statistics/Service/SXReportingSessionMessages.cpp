@@ -18,13 +18,12 @@ std::string SXReportingSession::messageIdForCategory(SXReportingCategory categor
   return kind + "_" + std::to_string(count);
 }
 
-std::shared_ptr<SXReportingAggregate> SXReportingSession::appendToAggregate(
-    SXReportingAggregateEntry entry) {
+bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint64_t bytes) {
   auto aggregate = aggregate_.load();
-  if (!aggregate) return nullptr;
+  if (!aggregate) return false;
   std::lock_guard lock(aggregate->mutex);
   // Stop may have dropped this array while we waited for its lock.
-  if (aggregate_.load() != aggregate) return nullptr;
+  if (aggregate_.load() != aggregate) return false;
   const SXReportingLimits& limits = environment_->limits();
   SXReportingCounters& counters = environment_->counters();
   std::optional<SXReportingGuardrail> full;
@@ -36,7 +35,8 @@ std::shared_ptr<SXReportingAggregate> SXReportingSession::appendToAggregate(
   }
   if (!full) {
     aggregate->entries.push_back(std::move(entry));
-    return aggregate;
+    aggregate->addBytes(bytes);
+    return true;
   }
   counters.dropped(*full);
   // One line per aggregate: a client that floods a session would otherwise flood the log.
@@ -49,7 +49,7 @@ std::shared_ptr<SXReportingAggregate> SXReportingSession::appendToAggregate(
           static_cast<unsigned long long>(aggregate->bytes.load()),
           static_cast<unsigned long long>(counters.aggregateBytes()));
   }
-  return nullptr;
+  return false;
 }
 
 void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
@@ -60,16 +60,20 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   // The key rewrite is made once, where it is first needed (normally by the send task).
   auto rewritten = std::make_shared<SXReportingMessagePayload>(payload);
   std::string messageId = messageIdForCategory(category, type);
-  std::shared_ptr<SXReportingAggregate> aggregate;
+  bool aggregated = false;
   if (aggregate_.load()) {
-    aggregate = appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten));
+    // What the entry will hold: the payload's text (about one and a half times its
+    // MessagePack size) and its id, holder and slot beside it.
+    uint64_t bytes = SXPackedSize(*payload) * 3 / 2 + 256;
+    aggregated =
+        appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten), bytes);
   }
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
   // The caller's own payload appears only in a verbose line; keep it only for that.
   if (!log().isEnabled(scope(), kSXLogVerboseLevel)) payload = nullptr;
-  queueSend({std::move(rewritten), std::move(payload), category, type, startedSnapshot,
-             std::move(aggregate)});
+  queueSend(
+      {std::move(rewritten), std::move(payload), category, type, startedSnapshot, aggregated});
   if (reply) reply(std::nullopt);
 }
 
@@ -121,9 +125,7 @@ void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
 }
 
 void SXReportingSession::keepOnlyText(const PendingSend& send) {
-  // An entry costs about this much beside its text (its id, its holder, its slot).
-  constexpr uint64_t kEntryOverheadBytes = 256;
-  if (send.aggregate) send.aggregate->addBytes(send.payload->makeText() + kEntryOverheadBytes);
+  if (send.aggregated) send.payload->makeText();
 }
 
 void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& sends) {

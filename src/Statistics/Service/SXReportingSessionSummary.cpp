@@ -61,26 +61,23 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   auto aggregate = aggregate_.load();
   if (!aggregate) return std::nullopt;
 
-  std::map<std::string, std::vector<std::string>> working;
+  // Each key's texts are joined as they come, so that the event is built with one copy of the
+  // aggregate's text rather than two.
+  std::map<std::string, std::string> joined;
   {
     std::lock_guard lock(aggregate->mutex);
     if (aggregate->entries.empty()) return std::nullopt;
-    working[kSummaryKey].push_back(std::to_string(serviceType()));
+    joined[kSummaryKey] = std::to_string(serviceType());
     for (const auto& entry : aggregate->entries) {
-      entry.forEachText([&](const std::string& key, std::string text) {
-        working[key].push_back(std::move(text));
+      entry.forEachText([&](const std::string& key, const std::string& text) {
+        auto [it, fresh] = joined.try_emplace(key);
+        if (!fresh) it->second += ',';
+        it->second += text;
       });
     }
   }
   SXValue event = SXValue::object();
-  for (const auto& [key, texts] : working) {
-    std::string joined;
-    for (size_t i = 0; i < texts.size(); ++i) {
-      if (i) joined += ',';
-      joined += texts[i];
-    }
-    event[key] = std::move(joined);
-  }
+  for (auto& [key, text] : joined) event[key] = std::move(text);
 
   SXValue info = userInfo();
   {

@@ -70,7 +70,7 @@ constexpr const char* kUsage =
     "                              (SXREPORTING_MAX_AGGREGATE_BYTES, default 1048576)\n"
     "  --max-aggregate-bytes-total N\n"
     "                              the same for all sessions together\n"
-    "                              (SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL, default 16777216)\n"
+    "                              (SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL, default 8388608)\n"
     "  --max-pending-standalone-bytes N\n"
     "                              payload bytes of one client's standalone sends waiting for\n"
     "                              their delay; further ones are refused\n"
@@ -92,7 +92,7 @@ constexpr const char* kUsage =
     "                              (SXREPORTING_MAX_CONNECTION_BYTES, default 1048576)\n"
     "  --max-inflight-bytes N      the same for all connections together; beyond it the\n"
     "                              connections holding the most stop being read\n"
-    "                              (SXREPORTING_MAX_INFLIGHT_BYTES, default 16777216)\n"
+    "                              (SXREPORTING_MAX_INFLIGHT_BYTES, default 8388608)\n"
     "  --partial-frame-timeout-ms N\n"
     "                              time a request that has begun to arrive may take to complete;\n"
     "                              then its connection ends "
@@ -100,6 +100,9 @@ constexpr const char* kUsage =
     "                              default 30000)\n"
     "  --max-error-lines N         error lines one client may cause a minute; the rest are\n"
     "                              counted in one line (SXREPORTING_MAX_ERROR_LINES, default 20)\n"
+    "  --max-connections-per-client N\n"
+    "                              open connections of one process; further ones are closed\n"
+    "                              at once (SXREPORTING_MAX_CONNECTIONS_PER_CLIENT, default 256)\n"
     "  -h, --help                  this text\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
@@ -141,6 +144,8 @@ constexpr LimitFlag kLimitFlags[] = {
     {"--partial-frame-timeout-ms", "SXREPORTING_PARTIAL_FRAME_TIMEOUT_MS",
      &SXReportingLimits::partialFrameTimeoutMs},
     {"--max-error-lines", "SXREPORTING_MAX_ERROR_LINES", &SXReportingLimits::maxErrorLines},
+    {"--max-connections-per-client", "SXREPORTING_MAX_CONNECTIONS_PER_CLIENT",
+     &SXReportingLimits::maxConnectionsPerClient},
     {"--max-queued-requests", "SXREPORTING_MAX_QUEUED_REQUESTS",
      &SXReportingLimits::maxQueuedRequests},
     {"--max-pending-reply-bytes", "SXREPORTING_MAX_PENDING_REPLY_BYTES",
