@@ -197,3 +197,76 @@ long residentKiB(pid_t pid) {
   }
   return -1;
 }
+
+TestFlood::TestFlood(std::vector<Sender> senders, size_t window) : window_(window) {
+  for (auto& sender : senders) {
+    lanes_.push_back(std::make_unique<Lane>());
+    lanes_.back()->sender = std::move(sender);
+  }
+  for (size_t i = 0; i < lanes_.size(); ++i) {
+    threads_.emplace_back([this, i] { run(*lanes_[i], static_cast<int64_t>(i) * kIdsPerSender); });
+  }
+}
+
+TestFlood::~TestFlood() {
+  stop();
+  // Answers still to come call back into this object: the clients go first.
+  for (auto& lane : lanes_) lane->sender.client.reset();
+}
+
+void TestFlood::stop() {
+  stop_ = true;
+  for (auto& lane : lanes_) {
+    std::lock_guard lock(lane->mutex);
+    lane->room.notify_all();
+  }
+  for (auto& thread : threads_) thread.join();
+  threads_.clear();
+}
+
+void TestFlood::run(Lane& lane, int64_t firstId) {
+  for (int64_t xid = firstId; !stop_; ++xid) {
+    {
+      std::unique_lock lock(lane.mutex);
+      lane.room.wait(lock, [&] { return stop_ || lane.lost || lane.unanswered < window_; });
+      if (stop_ || lane.lost) return;
+      ++lane.unanswered;
+    }
+    lane.sender.client->sendMessage(
+        {{"xid", xid}}, 3, 1, lane.sender.reporterIDs,
+        [this, &lane, xid](SXCallResult<std::optional<SXError>> result) {
+          if (result.replied() && !result.value) {
+            std::lock_guard lock(ackMutex_);
+            acknowledged_[xid] = Clock::now();
+          }
+          std::lock_guard lock(lane.mutex);
+          --lane.unanswered;
+          if (result.status == SXCallStatus::kConnectionLost) lane.lost = true;
+          lane.room.notify_all();
+        },
+        std::chrono::seconds(60));
+  }
+}
+
+size_t TestFlood::acknowledgedCount() const {
+  std::lock_guard lock(ackMutex_);
+  return acknowledged_.size();
+}
+
+std::map<int64_t, TestFlood::Clock::time_point> TestFlood::acknowledged() const {
+  std::lock_guard lock(ackMutex_);
+  return acknowledged_;
+}
+
+std::map<int64_t, size_t> TestFlood::stored(const TestDaemon& daemon, const std::string& db,
+                                            const std::string& table) {
+  std::map<int64_t, size_t> counts;
+  for (const auto& row : daemon.rows(db, "SELECT payload_json FROM " + table)) {
+    if (!row["payload_json"].is_string()) continue;
+    SXValue payload = SXValue::parse(row["payload_json"].get<std::string>(), nullptr, false);
+    if (payload.is_object() && payload["xid"].is_number_integer()) {
+      ++counts[payload["xid"].get<int64_t>()];
+    }
+  }
+  return counts;
+}

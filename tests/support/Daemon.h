@@ -4,11 +4,15 @@
 
 #include <sys/types.h>
 
+#include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "support/SqliteTestSupport.h"
@@ -86,3 +90,46 @@ T replied(std::future<SXCallResult<T>> future) {
   EXPECT_EQ(result.status, SXCallStatus::kReplied) << result.error;
   return result.value;
 }
+
+// Clients that each pipeline sends as fast as a window of unanswered ones allows, until
+// stopped or until their connection ends. Every message is {"xid": <unique id>}; the flood
+// records the id of every send answered as delivered, and when the answer came.
+class TestFlood {
+ public:
+  using Clock = std::chrono::steady_clock;
+  struct Sender {
+    std::unique_ptr<SXReportingClient> client;
+    std::optional<std::vector<int64_t>> reporterIDs;  // nothing: a broadcast
+  };
+
+  TestFlood(std::vector<Sender> senders, size_t window);
+  ~TestFlood();  // stops, then closes the clients
+
+  // Sends no more and waits for the senders' threads; answers may still come.
+  void stop();
+  size_t acknowledgedCount() const;
+  std::map<int64_t, Clock::time_point> acknowledged() const;
+  // The sender a message id belongs to.
+  static size_t senderOf(int64_t xid) { return static_cast<size_t>(xid / kIdsPerSender); }
+  // How many rows of `table` in `db` (a table with payload_json) carry each message id.
+  static std::map<int64_t, size_t> stored(const TestDaemon& daemon, const std::string& db,
+                                          const std::string& table);
+
+ private:
+  static constexpr int64_t kIdsPerSender = 1'000'000'000;
+  struct Lane {
+    Sender sender;
+    std::mutex mutex;
+    std::condition_variable room;
+    size_t unanswered = 0;  // guarded by mutex
+    bool lost = false;      // guarded by mutex
+  };
+  void run(Lane& lane, int64_t firstId);
+
+  const size_t window_;
+  std::vector<std::unique_ptr<Lane>> lanes_;
+  std::vector<std::thread> threads_;
+  std::atomic<bool> stop_{false};
+  mutable std::mutex ackMutex_;
+  std::map<int64_t, Clock::time_point> acknowledged_;  // guarded by ackMutex_
+};
