@@ -1,6 +1,7 @@
 // Back-pressure of the socket listener: a connection stops reading while too many of its
-// requests wait to be handled or too many reply bytes wait to be written, loses nothing, and
-// answers every request in order once it reads again.
+// requests wait to be handled, too many reply bytes wait to be written or the connections hold
+// too many bytes together, loses nothing, and answers every request in order once it reads
+// again; a request that never completes ends its connection.
 #include "platform/UnixSocketIpc.h"
 
 #include <gtest/gtest.h>
@@ -251,4 +252,60 @@ TEST(UnixSocketBackpressure, ABlockedQueueStopsReadingAtTheLimitAndEverythingFlo
   writer.join();
   EXPECT_LE(object->maxWaiting(), 16);
   ::close(fd);
+}
+
+// A request that stops arriving half-way ends its connection once the timeout has passed,
+// while a connection whose requests complete is kept however long it stays.
+TEST(UnixSocketBackpressure, AnUnfinishedRequestEndsItsConnectionAfterTheTimeout) {
+  auto queue = std::make_shared<SXAsioDispatch>()->createSerialQueue(
+      "requests", SXQualityOfService::kUserInteractive);
+  auto object = std::make_shared<QueueingObject>(queue);
+  object->open();
+  SXUnixSocketListener::Options options;
+  options.partialFrameTimeout = 200ms;
+  options.requestQueue = queue;
+  ServedListener served(options, object);
+  int partial = connectTo(served.path());
+  int whole = connectTo(served.path());
+  msgpack::sbuffer request;
+  RpcEncodeRequest(request, 1, "echo", SXValue::array({1}));
+  ASSERT_EQ(::write(partial, request.data(), request.size() - 1),
+            static_cast<ssize_t>(request.size() - 1));
+  writeRequests(whole, 1);
+  EXPECT_EQ(readResponses(whole, 1), range(1));
+  ASSERT_TRUE(waitFor([&] { return served.listener().partialFrameTimeouts() == 1; }));
+  char byte;
+  EXPECT_EQ(::read(partial, &byte, 1), 0);  // closed by the daemon
+  std::this_thread::sleep_for(300ms);
+  writeRequests(whole, 2);
+  EXPECT_EQ(readResponses(whole, 2), range(2));
+  ::close(partial);
+  ::close(whole);
+}
+
+// While the connections together hold more than the pool allows, one that holds next to
+// nothing is still read and answered; the one that filled the pool waits for room.
+TEST(UnixSocketBackpressure, AQuietConnectionIsServedWhileAnotherFillsThePool) {
+  auto queue = std::make_shared<SXAsioDispatch>()->createSerialQueue(
+      "requests", SXQualityOfService::kUserInteractive);
+  auto object = std::make_shared<QueueingObject>(queue);  // its gate stays shut for now
+  SXUnixSocketListener::Options options;
+  options.maxQueuedRequests = 100000;
+  options.maxInflightBytes = 64 * 1024;
+  options.requestQueue = queue;
+  ServedListener served(options, object);
+  int noisy = connectTo(served.path());
+  std::thread writer([&] { writeRequests(noisy, 5000); });
+  ASSERT_TRUE(waitFor([&] { return served.listener().inflightBytes() > 64 * 1024; }));
+  ASSERT_TRUE(waitFor([&] { return served.listener().backpressurePauses() > 0; }));
+  int64_t before = object->handedOn();  // the noisy connection is not read any more
+  int quiet = connectTo(served.path());
+  writeRequests(quiet, 1);
+  ASSERT_TRUE(waitFor([&] { return object->handedOn() == before + 1; }));
+  object->open();
+  EXPECT_EQ(readResponses(quiet, 1), range(1));
+  EXPECT_EQ(readResponses(noisy, 5000), range(5000));
+  writer.join();
+  ::close(noisy);
+  ::close(quiet);
 }

@@ -43,7 +43,7 @@ struct SXReportingLimits {
   // How long a request that has begun to arrive may take to complete.
   uint64_t partialFrameTimeoutMs = 30'000;
   // Open connections of one process; a further one is closed at once (logged and counted).
-  uint64_t maxConnectionsPerClient = 256;
+  uint64_t maxConnectionsPerClient = 128;
   // Error lines one client may cause a minute; the rest are counted in one summary line.
   uint64_t maxErrorLines = 20;
 };

@@ -9,6 +9,7 @@
 #include <asio/write.hpp>
 #include <cstdlib>
 
+#include "platform/DiscardLog.h"
 #include "platform/FileSystem.h"
 
 // One client connection. Lives while the I/O thread has an operation pending on it.
@@ -359,7 +360,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
 
 SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLogFacility> log)
     : options_(std::move(options)),
-      log_(std::move(log)),
+      log_(SXLogOrDiscard(std::move(log))),
       acceptor_(io_),
       pool_(std::make_shared<SXByteBudget>(options_.maxInflightBytes)),
       wakeTarget_(std::make_shared<WakeTarget>()) {

@@ -102,7 +102,7 @@ constexpr const char* kUsage =
     "                              counted in one line (SXREPORTING_MAX_ERROR_LINES, default 20)\n"
     "  --max-connections-per-client N\n"
     "                              open connections of one process; further ones are closed\n"
-    "                              at once (SXREPORTING_MAX_CONNECTIONS_PER_CLIENT, default 256)\n"
+    "                              at once (SXREPORTING_MAX_CONNECTIONS_PER_CLIENT, default 128)\n"
     "  -h, --help                  this text\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
