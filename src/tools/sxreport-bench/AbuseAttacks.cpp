@@ -17,19 +17,15 @@
 #include <unordered_map>
 
 #include "PipelinedRpcClient.h"
+#include "sxreporting/types.h"
 
 namespace {
 
 using Clock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
 
-const std::string kCreate = "createReportingSession:reply:";
-const std::string kSetType = "setServiceType:reportingSession:reply:";
-const std::string kConfigure = "setConfiguration:forReporterID:reply:";
-const std::string kStart = "startReportingSessionForID:reply:";
-const std::string kSend = "sendMessage:withCategory:andType:forReportingIDs:reply:";
-const std::string kValid = "reporterID:valid:";
-const std::string kGetAll = "getAllReporters:";
+// The protocol's method names, as the requests spell them.
+namespace method = sxr::method;
 
 constexpr uint16_t kTelephony = 2;  // standalone messages go out without a random delay
 constexpr size_t kConfigurationBytes = 900'000;
@@ -291,16 +287,22 @@ std::optional<uint64_t> roundTripOn(int fd, ReplyReader& reader, uint32_t msgid,
     closed = Clock::now() < deadline;
     return std::nullopt;
   }
+  // Whether the replies read so far hold ours; throws when the bytes are not MessagePack.
+  auto replied = [&] {
+    msgpack::object_handle handle;
+    while (reader.next(handle)) {
+      ParsedReply reply;
+      if (parseReply(handle.get(), reply) && reply.msgid == msgid) return true;
+    }
+    return false;
+  };
+  auto latency = [&] {
+    return static_cast<uint64_t>(
+        std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now() - sent).count());
+  };
   for (;;) {
     try {
-      msgpack::object_handle handle;
-      while (reader.next(handle)) {
-        ParsedReply reply;
-        if (parseReply(handle.get(), reply) && reply.msgid == msgid) {
-          return static_cast<uint64_t>(
-              std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now() - sent).count());
-        }
-      }
+      if (replied()) return latency();
     } catch (const std::exception&) {
       closed = true;
       return std::nullopt;
@@ -312,14 +314,7 @@ std::optional<uint64_t> roundTripOn(int fd, ReplyReader& reader, uint32_t msgid,
       closed = true;
       // What came before the end may still hold the reply.
       try {
-        msgpack::object_handle handle;
-        while (reader.next(handle)) {
-          ParsedReply reply;
-          if (parseReply(handle.get(), reply) && reply.msgid == msgid) {
-            return static_cast<uint64_t>(
-                std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now() - sent).count());
-          }
-        }
+        if (replied()) return latency();
       } catch (const std::exception&) {
       }
       return std::nullopt;
@@ -505,12 +500,12 @@ AttackCounters runPipelined(const Pipeline& pipeline, const AttackPlan& plan,
 // The setup of a session that takes messages: created, telephony, configured, started.
 void startedSession(RequestQueue& queue, int64_t id) {
   std::string params = arrayHeader(1) + integer(id);
-  queue.add(kCreate, {params}, BenchExpect::kTrue, false);
-  queue.add(kSetType, {arrayHeader(2), integer(kTelephony), integer(id)}, BenchExpect::kTrue,
-            false);
-  queue.add(kConfigure, {arrayHeader(2), bigDictionary(100, "setting"), integer(id)},
+  queue.add(method::kCreate, {params}, BenchExpect::kTrue, false);
+  queue.add(method::kSetServiceType, {arrayHeader(2), integer(kTelephony), integer(id)},
             BenchExpect::kTrue, false);
-  queue.add(kStart, {params}, BenchExpect::kTrue, false, true);
+  queue.add(method::kSetConfiguration, {arrayHeader(2), bigDictionary(100, "setting"), integer(id)},
+            BenchExpect::kTrue, false);
+  queue.add(method::kStart, {params}, BenchExpect::kTrue, false, true);
 }
 
 std::string categoryAndType() {
@@ -525,13 +520,14 @@ AttackCounters largeConfigurations(const AttackPlan& plan, Clock::time_point dea
   pipeline.window = kPipelineWindow;
   pipeline.setup = [](RequestQueue& queue, int64_t firstID) {
     for (size_t k = 0; k < kConfigSessions; ++k) {
-      queue.add(kCreate, {arrayHeader(1), integer(firstID + static_cast<int64_t>(k))},
+      queue.add(method::kCreate, {arrayHeader(1), integer(firstID + static_cast<int64_t>(k))},
                 BenchExpect::kTrue, false);
     }
   };
   pipeline.attack = [&](RequestQueue& queue, uint64_t n, int64_t firstID) {
     int64_t id = firstID + static_cast<int64_t>(n % kConfigSessions);
-    queue.add(kConfigure, {arrayHeader(2), configuration, integer(id)}, BenchExpect::kTrue, true);
+    queue.add(method::kSetConfiguration, {arrayHeader(2), configuration, integer(id)},
+              BenchExpect::kTrue, true);
   };
   return runPipelined(pipeline, plan, deadline, stop);
 }
@@ -555,7 +551,8 @@ AttackCounters longIdLists(const AttackPlan& plan, Clock::time_point deadline,
   int64_t repeatedFor = 0;
   pipeline.attack = [&](RequestQueue& queue, uint64_t n, int64_t firstID) {
     if (n % 2 == 1) {
-      queue.add(kSend, {header, smallPayload, meta, unknown}, BenchExpect::kNil, true);
+      queue.add(method::kSendMessage, {header, smallPayload, meta, unknown}, BenchExpect::kNil,
+                true);
       return;
     }
     if (repeated.empty() || repeatedFor != firstID) {
@@ -563,7 +560,7 @@ AttackCounters longIdLists(const AttackPlan& plan, Clock::time_point deadline,
       for (size_t i = 0; i < kRepeatedIds; ++i) repeated += integer(firstID);
       repeatedFor = firstID;
     }
-    queue.add(kSend, {header, payload, meta, repeated}, BenchExpect::kNil, true);
+    queue.add(method::kSendMessage, {header, payload, meta, repeated}, BenchExpect::kNil, true);
   };
   return runPipelined(pipeline, plan, deadline, stop);
 }
@@ -578,7 +575,7 @@ AttackCounters unreadReplies(const AttackPlan& plan, Clock::time_point deadline,
   pipeline.setup = [](RequestQueue& queue, int64_t firstID) {
     // Every session makes each getAllReporters: reply longer.
     for (size_t k = 0; k < kUnreadSessions; ++k) {
-      queue.add(kCreate, {arrayHeader(1), integer(firstID + static_cast<int64_t>(k))},
+      queue.add(method::kCreate, {arrayHeader(1), integer(firstID + static_cast<int64_t>(k))},
                 BenchExpect::kTrue, false);
     }
   };
@@ -587,7 +584,7 @@ AttackCounters unreadReplies(const AttackPlan& plan, Clock::time_point deadline,
     if (n % 16 == 15) {
       queue.add(unknownMethod, {noParams}, BenchExpect::kAnything, true);
     } else {
-      queue.add(kGetAll, {noParams}, BenchExpect::kAnything, true);
+      queue.add(method::kGetAllReporters, {noParams}, BenchExpect::kAnything, true);
     }
   };
   return runPipelined(pipeline, plan, deadline, stop);
@@ -609,7 +606,7 @@ AttackCounters largePayloads(const AttackPlan& plan, Clock::time_point deadline,
       ids = arrayHeader(1) + integer(firstID);
       idsFor = firstID;
     }
-    queue.add(kSend, {header, payload, meta, ids}, BenchExpect::kNil, true);
+    queue.add(method::kSendMessage, {header, payload, meta, ids}, BenchExpect::kNil, true);
   };
   return runPipelined(pipeline, plan, deadline, stop);
 }
@@ -630,7 +627,7 @@ AttackCounters partialFrames(const AttackPlan& plan, Clock::time_point deadline,
   {
     std::string prefix = arrayHeader(4);
     std::string tail = categoryAndType() + arrayHeader(1) + integer(plan.scenario->sessionID(2, 0));
-    appendFrame(frame, 1, kSend, {prefix});
+    appendFrame(frame, 1, method::kSendMessage, {prefix});
     std::string probe = frame + packed([](auto& packer) {
                           packer.pack_map(1);
                           packString(packer, "blob");
@@ -829,8 +826,8 @@ void Prober::run() {
     uint32_t msgid = 1;
     bool closed = false;
     // A session of its own, so that the probes look one up; not timed.
-    if (!roundTripOn(socket.fd(), reader, msgid++, kCreate, params, Clock::now() + kReplyTimeout,
-                     closed)) {
+    if (!roundTripOn(socket.fd(), reader, msgid++, method::kCreate, params,
+                     Clock::now() + kReplyTimeout, closed)) {
       ++phases_[phase_.load()].unanswered;
       continue;
     }
@@ -841,8 +838,8 @@ void Prober::run() {
       Phase& phase = phases_[phase_.load()];
       auto sent = Clock::now();
       next = sent + kInterval;
-      auto latency =
-          roundTripOn(socket.fd(), reader, msgid++, kValid, params, sent + kReplyTimeout, closed);
+      auto latency = roundTripOn(socket.fd(), reader, msgid++, method::kValid, params,
+                                 sent + kReplyTimeout, closed);
       if (latency) {
         phase.latency.record(*latency);
         continue;
@@ -865,8 +862,8 @@ std::optional<uint64_t> Prober::RoundTrip(const std::string& socketPath, int64_t
   if (!socket.connect(socketPath, deadline, error)) return std::nullopt;
   ReplyReader reader;
   bool closed = false;
-  auto latency = roundTripOn(socket.fd(), reader, 1, kValid, arrayHeader(1) + integer(reporterID),
-                             deadline, closed);
+  auto latency = roundTripOn(socket.fd(), reader, 1, method::kValid,
+                             arrayHeader(1) + integer(reporterID), deadline, closed);
   if (!latency) {
     error = closed ? "the daemon closed the connection"
                    : "no reply within " + std::to_string(timeout.count()) + " ms";
