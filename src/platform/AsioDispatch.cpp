@@ -5,7 +5,6 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
 
@@ -123,11 +122,7 @@ class PoolConcurrentQueue final : public SXWorkQueue {
 }  // namespace
 
 SXElasticPool::SXElasticPool(std::string threadName, int niceness, size_t maxThreads)
-    : threadName_(std::move(threadName)),
-      niceness_(niceness),
-      maxThreads_(maxThreads),
-      busyThreads_(
-          std::min<size_t>(maxThreads, std::max(2u, std::thread::hardware_concurrency()))) {}
+    : threadName_(std::move(threadName)), niceness_(niceness), maxThreads_(maxThreads) {}
 
 SXElasticPool::~SXElasticPool() {
   std::vector<std::thread> threads;
@@ -135,10 +130,8 @@ SXElasticPool::~SXElasticPool() {
     std::lock_guard lock(mutex_);
     stopping_ = true;
     threads.swap(threads_);
-    if (supervisor_.joinable()) threads.push_back(std::move(supervisor_));
   }
   wake_.notify_all();
-  stalled_.notify_all();
   for (auto& t : threads) {
     if (t.get_id() == std::this_thread::get_id()) {
       t.detach();
@@ -152,35 +145,10 @@ void SXElasticPool::submit(SXTask task) {
   std::lock_guard lock(mutex_);
   if (stopping_) return;
   tasks_.push_back(std::move(task));
-  if (idle_ > 0) {
+  if (idle_ >= tasks_.size()) {
     wake_.notify_one();
-  } else if (threads_.size() < busyThreads_) {
-    addWorker();
   } else if (threads_.size() < maxThreads_) {
-    if (!supervisor_.joinable()) supervisor_ = std::thread([this] { supervise(); });
-    stalled_.notify_one();
-  }
-}
-
-void SXElasticPool::addWorker() {
-  threads_.emplace_back([this] { work(); });
-}
-
-void SXElasticPool::supervise() {
-  nameThisThread(threadName_);
-  constexpr auto kStall = std::chrono::milliseconds(10);
-  std::unique_lock lock(mutex_);
-  while (!stopping_) {
-    stalled_.wait(lock, [this] { return stopping_ || (!tasks_.empty() && idle_ == 0); });
-    uint64_t finished = finished_;
-    stalled_.wait_for(lock, kStall, [this] { return stopping_; });
-    if (stopping_) return;
-    if (idle_ > 0 || finished_ != finished) continue;
-    // Every worker is blocked: one more for each waiting task, a few at a time.
-    constexpr size_t kAtOnce = 16;
-    for (size_t n = std::min(tasks_.size(), kAtOnce); n > 0 && threads_.size() < maxThreads_; --n) {
-      addWorker();
-    }
+    threads_.emplace_back([this] { work(); });
   }
 }
 
@@ -201,7 +169,6 @@ void SXElasticPool::work() {
     task();
     task = nullptr;  // release what the task captured before we sleep again
     lock.lock();
-    ++finished_;
   }
 }
 

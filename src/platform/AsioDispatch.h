@@ -17,10 +17,7 @@
 
 #include "platform/Dispatch.h"
 
-// A pool of threads: as many as there are cores run whatever is queued, and the pool grows,
-// up to `maxThreads`, only while all of its workers are blocked (no task has finished for a
-// moment while tasks wait). A flood of short tasks thus runs on a few threads, and a task
-// that waits (a session's backend wait) never holds up the others for long.
+// A pool of threads that grows up to `maxThreads` while all of its workers are busy.
 class SXElasticPool {
  public:
   SXElasticPool(std::string threadName, int niceness, size_t maxThreads);
@@ -32,23 +29,15 @@ class SXElasticPool {
 
  private:
   void work();
-  // Adds a worker when the pool has made no progress for a moment while tasks wait.
-  void supervise();
-  // REQUIRES: mutex_ held.
-  void addWorker();
 
   const std::string threadName_;
   const int niceness_;
   const size_t maxThreads_;
-  const size_t busyThreads_;  // workers started without waiting for a stall
   std::mutex mutex_;
   std::condition_variable wake_;
-  std::condition_variable stalled_;   // tasks wait and no worker is idle
   std::deque<SXTask> tasks_;          // GUARDED_BY(mutex_)
   std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
   size_t idle_ = 0;                   // GUARDED_BY(mutex_)
-  uint64_t finished_ = 0;             // GUARDED_BY(mutex_): tasks run so far
-  std::thread supervisor_;            // GUARDED_BY(mutex_): started with the first stall
   bool stopping_ = false;             // GUARDED_BY(mutex_)
 };
 
