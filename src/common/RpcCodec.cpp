@@ -5,6 +5,8 @@
 namespace {
 // The request itself and its params array sit above the payload.
 constexpr int kEnvelopeDepth = 2;
+// A buffer that grew past this for one large message is freed once idle.
+constexpr size_t kKeptBufferBytes = 4 * MSGPACK_UNPACKER_INIT_BUFFER_SIZE;
 }  // namespace
 
 RpcStreamDecoder::RpcStreamDecoder(RpcLimits limits) : limits_(limits), unpacker_(makeUnpacker()) {}
@@ -23,7 +25,6 @@ size_t RpcStreamDecoder::bufferedBytes() const {
 }
 
 void RpcStreamDecoder::shrinkIfIdle() {
-  constexpr size_t kKeptBufferBytes = 4 * MSGPACK_UNPACKER_INIT_BUFFER_SIZE;
   if (bufferedBytes() > kKeptBufferBytes) grown_ = true;
   if (grown_ && bufferedBytes() == 0) {
     unpacker_ = makeUnpacker();
@@ -49,7 +50,7 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
       // Converted in place: the unpacker keeps its zone (strings are copied into it, never
       // referenced from the buffer) and reuses it, instead of a fresh zone per message.
       lastMessageBytes_ = unpacker_.parsed_size();
-      if (lastMessageBytes_ > 4 * MSGPACK_UNPACKER_INIT_BUFFER_SIZE) grown_ = true;
+      if (lastMessageBytes_ > kKeptBufferBytes) grown_ = true;
       message = SXValueFromMsgpack(unpacker_.data(), limits_.maxPayloadDepth + kEnvelopeDepth);
       unpacker_.reset_zone();
       unpacker_.reset();

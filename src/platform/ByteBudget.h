@@ -44,9 +44,6 @@ class SXByteBudget {
 
   void add(uint64_t bytes);
   void release(uint64_t bytes);
-  static Charge charge(const std::shared_ptr<SXByteBudget>& budget, uint64_t bytes) {
-    return Charge(budget, bytes);
-  }
 
   bool overLimit() const;
   // Whether the pool (or this budget, when it has none) is over its own limit.

@@ -226,11 +226,11 @@ void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXValue> messa
 }
 
 std::shared_ptr<const SXValue> SXReportingServerInstance::chargeDeliveries(
-    std::shared_ptr<const SXValue> message, size_t deliveries) const {
+    std::shared_ptr<const SXValue> message, size_t packedBytes, size_t deliveries) const {
   if (!budget_ || deliveries < 2) return message;
-  uint64_t perDelivery = 512 + 2 * uint64_t{SXPackedSize(*message)};
+  uint64_t perDelivery = 512 + 2 * uint64_t{packedBytes};
   return SXChargedAlias(std::move(message),
-                        SXByteBudget::charge(budget_, (deliveries - 1) * perDelivery));
+                        SXByteBudget::Charge(budget_, (deliveries - 1) * perDelivery));
 }
 
 void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> message,
@@ -243,13 +243,16 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> me
     if (auto session = findReportingSessionForID(reporterID))
       sessions.push_back(std::move(session));
   }
-  message = chargeDeliveries(std::move(message), sessions.size());
+  if (sessions.empty()) return;
+  // Measured once for every delivery's charge and aggregate entry.
+  size_t packedBytes = SXPackedSize(*message);
+  message = chargeDeliveries(std::move(message), packedBytes, sessions.size());
   for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
                                              *session);
-    session->sendMessage(message, category, type, nullptr);
+    session->sendMessage(message, category, type, nullptr, packedBytes);
   }
 }
 
@@ -278,9 +281,10 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
                                           nullptr);
     return;
   }
-  auto charged = chargeDeliveries(message, active.size());
+  size_t packedBytes = SXPackedSize(*message);
+  auto charged = chargeDeliveries(message, packedBytes, active.size());
   for (const auto& session : active) {
-    session->sendMessage(charged, category, type, nullptr);
+    session->sendMessage(charged, category, type, nullptr, packedBytes);
     SXReportingTallyvaneBridge::handleEvent(*environment_, charged, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,

@@ -81,7 +81,7 @@ class SXReportingServerInstance final
   // The message, charged with what its deliveries beyond the first make the service hold
   // (each session's copy of its text, its queue entry, its aggregate entry, its analytics row).
   std::shared_ptr<const SXValue> chargeDeliveries(std::shared_ptr<const SXValue> message,
-                                                  size_t deliveries) const;
+                                                  size_t packedBytes, size_t deliveries) const;
   void routeBroadcast(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
                       SXReportingMessageType type);
   void sendDriverDeltaAndStop(const std::shared_ptr<SXReportingSession>& session);

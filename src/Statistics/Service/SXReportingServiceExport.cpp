@@ -210,7 +210,7 @@ void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params
       SXReportingRemoveRepeatedIDs(*ids);
     }
     auto payload = SXChargedShared(std::move(params[0]),
-                                   SXByteBudget::charge(budget_, SXDecodedBytes(wireBytes)));
+                                   SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
     instance.sendMessage(
         std::move(payload), params[1].get<SXReportingCategory>(),
         params[2].get<SXReportingMessageType>(), std::move(ids),

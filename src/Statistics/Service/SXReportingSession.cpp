@@ -95,9 +95,9 @@ std::string SXReportingMessagePayload::text() {
   return textLocked();
 }
 
-size_t SXReportingMessagePayload::makeText() {
+void SXReportingMessagePayload::keepOnlyText() {
   std::lock_guard lock(mutex_);
-  return textLocked().size();
+  textLocked();
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

@@ -33,8 +33,8 @@ class SXReportingMessagePayload {
   std::shared_ptr<const SXValue> rewritten();
   // SXValueText of the rewritten payload (compact JSON).
   std::string text();
-  // Makes the text, releasing the dictionaries, and returns its size in bytes.
-  size_t makeText();
+  // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
+  void keepOnlyText();
 
  private:
   // REQUIRES: mutex_ held.
@@ -133,15 +133,18 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
 
   std::string messageIdForCategory(SXReportingCategory category, SXReportingMessageType type);
   // `payload` is never changed; the shared form lets the send task read it without a copy.
+  // `packedBytes`, its MessagePack size, is measured here when the caller has not.
   void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
-                   SXReportingMessageType type, bool sync, SXReportingSendReply reply);
+                   SXReportingMessageType type, bool sync, SXReportingSendReply reply,
+                   std::optional<size_t> packedBytes = std::nullopt);
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply) {
     sendMessage(std::make_shared<const SXValue>(payload), category, type, sync, std::move(reply));
   }
   void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
-                   SXReportingMessageType type, SXReportingSendReply reply) {
-    sendMessage(std::move(payload), category, type, false, std::move(reply));
+                   SXReportingMessageType type, SXReportingSendReply reply,
+                   std::optional<size_t> packedBytes = std::nullopt) {
+    sendMessage(std::move(payload), category, type, false, std::move(reply), packedBytes);
   }
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, SXReportingSendReply reply) {
@@ -231,9 +234,9 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   void runSendBatch(const std::shared_ptr<SendBatch>& batch);
   // The send task of started messages in a row: all to the server-reporting session at once.
   void sendToServerReporting(const std::vector<PendingSend>& sends);
-  // An aggregated message keeps only its text once sent, so that its payload (and the client's
-  // charge on it) is let go.
-  void keepOnlyText(const PendingSend& send);
+  // The send task of started messages in a row, after which their aggregate entries keep only
+  // text, so that the payloads (and the clients' charges on them) are let go. Empties `sends`.
+  void sendStarted(std::vector<PendingSend>& sends);
   void runTeardownTask();
   void registerOrientationCallbacks();
   void unregisterOrientationCallbacks();

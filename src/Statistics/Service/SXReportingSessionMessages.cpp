@@ -54,7 +54,8 @@ bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint
 
 void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
                                      SXReportingCategory category, SXReportingMessageType type,
-                                     bool /*sync*/, SXReportingSendReply reply) {
+                                     bool /*sync*/, SXReportingSendReply reply,
+                                     std::optional<size_t> packedBytes) {
   SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
         reporterID());
   // The key rewrite is made once, where it is first needed (normally by the send task).
@@ -64,7 +65,7 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   if (aggregate_.load()) {
     // What the entry will hold: the payload's text (about one and a half times its
     // MessagePack size) and its id, holder and slot beside it.
-    uint64_t bytes = SXPackedSize(*payload) * 3 / 2 + 256;
+    uint64_t bytes = packedBytes.value_or(SXPackedSize(*payload)) * 3 / 2 + 256;
     aggregated =
         appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten), bytes);
   }
@@ -113,31 +114,26 @@ void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
       started.push_back(std::move(send));
       continue;
     }
-    sendToServerReporting(started);
-    started.clear();
+    sendStarted(started);
     SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
     // The session's configuration is not part of a standalone message, so none is copied.
     sendSingleMessage(environment_, send.payload->rewritten(), send.category, send.type,
                       serviceType(), nullptr, nullptr, standaloneBudget_);
-    keepOnlyText(send);
+    if (send.aggregated) send.payload->keepOnlyText();
   }
-  sendToServerReporting(started);
+  sendStarted(started);
 }
 
-void SXReportingSession::keepOnlyText(const PendingSend& send) {
-  if (send.aggregated) send.payload->makeText();
+void SXReportingSession::sendStarted(std::vector<PendingSend>& sends) {
+  sendToServerReporting(sends);
+  for (const PendingSend& send : sends) {
+    if (send.aggregated) send.payload->keepOnlyText();
+  }
+  sends.clear();
 }
 
 void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& sends) {
   if (sends.empty()) return;
-  // Whatever becomes of the sends, their aggregated entries keep only text afterwards.
-  struct KeepOnlyText {
-    SXReportingSession& session;
-    const std::vector<PendingSend>& sends;
-    ~KeepOnlyText() {
-      for (const PendingSend& send : sends) session.keepOnlyText(send);
-    }
-  } keepOnlyText{*this, sends};
   if (serviceType() == kTestServiceType) {
     for (size_t i = 0; i < sends.size(); ++i) {
       SXLOG(log(), scope(), SXLogLevel::kInfo, "transactions aren't allowed on this platform");
