@@ -98,16 +98,22 @@ TEST(MsgpackValue, NonStringKeysAreRefused) {
   EXPECT_THROW(SXValueFromMsgpack(handle.get()), SXValueConversionError);
 }
 
-TEST(SXValueText, WithMemberIsTheTextOfTheMergedCopy) {
+TEST(SXValueText, DictionariesAreTheCompactDumpAndWithMemberIsThatOfTheMergedCopy) {
   const SXValue host = "player";
-  for (const SXValue& payload : {SXValue::object(), SXValue{{"a", 1}},
-                                 SXValue{{"zz", {1, 2}}, {"HostApplicationDisplayID", "x"}},
-                                 SXValue{{"Host", 1}, {"Hz", 2.5}, {"b", {{"c", "\xff\n"}}}},
-                                 SXValue::array({1}), SXValue()}) {
+  const std::vector<uint8_t> bytes = {0, 255};
+  for (const SXValue& payload :
+       {SXValue::object(), SXValue{{"a", 1}},
+        SXValue{{"zz", {1, 2}}, {"HostApplicationDisplayID", "x"}},
+        SXValue{{"Host", 1}, {"Hz", 2.5}, {"b", {{"c", "\xff\n"}}}},
+        SXValue{{"q\"u\\o\te", "\x7f\x01"}, {"\xc3\xa9t\xc3\xa9", "caf\xc3\xa9"}, {"", ""}},
+        SXValue{{"n", {nullptr, true, -1, 18446744073709551615ull, 1e300, 0.1, SXValue::object()}},
+                {"bin", SXValue::binary(bytes)}, {"arr", SXValue::array()}},
+        SXValue::array({1}), SXValue()}) {
     SXValue merged = payload.is_object() ? payload : SXValue::object();
     merged["HostApplicationDisplayID"] = host;
     EXPECT_EQ(SXValueTextWithMember(payload, "HostApplicationDisplayID", host), SXValueText(merged))
         << payload.dump();
+    EXPECT_EQ(SXValueText(merged), merged.dump(-1, ' ', false, SXValue::error_handler_t::replace));
   }
 }
 

@@ -84,6 +84,12 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   auto sent = t.fern->events(Kind::kMessage);
   ASSERT_EQ(sent.size(), 1u);
   EXPECT_EQ(sent[0].payload, entries[0]["Playback_Start_3"]);
+  // The stored text is made without the rewritten copy: same members, same order.
+  for (const SXValue& spaced : {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}},
+                                SXValue::array({1})}) {
+    EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced),
+              SXValueText(SXReportingSessionUnderscoreKeys(spaced)));
+  }
 }
 
 TEST(SXReportingSessionMessages, NotStartedGoesStandaloneWithSessionServiceType) {

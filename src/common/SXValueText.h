@@ -1,7 +1,9 @@
 // The text of a value, as log lines ("%@") and the summary event print it.
 #pragma once
 
+#include <span>
 #include <string>
+#include <string_view>
 
 #include "sxreporting/types.h"
 
@@ -9,6 +11,16 @@
 // back exactly, booleans as 1 and 0, arrays and dictionaries as compact JSON (dictionary keys
 // in ascending order), null as "(null)".
 std::string SXValueText(const SXValue& value);
+
+// One member of a dictionary written by SXDictionaryText.
+struct SXTextMember {
+  std::string_view key;
+  const SXValue* value;
+};
+
+// SXValueText of the dictionary holding `members`, which come in ascending key order without
+// repeats: the text of a dictionary with changed keys, made without building it.
+std::string SXDictionaryText(std::span<const SXTextMember> members);
 
 // SXValueText of a copy of `dictionary` (an empty one when it is not a dictionary) whose
 // member `key` is set to `value`, made without the copy.

@@ -41,9 +41,10 @@ class FernSecureHierarchyToken {
 struct FernMessage {
   uint16_t category;
   uint16_t type;
+  // The payload, or null when `payloadJson` holds it: a service that stores JSON takes the
+  // text as it is, and the default sendMessages reads the dictionary back from it.
   const SXValue* payload;
-  // The payload as compact JSON (SXValueText), when the caller already has it; a service that
-  // stores JSON may take it instead of serialising the payload again.
+  // The payload as compact JSON (SXValueText), when the caller already has it.
   const std::string* payloadJson = nullptr;
 };
 
@@ -69,7 +70,10 @@ class FernReportingSession {
   virtual std::vector<FernSendOutcome> sendMessages(const std::vector<FernMessage>& messages) {
     std::vector<FernSendOutcome> outcomes(messages.size());
     for (size_t i = 0; i < messages.size(); ++i) {
-      outcomes[i].sent = sendMessage(messages[i].category, messages[i].type, *messages[i].payload,
+      const FernMessage& message = messages[i];
+      SXValue parsed = message.payload ? SXValue() : SXValue::parse(*message.payloadJson);
+      outcomes[i].sent = sendMessage(message.category, message.type,
+                                     message.payload ? *message.payload : parsed,
                                      outcomes[i].error);
     }
     return outcomes;

@@ -37,19 +37,45 @@ bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
   return false;
 }
 
+namespace {
+
+// The payload's members under their rewritten keys, in key order. Of keys that become equal
+// the last in the payload's order wins, as assigning them one after another would have it.
+std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXValue& payload) {
+  std::vector<std::pair<std::string, const SXValue*>> members;
+  if (!payload.is_object()) return members;
+  members.reserve(payload.size());
+  for (auto it = payload.cbegin(); it != payload.cend(); ++it) {
+    std::string key = it.key();
+    std::replace(key.begin(), key.end(), ' ', '_');
+    members.emplace_back(std::move(key), &it.value());
+  }
+  std::stable_sort(members.begin(), members.end(),
+                   [](const auto& a, const auto& b) { return a.first < b.first; });
+  auto kept = members.begin();
+  for (auto it = members.begin(); it != members.end(); ++it) {
+    if (std::next(it) != members.end() && std::next(it)->first == it->first) continue;
+    if (kept != it) *kept = std::move(*it);
+    ++kept;
+  }
+  members.erase(kept, members.end());
+  return members;
+}
+
+}  // namespace
+
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   SXValue rewritten = SXValue::object();
-  if (!payload.is_object()) return rewritten;
-  for (const auto& [key, value] : payload.items()) {
-    if (key.find(' ') == std::string::npos) {
-      rewritten[key] = value;
-    } else {
-      std::string newKey = key;
-      std::replace(newKey.begin(), newKey.end(), ' ', '_');
-      rewritten[newKey] = value;
-    }
-  }
+  for (const auto& [key, value] : underscoredMembers(payload)) rewritten[key] = *value;
   return rewritten;
+}
+
+std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload) {
+  auto members = underscoredMembers(payload);
+  std::vector<SXTextMember> text;
+  text.reserve(members.size());
+  for (const auto& [key, value] : members) text.push_back({key, value});
+  return SXDictionaryText(text);
 }
 
 std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
@@ -83,7 +109,14 @@ std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
 
 const std::string& SXReportingMessagePayload::textLocked() {
   if (!text_) {
-    text_ = SXValueText(*rewrittenLocked());
+    // Without a rewritten dictionary, the rewrite's text comes straight from the caller's.
+    if (rewritten_) {
+      text_ = SXValueText(*rewritten_);
+    } else if (SXReportingSessionHasSpacedKeys(*caller_)) {
+      text_ = SXReportingSessionUnderscoreKeysText(*caller_);
+    } else {
+      text_ = SXValueText(*caller_);
+    }
     caller_ = nullptr;
     rewritten_ = nullptr;
   }

@@ -105,6 +105,8 @@ using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
 
 // A copy of `payload` in which every space in a key is replaced by "_"; values untouched.
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload);
+// SXValueText of SXReportingSessionUnderscoreKeys(payload), made without the copy.
+std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload);
 // Whether the rewrite would change `payload`.
 bool SXReportingSessionHasSpacedKeys(const SXValue& payload);
 

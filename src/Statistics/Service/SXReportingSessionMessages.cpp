@@ -147,20 +147,16 @@ void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& s
     }
     return;
   }
-  // The dictionaries are held here while the service reads them; the text is the one the
-  // aggregate keeps, made once for both.
-  // (Reserved up front, so the messages' pointers into both stay valid.)
-  std::vector<std::shared_ptr<const SXValue>> payloads;
+  // The service stores text: the one the aggregate keeps, made once for both, straight from
+  // the caller's dictionary. (Reserved up front, so the messages' pointers stay valid.)
   std::vector<std::string> texts;
   std::vector<FernMessage> messages;
-  payloads.reserve(sends.size());
   texts.reserve(sends.size());
   messages.reserve(sends.size());
   for (const PendingSend& send : sends) {
-    payloads.push_back(send.payload->rewritten());
     texts.push_back(send.payload->text());
-    messages.push_back({static_cast<uint16_t>(send.category & 0xFFFF), send.type,
-                        payloads.back().get(), &texts.back()});
+    messages.push_back(
+        {static_cast<uint16_t>(send.category & 0xFFFF), send.type, nullptr, &texts.back()});
   }
   std::vector<FernSendOutcome> outcomes = fernSession->sendMessages(messages);
   // The verbose line's arguments cost a description per message; build them only when wanted.
