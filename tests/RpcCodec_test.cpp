@@ -76,16 +76,32 @@ TEST(RpcStreamDecoder, HugeDeclaredContainerIsRefusedNotAllocated) {
   EXPECT_EQ(decoder.next(message), RpcStreamDecoder::Status::kBroken);
 }
 
-TEST(RpcParseRequest, SaysWhatIsWrong) {
-  std::string why;
-  std::optional<uint32_t> id;
-  EXPECT_FALSE(RpcParseRequest(SXValue{1, 2}, why, id));
-  EXPECT_FALSE(id);
-  EXPECT_FALSE(RpcParseRequest(SXValue{0, 5, 3, SXValue::array()}, why, id));
-  EXPECT_EQ(id, 5u);
-  EXPECT_EQ(why, "method is not a string");
-  EXPECT_FALSE(RpcParseRequest(SXValue{0, 5, "m", 1}, why, id));
-  EXPECT_EQ(why, "params is not an array");
+TEST(RpcParseRequest, SaysWhatIsWrongAndKeepsAnyUsableMsgid) {
+  const std::string notRequest = "not a MessagePack-RPC request [0, msgid, method, params]";
+  struct Row {
+    SXValue message;
+    std::optional<uint32_t> id;  // the msgid an error reply can carry
+    std::string why;
+  } rows[] = {
+      {SXValue{1, 2}, 2u, notRequest},
+      {SXValue{0, 5, "m"}, 5u, notRequest},
+      {SXValue{0, 5, "m", SXValue::array(), 1}, 5u, notRequest},
+      {SXValue{7, 5, "m", SXValue::array()}, 5u, notRequest},
+      {SXValue{2, "m", SXValue::array()}, std::nullopt, notRequest},  // a notification
+      {SXValue{0, -1, "m", SXValue::array()}, std::nullopt, "msgid is not an unsigned 32-bit integer"},
+      {SXValue{0, 4294967296ull, "m", SXValue::array()}, std::nullopt,
+       "msgid is not an unsigned 32-bit integer"},
+      {SXValue("m"), std::nullopt, notRequest},
+      {SXValue{0, 5, 3, SXValue::array()}, 5u, "method is not a string"},
+      {SXValue{0, 5, "m", 1}, 5u, "params is not an array"},
+  };
+  for (const Row& row : rows) {
+    std::string why;
+    std::optional<uint32_t> id;
+    EXPECT_FALSE(RpcParseRequest(row.message, why, id)) << row.message.dump();
+    EXPECT_EQ(id, row.id) << row.message.dump();
+    EXPECT_EQ(why, row.why) << row.message.dump();
+  }
 }
 
 TEST(MsgpackValue, NonStringKeysAreRefused) {

@@ -313,7 +313,7 @@ TEST(SXReportingSessionSummary, InternalBuildWritesTheFileWithConfigurationFirst
   const auto& [path, contents] = *t.fileSystem->files.begin();
   EXPECT_EQ(path.rfind("/diag/", 0), 0u);
   EXPECT_EQ(path.find('/', 6), std::string::npos) << path;  // no directories below /diag
-  EXPECT_NE(path.find("-sonex-__evil_player-longformaudio.json"), std::string::npos) << path;
+  EXPECT_NE(path.find("-sonex-.._evil_player-longformaudio.json"), std::string::npos) << path;
   SXValue written = SXValue::parse(contents);
   EXPECT_EQ(written[0], config);
   EXPECT_EQ(written[1], (SXValue{{"Playback_Start_1", {{"a", 1}}}}));

@@ -1,5 +1,5 @@
-// The summary file's name on internal builds: the host application name comes from a client,
-// so it must never name another directory, hide the file or overrun a file name.
+// The summary file's name on internal builds: the host application name comes from a client
+// and stands in the name as it is, but it must never name another directory or overrun a name.
 #include <gtest/gtest.h>
 
 #include "SXReportingSession.h"
@@ -33,29 +33,42 @@ std::string hostPart(const SXValue& host) {
 
 }  // namespace
 
-TEST(SummaryFileName, OrdinaryNamesAreKept) {
-  EXPECT_EQ(hostPart("player"), "player");
-  EXPECT_EQ(hostPart("com.vendra.Music"), "com.vendra.Music");
-  EXPECT_EQ(hostPart("caf\u00e9 app"), "caf\u00e9 app");
-}
-
-TEST(SummaryFileName, SeparatorsDotsAndControlCharactersAreReplaced) {
-  EXPECT_EQ(hostPart("../../etc/passwd"), "____etc_passwd");
-  EXPECT_EQ(hostPart("a/../b"), "a___b");
-  EXPECT_EQ(hostPart(".hidden"), "_hidden");
-  EXPECT_EQ(hostPart("..."), "_");
-  EXPECT_EQ(hostPart("a\\b"), "a_b");
+TEST(SummaryFileName, NamesAreKeptButForSlashAndNul) {
+  for (const std::string name : {"player", "com.vendra.Music", "caf\u00e9 app", "", ".hidden", "...",
+                                 "a\\b", "tab\there\nnew\x7f"}) {
+    EXPECT_EQ(hostPart(name), name);
+  }
+  EXPECT_EQ(hostPart("../../etc/passwd"), ".._.._etc_passwd");
   EXPECT_EQ(hostPart(std::string("nul\0x", 5)), "nul_x");
-  EXPECT_EQ(hostPart("tab\there\nnew\x7f"), "tab_here_new_");
 }
 
-TEST(SummaryFileName, EmptyAndOverlongNames) {
-  EXPECT_EQ(hostPart(""), "unknown");
-  EXPECT_EQ(hostPart(std::string(300, 'a')), std::string(64, 'a'));
-  // 40 two-byte characters: the cut at 64 bytes keeps 31 of them whole.
+TEST(SummaryFileName, OnlyANameTooLongForTheFileSystemIsCut) {
+  // "20261116-185803+0000-sonex-" and "-longformaudio.json": 46 bytes besides the host.
+  EXPECT_EQ(hostPart(std::string(209, 'a')), std::string(209, 'a'));
+  EXPECT_EQ(hostPart(std::string(300, 'a')), std::string(209, 'a'));
+  // Two-byte characters: the cut keeps 104 of them whole rather than split the 105th.
   std::string accents;
-  for (int i = 0; i < 40; ++i) accents += "\u00e9";
-  std::string cut = hostPart(std::string("x") + accents);
-  EXPECT_EQ(cut, std::string("x") + accents.substr(0, 62));
-  EXPECT_EQ(cut.size(), 63u);
+  for (int i = 0; i < 120; ++i) accents += "\u00e9";
+  EXPECT_EQ(hostPart(accents), accents.substr(0, 208));
+}
+
+TEST(SummaryFileName, SessionsStoppingInTheSameSecondKeepTheirOwnFiles) {
+  TestEnvironment t(SXValue{{"InternalBuild", true}});
+  SXValue config = {{"HostApplicationDisplayID", "player"}};
+  for (int64_t id : {1, 2, 3}) {
+    auto session = SXReportingSession::initWithID(t.environment, id, SXValue::array());
+    session->setServiceType(7);
+    session->setConfiguration(&config);
+    session->start();
+    session->sendMessage({{"n", id}}, 3, 1, nullptr);
+    EXPECT_TRUE(session->createSummaryEventForSession());
+  }
+  t.drain();
+  std::vector<std::string> names;
+  for (const auto& [path, contents] : t.fileSystem->files) {
+    names.push_back(path.substr(path.rfind("-sonex-")));
+  }
+  EXPECT_EQ(names, (std::vector<std::string>{"-sonex-player-longformaudio-2.json",
+                                             "-sonex-player-longformaudio-3.json",
+                                             "-sonex-player-longformaudio.json"}));
 }

@@ -76,17 +76,22 @@ namespace {
 // Whether `message` is a request; on failure says why. Sets `msgid` whenever it is usable.
 bool IsRequest(const SXValue& message, std::string& why, std::optional<uint32_t>& msgid) {
   msgid.reset();
+  // Whatever else is wrong, an array whose second element can be a msgid gets its error reply.
+  if (message.is_array() && message.size() >= 2) {
+    const SXValue& id = message[1];
+    if (id.is_number_integer() && id.get<int64_t>() >= 0 && id.get<uint64_t>() <= UINT32_MAX) {
+      msgid = static_cast<uint32_t>(id.get<uint64_t>());
+    }
+  }
   if (!message.is_array() || message.size() != 4 || !message[0].is_number_integer() ||
       message[0].get<int64_t>() != 0) {
     why = "not a MessagePack-RPC request [0, msgid, method, params]";
     return false;
   }
-  if (!message[1].is_number_integer() || message[1].get<int64_t>() < 0 ||
-      message[1].get<uint64_t>() > UINT32_MAX) {
+  if (!msgid) {
     why = "msgid is not an unsigned 32-bit integer";
     return false;
   }
-  msgid = static_cast<uint32_t>(message[1].get<uint64_t>());
   if (!message[2].is_string()) {
     why = "method is not a string";
     return false;

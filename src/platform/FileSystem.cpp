@@ -85,6 +85,18 @@ std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string&
 
 std::optional<std::string> SXPosixFileSystem::writeFileAtomically(const std::string& path,
                                                                   const std::string& contents) {
+  return write(path, contents, nullptr);
+}
+
+std::optional<std::string> SXPosixFileSystem::writeNewFileAtomically(const std::string& path,
+                                                                     const std::string& contents,
+                                                                     bool& taken) {
+  taken = false;
+  return write(path, contents, &taken);
+}
+
+std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
+                                                    const std::string& contents, bool* taken) {
   size_t slash = path.rfind('/');
   std::string directory = slash == std::string::npos ? "." : path.substr(0, slash ? slash : 1);
   std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
@@ -118,11 +130,16 @@ std::optional<std::string> SXPosixFileSystem::writeFileAtomically(const std::str
     ::unlinkat(dir.get(), temp.c_str(), 0);
     return SXPosixError(directory + "/" + temp, err);
   }
-  // rename replaces a symlink at `name` instead of writing through it.
-  if (::renameat(dir.get(), temp.c_str(), dir.get(), name.c_str()) != 0) {
-    err = errno;
-    ::unlinkat(dir.get(), temp.c_str(), 0);
-    return SXPosixError(path, err);
+  // rename replaces a symlink at `name` instead of writing through it; link refuses anything
+  // at `name`, a symlink included.
+  bool placed = taken ? ::linkat(dir.get(), temp.c_str(), dir.get(), name.c_str(), 0) == 0
+                      : ::renameat(dir.get(), temp.c_str(), dir.get(), name.c_str()) == 0;
+  err = placed ? 0 : errno;
+  if (!placed || taken) ::unlinkat(dir.get(), temp.c_str(), 0);
+  if (taken && err == EEXIST) {
+    *taken = true;
+    return std::nullopt;
   }
+  if (err != 0) return SXPosixError(path, err);
   return std::nullopt;
 }

@@ -17,6 +17,11 @@ class SXFileSystem {
   // failure returns the failure's description.
   virtual std::optional<std::string> writeFileAtomically(const std::string& path,
                                                          const std::string& contents) = 0;
+  // As writeFileAtomically, but whatever is at `path` already is kept: then nothing is
+  // written and `taken` is set.
+  virtual std::optional<std::string> writeNewFileAtomically(const std::string& path,
+                                                            const std::string& contents,
+                                                            bool& taken) = 0;
 };
 
 class SXPosixFileSystem final : public SXFileSystem {
@@ -24,6 +29,14 @@ class SXPosixFileSystem final : public SXFileSystem {
   std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override;
   std::optional<std::string> writeFileAtomically(const std::string& path,
                                                  const std::string& contents) override;
+  std::optional<std::string> writeNewFileAtomically(const std::string& path,
+                                                    const std::string& contents,
+                                                    bool& taken) override;
+
+ private:
+  // `taken`: null to replace what is at `path`, else set when something is there.
+  std::optional<std::string> write(const std::string& path, const std::string& contents,
+                                   bool* taken);
 };
 
 // Owns one file descriptor and closes it (which also releases an flock taken through it).

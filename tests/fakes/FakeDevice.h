@@ -66,6 +66,15 @@ class FakeFileSystem final : public SXFileSystem {
     return std::nullopt;
   }
 
+  std::optional<std::string> writeNewFileAtomically(const std::string& path,
+                                                    const std::string& contents,
+                                                    bool& taken) override {
+    std::lock_guard lock(mutex_);
+    if (failWrites) return "open " + path + ": Permission denied";
+    taken = !files.try_emplace(path, contents).second;
+    return std::nullopt;
+  }
+
   std::mutex mutex_;
   bool failDirectories = false;
   bool failWrites = false;

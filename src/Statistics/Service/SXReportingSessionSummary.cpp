@@ -1,4 +1,5 @@
 // A session's summary event and JSON file, and its orientation tracking.
+#include <algorithm>
 #include <cmath>
 #include <ctime>
 
@@ -15,34 +16,35 @@ constexpr SXReportingServiceType kTelephony = 2;
 constexpr SXReportingServiceType kLongFormAudio = 7;
 constexpr int64_t kDeviceClassWithoutOrientation = 6;
 
-// Longest piece of a summary file name taken from a client's configuration, in bytes; the whole
-// name stays far below the usual 255-byte limit.
-constexpr size_t kMaxFileNameComponent = 64;
+// The longest file name the file systems we run on take, in bytes.
+constexpr size_t kMaxFileName = 255;
+// Files of one name written in one second are told apart by "-2" up to this count; beyond it
+// the summary's file is not written.
+constexpr int kMaxSameNameFiles = 1000;
 
-// A name as it may stand inside a file name. The host application name comes from the client,
-// so nothing in it may reach outside the directory or hide the file: directory separators,
-// NULs and other control characters become "_", as do runs of dots and a leading dot; the name
-// is cut at 64 bytes (never inside a UTF-8 sequence); an empty name becomes "unknown".
-std::string fileNameComponent(const std::string& name) {
-  std::string safe;
-  for (size_t i = 0; i < name.size(); ++i) {
-    auto c = static_cast<unsigned char>(name[i]);
-    if (c == '.' && (safe.empty() || (i + 1 < name.size() && name[i + 1] == '.'))) {
-      while (i + 1 < name.size() && name[i + 1] == '.') ++i;
-      safe += '_';
-    } else if (c == '/' || c == '\\' || c < 0x20 || c == 0x7f) {
-      safe += '_';
-    } else {
-      safe += static_cast<char>(c);
-    }
-  }
-  if (safe.size() > kMaxFileNameComponent) {
-    size_t cut = kMaxFileNameComponent;
-    // Back up over continuation bytes so that a multi-byte character is kept whole or dropped.
-    while (cut > 0 && (static_cast<unsigned char>(safe[cut]) & 0xC0) == 0x80) --cut;
-    safe.resize(cut);
-  }
-  return safe.empty() ? "unknown" : safe;
+// A name as it stands inside a file name: unchanged, but for the two bytes no file name can
+// hold, "/" and NUL, which become "_".
+std::string fileNameComponent(std::string name) {
+  std::replace_if(name.begin(), name.end(), [](char c) { return c == '/' || c == '\0'; }, '_');
+  return name;
+}
+
+// `text` cut to at most `bytes` bytes, never inside a UTF-8 sequence.
+std::string utf8Prefix(const std::string& text, size_t bytes) {
+  if (text.size() <= bytes) return text;
+  size_t cut = bytes;
+  while (cut > 0 && (static_cast<unsigned char>(text[cut]) & 0xC0) == 0x80) --cut;
+  return text.substr(0, cut);
+}
+
+// The summary file's name: "<stamp>-sonex-<host>-<type>.json", "-<n>" before ".json" for the
+// n-th file of that name. A host name too long for the file system is shortened to fit.
+std::string summaryFileName(const std::string& stamp, const std::string& host,
+                            const std::string& type, int n) {
+  std::string suffix = "-" + type + (n > 1 ? "-" + std::to_string(n) : "") + ".json";
+  std::string head = stamp + "-sonex-";
+  size_t room = kMaxFileName - std::min(kMaxFileName, head.size() + suffix.size());
+  return head + utf8Prefix(host, room) + suffix;
 }
 
 // "yyyyMMdd-HHmmssZ" in the device's time zone, for example 20261116-185803+0000.
@@ -113,14 +115,24 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
              "can't create logging directory at %@: %@", directory, *error);
   }
   auto host = info.find("HostApplicationDisplayID");
-  std::string hostName = host != info.end() ? SXValueText(*host) : "unknown";
-  std::string name = summaryTimeStamp(environment_->platform().clock->now()) + "-sonex-" +
-                     fileNameComponent(hostName) + "-" +
-                     fileNameComponent(SXReportingUtilityServiceTypeName(serviceType())) + ".json";
-  if (auto error = fs.writeFileAtomically(directory + "/" + name, json)) {
-    SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "jsonOutput writeToURL: %@",
-             *error);
+  std::string hostName = fileNameComponent(host != info.end() ? SXValueText(*host) : "unknown");
+  std::string typeName = fileNameComponent(SXReportingUtilityServiceTypeName(serviceType()));
+  std::string stamp = summaryTimeStamp(environment_->platform().clock->now());
+  // Sessions of one host and type that stop within the same second each keep their own file.
+  for (int n = 1; n <= kMaxSameNameFiles; ++n) {
+    std::string path = directory + "/" + summaryFileName(stamp, hostName, typeName, n);
+    bool taken = false;
+    auto error = fs.writeNewFileAtomically(path, json, taken);
+    if (taken) continue;
+    if (error) {
+      SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "jsonOutput writeToURL: %@",
+               *error);
+    }
+    return;
   }
+  SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "jsonOutput writeToURL: %@",
+           SXFormat("%d files named %@ in one second", kMaxSameNameFiles,
+                    summaryFileName(stamp, hostName, typeName, 1)));
 }
 
 bool SXReportingSession::shouldReportOrientation() {
