@@ -55,7 +55,8 @@ PREFIX ?= /usr/local
 install: build
 	DESTDIR=$(DESTDIR) cmake --install $(BUILD) --prefix $(PREFIX)
 
-# The Debian package, $(BUILD)/sxreportingd_<version>_<arch>.deb.
+# The Debian packages, $(BUILD)/<package>_<version>_<arch>.deb: sxreportingd, libsxreporting0,
+# libsxreporting-dev and sxreporting-bench (docs/operations.md, "Package layout").
 package: build
 	cd $(BUILD) && cpack -G DEB
 

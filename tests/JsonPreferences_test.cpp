@@ -30,7 +30,7 @@ class JsonPreferencesTest : public ::testing::Test {
   void TearDown() override { fs::remove_all(root_); }
 
   std::unique_ptr<SXJsonPreferences> open() {
-    return std::make_unique<SXJsonPreferences>(configDir_, log_);
+    return std::make_unique<SXJsonPreferences>(configDir_ + "/preferences", log_);
   }
   std::string domainFile(const std::string& domain = kDomain) const {
     return configDir_ + "/preferences/" + domain + ".json";
@@ -155,7 +155,7 @@ TEST_F(JsonPreferencesTest, FailedWriteLeavesFileAsItWas) {
 
   // An unwritable place for the store is an error, not a crash.
   writeFile(root_ + "/file", "");
-  SXJsonPreferences blocked(root_ + "/file", log_);
+  SXJsonPreferences blocked(root_ + "/file/preferences", log_);
   EXPECT_NE(blocked.setValue(kDomain, "a", SXValue(1)), std::nullopt);
 }
 
@@ -188,7 +188,7 @@ TEST_F(JsonPreferencesTest, ConcurrentWritersKeepEachOthersKeys) {
     pid_t pid = ::fork();
     ASSERT_GE(pid, 0);
     if (pid == 0) {
-      SXJsonPreferences child(configDir_, std::make_shared<FakeLog>());
+      SXJsonPreferences child(configDir_ + "/preferences", std::make_shared<FakeLog>());
       WriteKeys(child, prefix, kKeys);
       ::_exit(0);
     }

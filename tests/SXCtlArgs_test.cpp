@@ -146,6 +146,8 @@ TEST(SXCtlArgsTest, HelpForTheToolAndEachCommand) {
   EXPECT_EQ(send.command, "send");
   EXPECT_EQ(parse({"help", "start"}).command, "start");
   EXPECT_TRUE(parse({"-h"}).help);
+  EXPECT_TRUE(parse({"--version"}).version);
+  EXPECT_TRUE(parse({"list", "--version"}).version);
 
   EXPECT_EQ(SXCtlHelp("start").rfind("usage: sxreportctl [options] start ID\n", 0), 0u);
   const std::string text = SXCtlHelp("");
@@ -187,7 +189,7 @@ TEST(SXCtlArgsTest, StartWaitsWithoutLimitUnlessTold) {
   EXPECT_EQ(SXCtlTimeout(parse({"create", "1", "--timeout", "0.0001"})), 1ms);
 }
 
-TEST(SXCtlArgsTest, SocketFollowsTheRuntimeDirectoryUnlessGiven) {
+TEST(SXCtlArgsTest, SocketAndPreferencesFollowTheirDirectoriesUnlessGiven) {
   ::unsetenv("SXREPORTING_SOCKET");
   auto paths = SXCtlPaths(parse({"--runtime-dir", "/r", "list"}));
   EXPECT_EQ(paths.runtimeDir, "/r");
@@ -195,6 +197,17 @@ TEST(SXCtlArgsTest, SocketFollowsTheRuntimeDirectoryUnlessGiven) {
   paths = SXCtlPaths(parse({"--runtime-dir", "/r", "--socket", "/s", "list"}));
   EXPECT_EQ(paths.socketPath, "/s");
   EXPECT_EQ(SXCtlPaths(parse({"--state-dir", "/st", "list"})).stateDir, "/st");
+
+  ::unsetenv("SXREPORTING_PREFERENCES_DIR");
+  auto preferences = [](std::vector<std::string> args) {
+    return SXCtlPaths(parse(std::move(args))).preferencesDirectory();
+  };
+  EXPECT_EQ(preferences({"--config-dir", "/c", "list"}), "/c/preferences");
+  EXPECT_EQ(preferences({"--config-dir", "/c", "--preferences-dir", "/p", "list"}), "/p");
+  ::setenv("SXREPORTING_PREFERENCES_DIR", "/env", 1);
+  EXPECT_EQ(preferences({"--config-dir", "/c", "list"}), "/env");
+  EXPECT_EQ(preferences({"--preferences-dir", "/p", "list"}), "/p");
+  ::unsetenv("SXREPORTING_PREFERENCES_DIR");
 }
 
 }  // namespace

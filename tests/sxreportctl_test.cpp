@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <regex>
 #include <sstream>
 
 #include "fakes/FakeRpcServer.h"
@@ -83,7 +84,7 @@ TEST_F(SxreportctlTest, SendPutsItsArgumentsOnTheWire) {
   EXPECT_EQ(none.status, 0);
   EXPECT_EQ(none.out, "delivered\n");
   CtlRun all = run({"send", "--broadcast", "--category", "0x08000003", "--type", "2", "{}"});
-  EXPECT_EQ(all.status, 0);
+  EXPECT_EQ(all.status, 1);
   EXPECT_EQ(all.out,
             "not delivered: reporting is disabled (domain com.vendra.audio.reporting, code 1)\n");
 
@@ -93,34 +94,43 @@ TEST_F(SxreportctlTest, SendPutsItsArgumentsOnTheWire) {
   EXPECT_EQ(requests[1].params, SXValue::array({SXValue::object(), 0x08000003, 2, nullptr}));
 }
 
-TEST_F(SxreportctlTest, ExitStatusTellsReplyNoReplyAndErrors) {
-  server_.on(kKillService, [](auto&) { return Answer::none(); });
+TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
+  server_.on(kCreate, [](auto&) { return Answer::reply(true); });
+  server_.on(kStart, [](auto&) { return Answer::reply(false); });
+  server_.on(kSendMessage, [](auto&) {
+    return Answer::reply({{"domain", kSXReportingErrorDomain}, {"code", 1}});
+  });
+  server_.on(kStop, [](auto&) { return Answer::none(); });
   server_.on(kSetServiceType, [](auto&) { return Answer::fail("service type above 65535"); });
-
-  CtlRun kill = run({"--timeout", "0.2", "kill"});
-  EXPECT_EQ(kill.status, 1);
-  EXPECT_NE(kill.err.find("kill: the service sent no reply"), std::string::npos) << kill.err;
-
-  CtlRun rejected = run({"set-type", "1", "5"});
-  EXPECT_EQ(rejected.status, 2);
-  EXPECT_NE(rejected.err.find("service type above 65535"), std::string::npos) << rejected.err;
-
-  EXPECT_EQ(run({"create"}).status, 2);
-  EXPECT_EQ(run({"--help"}).status, 0);
-
-  CtlRun absent = run({"--socket", server_.directory() + "/nothing", "list"});
-  EXPECT_EQ(absent.status, 2);
-  EXPECT_NE(absent.err.find("cannot connect"), std::string::npos) << absent.err;
-}
-
-TEST_F(SxreportctlTest, KillEndsWhenTheServiceCloses) {
-  server_.on(kKillService, [&](auto&) {
+  server_.on(kKillService, [&](auto&) {  // the service exits instead of replying
     server_.closeConnections();
     return Answer::none();
   });
-  CtlRun kill = run({"kill"});
-  EXPECT_EQ(kill.status, 1);
-  EXPECT_NE(kill.err.find("kill: the service sent no reply"), std::string::npos) << kill.err;
+  struct Row {
+    std::vector<std::string> args;
+    int status;
+    std::string err;  // a part of stderr
+  };
+  const Row rows[] = {
+      {{"create", "42"}, 0, ""},
+      {{"kill"}, 0, ""},
+      {{"--version"}, 0, ""},
+      {{"start", "42"}, 1, ""},
+      {{"send", "--broadcast", "{}"}, 1, ""},
+      {{"create"}, 2, "usage: sxreportctl create ID"},
+      {{"--socket", server_.directory() + "/nothing", "list"}, 3, "cannot connect"},
+      {{"--timeout", "0.2", "stop", "0"}, 4, "stop: the service sent no reply within 0.2 s"},
+      {{"defaults", "read", "Name"}, 5, "has no value for Name"},
+      {{"set-type", "1", "5"}, 6, "service type above 65535"},
+      {{"events"}, 7, "no analytics store"},
+  };
+  for (const auto& row : rows) {
+    CtlRun result = run(row.args);
+    EXPECT_EQ(result.status, row.status) << row.args.back() << ": " << result.err;
+    EXPECT_NE(result.err.find(row.err), std::string::npos) << result.err;
+  }
+  EXPECT_TRUE(std::regex_match(run({"--version"}).out,
+                               std::regex("sxreportctl [0-9]+\\.[0-9]+\\.[0-9]+\n")));
 }
 
 TEST_F(SxreportctlTest, StartReturnsWhenTheServiceRepliesAtStop) {
@@ -137,15 +147,15 @@ TEST_F(SxreportctlTest, ChainedCommandsShareOneConnectionAndStopAtAFailure) {
   server_.on(kCreate, [](auto&) { return Answer::reply(true); });
   server_.on(kStart, [](auto&) { return Answer::reply(false); });
   server_.on(kStop, [](auto&) { return Answer::none(); });
-  CtlRun chain = run({"create", "42", "then", "start", "42"});
-  EXPECT_EQ(chain.status, 0);
+  CtlRun chain = run({"create", "42", "then", "start", "42", "then", "create", "1"});
+  EXPECT_EQ(chain.status, 1);
   EXPECT_EQ(chain.out, "true\nfalse\n");
   EXPECT_EQ(server_.connectionCount(), 1u);
 
   CtlRun stopped = run({"--timeout", "0.2", "stop", "0", "then", "create", "1"});
-  EXPECT_EQ(stopped.status, 1);
+  EXPECT_EQ(stopped.status, 4);
   EXPECT_EQ(stopped.err, "stop: the service sent no reply within 0.2 s\n");
-  EXPECT_EQ(server_.requests().size(), 3u);  // create 1 was never sent
+  EXPECT_EQ(server_.requests().size(), 3u);  // neither create 1 was sent
 }
 
 TEST_F(SxreportctlTest, StatusPrintsClientsSessionsDefaultsAndCounters) {
@@ -199,11 +209,16 @@ TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
   EXPECT_EQ(SXValue::parse(slurp(file)), (SXValue{{"Level", 3}, {"ReportingEnabled", false}}));
   EXPECT_EQ(run({"defaults", "read", "ReportingEnabled"}).out, "0\n");
   EXPECT_EQ(run({"--json", "defaults", "read"}).out, "{\"Level\":3,\"ReportingEnabled\":false}\n");
-  EXPECT_EQ(run({"defaults", "read", "Name"}).status, 1);
 
   std::ofstream(file) << "[not an object";
-  EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 2);
+  EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 7);
   EXPECT_EQ(slurp(file), "[not an object");  // left as it was
+
+  // Another preferences directory leaves the configuration directory's domain alone.
+  const std::string elsewhere = server_.directory() + "/state/preferences";
+  EXPECT_EQ(run({"--preferences-dir", elsewhere, "defaults", "write", "A", "b"}).status, 0);
+  EXPECT_EQ(SXValue::parse(slurp(elsewhere + "/com.vendra.sonex.json")), (SXValue{{"A", "b"}}));
+  EXPECT_EQ(slurp(file), "[not an object");
 }
 
 TEST_F(SxreportctlTest, NotifyWritesTheNamedFile) {
@@ -212,7 +227,7 @@ TEST_F(SxreportctlTest, NotifyWritesTheNamedFile) {
 }
 
 TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
-  EXPECT_EQ(run({"events"}).status, 2);  // no store yet
+  EXPECT_EQ(run({"events"}).status, 7);  // no store yet
   sqlite3* db = nullptr;
   ASSERT_EQ(sqlite3_open((server_.directory() + "/tallyvane.db").c_str(), &db), SQLITE_OK);
   ASSERT_EQ(sqlite3_exec(db,

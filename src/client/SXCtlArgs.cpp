@@ -228,7 +228,7 @@ bool contains(const std::vector<std::string_view>& names, std::string_view name)
 
 bool isGlobalValueOption(std::string_view name) {
   return name == "--socket" || name == "--state-dir" || name == "--config-dir" ||
-         name == "--runtime-dir" || name == "--timeout";
+         name == "--runtime-dir" || name == "--preferences-dir" || name == "--timeout";
 }
 
 bool setGlobal(const std::string& name, const std::string& value, SXCtlRequest& r,
@@ -237,6 +237,7 @@ bool setGlobal(const std::string& name, const std::string& value, SXCtlRequest& 
   if (name == "--state-dir") r.stateDir = value;
   if (name == "--config-dir") r.configDir = value;
   if (name == "--runtime-dir") r.runtimeDir = value;
+  if (name == "--preferences-dir") r.preferencesDir = value;
   if (name == "--timeout") {
     char* end = nullptr;
     double seconds = std::strtod(value.c_str(), &end);
@@ -257,13 +258,15 @@ bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSp
   const size_t equals = arg.find('=');
   const std::string name = arg.substr(0, equals);
   const bool wantsValue = isGlobalValueOption(name) || (spec && contains(spec->valueOptions, name));
-  if (name == "--json" || name == "--help" || (spec && contains(spec->flagOptions, name))) {
+  if (name == "--json" || name == "--help" || name == "--version" ||
+      (spec && contains(spec->flagOptions, name))) {
     if (equals != std::string::npos) {
       error = name + " takes no value";
       return false;
     }
     if (name == "--json") r.json = true;
     if (name == "--help") r.help = true;
+    if (name == "--version") r.version = true;
     raw.flags.insert(name);
     return true;
   }
@@ -323,7 +326,7 @@ bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& r, std::stri
     r.command = raw.positional.empty() ? "" : raw.positional[0];
     return true;
   }
-  if (r.help) return true;
+  if (r.help || r.version) return true;
   if (r.command.empty()) {
     error = "no command given; see sxreportctl --help";
     return false;
@@ -343,6 +346,7 @@ void applyGlobals(const SXCtlRequest& from, SXCtlRequest& to) {
   if (from.stateDir) to.stateDir = from.stateDir;
   if (from.configDir) to.configDir = from.configDir;
   if (from.runtimeDir) to.runtimeDir = from.runtimeDir;
+  if (from.preferencesDir) to.preferencesDir = from.preferencesDir;
   if (from.timeoutSeconds) to.timeoutSeconds = from.timeoutSeconds;
   to.json = to.json || from.json;
 }
@@ -377,6 +381,21 @@ bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequ
   return true;
 }
 
+SXCtlExit SXCtlExitFor(SXCallStatus status) {
+  switch (status) {
+    case SXCallStatus::kReplied:
+      return kSXCtlOK;
+    case SXCallStatus::kTimedOut:
+      return kSXCtlNoReply;
+    case SXCallStatus::kConnectionLost:
+      return kSXCtlUnreachable;
+    case SXCallStatus::kRemoteError:
+    case SXCallStatus::kBadReply:
+      break;
+  }
+  return kSXCtlRejected;
+}
+
 SXTimeout SXCtlTimeout(const SXCtlRequest& request) {
   if (!request.timeoutSeconds) {
     if (request.command == "start") return kSXWaitForever;
@@ -395,6 +414,7 @@ SXPaths SXCtlPaths(const SXCtlRequest& request) {
     paths.runtimeDir = *request.runtimeDir;
     paths.runtimeDirChanged();
   }
+  if (request.preferencesDir) paths.preferencesDir = *request.preferencesDir;
   if (request.socketPath) {
     paths.socketPath = *request.socketPath;
     paths.socketPathExplicit = true;
@@ -449,8 +469,8 @@ const std::vector<CommandSpec>& commandSpecs() {
        "One reporter ID a line, client by client; \"(none)\" when there are none.", 0, 0, {},
        {}, buildNothing},
       {"kill", "kill", "make the service exit",
-       "The service exits with status 2 and never replies, so kill always ends with\n"
-       "\"the service sent no reply\" and exit status 1.",
+       "The service exits with status 2 and never replies: kill ends with exit status 0 when\n"
+       "the service closes the connection, or 4 when it is still there after the time-out.",
        0, 0, {}, {}, buildNothing},
       {"status", "status [--metrics]",
        "show clients, sessions, the enable switch and the defaults",
@@ -464,8 +484,8 @@ const std::vector<CommandSpec>& commandSpecs() {
        0, 0, {"--name", "--limit"}, {}, buildEvents},
       {"defaults", "defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | delete KEY",
        "read and change the preferences",
-       "The domain com.vendra.sonex, kept in <config-dir>/preferences/com.vendra.sonex.json.\n"
-       "read prints the whole domain or one key (exit status 1 when the key is not set);\n"
+       "The domain com.vendra.sonex, kept in <preferences-dir>/com.vendra.sonex.json.\n"
+       "read prints the whole domain or one key (exit status 5 when the key is not set);\n"
        "write stores VALUE as a string unless --bool or --int says otherwise.",
        1, 3, {}, {"--bool", "--int", "--string"}, buildDefaults},
       {"notify", "notify NAME", "post a named notification",
@@ -482,22 +502,38 @@ constexpr std::string_view kOptionsHelp =
     "                      (default <runtime-dir>/com.vendra.audio.kitbench.reporting.service)\n"
     "  --state-dir DIR     where tallyvane.db is (default ./var/lib;\n"
     "                      as root /var/lib/sxreportingd)\n"
-    "  --config-dir DIR    where preferences/ is (default ./var/etc; as root /etc/sxreportingd)\n"
+    "  --config-dir DIR    the service's configuration (default ./var/etc;\n"
+    "                      as root /etc/sxreportingd)\n"
+    "  --preferences-dir DIR\n"
+    "                      where the defaults domain is (default <config-dir>/preferences;\n"
+    "                      the packaged service uses /var/lib/sxreportingd/preferences)\n"
     "  --runtime-dir DIR   where the socket and notify/ are (default ./var/run;\n"
     "                      as root /run/sxreportingd)\n"
     "  --json              print the reply as JSON\n"
     "  --timeout SECONDS   wait this long for a reply; 0 waits without limit\n"
     "                      (default 5, and no limit for start)\n"
     "  -h, --help          show help; `sxreportctl COMMAND --help` for one command\n"
+    "  --version           print the version\n"
     "\n"
-    "Environment: SXREPORTING_SOCKET, SXREPORTING_STATE_DIR, SXREPORTING_CONFIG_DIR and\n"
-    "SXREPORTING_RUNTIME_DIR stand in for the options of the same name.\n"
-    "Exit status: 0 the service replied, 1 it sent no reply in time, 2 a usage, connection\n"
-    "or request error.\n";
+    "Environment: SXREPORTING_SOCKET, SXREPORTING_STATE_DIR, SXREPORTING_CONFIG_DIR,\n"
+    "SXREPORTING_RUNTIME_DIR and SXREPORTING_PREFERENCES_DIR stand in for the options of the\n"
+    "same name.\n"
+    "\n"
+    "Exit status:\n"
+    "  0  done: the service replied true or answered, or the local command did its job\n"
+    "  1  the service replied false, or did not deliver the message (send)\n"
+    "  2  usage error: the command line is wrong\n"
+    "  3  the service cannot be reached, or closed the connection before replying\n"
+    "  4  no reply within the time-out\n"
+    "  5  defaults read KEY: the key is not set\n"
+    "  6  the service refused the request as malformed, or its reply made no sense\n"
+    "  7  a local store or file could not be read or written\n"
+    "A chain stops at the first command that does not end with 0 and exits with its status.\n";
 
 constexpr std::string_view kCommandOptionsHelp =
-    "Options: --socket PATH, --state-dir DIR, --config-dir DIR, --runtime-dir DIR, --json,\n"
-    "--timeout SECONDS (0: no limit); see sxreportctl --help.\n";
+    "Options: --socket PATH, --state-dir DIR, --config-dir DIR, --runtime-dir DIR,\n"
+    "--preferences-dir DIR, --json, --timeout SECONDS (0: no limit); see sxreportctl --help\n"
+    "(also for the exit statuses).\n";
 
 }  // namespace
 

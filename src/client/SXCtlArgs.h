@@ -10,14 +10,16 @@
 #include "sxreporting/client.h"
 
 struct SXCtlRequest {
-  std::string command;  // "create", "send", ...; empty when none was given
-  bool help = false;    // show the help of `command` (the overview when there is none)
+  std::string command;   // "create", "send", ...; empty when none was given
+  bool help = false;     // show the help of `command` (the overview when there is none)
+  bool version = false;  // print the version instead of running anything
 
   // Global options.
   std::optional<std::string> socketPath;
   std::optional<std::string> stateDir;
   std::optional<std::string> configDir;
   std::optional<std::string> runtimeDir;
+  std::optional<std::string> preferencesDir;
   bool json = false;
   std::optional<double> timeoutSeconds;  // 0: wait without limit
 
@@ -37,6 +39,21 @@ struct SXCtlRequest {
   std::string notificationName;                     // notify
   bool metrics = false;                             // status: Prometheus text, not prose
 };
+
+// How sxreportctl ends, so that scripts can tell the outcomes apart.
+enum SXCtlExit : int {
+  kSXCtlOK = 0,           // the service replied true or answered; a local command did its job
+  kSXCtlFailed = 1,       // the service replied false, or refused the message (send)
+  kSXCtlUsage = 2,        // the command line is wrong
+  kSXCtlUnreachable = 3,  // no connection to the service, or it closed the connection
+  kSXCtlNoReply = 4,      // no reply within the time-out
+  kSXCtlNotSet = 5,       // defaults read KEY: the key is not set
+  kSXCtlRejected = 6,     // the service refused the request as malformed, or replied nonsense
+  kSXCtlLocalError = 7,   // a local store or file could not be read or written
+};
+
+// The exit status of a call that did not reply (kSXCtlOK for one that did).
+SXCtlExit SXCtlExitFor(SXCallStatus status);
 
 // Parses the arguments that follow the program name. On failure returns false and says what
 // is wrong in `error`.

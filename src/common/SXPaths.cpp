@@ -24,6 +24,7 @@ SXPaths SXPaths::fromEnvironment() {
               root ? "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting"
                    : "./var/log/DiagnosticLogs/Audio/Reporting");
   p.kestrelRoot = fromEnv("SXREPORTING_KESTREL_ROOT", root ? "/run/kestrel" : "./var/kestrel");
+  if (auto dir = fromEnv("SXREPORTING_PREFERENCES_DIR", ""); !dir.empty()) p.preferencesDir = dir;
   const char* socket = std::getenv("SXREPORTING_SOCKET");
   p.socketPathExplicit = socket && *socket;
   p.socketPath = p.socketPathExplicit ? std::string(socket) : std::string();

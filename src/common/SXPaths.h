@@ -3,6 +3,7 @@
 // system's directories for root. The daemon and sxreportctl resolve them the same way.
 #pragma once
 
+#include <optional>
 #include <string>
 
 struct SXPaths {
@@ -12,10 +13,18 @@ struct SXPaths {
   std::string diagnosticLogsDir;  // session summary files of internal builds
   std::string kestrelRoot;        // driver counters
   std::string socketPath;
+  // The preferences domains; nothing means `<configDir>/preferences`. A packaged service keeps
+  // them with its state, since they change at run time and /etc is for the administrator.
+  std::optional<std::string> preferencesDir;
+
+  std::string preferencesDirectory() const {
+    return preferencesDir.value_or(configDir + "/preferences");
+  }
 
   // Defaults with the environment twins applied (SXREPORTING_STATE_DIR, SXREPORTING_CONFIG_DIR,
   // SXREPORTING_RUNTIME_DIR, SXREPORTING_DIAGNOSTIC_LOGS_DIR, SXREPORTING_KESTREL_ROOT,
-  // SXREPORTING_SOCKET). The socket follows the runtime directory unless set itself.
+  // SXREPORTING_SOCKET, SXREPORTING_PREFERENCES_DIR). The socket follows the runtime directory
+  // unless set itself.
   static SXPaths fromEnvironment();
   // Call after a flag changed runtimeDir, so that the socket follows it (unless set itself).
   void runtimeDirChanged();

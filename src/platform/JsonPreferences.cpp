@@ -64,8 +64,8 @@ bool EqualsIgnoringCase(std::string_view a, std::string_view b) {
 
 }  // namespace
 
-SXJsonPreferences::SXJsonPreferences(std::string configDir, std::shared_ptr<SXLogFacility> log)
-    : directory_(std::move(configDir) + "/preferences"), log_(std::move(log)) {}
+SXJsonPreferences::SXJsonPreferences(std::string directory, std::shared_ptr<SXLogFacility> log)
+    : directory_(std::move(directory)), log_(std::move(log)) {}
 
 bool SXJsonPreferences::isValidDomain(const std::string& domain) {
   return !domain.empty() && domain != "." && domain != ".." &&

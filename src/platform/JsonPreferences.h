@@ -1,5 +1,5 @@
-// Production preferences store: one JSON object per domain in
-// `<config-dir>/preferences/<domain>.json`.
+// Production preferences store: one JSON object per domain in `<directory>/<domain>.json`
+// (`<config-dir>/preferences/` unless --preferences-dir says otherwise).
 //
 // Every read opens the file afresh, because other processes (the admin tool, another daemon)
 // change it. Writes hold an exclusive flock on `<domain>.json.lock` across read-modify-write
@@ -21,7 +21,7 @@
 
 class SXJsonPreferences final : public SXPreferences {
  public:
-  SXJsonPreferences(std::string configDir, std::shared_ptr<SXLogFacility> log);
+  SXJsonPreferences(std::string directory, std::shared_ptr<SXLogFacility> log);
 
   std::optional<SXValue> copyValue(const std::string& domain, const std::string& key) override;
   SXValue copyDomain(const std::string& domain) override;

@@ -27,14 +27,20 @@ pid_t spawnCtl(const TestDaemon& daemon, const std::vector<std::string>& args) {
 
 }  // namespace
 
+// The preferences live outside the configuration directory, as under the packaged unit; the
+// daemon's flag and the tool's environment twin must name the same place.
 TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
-  TestDaemon daemon;
+  SXTestTempDir state;
+  const std::string preferences = state.file("preferences");
+  TestDaemon daemon({{"--preferences-dir", preferences}, nullptr, nullptr, {}});
+  ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
   EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "true"}), 0);
   ASSERT_EQ(daemon.ctl({"defaults", "write", "device_name", "bench"}), 0);
+  ASSERT_TRUE(std::filesystem::exists(preferences + "/com.vendra.sonex.json"));
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
   ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
   ASSERT_TRUE(
@@ -62,6 +68,7 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   EXPECT_EQ(userInfo["disable_reporting"], false);
   EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
   EXPECT_TRUE(start.get().value);
+  ::unsetenv("SXREPORTING_PREFERENCES_DIR");
 }
 
 TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "SXReportingServiceDelegate.h"
+#include "SXVersion.h"
 #include "common/SXPaths.h"
 #include "platform/AsioDispatch.h"
 #include "platform/FileKestrel.h"
@@ -46,6 +47,8 @@ constexpr const char* kUsage =
     "  --config-dir DIR            device.json, fernreporting.json, preferences/ "
     "(SXREPORTING_CONFIG_DIR)\n"
     "  --runtime-dir DIR           socket and notify/ directory (SXREPORTING_RUNTIME_DIR)\n"
+    "  --preferences-dir DIR       preferences domains (SXREPORTING_PREFERENCES_DIR,\n"
+    "                              default <config-dir>/preferences)\n"
     "  --diagnostic-logs-dir DIR   session summary files of internal builds\n"
     "                              (SXREPORTING_DIAGNOSTIC_LOGS_DIR)\n"
     "  --kestrel-root DIR          driver counters (SXREPORTING_KESTREL_ROOT)\n"
@@ -104,6 +107,7 @@ constexpr const char* kUsage =
     "                              open connections of one process; further ones are closed\n"
     "                              at once (SXREPORTING_MAX_CONNECTIONS_PER_CLIENT, default 128)\n"
     "  -h, --help                  this text\n"
+    "  --version                   print the version\n"
     "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
 
@@ -212,6 +216,10 @@ int parseOptions(int argc, char** argv, Options& options) {
       std::fputs(kUsage, stdout);
       return -1;
     }
+    if (arg == "--version") {
+      std::printf("sxreportingd %s\n", kSXVersion);
+      return -1;
+    }
     if (i + 1 >= argc) {
       std::fprintf(stderr, "sxreportingd: %s needs a value\n%s", arg.c_str(), kUsage);
       return 2;
@@ -235,6 +243,8 @@ int parseOptions(int argc, char** argv, Options& options) {
     } else if (arg == "--runtime-dir") {
       p.runtimeDir = value;
       p.runtimeDirChanged();
+    } else if (arg == "--preferences-dir") {
+      p.preferencesDir = value;
     } else if (arg == "--diagnostic-logs-dir") {
       p.diagnosticLogsDir = value;
     } else if (arg == "--kestrel-root") {
@@ -290,7 +300,7 @@ SXPlatform productionPlatform(const Options& options, const Stores& stores,
   platform.fernReporting = stores.fernReporting;
   platform.kestrel = std::make_shared<SXFileKestrel>(p.kestrelRoot, log);
   platform.orientation = std::make_shared<SXNoSensorOrientationService>();
-  platform.preferences = std::make_shared<SXJsonPreferences>(p.configDir, log);
+  platform.preferences = std::make_shared<SXJsonPreferences>(p.preferencesDirectory(), log);
   platform.notifications = std::make_shared<SXInotifyNotifications>(p.runtimeDir, log);
   platform.diagnosticLogsDirectory = p.diagnosticLogsDir;
   return platform;

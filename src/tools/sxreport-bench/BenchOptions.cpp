@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <sstream>
 
+#include "SXVersion.h"
 #include "common/SXPaths.h"
 
 namespace {
@@ -58,7 +59,8 @@ constexpr const char* kUsage =
     "\n"
     "output:\n"
     "  --json                 one JSON object on stdout\n"
-    "  -h, --help             this text\n";
+    "  -h, --help             this text\n"
+    "  --version              print the version\n";
 
 bool parseCount(const char* text, uint64_t& out) {
   char* end = nullptr;
@@ -188,6 +190,10 @@ int ParseBenchOptions(int argc, char** argv, BenchOptions& options) {
     std::string arg = argv[i];
     if (arg == "-h" || arg == "--help") {
       std::fputs(kUsage, stdout);
+      return 0;
+    }
+    if (arg == "--version") {
+      std::printf("sxreport-bench %s\n", kSXVersion);
       return 0;
     }
     if (arg == "--spawn") {

@@ -21,7 +21,7 @@ namespace {
 
 int fail(const std::string& message) {
   std::cerr << message << "\n";
-  return 2;
+  return kSXCtlLocalError;
 }
 
 std::string jsonText(const SXValue& value, int indent = -1) {
@@ -93,7 +93,7 @@ int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
 namespace {
 
 std::string domainPath(const SXPaths& paths) {
-  return paths.configDir + "/preferences/" + kSXCtlPreferencesDomain + ".json";
+  return paths.preferencesDirectory() + "/" + kSXCtlPreferencesDomain + ".json";
 }
 
 // The stored domain; an absent file is an empty domain.
@@ -147,7 +147,7 @@ int readDefaults(const SXCtlRequest& r, const SXValue& domain) {
   auto it = domain.find(*r.key);
   if (it == domain.end()) {
     std::cerr << "defaults: " << kSXCtlPreferencesDomain << " has no value for " << *r.key << "\n";
-    return 1;
+    return kSXCtlNotSet;
   }
   std::cout << (r.json ? jsonText(*it) : SXValueText(*it)) << "\n";
   return 0;

@@ -1,6 +1,5 @@
 // The sxreportctl commands that work on the service's files, not through its socket.
-// Each returns the exit status: 0 done, 1 nothing to show (defaults read of a key not set),
-// 2 an error, printed.
+// Each returns the exit status (SXCtlExit), and prints what went wrong.
 #pragma once
 
 #include "client/SXCtlArgs.h"
@@ -9,7 +8,7 @@
 int SXCtlRunEvents(const SXCtlRequest& request, const SXPaths& paths);
 
 // `defaults read|write|delete`: the preferences domain, one JSON object in
-// <config-dir>/preferences/com.vendra.sonex.json, replaced atomically on every change.
+// <preferences-dir>/com.vendra.sonex.json, replaced atomically on every change.
 int SXCtlRunDefaults(const SXCtlRequest& request, const SXPaths& paths);
 
 // `notify NAME`: touches <runtime-dir>/notify/NAME so that watchers of the name wake.

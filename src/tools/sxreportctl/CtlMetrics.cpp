@@ -9,17 +9,17 @@ int SXCtlRunMetrics(const SXCtlRequest& request, SXReportingClient& client) {
   switch (result.status) {
     case SXCallStatus::kReplied:
       std::cout << SXCtlMetricsText(result.value) << std::flush;
-      return 0;
+      break;
     case SXCallStatus::kTimedOut:
       std::cerr << "status: the service sent " << result.error << "\n";  // "no reply within 5 s"
-      return 1;
+      break;
     case SXCallStatus::kRemoteError:
       std::cerr << "status: the service rejected the request: " << result.error << "\n";
-      return 2;
+      break;
     case SXCallStatus::kConnectionLost:
     case SXCallStatus::kBadReply:
+      std::cerr << "status: " << result.error << "\n";
       break;
   }
-  std::cerr << "status: " << result.error << "\n";
-  return 2;
+  return SXCtlExitFor(result.status);
 }

@@ -4,6 +4,6 @@
 #include "client/SXCtlArgs.h"
 
 // Asks `client` (connected) for the status and prints it in the Prometheus text format; --json
-// does not apply. Returns the exit status: 0 replied, 1 no reply in time, 2 connection or
-// request error (with nothing on stdout, so that a collector never reads half a scrape).
+// does not apply. Returns the exit status (SXCtlExit); nothing is on stdout unless it is 0, so
+// that a collector never reads half a scrape.
 int SXCtlRunMetrics(const SXCtlRequest& request, SXReportingClient& client);

@@ -12,8 +12,9 @@ namespace {
 struct Outcome {
   SXCallStatus status = SXCallStatus::kReplied;
   std::string error;
-  SXValue json;      // the reply as it came over the wire
-  std::string text;  // the reply for people
+  SXValue json;         // the reply as it came over the wire
+  std::string text;     // the reply for people
+  bool failed = false;  // the reply says the operation did not happen
 };
 
 std::string jsonText(const SXValue& value, int indent = -1) {
@@ -35,6 +36,14 @@ SXValue wireValue(const SXReporterIDValidity& v) {
 SXValue wireValue(const std::optional<SXError>& error) {
   if (!error) return nullptr;
   return {{"domain", error->domain}, {"code", error->code}};
+}
+
+// Whether a reply reports a failure: false, or an error instead of a delivery.
+bool failure(bool value) { return !value; }
+bool failure(const std::optional<SXError>& error) { return error.has_value(); }
+template <typename T>
+bool failure(const T&) {
+  return false;
 }
 
 std::string boolText(bool value) { return value ? "true" : "false"; }
@@ -67,6 +76,7 @@ Outcome finish(std::future<SXCallResult<T>> future, Describe describe) {
   if (result.replied()) {
     outcome.json = wireValue(result.value);
     outcome.text = describe(result.value);
+    outcome.failed = failure(result.value);
   }
   return outcome;
 }
@@ -107,25 +117,25 @@ int report(const SXCtlRequest& request, const Outcome& outcome) {
   switch (outcome.status) {
     case SXCallStatus::kReplied:
       std::cout << (request.json ? jsonText(outcome.json) : outcome.text) << "\n";
-      return 0;
+      return outcome.failed ? kSXCtlFailed : kSXCtlOK;
     case SXCallStatus::kTimedOut:
       std::cerr << name << ": the service sent no reply" << waitedText(request) << "\n";
-      return 1;
+      break;
     case SXCallStatus::kConnectionLost:
       if (name == "kill") {  // the service exits instead of replying
-        std::cerr << name << ": the service sent no reply (it closed the connection)\n";
-        return 1;
+        std::cout << (request.json ? "null" : "the service closed the connection") << "\n";
+        return kSXCtlOK;
       }
       std::cerr << name << ": " << outcome.error << "\n";
-      return 2;
+      break;
     case SXCallStatus::kRemoteError:
       std::cerr << name << ": the service rejected the request: " << outcome.error << "\n";
-      return 2;
+      break;
     case SXCallStatus::kBadReply:
       std::cerr << name << ": " << outcome.error << "\n";
-      return 2;
+      break;
   }
-  return 2;
+  return SXCtlExitFor(outcome.status);
 }
 
 }  // namespace

@@ -5,5 +5,5 @@
 #include "client/SXCtlArgs.h"
 
 // Performs the request's operation on `client` (connected) and prints the outcome. Returns the
-// exit status: 0 replied, 1 no reply in time, 2 connection or request error.
+// exit status (SXCtlExit).
 int SXCtlRunRemote(const SXCtlRequest& request, SXReportingClient& client);

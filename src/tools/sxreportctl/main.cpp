@@ -5,6 +5,7 @@
 
 #include "CtlLocal.h"
 #include "CtlRemote.h"
+#include "SXVersion.h"
 #include "client/SXCtlArgs.h"
 
 namespace {
@@ -30,14 +31,14 @@ int runChain(const std::vector<SXCtlRequest>& requests) {
       std::string error;
       if (!client->connect(&error)) {
         std::cerr << "sxreportctl: " << error << " (is sxreportingd running?)\n";
-        return 2;
+        return kSXCtlUnreachable;
       }
     }
     const int status =
         isLocal(request) ? runLocal(request, paths) : SXCtlRunRemote(request, *client);
-    if (status != 0) return status;
+    if (status != kSXCtlOK) return status;
   }
-  return 0;
+  return kSXCtlOK;
 }
 
 }  // namespace
@@ -48,17 +49,21 @@ int main(int argc, char** argv) {
     std::string error;
     if (!SXCtlParseChain(std::vector<std::string>(argv + 1, argv + argc), requests, error)) {
       std::cerr << "sxreportctl: " << error << "\n";
-      return 2;
+      return kSXCtlUsage;
     }
     for (const auto& request : requests) {
       if (request.help) {
         std::cout << SXCtlHelp(request.command);
-        return 0;
+        return kSXCtlOK;
+      }
+      if (request.version) {
+        std::cout << "sxreportctl " << kSXVersion << "\n";
+        return kSXCtlOK;
       }
     }
     return runChain(requests);
   } catch (const std::exception& e) {
     std::cerr << "sxreportctl: " << e.what() << "\n";
-    return 2;
+    return kSXCtlLocalError;
   }
 }

@@ -1,12 +1,12 @@
 #!/bin/sh
 # Installs the build into a staging root and uses it the way a system does: checks the installed
-# files and units, starts the staged daemon through socket activation, talks to it with the
-# staged sxreportctl, and builds small clients against the staged headers and library through
-# pkg-config and the CMake package. Those two builds are left out under the sanitizers, whose
-# runtime an outside compiler line does not link.
-# usage: install_test.sh BUILD_DIR SOURCE_DIR SANITIZED(0|1)
+# files, the programs' versions and the bash completion, starts the staged daemon through socket
+# activation, talks to it with the staged sxreportctl, and builds small clients against the
+# staged headers and library through pkg-config and the CMake package. Those two builds are left
+# out under the sanitizers, whose runtime an outside compiler line does not link.
+# usage: install_test.sh BUILD_DIR SOURCE_DIR SANITIZED(0|1) VERSION
 set -eu
-build=$1 src=$2 sanitized=$3
+build=$1 src=$2 sanitized=$3 version=$4
 here=$src/tests/e2e/install
 work=$(mktemp -d /tmp/sxr-install.XXXXXX)
 stage=$work/stage/usr
@@ -40,32 +40,63 @@ cmake --install "$build" --prefix "$stage" > "$work/install.log" 2>&1 || fail "c
 echo "== installed files"
 for file in sbin/sxreportingd bin/sxreportctl include/sxreporting/client.h \
         include/sxreporting/types.h lib/systemd/system/sxreportingd.socket \
-        lib/systemd/system/sxreportingd.service lib/sysusers.d/sxreportingd.conf; do
+        lib/systemd/system/sxreportingd.service lib/sysusers.d/sxreportingd.conf \
+        lib/tmpfiles.d/sxreportingd.conf share/bash-completion/completions/sxreportctl \
+        lib/sxreporting-bench/sxreport-bench share/doc/sxreportingd/copyright \
+        share/doc/libsxreporting0/changelog.Debian.gz; do
     [ -e "$stage/$file" ] || fail "$file is not installed"
 done
+[ ! -e "$stage/bin/sxreport-bench" ] || fail "the benchmark is on PATH"
+# The benchmark spawns the daemon beside it by default: a link to the installed one.
+[ "$(readlink -f "$stage/lib/sxreporting-bench/sxreportingd")" = "$(readlink -f "$stage/sbin/sxreportingd")" ] ||
+    fail "the benchmark's daemon link does not lead to the installed daemon"
 library=$(find "$stage" -name 'libsxreporting.so.*.*.*')
 [ -n "$library" ] || fail "libsxreporting.so.X.Y.Z is not installed"
 libdir=$(dirname "$library")
+multiarch=$(gcc -print-multiarch 2>/dev/null || true)
+[ -z "$multiarch" ] || [ "$libdir" = "$stage/lib/$multiarch" ] ||
+    fail "the library is in $libdir, not in the multiarch lib/$multiarch"
 [ -L "$libdir/libsxreporting.so" ] || fail "no libsxreporting.so development link"
 readelf -d "$library" | grep -q 'SONAME.*\[libsxreporting\.so\.0\]' || fail "SONAME is not libsxreporting.so.0"
 [ -f "$libdir/pkgconfig/sxreporting.pc" ] || fail "sxreporting.pc is not installed"
 [ -f "$libdir/cmake/SXReporting/SXReportingConfig.cmake" ] || fail "SXReportingConfig.cmake missing"
 if [ -f "$build/man/sxreportingd.8" ]; then
-    [ -f "$stage/share/man/man8/sxreportingd.8" ] || fail "sxreportingd.8 is not installed"
-    [ -f "$stage/share/man/man1/sxreportctl.1" ] || fail "sxreportctl.1 is not installed"
+    [ -f "$stage/share/man/man8/sxreportingd.8.gz" ] || fail "sxreportingd.8.gz is not installed"
+    [ -f "$stage/share/man/man1/sxreportctl.1.gz" ] || fail "sxreportctl.1.gz is not installed"
 fi
 grep -q "^ExecStart=$stage/sbin/sxreportingd " "$stage/lib/systemd/system/sxreportingd.service" ||
     fail "the service does not start the installed daemon"
 
-if command -v systemd-analyze >/dev/null 2>&1; then
-    echo "== systemd-analyze verify"
-    # Only the units' own lines count: the machine may lack the user or a running manager.
-    (cd "$stage/lib/systemd/system" && systemd-analyze verify --man=no \
-        ./sxreportingd.socket ./sxreportingd.service) > "$work/verify.log" 2>&1 || true
-    if grep -E 'sxreportingd\.(socket|service):[0-9]+:' "$work/verify.log"; then
-        fail "systemd-analyze verify complains about the units"
-    fi
-fi
+echo "== --version"
+for program in sbin/sxreportingd bin/sxreportctl lib/sxreporting-bench/sxreport-bench; do
+    [ "$("$stage/$program" --version)" = "$(basename "$program") $version" ] ||
+        fail "$program --version does not print $(basename "$program") $version"
+done
+
+echo "== bash completion"
+# The candidates bash offers after the words given; the last word is the one being completed.
+complete_words() {
+    bash -c '. "$1"; shift; COMP_WORDS=("$@"); COMP_CWORD=$(($# - 1)); _sxreportctl
+        printf "%s\n" "${COMPREPLY[@]}"' completion \
+        "$stage/share/bash-completion/completions/sxreportctl" sxreportctl "$@" | sort | tr '\n' ' '
+}
+expect_completion() {  # EXPECTED WORDS...
+    expected=$1
+    shift
+    got=$(complete_words "$@")
+    [ "$got" = "$expected " ] || fail "completing '$*': '$got', not '$expected'"
+}
+expect_completion "defaults destroy" de
+expect_completion "delete read then write" defaults ""
+expect_completion "send set-type start status stop" --json create 42 "then" s
+expect_completion "--broadcast" send --b
+expect_completion "--state-dir" --socket /x/y --st
+expect_completion "kill" help k
+expect_completion "$stage/lib/systemd/system/sxreportingd.service" --state-dir "$stage/lib/systemd/system/sxreportingd.se"
+for command in $("$stage/bin/sxreportctl" --help | sed -n '/^Commands:/,/^$/p' | sed -n 's/^  \([a-z][a-z-]*\).*/\1/p'); do
+    complete_words "" | grep -q -w -e "$command" || fail "the completion does not offer $command"
+done
+
 if command -v systemd-sysusers >/dev/null 2>&1 && [ "$(id -u)" = 0 ]; then
     echo "== systemd-sysusers --root"
     mkdir -p "$work/root/etc"
@@ -73,6 +104,17 @@ if command -v systemd-sysusers >/dev/null 2>&1 && [ "$(id -u)" = 0 ]; then
         > "$work/sysusers.log" 2>&1 || fail "systemd-sysusers"
     grep -q '^sxreportingd:' "$work/root/etc/passwd" || fail "no user sxreportingd"
     grep -q '^sxreporting:' "$work/root/etc/group" || fail "no group sxreporting"
+
+    echo "== systemd-tmpfiles --root"
+    systemd-tmpfiles --root="$work/root" --create "$stage/lib/tmpfiles.d/sxreportingd.conf" \
+        > "$work/tmpfiles.log" 2>&1 || fail "systemd-tmpfiles"
+    id_of() { awk -F: -v name="$2" '$1 == name { print $3 }' "$work/root/etc/$1"; }
+    # The socket's directory reachable by the clients' group, the configuration by the service's.
+    [ "$(stat -c '%a %u %g' "$work/root/run/sxreportingd")" = \
+        "750 $(id_of passwd sxreportingd) $(id_of group sxreporting)" ] ||
+        fail "/run/sxreportingd is not sxreportingd:sxreporting 0750"
+    [ "$(stat -c '%a %u %g' "$work/root/etc/sxreportingd")" = "750 0 $(id_of group sxreportingd)" ] ||
+        fail "/etc/sxreportingd is not root:sxreportingd 0750"
 fi
 
 echo "== socket activation"
