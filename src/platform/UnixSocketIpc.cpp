@@ -80,13 +80,6 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     }
   }
 
-  // I/O thread: the pending read, if any, ends (cancel would end pending writes too); the
-  // client's further writes fail.
-  void stopReading() {
-    std::error_code ignored;
-    socket_.shutdown(asio::socket_base::shutdown_receive, ignored);
-  }
-
   // I/O thread: ends the connection; `interrupted` when it ended badly.
   void end(bool interrupted) {
     if (ended_) return;
@@ -111,8 +104,8 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     char* buffer = decoder_.prepare(size);
     socket_.async_read_some(asio::buffer(buffer, size),
                             [self = shared_from_this()](const std::error_code& ec, size_t n) {
-                              // A read ended by stopReading() leaves the connection open
-                              // for the replies still to come.
+                              // Once the listener stops reading, a client that goes away
+                              // is noticed when the connections are closed.
                               bool stopped = !self->ended_ && !self->listener_.reading();
                               if (ec && !stopped) {
                                 self->end(ec != asio::error::eof);
@@ -464,10 +457,11 @@ void SXUnixSocketListener::stop() {
 }
 
 void SXUnixSocketListener::stopReading() {
+  // A read in progress completes when its bytes come; the requests they finish are still
+  // handed on, and no further read is started.
   reading_ = false;
   std::error_code ignored;
   acceptor_.close(ignored);
-  for (const auto& connection : connections_) connection->stopReading();
 }
 
 size_t SXUnixSocketListener::closeConnections() {

@@ -72,8 +72,8 @@ class SXUnixSocketListener final : public SXIpcListener {
 
   // The I/O thread's executor, for the daemon's signals and timers.
   asio::io_context::executor_type executor() { return io_.get_executor(); }
-  // I/O thread, for a stop: accepts no more connections and reads no more requests; the
-  // requests already received are still handled and answered.
+  // I/O thread, for a stop: accepts no more connections and starts no more reads; the
+  // requests already received are still handled and answered, and clients' writes wait.
   void stopReading();
   // I/O thread: ends every connection (their invalidation handlers run); returns how many.
   size_t closeConnections();

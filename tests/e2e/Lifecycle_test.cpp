@@ -140,7 +140,9 @@ TEST(LifecycleEndToEnd, AStopThatCannotDrainEndsAtItsLimitOrAtASecondSignal) {
     }));
     ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
     ASSERT_TRUE(daemon.waitForLog("stopping on SIGTERM"));
-    if (secondSignal) ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+    if (secondSignal) {
+      ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+    }
     EXPECT_EQ(daemon.waitForExit(), 1);
     EXPECT_EQ(daemon.countInLog(secondSignal ? "a second SIGTERM came during the stop drain"
                                              : "the stop drain took longer than its limit"),

@@ -149,6 +149,7 @@ TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   SendStandalone(*client, 1, 2);
+  ASSERT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
   EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
 
   daemon.writeConfig("fernreporting.json", Exporting(receiver).fernConfig);
@@ -163,7 +164,7 @@ TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
   ASSERT_TRUE(daemon.waitForLog("otlp-http export stopped")) << daemon.log();
   SendStandalone(*client, 3, 1);
-  EXPECT_EQ(SpooledIds(daemon).size(), 3u);
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 3).size(), 3u);
   EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
   EXPECT_EQ(Deliveries(receiver).size(), 2u);
 }

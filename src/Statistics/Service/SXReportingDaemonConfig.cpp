@@ -98,7 +98,10 @@ std::optional<SXReportingLimits> SXReportingLimitsSection::parse(const SXValue& 
             key);
       return std::nullopt;
     }
-    if (!value.is_number_unsigned() || value.get<uint64_t>() == 0) {
+    bool positive = value.is_number_unsigned()
+                        ? value.get<uint64_t>() > 0
+                        : value.is_number_integer() && value.get<int64_t>() > 0;
+    if (!positive) {
       SXLOG(log, nullptr, SXLogLevel::kError,
             "\"limits\": %@ is %@, not a positive integer; the limits stay", key, value);
       return std::nullopt;

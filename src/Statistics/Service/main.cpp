@@ -438,8 +438,8 @@ std::string drain(Service& s) {
       connections, static_cast<unsigned long long>(sessions),
       static_cast<unsigned long long>(inflight));
   if (uint64_t held = s.listener.inflightBytes()) {
-    drained += SXFormat("; %llu bytes of standalone sends still waiting for their delay are "
-                        "dropped", static_cast<unsigned long long>(held));
+    drained += SXFormat("; %llu payload bytes still waiting for a delay (alarm sends) are dropped",
+                        static_cast<unsigned long long>(held));
   }
   if (s.exporter.active()) {
     drained += SXFormat("; %llu messages wait in the spool for the next export",
