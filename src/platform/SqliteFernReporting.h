@@ -9,10 +9,10 @@
 // replaced).
 //
 // The backends come from the JSON file `configPath` (`{"backends": ["spool"]}`), read at
-// construction and by reloadBackends(): an absent file, or one without "backends", means ["spool"]; an empty list
-// means no backends; a file that cannot be read or parsed logs an error line and means
-// ["spool"]. Every row is stored whatever the backends are; the list is what
-// startConfiguration() reports, or nothing (std::nullopt) when it is empty.
+// construction and by reloadBackends(): an absent file, or one without "backends", means
+// ["spool"]; an empty list means no backends; a file that cannot be read or parsed logs an
+// error line and means ["spool"]. Every row is stored whatever the backends are; the list is
+// what startConfiguration() reports, or nothing (std::nullopt) when it is empty.
 //
 // All methods may be called from any thread. Completions run on a thread of this adapter,
 // never on the caller's, in the order they were asked for. Sends are stored synchronously: a
