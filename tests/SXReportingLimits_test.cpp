@@ -7,6 +7,7 @@
 
 #include <thread>
 
+#include "SXReportingDaemonConfig.h"
 #include "SXReportingServiceDelegate.h"
 #include "fakes/FakeIpc.h"
 #include "support/TestEnvironment.h"
@@ -286,4 +287,41 @@ TEST(SXReportingLimitsConnections, AProcessBeyondItsConnectionLimitIsRefusedUnti
   first->end(false);
   s.t.drain();
   EXPECT_TRUE(s.connect(10)->resumed());
+}
+
+// The "limits" section of sxreportingd.json over the limits of the command line: a load takes
+// what the file says except what the flags fixed, a reload keeps the listener's limits until the
+// next start, and a bad section changes nothing.
+TEST(SXReportingLimitsFile, SectionAppliesOverTheFlagsAndABadOneChangesNothing) {
+  TestEnvironment t;
+  SXReportingLimits flags;
+  flags.maxReporterIDs = 3;
+  auto environment = limitedEnvironment(t, flags);
+  SXReportingLimitsSection section(environment, {"max-reporter-ids"});
+  auto limits = [&] { return environment->limits(); };
+
+  ASSERT_TRUE(section.read({{"limits",
+                             {{"max-payload-bytes", 100},
+                              {"max-reporter-ids", 50},
+                              {"max-inflight-bytes", 4096}}}}));
+  EXPECT_EQ(limits().maxPayloadBytes, 100u);
+  EXPECT_EQ(limits().maxReporterIDs, 3u);  // the flag wins
+  EXPECT_EQ(limits().maxInflightBytes, 4096u);  // at start, the listener takes it
+
+  ASSERT_TRUE(section.read({{"limits", {{"max-inflight-bytes", 8192}}}}));
+  EXPECT_EQ(limits().maxPayloadBytes, SXReportingLimits{}.maxPayloadBytes);  // key gone: default
+  EXPECT_EQ(limits().maxInflightBytes, 4096u);  // until the next start
+  EXPECT_EQ(t.log->countContaining("limit max-inflight-bytes changed to 8192; it applies at the "
+                                   "next start"),
+            1u);
+
+  for (const SXValue& bad : {SXValue{{"limits", 5}},
+                             SXValue{{"limits", {{"max-payload", 5}}}},
+                             SXValue{{"limits", {{"max-payload-bytes", 0}}}},
+                             SXValue{{"limits", {{"max-payload-bytes", -5}}}},
+                             SXValue{{"limits", {{"max-payload-bytes", 5.5}}}}}) {
+    EXPECT_FALSE(section.read(bad)) << bad;
+    EXPECT_EQ(limits().maxPayloadBytes, SXReportingLimits{}.maxPayloadBytes) << bad;
+  }
+  EXPECT_TRUE(section.read(SXValue::object()));  // no section: the flags and defaults
 }

@@ -1,7 +1,8 @@
 #include "SXReportingEnvironment.h"
 
 SXReportingEnvironment::SXReportingEnvironment(SXPlatform platform, SXReportingLimits limits)
-    : platform_(std::move(platform)), limits_(limits) {
+    : platform_(std::move(platform)),
+      limits_(std::make_shared<const SXReportingLimits>(limits)) {
   if (platform_.joulebook) {
     platform_.joulebook =
         std::make_shared<SXReportingCountingJoulebook>(platform_.joulebook, counters_);

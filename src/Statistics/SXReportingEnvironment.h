@@ -56,14 +56,18 @@ class SXReportingEnvironment {
   double backendWaitSeconds() const { return backendWaitSeconds_.load(); }
   void setBackendWaitSeconds(double seconds) { backendWaitSeconds_.store(seconds); }
 
-  // Fixed at construction, so any thread may read them.
-  const SXReportingLimits& limits() const { return limits_; }
+  // A copy of the limits in force, so that one request sees one consistent set while a reload
+  // replaces them. Any thread.
+  SXReportingLimits limits() const { return *limits_.load(); }
+  void setLimits(const SXReportingLimits& limits) {
+    limits_.store(std::make_shared<const SXReportingLimits>(limits));
+  }
   SXReportingCounters& counters() const { return *counters_; }
 
  private:
   const std::shared_ptr<SXReportingCounters> counters_ = std::make_shared<SXReportingCounters>();
   SXPlatform platform_;
-  const SXReportingLimits limits_;
+  std::atomic<std::shared_ptr<const SXReportingLimits>> limits_;
   // Scope handles are read from any thread; a handle, once stored, lives as long as this.
   std::atomic<std::shared_ptr<const SXLogScope>> serviceScope_;
   std::atomic<std::shared_ptr<const SXLogScope>> sessionScope_;

@@ -165,11 +165,17 @@ void SXElasticPool::work() {
     if (tasks_.empty()) return;  // stopping, and nothing left to run
     SXTask task = std::move(tasks_.front());
     tasks_.pop_front();
+    ++begun_;
     lock.unlock();
     task();
     task = nullptr;  // release what the task captured before we sleep again
     lock.lock();
   }
+}
+
+SXElasticPool::Activity SXElasticPool::activity() const {
+  std::lock_guard lock(mutex_);
+  return {tasks_.size() + threads_.size() - idle_, begun_};
 }
 
 SXAsioDispatch::SXAsioDispatch()
@@ -196,6 +202,12 @@ std::shared_ptr<SXWorkQueue> SXAsioDispatch::createSerialQueue(std::string label
     return std::make_shared<ThreadQueue>(std::move(label));
   }
   return std::make_shared<PoolSerialQueue>(std::move(label), utilityPool_);
+}
+
+SXElasticPool::Activity SXAsioDispatch::activity() const {
+  auto utility = utilityPool_.activity();
+  auto low = lowPriorityPool_->activity();
+  return {utility.busy + low.busy, utility.begun + low.begun};
 }
 
 std::shared_ptr<SXWorkQueue> SXAsioDispatch::lowPriorityConcurrentQueue() {

@@ -27,17 +27,26 @@ class SXElasticPool {
 
   void submit(SXTask task);
 
+  // Tasks queued or running, and tasks begun since the start. A stop waits for the pools to
+  // stay idle across a pass of the server queue.
+  struct Activity {
+    size_t busy = 0;
+    uint64_t begun = 0;
+  };
+  Activity activity() const;
+
  private:
   void work();
 
   const std::string threadName_;
   const int niceness_;
   const size_t maxThreads_;
-  std::mutex mutex_;
+  mutable std::mutex mutex_;
   std::condition_variable wake_;
   std::deque<SXTask> tasks_;          // GUARDED_BY(mutex_)
   std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
   size_t idle_ = 0;                   // GUARDED_BY(mutex_)
+  uint64_t begun_ = 0;                // GUARDED_BY(mutex_)
   bool stopping_ = false;             // GUARDED_BY(mutex_)
 };
 
@@ -51,6 +60,10 @@ class SXAsioDispatch final : public SXDispatch {
   std::shared_ptr<SXWorkQueue> lowPriorityConcurrentQueue() override;
   void after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQueue> queue,
              SXTask task) override;
+
+  // Both pools together (the utility queues and the low-priority queue). Tasks still waiting
+  // for their delay are not counted.
+  SXElasticPool::Activity activity() const;
 
  private:
   SXElasticPool utilityPool_;

@@ -1,6 +1,7 @@
 // Device properties ("InternalBuild", "DeviceClassNumber"). May be called from any thread.
 #pragma once
 
+#include <mutex>
 #include <optional>
 #include <string>
 
@@ -13,13 +14,17 @@ class SXDeviceProperties {
   virtual std::optional<SXValue> property(const std::string& key) const = 0;
 };
 
-// Production: the JSON object in `<config-dir>/device.json`, read once at construction.
-// An absent or unreadable file answers nothing for every key.
+// Production: the JSON object in `<config-dir>/device.json`, read at construction and again
+// by reload(). An absent or unreadable file answers nothing for every key.
 class SXJsonDeviceProperties final : public SXDeviceProperties {
  public:
-  explicit SXJsonDeviceProperties(const std::string& path);
+  explicit SXJsonDeviceProperties(std::string path);
   std::optional<SXValue> property(const std::string& key) const override;
+  // Reads the file again; returns whether the answers changed. Any thread.
+  bool reload();
 
  private:
-  SXValue properties_;
+  const std::string path_;
+  mutable std::mutex mutex_;
+  SXValue properties_;  // GUARDED_BY(mutex_)
 };

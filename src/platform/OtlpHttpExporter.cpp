@@ -261,14 +261,14 @@ void SXOtlpHttpExporter::start() {
   thread_ = std::thread([this] { run(); });
 }
 
-void SXOtlpHttpExporter::stop() {
+void SXOtlpHttpExporter::stop(bool cancelPost) {
   if (!thread_.joinable()) return;
   {
     std::lock_guard lock(mutex_);
     stopping_ = true;
   }
   wake_.notify_all();
-  http_->cancel();
+  if (cancelPost) http_->cancel();
   thread_.join();
 }
 

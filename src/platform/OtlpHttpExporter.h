@@ -95,8 +95,9 @@ class SXOtlpHttpExporter {
   // Starts the thread "sxr-otlp", which runs passes until stop(). Only the first call starts.
   void start();
   // Cancels a POST in progress (and every later one) and joins the thread. The cursor stays
-  // where it is.
-  void stop();
+  // where it is. With `cancelPost` false, a POST in progress is answered first (and the cursor
+  // moves); its timeout bounds the wait.
+  void stop(bool cancelPost = true);
 
   // Messages beyond the cursor. On failure returns the last count it could read (0 at first).
   uint64_t backlog() const;

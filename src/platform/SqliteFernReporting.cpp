@@ -90,7 +90,14 @@ class SXSqliteFernReporting::Spool {
   }
 
   void post(std::function<void()> task) { completions_.post(std::move(task)); }
-  const std::vector<std::string>& backends() const { return backends_; }
+  std::vector<std::string> backends() const {
+    std::lock_guard lock(backendsMutex_);
+    return backends_;
+  }
+  void setBackends(std::vector<std::string> backends) {
+    std::lock_guard lock(backendsMutex_);
+    backends_ = std::move(backends);
+  }
   uint64_t writeErrors() const { return writeErrors_.load(); }
   const std::shared_ptr<SXLogFacility>& log() const { return log_; }
 
@@ -203,7 +210,8 @@ class SXSqliteFernReporting::Spool {
   }
 
   const std::string path_;
-  const std::vector<std::string> backends_;
+  mutable std::mutex backendsMutex_;
+  std::vector<std::string> backends_;  // GUARDED_BY(backendsMutex_)
   const std::shared_ptr<SXLogFacility> log_;
   const std::chrono::milliseconds busyTimeout_;
   std::mutex mutex_;
@@ -283,9 +291,10 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
 
 SXSqliteFernReporting::SXSqliteFernReporting(std::string dbPath, std::string configPath,
                                              std::shared_ptr<SXLogFacility> log,
-                                             std::chrono::milliseconds busyTimeout) {
+                                             std::chrono::milliseconds busyTimeout)
+    : configPath_(std::move(configPath)) {
   log = SXLogOrDiscard(std::move(log));
-  std::vector<std::string> backends = loadBackends(configPath, log.get());
+  std::vector<std::string> backends = loadBackends(configPath_, log.get());
   spool_ = std::make_shared<Spool>(std::move(dbPath), std::move(backends), log, busyTimeout);
   std::string error;
   if (!spool_->ensureOpen(error)) SXLOG(*log, nullptr, SXLogLevel::kError, "%s", error);
@@ -293,8 +302,13 @@ SXSqliteFernReporting::SXSqliteFernReporting(std::string dbPath, std::string con
 
 SXSqliteFernReporting::~SXSqliteFernReporting() = default;
 
-const std::vector<std::string>& SXSqliteFernReporting::backends() const {
-  return spool_->backends();
+std::vector<std::string> SXSqliteFernReporting::backends() const { return spool_->backends(); }
+
+bool SXSqliteFernReporting::reloadBackends() {
+  auto backends = loadBackends(configPath_, spool_->log().get());
+  if (backends == spool_->backends()) return false;
+  spool_->setBackends(std::move(backends));
+  return true;
 }
 
 uint64_t SXSqliteFernReporting::writeErrors() const { return spool_->writeErrors(); }

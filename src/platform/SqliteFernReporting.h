@@ -8,11 +8,11 @@
 // Times are seconds since the Unix epoch; dictionaries are compact JSON (invalid UTF-8
 // replaced).
 //
-// The backends come from the JSON file `configPath` (`{"backends": ["spool"]}`), read once at
-// construction: an absent file, or one without "backends", means ["spool"]; an empty list
-// means no backends; a file that cannot be read or parsed logs an error line and means
-// ["spool"]. Every row is stored whatever the backends are; the list is what
-// startConfiguration() reports, or nothing (std::nullopt) when it is empty.
+// The backends come from the JSON file `configPath` (`{"backends": ["spool"]}`), read at
+// construction and by reloadBackends(): an absent file, or one without "backends", means
+// ["spool"]; an empty list means no backends; a file that cannot be read or parsed logs an
+// error line and means ["spool"]. Every row is stored whatever the backends are; the list is
+// what startConfiguration() reports, or nothing (std::nullopt) when it is empty.
 //
 // All methods may be called from any thread. Completions run on a thread of this adapter,
 // never on the caller's, in the order they were asked for. Sends are stored synchronously: a
@@ -57,7 +57,10 @@ class SXSqliteFernReporting final : public FernReporting {
                       std::optional<FernError>& error) override;
 
   // The configured backends; empty when there are none.
-  const std::vector<std::string>& backends() const;
+  std::vector<std::string> backends() const;
+  // Reads the backends file again; sessions started from now on get the new list. Returns
+  // whether it changed.
+  bool reloadBackends();
 
   // Sessions, messages and flushes that could not be stored since start (the store failed to
   // open or the insert failed). Any thread.
@@ -69,5 +72,6 @@ class SXSqliteFernReporting final : public FernReporting {
  private:
   class Spool;
   class Session;
+  const std::string configPath_;
   std::shared_ptr<Spool> spool_;
 };

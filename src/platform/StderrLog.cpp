@@ -1,9 +1,51 @@
 #include "platform/StderrLog.h"
 
+#include <sys/stat.h>
+#include <sys/uio.h>
+#include <systemd/sd-journal.h>
+#include <unistd.h>
+
 #include <charconv>
 #include <cstdio>
+#include <cstdlib>
+#include <vector>
 
-SXStderrLog::SXStderrLog(std::string_view levels) { parseLevels(levels, levels_); }
+namespace {
+
+int SyslogPriority(SXLogLevel level) {
+  switch (level) {
+    case SXLogLevel::kInfo:
+      return 6;
+    case SXLogLevel::kError:
+      return 3;
+    case SXLogLevel::kDebug:
+      return 7;
+    case SXLogLevel::kDefault:
+      break;
+  }
+  return 5;
+}
+
+// Whether JOURNAL_STREAM ("<device>:<inode>") names the file open on `fd`.
+bool JournalAttached(int fd) {
+  const char* stream = std::getenv("JOURNAL_STREAM");
+  struct stat st {};
+  if (!stream || ::fstat(fd, &st) != 0) return false;
+  unsigned long long device = 0, inode = 0;
+  return std::sscanf(stream, "%llu:%llu", &device, &inode) == 2 && device == st.st_dev &&
+         inode == st.st_ino;
+}
+
+}  // namespace
+
+SXStderrLog::SXStderrLog(std::string_view levels, Output output) : output_(output) {
+  parseLevels(levels, levels_);
+}
+
+SXStderrLog::Output SXStderrLog::outputFor(int fd) {
+  if (JournalAttached(fd)) return Output::kJournal;
+  return ::isatty(fd) ? Output::kPlain : Output::kPrefixed;
+}
 
 bool SXStderrLog::parseLevels(std::string_view text, std::map<std::string, int>& out) {
   bool ok = true;
@@ -37,24 +79,25 @@ bool SXStderrLog::isEnabled(const SXLogScope* scope, int level) const {
   return it != levels_.end() && level <= it->second;
 }
 
-void SXStderrLog::write(const SXLogScope*, SXLogLevel level, std::string_view line) {
-  const char* priority = "<5>";
-  switch (level) {
-    case SXLogLevel::kDefault:
-      priority = "<5>";
-      break;
-    case SXLogLevel::kInfo:
-      priority = "<6>";
-      break;
-    case SXLogLevel::kError:
-      priority = "<3>";
-      break;
-    case SXLogLevel::kDebug:
-      priority = "<7>";
-      break;
+bool SXStderrLog::writeToJournal(const SXLogScope* scope, int priority, std::string_view line) {
+  std::vector<std::string> fields = {"MESSAGE=" + std::string(line),
+                                     "PRIORITY=" + std::to_string(priority),
+                                     "SYSLOG_IDENTIFIER=sxreportingd"};
+  if (scope) {
+    fields.push_back("SXR_SCOPE=" + scope->shortName);
+    fields.push_back("SXR_SUBSYSTEM=" + scope->subsystem);
+    fields.push_back("SXR_CATEGORY=" + scope->category);
   }
+  std::vector<iovec> vector;
+  for (auto& field : fields) vector.push_back({field.data(), field.size()});
+  return sd_journal_sendv(vector.data(), static_cast<int>(vector.size())) >= 0;
+}
+
+void SXStderrLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view line) {
+  int priority = SyslogPriority(level);
+  if (output_ == Output::kJournal && writeToJournal(scope, priority, line)) return;
   std::lock_guard lock(writeMutex_);
-  std::fputs(priority, stderr);
+  if (output_ != Output::kPlain) std::fprintf(stderr, "<%d>", priority);
   std::fwrite(line.data(), 1, line.size(), stderr);
   std::fputc('\n', stderr);
   std::fflush(stderr);

@@ -2,12 +2,12 @@
 
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
 #include <asio/write.hpp>
-#include <cstdlib>
 
 #include "platform/DiscardLog.h"
 #include "platform/FileSystem.h"
@@ -104,7 +104,10 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     char* buffer = decoder_.prepare(size);
     socket_.async_read_some(asio::buffer(buffer, size),
                             [self = shared_from_this()](const std::error_code& ec, size_t n) {
-                              if (ec) {
+                              // Once the listener stops reading, a client that goes away
+                              // is noticed when the connections are closed.
+                              bool stopped = !self->ended_ && !self->listener_.reading();
+                              if (ec && !stopped) {
                                 self->end(ec != asio::error::eof);
                                 return;
                               }
@@ -117,6 +120,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   // How much may be read now. While the pool is full only a connection that holds less than
   // the floor reads, and only up to it.
   size_t readAllowance() const {
+    if (!listener_.reading()) return 0;
     if (!budget_->poolOverLimit()) return kReadSize;
     uint64_t held = budget_->held() + bufferedCharged_;
     uint64_t floor = budget_->floor();
@@ -385,17 +389,24 @@ void SXUnixSocketListener::resumePaused() {
 
 bool SXUnixSocketListener::open(std::string& error) {
   std::error_code ec;
-  const char* listenPid = std::getenv("LISTEN_PID");
-  const char* listenFds = std::getenv("LISTEN_FDS");
-  if (listenPid && listenFds && std::atoi(listenPid) == ::getpid() && std::atoi(listenFds) >= 1) {
-    acceptor_.assign(asio::local::stream_protocol(), 3, ec);
+  // Clears LISTEN_FDS and LISTEN_PID, so that nothing this process starts takes them as its own.
+  int passed = sd_listen_fds(1);
+  if (passed < 0) {
+    error = SXPosixError("sd_listen_fds", -passed);
+    return false;
+  }
+  if (passed > 0) {
+    if (passed != 1 || sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) <= 0) {
+      error = "the service manager passed " + std::to_string(passed) +
+              " descriptors; expected one listening Unix stream socket";
+      return false;
+    }
+    acceptor_.assign(asio::local::stream_protocol(), SD_LISTEN_FDS_START, ec);
     if (ec) {
-      error = "cannot adopt the socket passed as fd 3: " + ec.message();
+      error = "cannot adopt the socket passed by the service manager: " + ec.message();
       return false;
     }
     activated_ = true;
-    ::unsetenv("LISTEN_PID");
-    ::unsetenv("LISTEN_FDS");
     return true;
   }
   ::unlink(options_.socketPath.c_str());  // a stale socket of an earlier run
@@ -443,6 +454,20 @@ void SXUnixSocketListener::stop() {
     for (const auto& connection : live) connection->end(false);
     io_.stop();
   });
+}
+
+void SXUnixSocketListener::stopReading() {
+  // A read in progress completes when its bytes come; the requests they finish are still
+  // handed on, and no further read is started.
+  reading_ = false;
+  std::error_code ignored;
+  acceptor_.close(ignored);
+}
+
+size_t SXUnixSocketListener::closeConnections() {
+  auto live = connections_;
+  for (const auto& connection : live) connection->end(false);
+  return live.size();
 }
 
 void SXUnixSocketListener::connectionClosed(

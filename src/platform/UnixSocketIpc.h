@@ -1,10 +1,10 @@
 // Production IPC: a Unix stream socket carrying MessagePack-RPC.
 //
-// The listener binds the socket path (or adopts a socket passed by the service manager as fd 3
-// through LISTEN_FDS/LISTEN_PID) and serves every connection on the thread that calls
-// `resume`; that thread is "the connection's thread" for requests and handlers. Replies may be
-// sent from any thread: they are encoded at once, appended to the connection's output under a
-// lock, and written by the I/O thread in batches.
+// The listener binds the socket path (or adopts the one listening Unix stream socket that the
+// service manager passed through LISTEN_FDS/LISTEN_PID) and serves every connection on the
+// thread that calls `resume`; that thread is "the connection's thread" for requests and
+// handlers. Replies may be sent from any thread: they are encoded at once, appended to the
+// connection's output under a lock, and written by the I/O thread in batches.
 //
 // A request that is not a well-formed MessagePack-RPC request but carries a msgid gets an
 // error response; bytes that are not MessagePack, a message larger than the limit or nested
@@ -70,6 +70,15 @@ class SXUnixSocketListener final : public SXIpcListener {
   // Ends `resume` from any thread; open connections are closed.
   void stop();
 
+  // The I/O thread's executor, for the daemon's signals and timers.
+  asio::io_context::executor_type executor() { return io_.get_executor(); }
+  // I/O thread, for a stop: accepts no more connections and starts no more reads; the
+  // requests already received are still handled and answered, and clients' writes wait.
+  void stopReading();
+  // I/O thread: ends every connection (their invalidation handlers run); returns how many.
+  size_t closeConnections();
+  bool reading() const { return reading_; }
+
   // How many times a connection stopped reading because of back-pressure. Any thread.
   uint64_t backpressurePauses() const { return pauses_.load(std::memory_order_relaxed); }
 
@@ -100,6 +109,7 @@ class SXUnixSocketListener final : public SXIpcListener {
   asio::local::stream_protocol::acceptor acceptor_;
   std::shared_ptr<SXIpcListenerDelegate> delegate_;
   bool activated_ = false;
+  bool reading_ = true;  // I/O thread only
   std::atomic<uint64_t> pauses_{0};
   std::atomic<uint64_t> timeouts_{0};
   std::shared_ptr<SXByteBudget> pool_;

@@ -113,3 +113,22 @@ TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
   EXPECT_LE(event["seconds"].get<double>(), lifetime + 0.5);
   EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=sxreportctl"));
 }
+
+// The service manager passes the listening socket: exactly one Unix stream socket is served,
+// anything else is a clear error at start.
+TEST(ConnectionEndToEnd, SocketActivationTakesOnePassedListeningSocket) {
+  TestDaemon::Options options;
+  options.activationSockets = 1;
+  TestDaemon daemon(options);
+  EXPECT_EQ(daemon.countInLog("(socket activated)"), 1u) << daemon.log();
+  auto client = daemon.client();
+  EXPECT_TRUE(replied(client->createReportingSession(5)));
+
+  options.activationSockets = 2;
+  options.waitForReady = false;
+  TestDaemon refused(options);
+  EXPECT_EQ(refused.waitForExit(), 1);
+  EXPECT_EQ(refused.countInLog("passed 2 descriptors; expected one listening Unix stream socket"),
+            1u)
+      << refused.log();
+}

@@ -157,54 +157,66 @@ constexpr int64_t kPoolFloorBytes = 16 * 1024;
 
 void PrintTo(const FloodKind& kind, std::ostream* out) { *out << kind.name; }
 
+TestDaemon::Options smallBudgets() {
+  TestDaemon::Options options;
+  options.extraArgs = {"--max-connection-bytes", std::to_string(kConnectionBytes),
+                       "--max-inflight-bytes", std::to_string(kInflightBytes)};
+  return options;
+}
+
+constexpr int kFloodClients = 4;
+// What the budgets hold at most: answered messages that may not be stored yet.
+constexpr size_t kBound = (kInflightBytes + kPoolFloorBytes * kFloodClients) / kMinChargePerMessage;
+
+// Clients of `kind` flooding `daemon`, once several times what the budgets hold has been
+// answered, so that the budgets are full and the stores lag.
+std::unique_ptr<TestFlood> fullFlood(const TestDaemon& daemon, const FloodKind& kind) {
+  std::vector<TestFlood::Sender> senders;
+  for (int k = 0; k < kFloodClients; ++k) {
+    auto client = daemon.client();
+    int64_t reporter = 100 + k;
+    EXPECT_TRUE(replied(client->createReportingSession(reporter)));
+    if (kind.started) {
+      client->startReportingSessionForID(
+          reporter, [](SXCallResult<bool>) {}, kSXWaitForever);
+    } else {
+      EXPECT_TRUE(replied(client->setServiceType(2, reporter)));  // telephony: sent at once
+    }
+    // Handled after the start: every broadcast reaches every session.
+    EXPECT_EQ(replied(client->reporterID(reporter)).reporterID, reporter);
+    std::optional<std::vector<int64_t>> to;
+    if (!kind.broadcast) to = std::vector<int64_t>{reporter};
+    senders.push_back({std::move(client), std::move(to)});
+  }
+  // A window wider than a connection's budget, so that the budget is what holds a client back.
+  auto flood =
+      std::make_unique<TestFlood>(std::move(senders), 2 * kConnectionBytes / kMinChargePerMessage);
+  EXPECT_TRUE(waitUntil([&] { return flood->acknowledgedCount() >= 3 * kBound; }, 60s))
+      << flood->acknowledgedCount() << " answered\n"
+      << daemon.log();
+  return flood;
+}
+
 }  // namespace
 
 class KillNineUnderFlood : public testing::TestWithParam<FloodKind> {};
 
 TEST_P(KillNineUnderFlood, LosesNoMoreAnsweredMessagesThanTheBudgetsAllow) {
   const FloodKind& kind = GetParam();
-  constexpr int kClients = 4;
-  TestDaemon::Options options;
-  options.extraArgs = {"--max-connection-bytes", std::to_string(kConnectionBytes),
-                       "--max-inflight-bytes", std::to_string(kInflightBytes)};
-  TestDaemon daemon(options);
-  std::vector<TestFlood::Sender> senders;
-  for (int k = 0; k < kClients; ++k) {
-    auto client = daemon.client();
-    int64_t reporter = 100 + k;
-    ASSERT_TRUE(replied(client->createReportingSession(reporter)));
-    if (kind.started) {
-      client->startReportingSessionForID(
-          reporter, [](SXCallResult<bool>) {}, kSXWaitForever);
-    } else {
-      ASSERT_TRUE(replied(client->setServiceType(2, reporter)));  // telephony: sent at once
-    }
-    // Handled after the start: every broadcast reaches every session.
-    ASSERT_EQ(replied(client->reporterID(reporter)).reporterID, reporter);
-    std::optional<std::vector<int64_t>> to;
-    if (!kind.broadcast) to = std::vector<int64_t>{reporter};
-    senders.push_back({std::move(client), std::move(to)});
-  }
-  // A window wider than a connection's budget, so that the budget is what holds a client back.
-  TestFlood flood(std::move(senders), 2 * kConnectionBytes / kMinChargePerMessage);
-  const size_t bound = (kInflightBytes + kPoolFloorBytes * kClients) / kMinChargePerMessage;
+  TestDaemon daemon(smallBudgets());
+  auto flood = fullFlood(daemon, kind);
   const size_t boundPerClient = kConnectionBytes / kMinChargePerMessage;
-  // Several times what the budgets hold, so that they are full and the stores lag at the kill.
-  const size_t enough = 3 * bound;
-  ASSERT_TRUE(waitUntil([&] { return flood.acknowledgedCount() >= enough; }, 60s))
-      << flood.acknowledgedCount() << " answered\n"
-      << daemon.log();
   auto killedAt = TestFlood::Clock::now();
   ASSERT_EQ(::kill(daemon.pid(), SIGKILL), 0);
   ASSERT_EQ(daemon.waitForExit(), 128 + SIGKILL);
-  flood.stop();
+  flood->stop();
 
-  const size_t rowsPerMessage = kind.perSession ? kClients : 1;
+  const size_t rowsPerMessage = kind.perSession ? kFloodClients : 1;
   auto events = TestFlood::stored(daemon, "tallyvane.db", "events");
   auto messages = TestFlood::stored(daemon, "fernreporting.db", "messages");
-  auto acknowledged = flood.acknowledged();
+  auto acknowledged = flood->acknowledged();
   size_t missing = 0;
-  size_t missingOf[kClients] = {};
+  size_t missingOf[kFloodClients] = {};
   auto newest = killedAt - 1h;
   auto oldest = killedAt;
   for (const auto& [xid, answeredAt] : acknowledged) {
@@ -214,14 +226,14 @@ TEST_P(KillNineUnderFlood, LosesNoMoreAnsweredMessagesThanTheBudgetsAllow) {
     newest = std::max(newest, answeredAt);
     oldest = std::min(oldest, answeredAt);
   }
-  EXPECT_LE(missing, bound) << kind.name;
+  EXPECT_LE(missing, kBound) << kind.name;
   for (size_t of : missingOf) EXPECT_LE(of, boundPerClient) << kind.name;
   auto ms = [](auto d) { return std::chrono::duration<double, std::milli>(d).count(); };
   std::printf(
       "[ measured ] kill -9 under a %s flood: %zu answered, %zu of them not stored "
       "(at most %zu per client; bound %zu, %zu per client)",
       kind.name, acknowledged.size(), missing,
-      *std::max_element(std::begin(missingOf), std::end(missingOf)), bound, boundPerClient);
+      *std::max_element(std::begin(missingOf), std::end(missingOf)), kBound, boundPerClient);
   if (missing > 0) {
     std::printf("; their answers came %.1f to %.1f ms before the kill", ms(killedAt - oldest),
                 std::max(0.0, ms(killedAt - newest)));
@@ -230,6 +242,32 @@ TEST_P(KillNineUnderFlood, LosesNoMoreAnsweredMessagesThanTheBudgetsAllow) {
 }
 
 INSTANTIATE_TEST_SUITE_P(CrashSafetyEndToEnd, KillNineUnderFlood, testing::ValuesIn(kFloodKinds),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// SIGTERM stops reading, lets everything read be handled and stored, then exits 0.
+class StopUnderFlood : public testing::TestWithParam<FloodKind> {};
+
+TEST_P(StopUnderFlood, StoresEveryAnsweredMessageAndExitsZero) {
+  const FloodKind& kind = GetParam();
+  TestDaemon daemon(smallBudgets());
+  auto flood = fullFlood(daemon, kind);
+  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+  ASSERT_EQ(daemon.waitForExit(), 0) << daemon.log();
+  flood->stop();
+
+  const size_t rowsPerMessage = kind.perSession ? kFloodClients : 1;
+  auto events = TestFlood::stored(daemon, "tallyvane.db", "events");
+  auto messages = TestFlood::stored(daemon, "fernreporting.db", "messages");
+  size_t missing = 0;
+  for (const auto& [xid, answeredAt] : flood->acknowledged()) {
+    missing += events[xid] < rowsPerMessage || messages[xid] < rowsPerMessage;
+  }
+  EXPECT_EQ(missing, 0u) << kind.name;
+  EXPECT_EQ(daemon.countInLog("stopping on SIGTERM"), 1u);
+  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
+}
+
+INSTANTIATE_TEST_SUITE_P(CrashSafetyEndToEnd, StopUnderFlood, testing::ValuesIn(kFloodKinds),
                          [](const auto& info) { return std::string(info.param.name); });
 
 TEST(CrashSafetyEndToEnd, StoresUseWriteAheadLogging) {

@@ -1,9 +1,16 @@
 // Session start, stop and destroy through the real daemon: the held start reply, the driver
-// delta, the summary, the flush and the JSON file.
+// delta, the summary, the flush and the JSON file; and the daemon's own life: what it tells the
+// service manager, reloads and the bound on a stop.
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+
+#include <asio.hpp>
 
 #include "support/Daemon.h"
 
@@ -23,7 +30,127 @@ const char* kSessionMessages =
     "SELECT m.category, m.type, m.payload_json, m.time FROM messages m "
     "WHERE m.session_id IS NOT NULL ORDER BY m.id";
 
+// A datagram socket standing in for the service manager's notify socket.
+class NotifySocket {
+ public:
+  explicit NotifySocket(std::string path) : path_(std::move(path)) {
+    fd_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
+    EXPECT_EQ(::bind(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    timeval poll{0, 50'000};
+    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &poll, sizeof poll);
+  }
+  ~NotifySocket() { ::close(fd_); }
+  const std::string& path() const { return path_; }
+
+  // The next notification holding `fragment`, skipping those before it; empty after 15 s.
+  std::string next(const std::string& fragment) {
+    auto deadline = std::chrono::steady_clock::now() + 15s;
+    while (std::chrono::steady_clock::now() < deadline) {
+      char buffer[4096];
+      ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
+      if (n <= 0) continue;
+      std::string message(buffer, static_cast<size_t>(n));
+      if (message.find(fragment) != std::string::npos) return message;
+    }
+    return "";
+  }
+
+ private:
+  const std::string path_;
+  int fd_ = -1;
+};
+
 }  // namespace
+
+TEST(LifecycleEndToEnd, TellsTheServiceManagerItsStateAndFeedsTheWatchdog) {
+  SXTestTempDir dir;
+  NotifySocket manager(dir.file("notify"));
+  TestDaemon::Options options;
+  options.environment = {{"NOTIFY_SOCKET", manager.path()}, {"WATCHDOG_USEC", "200000"}};
+  TestDaemon daemon(options);
+  EXPECT_NE(manager.next("READY=1").find("STATUS=serving on "), std::string::npos);
+  EXPECT_NE(manager.next("WATCHDOG=1"), "");
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  EXPECT_NE(manager.next("RELOADING=1").find("MONOTONIC_USEC="), std::string::npos);
+  EXPECT_NE(manager.next("READY=1"), "");  // the reload is over
+  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+  EXPECT_NE(manager.next("STOPPING=1"), "");
+  EXPECT_EQ(daemon.waitForExit(), 0);
+  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
+}
+
+TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesNothing) {
+  TestDaemon::Options options;
+  options.daemonConfig = {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", 8}}}};
+  options.extraArgs = {"--max-reporter-ids", "1"};
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+  const SXValue big = {{"text", std::string(200, 'x')}};
+  auto send = [&](const SXValue& payload, std::vector<int64_t> ids) {
+    return client->sendMessage(payload, 3, 1, ids).get().status;
+  };
+  EXPECT_EQ(send(big, {7}), SXCallStatus::kRemoteError);
+
+  daemon.writeConfig("sxreportingd.json",
+                     {{"limits", {{"max-payload-bytes", 4096}, {"max-reporter-ids", 8}}}});
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.waitForLog("limit max-payload-bytes: 4096 (was 64)")) << daemon.log();
+  EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
+  EXPECT_EQ(send({{"a", 1}}, {7, 8}), SXCallStatus::kRemoteError);  // the flag wins
+
+  daemon.writeConfig("sxreportingd.json", "limits");
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.waitForLog("sxreportingd.json: not a JSON object; the configuration stays"));
+  EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
+
+  TestDaemon::Options bad;
+  bad.daemonConfig = {{"limits", {{"max-payload", 64}}}};
+  bad.waitForReady = false;
+  TestDaemon refused(bad);
+  EXPECT_EQ(refused.waitForExit(), 2);
+  EXPECT_EQ(refused.countInLog("unknown limit \"max-payload\""), 1u) << refused.log();
+}
+
+// A collector that never answers holds the exporter's batch, and with it the drain.
+TEST(LifecycleEndToEnd, AStopThatCannotDrainEndsAtItsLimitOrAtASecondSignal) {
+  asio::io_context io;
+  asio::ip::tcp::acceptor silent(io, {asio::ip::address_v4::loopback(), 0});
+  silent.non_blocking(true);
+  std::string endpoint =
+      "http://127.0.0.1:" + std::to_string(silent.local_endpoint().port()) + "/v1/logs";
+  for (bool secondSignal : {false, true}) {
+    TestDaemon::Options options;
+    options.fernConfig = {{"backends", {"spool", "otlp-http"}},
+                          {"otlp-http",
+                           {{"endpoint", endpoint}, {"intervalMs", 20}, {"timeoutMs", 60000}}}};
+    options.extraArgs = {"--drain-timeout-ms", secondSignal ? "60000" : "300"};
+    TestDaemon daemon(options);
+    auto client = daemon.client();
+    ASSERT_TRUE(replied(client->createReportingSession(7)));
+    EXPECT_FALSE(replied(client->sendMessage({{"n", 1}}, 3, 1, std::vector<int64_t>{7})));
+    asio::ip::tcp::socket post(io);  // the exporter's, never answered
+    ASSERT_TRUE(waitUntil([&] {
+      std::error_code ec;
+      silent.accept(post, ec);
+      return !ec;
+    }));
+    ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+    ASSERT_TRUE(daemon.waitForLog("stopping on SIGTERM"));
+    if (secondSignal) {
+      ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+    }
+    EXPECT_EQ(daemon.waitForExit(), 1);
+    EXPECT_EQ(daemon.countInLog(secondSignal ? "a second SIGTERM came during the stop drain"
+                                             : "the stop drain took longer than its limit"),
+              1u)
+        << daemon.log();
+    EXPECT_EQ(daemon.countInLog("1 messages not exported"), 1u) << daemon.log();
+  }
+}
 
 TEST(LifecycleEndToEnd, StartReplyWaitsForStopThenSpoolAndFileHoldTheSession) {
   TestDaemon daemon(internalDevice());

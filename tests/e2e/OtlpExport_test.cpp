@@ -142,3 +142,29 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   EXPECT_EQ(dropped, 2u);
   EXPECT_TRUE(second.waitForLog("again after"));
 }
+
+TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
+  OtlpReceiver receiver;
+  TestDaemon daemon;
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+  SendStandalone(*client, 1, 2);
+  ASSERT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
+  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
+
+  daemon.writeConfig("fernreporting.json", Exporting(receiver).fernConfig);
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  // What was spooled before the reload goes too.
+  ASSERT_TRUE(receiver.waitFor([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
+      << daemon.log();
+  EXPECT_EQ(Deliveries(receiver).size(), 2u);
+  EXPECT_TRUE(replied(client->status()).at("gauges").contains("spool_backlog"));
+
+  daemon.writeConfig("fernreporting.json", {{"backends", {"spool"}}});
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.waitForLog("otlp-http export stopped")) << daemon.log();
+  SendStandalone(*client, 3, 1);
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 3).size(), 3u);
+  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
+  EXPECT_EQ(Deliveries(receiver).size(), 2u);
+}

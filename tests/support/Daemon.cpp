@@ -2,8 +2,12 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <cstring>
 
 #include <filesystem>
 #include <fstream>
@@ -53,9 +57,8 @@ TestDaemon::TestDaemon(Options options) {
     std::filesystem::create_directories(dir_.file(sub));
   }
   if (!options.device.is_null()) writeJson(dir_.file("etc/device.json"), options.device);
-  if (!options.fernConfig.is_null()) {
-    writeJson(dir_.file("etc/fernreporting.json"), options.fernConfig);
-  }
+  if (!options.fernConfig.is_null()) writeConfig("fernreporting.json", options.fernConfig);
+  if (!options.daemonConfig.is_null()) writeConfig("sxreportingd.json", options.daemonConfig);
   for (const auto& [path, value] : options.counters) setCounter(path, value);
   stateDir_ = options.stateDir.empty() ? dir_.file("lib") : options.stateDir;
   socket_ = dir_.file("run/sxr.sock");
@@ -75,6 +78,11 @@ TestDaemon::TestDaemon(Options options) {
   args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
   std::string logPath = dir_.file("daemon.log");
   std::vector<char*> argv = pointersTo(args);
+  std::vector<int> passed = listeningSockets(options.activationSockets);
+  if (!passed.empty()) {
+    options.environment["LISTEN_FDS"] = std::to_string(passed.size());
+    options.environment["LISTEN_PID"] = std::string(16, ' ');  // the child's, filled in there
+  }
   std::vector<std::string> environment = childEnvironment(options.environment);
   std::vector<char*> envp = pointersTo(environment);
   pid_ = ::fork();
@@ -82,10 +90,41 @@ TestDaemon::TestDaemon(Options options) {
     int fd = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     ::dup2(fd, STDERR_FILENO);
     ::dup2(fd, STDOUT_FILENO);
+    for (size_t i = 0; i < passed.size(); ++i) ::dup2(passed[i], 3 + static_cast<int>(i));
+    for (char* entry : envp) {
+      if (entry && std::strncmp(entry, "LISTEN_PID=", 11) == 0) {
+        std::snprintf(entry + 11, 16, "%d", static_cast<int>(::getpid()));
+      }
+    }
     ::execve(argv[0], argv.data(), envp.data());
     ::_exit(127);
   }
-  if (!waitForLog("ready, listening on")) ADD_FAILURE() << "daemon did not start:\n" << log();
+  for (int fd : passed) ::close(fd);
+  if (options.waitForReady && !waitForLog("ready, listening on")) {
+    ADD_FAILURE() << "daemon did not start:\n" << log();
+  }
+}
+
+// `count` listening Unix stream sockets, the first at socket(), each on a descriptor above
+// those the child sets up, so that placing them at 3, 4, ... overwrites none of them.
+std::vector<int> TestDaemon::listeningSockets(int count) const {
+  std::vector<int> fds;
+  for (int i = 0; i < count; ++i) {
+    std::string path = i == 0 ? socket_ : socket_ + "." + std::to_string(i);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    EXPECT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0) << path;
+    EXPECT_EQ(::listen(fd, 16), 0);
+    fds.push_back(::fcntl(fd, F_DUPFD_CLOEXEC, 64));
+    ::close(fd);
+  }
+  return fds;
+}
+
+void TestDaemon::writeConfig(const std::string& name, const SXValue& value) const {
+  writeJson(dir_.file("etc/" + name), value);
 }
 
 void TestDaemon::setCounter(const std::string& channelPath, int64_t value) const {

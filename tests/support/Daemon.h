@@ -31,10 +31,17 @@ class TestDaemon {
     std::string stateDir = {};
     // Variables set for the daemon process alone (LD_PRELOAD, say), beside the test's own.
     std::map<std::string, std::string> environment = {};
+    SXValue daemonConfig = nullptr;  // sxreportingd.json, when not null
+    // Listening sockets passed as a service manager passes them (LISTEN_FDS, LISTEN_PID from
+    // fd 3 on): the first bound at socket(), further ones beside it.
+    int activationSockets = 0;
+    bool waitForReady = true;  // false for a daemon expected not to start
   };
 
   // Writes a driver counter file under the kestrel root.
   void setCounter(const std::string& channelPath, int64_t value) const;
+  // Writes a file of the configuration directory, e.g. "fernreporting.json".
+  void writeConfig(const std::string& name, const SXValue& value) const;
 
   TestDaemon();
   explicit TestDaemon(Options options);
@@ -69,6 +76,8 @@ class TestDaemon {
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
 
  private:
+  std::vector<int> listeningSockets(int count) const;
+
   SXTestTempDir dir_;
   std::string stateDir_;
   std::string socket_;

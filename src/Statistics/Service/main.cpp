@@ -2,11 +2,22 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <asio/post.hpp>
+#include <atomic>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
+#include <future>
+#include <map>
+#include <memory>
+#include <set>
 #include <string>
+#include <thread>
 
+#include "SXReportingDaemonConfig.h"
+#include "SXReportingLifecycle.h"
 #include "SXReportingServiceDelegate.h"
 #include "SXVersion.h"
 #include "common/SXPaths.h"
@@ -15,6 +26,7 @@
 #include "platform/InotifyNotifications.h"
 #include "platform/JsonPreferences.h"
 #include "platform/OtlpHttpExporter.h"
+#include "platform/ServiceManager.h"
 #include "platform/SqliteFernReporting.h"
 #include "platform/SqliteJoulebook.h"
 #include "platform/SqliteTallyvane.h"
@@ -109,6 +121,18 @@ constexpr const char* kUsage =
     "  -h, --help                  this text\n"
     "  --version                   print the version\n"
     "\n"
+    "lifecycle:\n"
+    "  --drain-timeout-ms N        how long a stop (SIGTERM, SIGINT) may drain before the\n"
+    "                              daemon exits with what is left (SXREPORTING_DRAIN_TIMEOUT_MS,\n"
+    "                              default 10000)\n"
+    "\n"
+    "Signals: SIGTERM and SIGINT stop after storing everything answered (exit status 0); a\n"
+    "second one during that drain exits at once (status 1). SIGHUP re-reads fernreporting.json,\n"
+    "device.json and sxreportingd.json.\n"
+    "\n"
+    "The limits can also be set in <config-dir>/sxreportingd.json, e.g.\n"
+    "{\"limits\": {\"max-payload-bytes\": 131072}}; options and environment variables win.\n"
+    "\n"
     "With no options and not root, everything lives under ./var of the working directory.\n";
 
 struct Options {
@@ -117,43 +141,9 @@ struct Options {
   size_t maxMessageBytes = 1 << 20;
   unsigned socketMode = 0660;
   SXReportingLimits limits;
-};
-
-struct LimitFlag {
-  const char* flag;
-  const char* environment;
-  uint64_t SXReportingLimits::*member;
-};
-
-constexpr LimitFlag kLimitFlags[] = {
-    {"--max-sessions-per-client", "SXREPORTING_MAX_SESSIONS_PER_CLIENT",
-     &SXReportingLimits::maxSessionsPerClient},
-    {"--max-sessions", "SXREPORTING_MAX_SESSIONS", &SXReportingLimits::maxSessions},
-    {"--max-aggregate-entries", "SXREPORTING_MAX_AGGREGATE_ENTRIES",
-     &SXReportingLimits::maxAggregateEntries},
-    {"--max-aggregate-bytes", "SXREPORTING_MAX_AGGREGATE_BYTES",
-     &SXReportingLimits::maxAggregateBytes},
-    {"--max-aggregate-bytes-total", "SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL",
-     &SXReportingLimits::maxAggregateBytesTotal},
-    {"--max-pending-standalone-bytes", "SXREPORTING_MAX_PENDING_STANDALONE_BYTES",
-     &SXReportingLimits::maxPendingStandaloneBytes},
-    {"--max-payload-bytes", "SXREPORTING_MAX_PAYLOAD_BYTES", &SXReportingLimits::maxPayloadBytes},
-    {"--max-configuration-bytes", "SXREPORTING_MAX_CONFIGURATION_BYTES",
-     &SXReportingLimits::maxConfigurationBytes},
-    {"--max-reporter-ids", "SXREPORTING_MAX_REPORTER_IDS", &SXReportingLimits::maxReporterIDs},
-    {"--max-connection-bytes", "SXREPORTING_MAX_CONNECTION_BYTES",
-     &SXReportingLimits::maxConnectionBytes},
-    {"--max-inflight-bytes", "SXREPORTING_MAX_INFLIGHT_BYTES",
-     &SXReportingLimits::maxInflightBytes},
-    {"--partial-frame-timeout-ms", "SXREPORTING_PARTIAL_FRAME_TIMEOUT_MS",
-     &SXReportingLimits::partialFrameTimeoutMs},
-    {"--max-error-lines", "SXREPORTING_MAX_ERROR_LINES", &SXReportingLimits::maxErrorLines},
-    {"--max-connections-per-client", "SXREPORTING_MAX_CONNECTIONS_PER_CLIENT",
-     &SXReportingLimits::maxConnectionsPerClient},
-    {"--max-queued-requests", "SXREPORTING_MAX_QUEUED_REQUESTS",
-     &SXReportingLimits::maxQueuedRequests},
-    {"--max-pending-reply-bytes", "SXREPORTING_MAX_PENDING_REPLY_BYTES",
-     &SXReportingLimits::maxPendingReplyBytes},
+  // Limits given as options or environment variables: the configuration file cannot change them.
+  std::set<std::string> fixedLimits;
+  std::chrono::milliseconds drainTimeout{10'000};
 };
 
 const char* envOr(const char* name, const char* fallback) {
@@ -175,25 +165,41 @@ bool parsePositive(const char* text, uint64_t& out) {
   return true;
 }
 
-// The limits from their environment variables; false (and a message) when one is malformed.
-bool limitsFromEnvironment(SXReportingLimits& limits) {
-  for (const auto& limit : kLimitFlags) {
+// The limits and the drain timeout from their environment variables; false (and a message)
+// when one is malformed.
+bool lifecycleFromEnvironment(Options& options) {
+  for (const auto& limit : SXReportingLimitOptions()) {
     const char* text = envOr(limit.environment, nullptr);
-    if (text && !parsePositive(text, limits.*limit.member)) {
+    if (!text) continue;
+    if (!parsePositive(text, options.limits.*limit.member)) {
       std::fprintf(stderr, "sxreportingd: bad %s '%s' (expected a positive number)\n",
                    limit.environment, text);
       return false;
     }
+    options.fixedLimits.insert(limit.name);
   }
+  uint64_t ms = 0;
+  const char* drain = envOr("SXREPORTING_DRAIN_TIMEOUT_MS", nullptr);
+  if (drain && !parsePositive(drain, ms)) {
+    std::fprintf(stderr, "sxreportingd: bad SXREPORTING_DRAIN_TIMEOUT_MS '%s'\n", drain);
+    return false;
+  }
+  if (drain) options.drainTimeout = std::chrono::milliseconds(ms);
   return true;
 }
 
-// Whether `arg` names a limit; `ok` says whether its value was good.
-bool parseLimitFlag(const std::string& arg, const char* value, SXReportingLimits& limits,
-                    bool& ok) {
-  for (const auto& limit : kLimitFlags) {
-    if (arg != limit.flag) continue;
-    ok = parsePositive(value, limits.*limit.member);
+// Whether `arg` names a limit or the drain timeout; `ok` says whether its value was good.
+bool parseLifecycleFlag(const std::string& arg, const char* value, Options& options, bool& ok) {
+  if (arg == "--drain-timeout-ms") {
+    uint64_t ms = 0;
+    ok = parsePositive(value, ms);
+    options.drainTimeout = std::chrono::milliseconds(ms);
+    return true;
+  }
+  for (const auto& limit : SXReportingLimitOptions()) {
+    if (arg != std::string("--") + limit.name) continue;
+    ok = parsePositive(value, options.limits.*limit.member);
+    options.fixedLimits.insert(limit.name);
     return true;
   }
   return false;
@@ -201,7 +207,7 @@ bool parseLimitFlag(const std::string& arg, const char* value, SXReportingLimits
 
 // Returns 0 to go on, or the exit status.
 int parseOptions(int argc, char** argv, Options& options) {
-  if (!limitsFromEnvironment(options.limits)) return 2;
+  if (!lifecycleFromEnvironment(options)) return 2;
   options.logScopes = envOr("SXREPORTING_LOG_SCOPES", "");
   unsigned long long number = 0;
   if (parseNumber(envOr("SXREPORTING_MAX_MESSAGE_BYTES", "1048576"), number, 10)) {
@@ -226,9 +232,9 @@ int parseOptions(int argc, char** argv, Options& options) {
     }
     const char* value = argv[++i];
     SXPaths& p = options.paths;
-    bool limitOk = false;
-    if (parseLimitFlag(arg, value, options.limits, limitOk)) {
-      if (limitOk) continue;
+    bool lifecycleOk = false;
+    if (parseLifecycleFlag(arg, value, options, lifecycleOk)) {
+      if (lifecycleOk) continue;
       std::fprintf(stderr, "sxreportingd: bad option %s %s (expected a positive number)\n",
                    arg.c_str(), value);
       return 2;
@@ -283,21 +289,28 @@ Stores openStores(const SXPaths& p, const std::shared_ptr<SXLogFacility>& log) {
                                                   p.configDir + "/fernreporting.json", log)};
 }
 
-SXPlatform productionPlatform(const Options& options, const Stores& stores,
+// The adapters that a reload or a stop reaches beyond the platform interfaces.
+struct Adapters {
+  Stores stores;
+  std::shared_ptr<SXAsioDispatch> dispatch = std::make_shared<SXAsioDispatch>();
+  std::shared_ptr<SXJsonDeviceProperties> device;
+};
+
+SXPlatform productionPlatform(const Options& options, const Adapters& adapters,
                               std::shared_ptr<SXLogFacility> log) {
   const SXPaths& p = options.paths;
   SXPlatform platform;
   platform.log = log;
   platform.tracer = std::make_shared<SXUsdtTracer>();
   platform.clock = std::make_shared<SXSystemClock>();
-  platform.dispatch = std::make_shared<SXAsioDispatch>();
+  platform.dispatch = adapters.dispatch;
   platform.random = std::make_shared<SXSystemRandom>();
   platform.process = std::make_shared<SXProcProcessInfo>();
-  platform.device = std::make_shared<SXJsonDeviceProperties>(p.configDir + "/device.json");
+  platform.device = adapters.device;
   platform.fileSystem = std::make_shared<SXPosixFileSystem>();
-  platform.tallyvane = stores.tallyvane;
-  platform.joulebook = stores.joulebook;
-  platform.fernReporting = stores.fernReporting;
+  platform.tallyvane = adapters.stores.tallyvane;
+  platform.joulebook = adapters.stores.joulebook;
+  platform.fernReporting = adapters.stores.fernReporting;
   platform.kestrel = std::make_shared<SXFileKestrel>(p.kestrelRoot, log);
   platform.orientation = std::make_shared<SXNoSensorOrientationService>();
   platform.preferences = std::make_shared<SXJsonPreferences>(p.preferencesDirectory(), log);
@@ -306,20 +319,217 @@ SXPlatform productionPlatform(const Options& options, const Stores& stores,
   return platform;
 }
 
-// The "otlp-http" backend, when fernreporting.json lists it; it reads the spool's database.
-std::unique_ptr<SXOtlpHttpExporter> otlpExporter(const Options& options, const SXPlatform& platform,
-                                                 const std::shared_ptr<SXLogFacility>& log) {
-  const SXPaths& p = options.paths;
-  std::string configPath = p.configDir + "/fernreporting.json";
-  // The spool adapter has already logged whatever is wrong with the backends list.
-  auto backends = SXSqliteFernReporting::loadBackends(configPath, nullptr);
-  auto exportOptions = SXOtlpExportOptions::load(configPath, backends, *log);
-  if (!exportOptions) return nullptr;
-  char host[256] = "";
-  if (::gethostname(host, sizeof host - 1) == 0) exportOptions->resource.hostName = host;
-  return std::make_unique<SXOtlpHttpExporter>(p.stateDir + "/fernreporting.db", *exportOptions,
-                                              std::make_shared<SXCurlHttpPost>(), platform.clock,
-                                              platform.random, log);
+// The "otlp-http" backend as fernreporting.json describes it now. A reload that finds the file
+// changed replaces the exporter; the spool's cursor carries the position over.
+class Exporter {
+ public:
+  Exporter(const Options& options, const SXPlatform& platform, std::shared_ptr<SXLogFacility> log)
+      : options_(options), platform_(platform), log_(std::move(log)) {}
+
+  // I/O thread (or before it runs). Returns whether the exporter was replaced.
+  bool reload() {
+    std::string configPath = options_.paths.configDir + "/fernreporting.json";
+    std::ifstream in(configPath);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    if (text == file_) return false;
+    file_ = text;
+    // The spool adapter has already logged whatever is wrong with the backends list.
+    auto backends = SXSqliteFernReporting::loadBackends(configPath, nullptr);
+    auto exportOptions = SXOtlpExportOptions::load(configPath, backends, *log_);
+    std::shared_ptr<SXOtlpHttpExporter> next;
+    if (exportOptions) {
+      char host[256] = "";
+      if (::gethostname(host, sizeof host - 1) == 0) exportOptions->resource.hostName = host;
+      next = std::make_shared<SXOtlpHttpExporter>(
+          options_.paths.stateDir + "/fernreporting.db", *exportOptions,
+          std::make_shared<SXCurlHttpPost>(), platform_.clock, platform_.random, log_);
+    }
+    auto previous = current_.exchange(next);
+    if (previous) previous->stop();
+    if (next) next->start();
+    return previous || next;
+  }
+  bool active() const { return current_.load() != nullptr; }
+  uint64_t backlog() const {
+    auto exporter = current_.load();
+    return exporter ? exporter->backlog() : 0;
+  }
+  // Drain thread: lets the batch being posted be answered, then stops.
+  void stopAfterPass() {
+    if (auto exporter = current_.load()) exporter->stop(false);
+  }
+
+ private:
+  const Options& options_;
+  const SXPlatform& platform_;
+  const std::shared_ptr<SXLogFacility> log_;
+  std::string file_ = "\n(not read yet)";  // I/O thread: the file as last read
+  std::atomic<std::shared_ptr<SXOtlpHttpExporter>> current_;
+};
+
+// Everything a stop or a reload reaches.
+struct Service {
+  const Options& options;
+  Adapters& adapters;
+  SXReportingEnvironment& environment;
+  SXReportingServiceDelegate& delegate;
+  SXUnixSocketListener& listener;
+  Exporter& exporter;
+  SXReportingConfigFile& configFile;
+};
+
+void setStatusProviders(Service& s) {
+  const Stores& stores = s.adapters.stores;
+  SXUnixSocketListener& listener = s.listener;
+  Exporter& exporter = s.exporter;
+  s.delegate.setStatusProviders(
+      {.requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
+       .tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
+       .joulebookWriteErrors = [j = stores.joulebook] { return j->writeErrors(); },
+       .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
+       .spoolBacklog = exporter.active()
+                           ? std::function<uint64_t()>([&exporter] { return exporter.backlog(); })
+                           : std::function<uint64_t()>(),
+       .partialFrames = [&listener] { return listener.partialFrameTimeouts(); },
+       .inflightBytes = [&listener] { return listener.inflightBytes(); }});
+}
+
+// SIGHUP, on the I/O thread: each file keeps its old values when the new ones are bad.
+void reload(Service& s) {
+  const SXPaths& p = s.options.paths;
+  SXLogFacility& log = s.environment.log();
+  s.configFile.load();
+  if (s.adapters.device->reload()) {
+    SXLOG(log, nullptr, SXLogLevel::kDefault, "%@/device.json changed (InternalBuild is kept "
+          "from the start)", p.configDir);
+  }
+  if (s.adapters.stores.fernReporting->reloadBackends()) {
+    SXLOG(log, nullptr, SXLogLevel::kDefault, "backends for sessions started from now on: %@",
+          SXValue(s.adapters.stores.fernReporting->backends()));
+  }
+  if (s.exporter.reload()) {
+    SXLOG(log, nullptr, SXLogLevel::kDefault, "otlp-http export %@",
+          s.exporter.active() ? "restarted with the new options" : "stopped");
+    setStatusProviders(s);
+  }
+}
+
+// Returns once the server queue has run everything queued before it and the pools stayed idle
+// meanwhile: work that hands work on (server queue, session queues, back) has settled.
+void waitUntilSettled(Service& s) {
+  auto& queue = *s.environment.serverQueue();
+  for (;;) {
+    auto before = s.adapters.dispatch->activity();
+    std::promise<void> marker;
+    queue.async([&marker] { marker.set_value(); });
+    marker.get_future().wait();
+    auto after = s.adapters.dispatch->activity();
+    if (before.busy == 0 && after.busy == 0 && before.begun == after.begun) return;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+}
+
+// The stop drain, on a thread of its own while the I/O thread still writes replies. Returns
+// what it drained.
+std::string drain(Service& s) {
+  uint64_t inflight = s.listener.inflightBytes();
+  waitUntilSettled(s);  // the requests received have been handled and answered
+  uint64_t sessions = s.environment.counters().sessionsLive();
+  std::promise<size_t> closing;
+  asio::post(s.listener.executor(),
+             [&] { closing.set_value(s.listener.closeConnections()); });
+  size_t connections = closing.get_future().get();
+  waitUntilSettled(s);  // their sessions have stopped and their summaries are written
+  s.adapters.stores.tallyvane->flush();
+  s.adapters.stores.joulebook->flush();
+  s.exporter.stopAfterPass();
+  std::string drained = SXFormat(
+      "closed %zu connections and %llu sessions; stored the %llu payload bytes in flight",
+      connections, static_cast<unsigned long long>(sessions),
+      static_cast<unsigned long long>(inflight));
+  if (uint64_t held = s.listener.inflightBytes()) {
+    drained += SXFormat("; %llu payload bytes still waiting for a delay (alarm sends) are dropped",
+                        static_cast<unsigned long long>(held));
+  }
+  if (s.exporter.active()) {
+    drained += SXFormat("; %llu messages wait in the spool for the next export",
+                        static_cast<unsigned long long>(s.exporter.backlog()));
+  }
+  return drained;
+}
+
+// Any thread: what a stop cut short leaves behind.
+std::string leftovers(Service& s) {
+  return SXFormat("%llu payload bytes in flight, %llu sessions live, %llu messages not exported",
+                  static_cast<unsigned long long>(s.listener.inflightBytes()),
+                  static_cast<unsigned long long>(s.environment.counters().sessionsLive()),
+                  static_cast<unsigned long long>(s.exporter.backlog()));
+}
+
+void logLimits(SXLogFacility& log, const SXReportingLimits& l) {
+  using ull = unsigned long long;
+  SXLOG(log, nullptr, SXLogLevel::kDefault,
+        "limits: %llu sessions per client, %llu sessions, %llu aggregate entries and %llu bytes "
+        "per session, %llu aggregate bytes in all, %llu bytes of delayed standalone sends per "
+        "client; payloads %llu, configurations %llu bytes, %llu reporter IDs per send; %llu "
+        "queued requests, %llu reply bytes and %llu bytes in flight per connection, %llu in "
+        "all; partial requests end after %llu ms",
+        ull{l.maxSessionsPerClient}, ull{l.maxSessions}, ull{l.maxAggregateEntries},
+        ull{l.maxAggregateBytes}, ull{l.maxAggregateBytesTotal}, ull{l.maxPendingStandaloneBytes},
+        ull{l.maxPayloadBytes}, ull{l.maxConfigurationBytes}, ull{l.maxReporterIDs},
+        ull{l.maxQueuedRequests}, ull{l.maxPendingReplyBytes}, ull{l.maxConnectionBytes},
+        ull{l.maxInflightBytes}, ull{l.partialFrameTimeoutMs});
+}
+
+SXUnixSocketListener::Options listenerOptions(const Options& options,
+                                              const SXReportingEnvironment& environment) {
+  const SXReportingLimits l = environment.limits();
+  RpcLimits limits;
+  limits.maxMessageBytes = options.maxMessageBytes;
+  // Requests are handed to the server queue, so that queue tells when they have been handled.
+  return {.socketPath = options.paths.socketPath,
+          .socketMode = options.socketMode,
+          .limits = limits,
+          .maxQueuedRequests = l.maxQueuedRequests,
+          .maxPendingReplyBytes = l.maxPendingReplyBytes,
+          .maxConnectionBytes = l.maxConnectionBytes,
+          .maxInflightBytes = l.maxInflightBytes,
+          .partialFrameTimeout = std::chrono::milliseconds(l.partialFrameTimeoutMs),
+          .requestQueue = environment.serverQueue()};
+}
+
+// Serves until a stop has drained; returns the exit status.
+int serve(Service& s) {
+  SXLogFacility& log = s.environment.log();
+  std::string error;
+  if (!s.listener.open(error)) {
+    SXLOG(log, nullptr, SXLogLevel::kError, "cannot listen: %@", error);
+    return 1;
+  }
+  s.listener.setDelegate(s.delegate.shared_from_this());
+  logLimits(log, s.environment.limits());
+  const std::string& socket = s.options.paths.socketPath;
+  SXLOG(log, nullptr, SXLogLevel::kDefault,
+        "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ "
+        "status)",
+        s.environment.platform().process->processIdentifier(), socket,
+        s.listener.socketActivated() ? " (socket activated)" : "", socket);
+  SXServiceManager manager;
+  SXReportingLifecycle lifecycle(
+      s.listener.executor(),
+      {.stopReading = [&s] { s.listener.stopReading(); },
+       .drain = [&s] { return drain(s); },
+       .leftovers = [&s] { return leftovers(s); },
+       .reload = [&s] { reload(s); },
+       .throughServerQueue = [q = s.environment.serverQueue()](
+                                 std::function<void()> task) { q->async(std::move(task)); },
+       .finish = [&s] { s.listener.stop(); }},
+      manager, s.options.drainTimeout, s.environment.platform().log);
+  lifecycle.start();
+  if (s.exporter.reload()) setStatusProviders(s);
+  manager.ready("serving on " + socket);
+  s.listener.resume();
+  return lifecycle.exitStatus();
 }
 
 }  // namespace
@@ -342,63 +552,28 @@ int main(int argc, char** argv) {
     }
   }
 
-  Stores stores = openStores(options.paths, log);
+  Adapters adapters{
+      .stores = openStores(options.paths, log),
+      .device = std::make_shared<SXJsonDeviceProperties>(options.paths.configDir + "/device.json")};
   auto environment = std::make_shared<SXReportingEnvironment>(
-      productionPlatform(options, stores, log), options.limits);
-  auto delegate = SXReportingServiceDelegate::init(environment);
-  std::shared_ptr<SXOtlpHttpExporter> exporter =
-      otlpExporter(options, environment->platform(), log);
-  RpcLimits limits;
-  limits.maxMessageBytes = options.maxMessageBytes;
-  // Requests are handed to the server queue, so that queue tells when they have been handled.
-  SXUnixSocketListener listener(
-      {.socketPath = options.paths.socketPath,
-       .socketMode = options.socketMode,
-       .limits = limits,
-       .maxQueuedRequests = options.limits.maxQueuedRequests,
-       .maxPendingReplyBytes = options.limits.maxPendingReplyBytes,
-       .maxConnectionBytes = options.limits.maxConnectionBytes,
-       .maxInflightBytes = options.limits.maxInflightBytes,
-       .partialFrameTimeout = std::chrono::milliseconds(options.limits.partialFrameTimeoutMs),
-       .requestQueue = environment->serverQueue()},
-      log);
-  delegate->setStatusProviders(
-      {.requestsBackpressure = [&listener] { return listener.backpressurePauses(); },
-       .tallyvaneWriteErrors = [t = stores.tallyvane] { return t->writeErrors(); },
-       .joulebookWriteErrors = [j = stores.joulebook] { return j->writeErrors(); },
-       .fernReportingWriteErrors = [f = stores.fernReporting] { return f->writeErrors(); },
-       .spoolBacklog = exporter
-                           ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
-                           : std::function<uint64_t()>(),
-       .partialFrames = [&listener] { return listener.partialFrameTimeouts(); },
-       .inflightBytes = [&listener] { return listener.inflightBytes(); }});
-
-  std::string error;
-  if (!listener.open(error)) {
-    SXLOG(*log, nullptr, SXLogLevel::kError, "cannot listen: %@", error);
-    return 1;
+      productionPlatform(options, adapters, log), options.limits);
+  SXReportingConfigFile configFile(options.paths.configDir + "/sxreportingd.json", log);
+  SXReportingLimitsSection limits(environment, options.fixedLimits);
+  configFile.addSection([&limits](const SXValue& file) { return limits.read(file); });
+  // Further sections of sxreportingd.json hook in here, each with a reader of its own, e.g.
+  // configFile.addSection([&](const SXValue& file) { return retention.read(file); });
+  if (!configFile.load()) {
+    SXLOG(*log, nullptr, SXLogLevel::kError, "cannot start: %@ is not valid (see above)",
+          configFile.path());
+    return 2;
   }
-  listener.setDelegate(delegate);
-  const SXReportingLimits& l = options.limits;
-  using ull = unsigned long long;
-  SXLOG(*log, nullptr, SXLogLevel::kDefault,
-        "limits: %llu sessions per client, %llu sessions, %llu aggregate entries and %llu bytes "
-        "per session, %llu aggregate bytes in all, %llu bytes of delayed standalone sends per "
-        "client; payloads %llu, configurations %llu bytes, %llu reporter IDs per send; %llu "
-        "queued requests, %llu reply bytes and %llu bytes in flight per connection, %llu in "
-        "all; partial requests end after %llu ms",
-        ull{l.maxSessionsPerClient}, ull{l.maxSessions}, ull{l.maxAggregateEntries},
-        ull{l.maxAggregateBytes}, ull{l.maxAggregateBytesTotal}, ull{l.maxPendingStandaloneBytes},
-        ull{l.maxPayloadBytes}, ull{l.maxConfigurationBytes}, ull{l.maxReporterIDs},
-        ull{l.maxQueuedRequests}, ull{l.maxPendingReplyBytes}, ull{l.maxConnectionBytes},
-        ull{l.maxInflightBytes}, ull{l.partialFrameTimeoutMs});
-  SXLOG(
-      *log, nullptr, SXLogLevel::kDefault,
-      "sxreportingd %i ready, listening on %@%@ (talk to it with: sxreportctl --socket %@ status)",
-      environment->platform().process->processIdentifier(), options.paths.socketPath,
-      listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
-  if (exporter) exporter->start();
-  listener.resume();
-  if (exporter) exporter->stop();
-  return 0;
+  auto delegate = SXReportingServiceDelegate::init(environment);
+  Exporter exporter(options, environment->platform(), log);
+  SXUnixSocketListener listener(listenerOptions(options, *environment), log);
+  Service service{options, adapters, *environment, *delegate, listener, exporter, configFile};
+  setStatusProviders(service);
+  int status = serve(service);
+  // After a drain everything is stored; tearing down the object graph would only repeat it.
+  std::fflush(nullptr);
+  std::_Exit(status);
 }
