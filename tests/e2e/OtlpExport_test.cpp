@@ -88,8 +88,8 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   EXPECT_EQ(request.headers["x-test"], "yes");              // the file wins
   EXPECT_EQ(request.headers["x-env"], "from env");          // the environment fills in
   std::map<std::string, std::string> resource;
-  for (const SXValue& attribute :
-       OtlpReceiver::json(request)["resourceLogs"][0]["resource"]["attributes"]) {
+  SXValue body = OtlpReceiver::json(request);
+  for (const SXValue& attribute : body["resourceLogs"][0]["resource"]["attributes"]) {
     resource[attribute["key"]] = attribute["value"]["stringValue"];
   }
   EXPECT_EQ(resource["service.name"], "sxreportingd");
