@@ -341,9 +341,15 @@ TEST_F(OtlpHttpExporterTest, TimeoutsHalveTheBatchAndLengthenTheTimeUntilDrained
   }
   // Halved down to one message and doubled up to 8 times the timeout; then the batch grows
   // back by doubling after each 2xx while the longer timeout stays for the backlog.
-  EXPECT_EQ(posts, (std::vector<std::pair<size_t, int64_t>>{
-                       {8, 100}, {4, 200}, {2, 400}, {1, 800}, {1, 800}, {1, 800}, {2, 800},
-                       {4, 800}, {2, 800}}));
+  EXPECT_EQ(posts, (std::vector<std::pair<size_t, int64_t>>{{8, 100},
+                                                            {4, 200},
+                                                            {2, 400},
+                                                            {1, 800},
+                                                            {1, 800},
+                                                            {1, 800},
+                                                            {2, 800},
+                                                            {4, 800},
+                                                            {2, 800}}));
   // Drained: the next backlog starts with the configured timeout again.
   Standalone({{"i", 10}});
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
@@ -497,26 +503,26 @@ TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
          EXPECT_EQ(o.endpoint, "http://file/v1/logs");
          EXPECT_EQ(o.encoding, SXOtlpExportOptions::Encoding::kJson);
          EXPECT_EQ(o.headers, (std::map<std::string, std::string>{{"A", "file"}, {"B", "x y"}}));
-         EXPECT_EQ(o.resource.attributes,
-                   (std::map<std::string, std::string>{{"deployment.environment", "prod"},
-                                                       {"service.name", "b"},
-                                                       {"team", "audio"}}));
+         EXPECT_EQ(
+             o.resource.attributes,
+             (std::map<std::string, std::string>{
+                 {"deployment.environment", "prod"}, {"service.name", "b"}, {"team", "audio"}}));
        }},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.file);
     std::string error;
-    auto options = SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment,
-                                                    error);
+    auto options =
+        SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment, error);
     ASSERT_TRUE(options) << error;
     row.check(*options);
   }
-  for (const auto& [name, value] :
-       std::vector<std::pair<std::string, std::string>>{{"OTEL_EXPORTER_OTLP_PROTOCOL", "grpc"},
-                                                        {"OTEL_EXPORTER_OTLP_TIMEOUT", "1s"},
-                                                        {"OTEL_EXPORTER_OTLP_HEADERS", "A"},
-                                                        {"OTEL_EXPORTER_OTLP_COMPRESSION", "br"},
-                                                        {"OTEL_EXPORTER_OTLP_ENDPOINT", "c:4318"}}) {
+  for (const auto& [name, value] : std::vector<std::pair<std::string, std::string>>{
+           {"OTEL_EXPORTER_OTLP_PROTOCOL", "grpc"},
+           {"OTEL_EXPORTER_OTLP_TIMEOUT", "1s"},
+           {"OTEL_EXPORTER_OTLP_HEADERS", "A"},
+           {"OTEL_EXPORTER_OTLP_COMPRESSION", "br"},
+           {"OTEL_EXPORTER_OTLP_ENDPOINT", "c:4318"}}) {
     SCOPED_TRACE(name);
     std::string error;
     EXPECT_FALSE(SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}}, error));

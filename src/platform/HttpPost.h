@@ -29,11 +29,11 @@ struct SXHttpRequest {
 };
 
 struct SXHttpResult {
-  std::optional<int> status;  // none when no response came
+  std::optional<int> status;                   // none when no response came
   std::map<std::string, std::string> headers;  // of the response; names in lower case
-  std::string body;       // the start of the response body (the first 4 KiB)
-  std::string error;      // why no response came; empty when one did
-  bool timedOut = false;  // no response within the request's timeout
+  std::string body;                            // the start of the response body (the first 4 KiB)
+  std::string error;                           // why no response came; empty when one did
+  bool timedOut = false;                       // no response within the request's timeout
 };
 
 // The wait a Retry-After header's `value` asks for, in delta-seconds or as an HTTP-date (taken

@@ -138,26 +138,26 @@ std::optional<std::string> EnvironmentSection(const SXEnvironment& environment, 
     if (url.ends_with('/')) url.pop_back();
     section["endpoint"] = url + "/v1/logs";
   }
-  if (auto headers =
-          Variable(environment, {"OTEL_EXPORTER_OTLP_LOGS_HEADERS", "OTEL_EXPORTER_OTLP_HEADERS"})) {
+  if (auto headers = Variable(environment,
+                              {"OTEL_EXPORTER_OTLP_LOGS_HEADERS", "OTEL_EXPORTER_OTLP_HEADERS"})) {
     if (auto bad = ParseList(headers->second, section["headers"])) {
       return headers->first + ": " + *bad;
     }
   }
-  if (auto timeout =
-          Variable(environment, {"OTEL_EXPORTER_OTLP_LOGS_TIMEOUT", "OTEL_EXPORTER_OTLP_TIMEOUT"})) {
+  if (auto timeout = Variable(environment,
+                              {"OTEL_EXPORTER_OTLP_LOGS_TIMEOUT", "OTEL_EXPORTER_OTLP_TIMEOUT"})) {
     if (timeout->second.size() > 9 ||
         timeout->second.find_first_not_of("0123456789") != std::string::npos) {
       return timeout->first + ": must be a whole number of milliseconds";
     }
     section["timeoutMs"] = std::stoll(timeout->second);
   }
-  if (auto compression = Variable(environment, {"OTEL_EXPORTER_OTLP_LOGS_COMPRESSION",
-                                                "OTEL_EXPORTER_OTLP_COMPRESSION"})) {
+  if (auto compression = Variable(
+          environment, {"OTEL_EXPORTER_OTLP_LOGS_COMPRESSION", "OTEL_EXPORTER_OTLP_COMPRESSION"})) {
     section["compression"] = compression->second;
   }
-  if (auto protocol = Variable(environment, {"OTEL_EXPORTER_OTLP_LOGS_PROTOCOL",
-                                             "OTEL_EXPORTER_OTLP_PROTOCOL"})) {
+  if (auto protocol = Variable(
+          environment, {"OTEL_EXPORTER_OTLP_LOGS_PROTOCOL", "OTEL_EXPORTER_OTLP_PROTOCOL"})) {
     if (protocol->second != "http/json" && protocol->second != "http/protobuf") {
       return protocol->first + ": must be http/json or http/protobuf";
     }
@@ -205,10 +205,10 @@ SXEnvironment ProcessEnvironment() {
 
 std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& section,
                                                                  std::string& error) {
-  static const char* const kKnown[] = {
-      "endpoint",     "headers",   "batchSize",   "maxBatchBytes", "intervalMs",
-      "initialBackoffMs", "maxBackoffMs", "timeoutMs", "compression", "encoding",
-      "resourceAttributes"};
+  static const char* const kKnown[] = {"endpoint",      "headers",           "batchSize",
+                                       "maxBatchBytes", "intervalMs",        "initialBackoffMs",
+                                       "maxBackoffMs",  "timeoutMs",         "compression",
+                                       "encoding",      "resourceAttributes"};
   if (!section.is_object()) {
     error = "must be an object";
     return std::nullopt;

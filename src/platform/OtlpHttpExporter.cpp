@@ -128,9 +128,9 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& ro
     return {Outcome::kShrunk, rows.size()};
   }
   if (!accepted) {
-    return dropped(first, last, rows.size(),
-                   SXFormat("the collector rejected them with %i %@", status,
-                            OneLine(result.body)));
+    return dropped(
+        first, last, rows.size(),
+        SXFormat("the collector rejected them with %i %@", status, OneLine(result.body)));
   }
   bool protobuf = result.headers["content-type"] == "application/x-protobuf";
   LogPartialSuccess(*log_, protobuf ? SXOtlpResponseJson(result.body) : result.body, first, last);
@@ -140,8 +140,7 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& ro
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::dropped(int64_t first, int64_t last, size_t rows,
                                                      const std::string& why) {
-  SXLOG(*log_, nullptr, SXLogLevel::kError, "dropping messages %lli to %lli: %@", first, last,
-        why);
+  SXLOG(*log_, nullptr, SXLogLevel::kError, "dropping messages %lli to %lli: %@", first, last, why);
   return moved(last, Outcome::kDropped, rows);
 }
 

@@ -99,8 +99,7 @@ class SXOtlpHttpExporter {
   std::chrono::milliseconds delayAfter(const Pass& pass);
 
  private:
-  std::optional<SXHttpRequest> request(const std::vector<SXValue>& rows,
-                                       std::string& error) const;
+  std::optional<SXHttpRequest> request(const std::vector<SXValue>& rows, std::string& error) const;
   Pass post(const std::vector<SXValue>& rows);
   // Moves the cursor past `last` after an answer that settles the batch.
   Pass moved(int64_t last, Outcome outcome, size_t rows);
@@ -123,7 +122,7 @@ class SXOtlpHttpExporter {
   size_t paceLimit_;  // batchSize, halved after a time-out, doubled after each 2xx
   std::chrono::milliseconds timeout_;  // doubled after a time-out, reset once drained
   std::optional<std::chrono::milliseconds> retryAfter_;  // asked for by the last answer
-  unsigned failures_ = 0;  // failed attempts in the current streak
+  unsigned failures_ = 0;                                // failed attempts in the current streak
 
   std::mutex mutex_;
   std::condition_variable wake_;  // with mutex_: stop() wakes the thread from its wait

@@ -27,8 +27,8 @@
 
 struct SXOtlpResource {
   std::string serviceName = "sxreportingd";
-  std::string serviceVersion;  // left out when empty
-  std::string hostName;        // left out when empty
+  std::string serviceVersion;                     // left out when empty
+  std::string hostName;                           // left out when empty
   std::map<std::string, std::string> attributes;  // more; these win over the three above
 };
 

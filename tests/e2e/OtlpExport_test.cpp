@@ -85,8 +85,8 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   EXPECT_EQ(request.target, "/v1/logs");
   EXPECT_EQ(request.headers["content-type"], "application/json");
   EXPECT_EQ(request.headers["content-encoding"], "gzip");  // decoded by the receiver
-  EXPECT_EQ(request.headers["x-test"], "yes");              // the file wins
-  EXPECT_EQ(request.headers["x-env"], "from env");          // the environment fills in
+  EXPECT_EQ(request.headers["x-test"], "yes");             // the file wins
+  EXPECT_EQ(request.headers["x-env"], "from env");         // the environment fills in
   std::map<std::string, std::string> resource;
   SXValue body = OtlpReceiver::json(request);
   for (const SXValue& attribute : body["resourceLogs"][0]["resource"]["attributes"]) {

@@ -27,8 +27,8 @@ class OtlpReceiver {
     std::string method;
     std::string target;
     std::map<std::string, std::string> headers;  // names in lower case
-    std::string body;  // as sent, but decompressed
-    int status = 0;    // the status it was answered with; 0 when its connection was dropped
+    std::string body;                            // as sent, but decompressed
+    int status = 0;  // the status it was answered with; 0 when its connection was dropped
     std::chrono::steady_clock::time_point at;  // when it had come in whole
   };
 
@@ -82,10 +82,10 @@ class OtlpReceiver {
   asio::ip::tcp::acceptor acceptor_{io_};
   uint16_t port_ = 0;
   mutable std::mutex mutex_;
-  std::vector<Request> requests_;  // guarded by mutex_
-  size_t faultsLeft_ = 0;          // guarded by mutex_
-  int faultStatus_ = 0;            // guarded by mutex_; 0: drop
-  std::string faultRetryAfter_;    // guarded by mutex_
+  std::vector<Request> requests_;       // guarded by mutex_
+  size_t faultsLeft_ = 0;               // guarded by mutex_
+  int faultStatus_ = 0;                 // guarded by mutex_; 0: drop
+  std::string faultRetryAfter_;         // guarded by mutex_
   std::chrono::milliseconds delay_{0};  // guarded by mutex_
   std::thread thread_;
 };
