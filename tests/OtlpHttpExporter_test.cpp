@@ -2,11 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
 #include <fstream>
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeHttpPost.h"
 #include "fakes/FakeLog.h"
+#include "opentelemetry/proto/collector/logs/v1/logs_service.pb.h"
 #include "platform/SqliteFernReporting.h"
 #include "support/Daemon.h"
 #include "support/OtlpReceiver.h"
@@ -28,11 +30,22 @@ class OtlpHttpExporterTest : public ::testing::Test {
     options_.initialBackoff = 100ms;
     options_.maxBackoff = 1000ms;
     options_.resource.hostName = "box";
+    options_.gzip = false;  // bodies the fake can parse
   }
 
   std::unique_ptr<SXOtlpHttpExporter> Make(uint32_t random = 0) {
     return std::make_unique<SXOtlpHttpExporter>(db_, options_, http_, clock_,
                                                 std::make_shared<FixedRandom>(random), log_);
+  }
+  // An exporter that posts over HTTP with the real clock, started.
+  std::unique_ptr<SXOtlpHttpExporter> Started(const OtlpReceiver& receiver) {
+    options_.endpoint = receiver.endpoint();
+    options_.gzip = true;
+    auto exporter = std::make_unique<SXOtlpHttpExporter>(
+        db_, options_, std::make_shared<SXCurlHttpPost>(), std::make_shared<SXSystemClock>(),
+        std::make_shared<FixedRandom>(0), log_);
+    exporter->start();
+    return exporter;
   }
   // A standalone message, stored as the daemon stores it.
   void Standalone(const SXValue& payload, uint16_t category = 3) {
@@ -97,8 +110,8 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
   SXValue body = SXValue::parse(request.body);
   const SXValue& resource = body["resourceLogs"][0]["resource"];
   EXPECT_EQ(resource["attributes"],
-            (SXValue{{{"key", "service.name"}, {"value", {{"stringValue", "sxreportingd"}}}},
-                     {{"key", "host.name"}, {"value", {{"stringValue", "box"}}}}}));
+            (SXValue{{{"key", "host.name"}, {"value", {{"stringValue", "box"}}}},
+                     {{"key", "service.name"}, {"value", {{"stringValue", "sxreportingd"}}}}}));
   const SXValue& scope = body["resourceLogs"][0]["scopeLogs"][0];
   EXPECT_EQ(scope["scope"]["name"], "sxreporting");
   ASSERT_EQ(scope["logRecords"].size(), 2u);
@@ -133,6 +146,76 @@ TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
   // Beyond int64 a number keeps its digits as a string.
   EXPECT_EQ(single["body"]["kvlistValue"]["values"][0]["value"],
             (SXValue{{"stringValue", "9223372036854775808"}}));
+}
+
+TEST(OtlpLogsBody, ValuesMapAsTheProtobufJsonMappingWritesThem) {
+  const double inf = std::numeric_limits<double>::infinity();
+  struct Row {
+    SXValue value;
+    SXValue any;
+  } rows[] = {
+      {"text", {{"stringValue", "text"}}},
+      {true, {{"boolValue", true}}},
+      {-7, {{"intValue", "-7"}}},
+      {uint64_t(1) << 63, {{"stringValue", "9223372036854775808"}}},  // digits over kind
+      {1.5, {{"doubleValue", 1.5}}},
+      {std::nan(""), {{"doubleValue", "NaN"}}},
+      {inf, {{"doubleValue", "Infinity"}}},
+      {-inf, {{"doubleValue", "-Infinity"}}},
+      {SXValue::binary({0xde, 0xad, 0xbe, 0xef}), {{"bytesValue", "3q2+7w=="}}},
+      {SXValue::binary({'a', 'b'}), {{"bytesValue", "YWI="}}},
+      // A binary value as a JSON store gives it back.
+      {SXValue::parse(R"({"bytes": [104, 105, 33], "subtype": null})"), {{"bytesValue", "aGkh"}}},
+      {SXValue::parse(R"({"bytes": [1, 300], "subtype": null})"),  // not bytes: a dictionary
+       SXValue::parse(R"({"kvlistValue": {"values": [
+           {"key": "bytes", "value": {"arrayValue": {"values": [{"intValue": "1"},
+                                                                {"intValue": "300"}]}}},
+           {"key": "subtype", "value": {}}]}})")},
+      {nullptr, SXValue::object()},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.value.dump(-1, ' ', false, SXValue::error_handler_t::replace));
+    EXPECT_EQ(SXOtlpAnyValue(row.value), row.any);
+  }
+}
+
+TEST_F(OtlpHttpExporterTest, ProtobufBodyDecodesAsAnExportLogsServiceRequest) {
+  namespace otlp = opentelemetry::proto;
+  options_.encoding = SXOtlpExportOptions::Encoding::kProtobuf;
+  options_.resource.serviceVersion = "1.2.3";
+  options_.resource.attributes = {{"deployment.environment", "lab"}};
+  Standalone({{"level", 2.5}, {"blob", SXValue::binary({1, 2, 3})}, {"n", -4}});
+  Standalone({{"i", 2}});
+  ASSERT_EQ(Make()->exportOnce().outcome, Outcome::kExported);
+  auto request = http_->requests().at(0);
+  EXPECT_EQ(request.headers["Content-Type"], "application/x-protobuf");
+
+  otlp::collector::logs::v1::ExportLogsServiceRequest body;
+  ASSERT_TRUE(body.ParseFromString(request.body));
+  ASSERT_EQ(body.resource_logs_size(), 1);
+  std::map<std::string, std::string> resource;
+  for (const auto& attribute : body.resource_logs(0).resource().attributes()) {
+    resource[attribute.key()] = attribute.value().string_value();
+  }
+  EXPECT_EQ(resource, (std::map<std::string, std::string>{{"deployment.environment", "lab"},
+                                                          {"host.name", "box"},
+                                                          {"service.name", "sxreportingd"},
+                                                          {"service.version", "1.2.3"}}));
+  const auto& scope = body.resource_logs(0).scope_logs(0);
+  EXPECT_EQ(scope.scope().name(), "sxreporting");
+  ASSERT_EQ(scope.log_records_size(), 2);
+  const auto& record = scope.log_records(0);
+  EXPECT_EQ(record.observed_time_unix_nano(), 1800000000000000000u);
+  EXPECT_EQ(record.severity_number(), otlp::logs::v1::SEVERITY_NUMBER_INFO);
+  EXPECT_EQ(record.attributes(0).key(), "sxr.message.id");
+  EXPECT_EQ(record.attributes(0).value().int_value(), 1);
+  EXPECT_EQ(scope.log_records(1).attributes(0).value().int_value(), 2);
+  // Payload keys in order: blob, level, n.
+  const auto& payload = record.body().kvlist_value();
+  ASSERT_EQ(payload.values_size(), 3);
+  EXPECT_EQ(payload.values(0).value().bytes_value(), std::string("\x01\x02\x03", 3));
+  EXPECT_EQ(payload.values(1).value().double_value(), 2.5);
+  EXPECT_EQ(payload.values(2).value().int_value(), -4);
 }
 
 TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
@@ -218,6 +301,61 @@ TEST_F(OtlpHttpExporterTest, BackOffIsCappedAndHalfOfItIsRandom) {
             (std::vector<std::chrono::milliseconds>{300ms, 600ms, 1000ms, 1000ms, 1000ms, 1000ms}));
 }
 
+TEST_F(OtlpHttpExporterTest, RetryAfterOn429And503WaitsAtLeastThatLong) {
+  Standalone({{"i", 1}});
+  // FixedRandom(0): the back-off of a first failure is 50 ms; the clock says 08:00:00.
+  struct Row {
+    int status;
+    std::string retryAfter;
+    std::chrono::milliseconds delay;
+  } rows[] = {
+      {429, "2", 2000ms},
+      {503, "Fri, 15 Jan 2027 08:00:03 GMT", 3000ms},
+      {503, "Friday, 15-Jan-27 08:00:04 GMT", 4000ms},
+      {429, "Fri Jan 15 08:00:01 2027", 1000ms},
+      {429, "Fri, 15 Jan 2027 07:43:20 GMT", 50ms},  // past: the back-off
+      {429, "0", 50ms},                              // never shorter than the back-off
+      {503, "86400", 300000ms},                      // capped at 5 minutes
+      {429, "soon", 50ms},
+      {500, "2", 50ms},  // only 429 and 503 carry a wait
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.retryAfter);
+    http_->answer(row.status, "", {{"retry-after", row.retryAfter}});
+    auto exporter = Make();
+    EXPECT_EQ(exporter->delayAfter(exporter->exportOnce()), row.delay);
+  }
+}
+
+TEST_F(OtlpHttpExporterTest, TimeoutsHalveTheBatchAndLengthenTheTimeUntilDrained) {
+  options_.batchSize = 8;
+  options_.timeout = 100ms;
+  for (int i = 1; i <= 9; ++i) Standalone({{"i", i}});
+  for (int i = 0; i < 5; ++i) http_->timeOut();
+  auto exporter = Make();
+  while (exporter->exportOnce().outcome != Outcome::kIdle) {
+  }
+  std::vector<std::pair<size_t, int64_t>> posts;  // (records, timeout in ms)
+  for (const SXHttpRequest& request : http_->requests()) {
+    posts.emplace_back(Ids(SXValue::parse(request.body)).size(), request.timeout.count());
+  }
+  // Halved down to one message and doubled up to 8 times the timeout; then the batch grows
+  // back by doubling after each 2xx while the longer timeout stays for the backlog.
+  EXPECT_EQ(posts, (std::vector<std::pair<size_t, int64_t>>{{8, 100},
+                                                            {4, 200},
+                                                            {2, 400},
+                                                            {1, 800},
+                                                            {1, 800},
+                                                            {1, 800},
+                                                            {2, 800},
+                                                            {4, 800},
+                                                            {2, 800}}));
+  // Drained: the next backlog starts with the configured timeout again.
+  Standalone({{"i", 10}});
+  EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
+  EXPECT_EQ(http_->requests().back().timeout, 100ms);
+}
+
 TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
   for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
   options_.batchSize = 4;
@@ -297,6 +435,9 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
   EXPECT_EQ(defaults->endpoint, "http://127.0.0.1:4318/v1/logs");
   EXPECT_EQ(defaults->batchSize, 256u);
   EXPECT_EQ(defaults->maxBackoff, 60s);
+  EXPECT_TRUE(defaults->gzip);
+  EXPECT_EQ(defaults->encoding, SXOtlpExportOptions::Encoding::kJson);
+  EXPECT_FALSE(defaults->resource.serviceVersion.empty());  // the project's version
 
   auto options = SXOtlpExportOptions::fromJson({{"endpoint", "https://c:4318/v1/logs"},
                                                 {"batchSize", 10},
@@ -315,11 +456,77 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
   for (const char* bad :
        {R"([])", R"({"endpoint": "ftp://x"})", R"({"batchSize": 0})", R"({"batchSize": "5"})",
         R"({"intervalMs": -1})", R"({"headers": {"A": 1}})", R"({"headers": {"A": "x\ny"}})",
-        R"({"batchsize": 5})", R"({"initialBackoffMs": 500, "maxBackoffMs": 100})"}) {
+        R"({"batchsize": 5})", R"({"initialBackoffMs": 500, "maxBackoffMs": 100})",
+        R"({"compression": "zstd"})", R"({"encoding": "grpc"})",
+        R"({"resourceAttributes": {"a": 1}})"}) {
     SCOPED_TRACE(bad);
     error.clear();
     EXPECT_FALSE(SXOtlpExportOptions::fromJson(SXValue::parse(bad), error));
     EXPECT_FALSE(error.empty());
+  }
+}
+
+TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
+  struct Row {
+    const char* file;
+    SXEnvironment environment;
+    std::function<void(const SXOtlpExportOptions&)> check;
+  } rows[] = {
+      {"{}",
+       {{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://c:4318/"},
+        {"OTEL_EXPORTER_OTLP_PROTOCOL", "http/protobuf"},
+        {"OTEL_EXPORTER_OTLP_COMPRESSION", "none"}},
+       [](const SXOtlpExportOptions& o) {
+         EXPECT_EQ(o.endpoint, "http://c:4318/v1/logs");
+         EXPECT_EQ(o.encoding, SXOtlpExportOptions::Encoding::kProtobuf);
+         EXPECT_FALSE(o.gzip);
+       }},
+      // The signal's own variable is used as is and wins over the generic one.
+      {"{}",
+       {{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://c:4318"},
+        {"OTEL_EXPORTER_OTLP_LOGS_ENDPOINT", "https://d/logs"},
+        {"OTEL_EXPORTER_OTLP_TIMEOUT", "900"},
+        {"OTEL_EXPORTER_OTLP_LOGS_TIMEOUT", "250"}},
+       [](const SXOtlpExportOptions& o) {
+         EXPECT_EQ(o.endpoint, "https://d/logs");
+         EXPECT_EQ(o.timeout, 250ms);
+       }},
+      // What the file says wins, per key and per header or attribute name.
+      {R"({"endpoint": "http://file/v1/logs", "encoding": "json", "headers": {"A": "file"},
+           "resourceAttributes": {"deployment.environment": "prod"}})",
+       {{"OTEL_EXPORTER_OTLP_ENDPOINT", "http://env"},
+        {"OTEL_EXPORTER_OTLP_PROTOCOL", "http/protobuf"},
+        {"OTEL_EXPORTER_OTLP_HEADERS", "A=env, B=x%20y"},
+        {"OTEL_RESOURCE_ATTRIBUTES", "deployment.environment=lab,service.name=a,team=audio"},
+        {"OTEL_SERVICE_NAME", "b"}},
+       [](const SXOtlpExportOptions& o) {
+         EXPECT_EQ(o.endpoint, "http://file/v1/logs");
+         EXPECT_EQ(o.encoding, SXOtlpExportOptions::Encoding::kJson);
+         EXPECT_EQ(o.headers, (std::map<std::string, std::string>{{"A", "file"}, {"B", "x y"}}));
+         EXPECT_EQ(
+             o.resource.attributes,
+             (std::map<std::string, std::string>{
+                 {"deployment.environment", "prod"}, {"service.name", "b"}, {"team", "audio"}}));
+       }},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.file);
+    std::string error;
+    auto options =
+        SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment, error);
+    ASSERT_TRUE(options) << error;
+    row.check(*options);
+  }
+  for (const auto& [name, value] : std::vector<std::pair<std::string, std::string>>{
+           {"OTEL_EXPORTER_OTLP_PROTOCOL", "grpc"},
+           {"OTEL_EXPORTER_OTLP_TIMEOUT", "1s"},
+           {"OTEL_EXPORTER_OTLP_HEADERS", "A"},
+           {"OTEL_EXPORTER_OTLP_COMPRESSION", "br"},
+           {"OTEL_EXPORTER_OTLP_ENDPOINT", "c:4318"}}) {
+    SCOPED_TRACE(name);
+    std::string error;
+    EXPECT_FALSE(SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}}, error));
+    EXPECT_TRUE(error.starts_with("environment: ")) << error;
   }
 }
 
@@ -343,6 +550,42 @@ TEST(OtlpExportOptions, LoadsOnlyWhenTheBackendIsListed) {
             std::string::npos);
 }
 
+TEST_F(OtlpHttpExporterTest, OverHttpTheNextAttemptWaitsForRetryAfter) {
+  OtlpReceiver receiver;
+  receiver.failNext(1, 503, "1");
+  Standalone({{"i", 1}});
+  auto exporter = Started(receiver);
+  ASSERT_TRUE(receiver.waitFor([&] { return receiver.requests().size() >= 2; }));
+  auto requests = receiver.requests();
+  EXPECT_EQ(requests[0].status, 503);
+  EXPECT_EQ(requests[1].status, 200);
+  EXPECT_GE(requests[1].at - requests[0].at, 1s);  // not the 100 ms back-off
+}
+
+TEST_F(OtlpHttpExporterTest, OverHttpASlowCollectorGetsEachMessageAtMostFourTimes) {
+  OtlpReceiver receiver;
+  receiver.answerAfter(450ms);  // beyond the first two timeouts, within the third
+  options_.batchSize = 4;
+  options_.timeout = 150ms;
+  options_.initialBackoff = 10ms;
+  options_.maxBackoff = 20ms;
+  for (int i = 1; i <= 6; ++i) Standalone({{"i", i}});
+  auto exporter = Started(receiver);
+  std::map<int64_t, int> received;
+  auto count = [&] {
+    received.clear();
+    for (const SXValue& record : receiver.acceptedRecords()) {
+      ++received[*OtlpReceiver::intAttribute(record, "sxr.message.id")];
+    }
+    return received;
+  };
+  ASSERT_TRUE(receiver.waitFor([&] { return DurableCursor() == 6; })) << log_->messages().size();
+  exporter->stop();
+  count();
+  EXPECT_EQ(received.size(), 6u);
+  for (const auto& [id, times] : received) EXPECT_LE(times, 4) << "message " << id;
+}
+
 TEST(CurlHttpPost, ReportsStatusesAndFailuresWithoutAResponse) {
   OtlpReceiver receiver;
   SXCurlHttpPost http;
@@ -355,14 +598,33 @@ TEST(CurlHttpPost, ReportsStatusesAndFailuresWithoutAResponse) {
   EXPECT_EQ(seen.headers["x-key"], "v");
   EXPECT_EQ(seen.headers.count("expect"), 0u);  // no 100-continue round trip
 
-  receiver.failNext(1, 503);
-  EXPECT_EQ(http.post(request).status, 503);
+  receiver.failNext(1, 503, "7");
+  SXHttpResult unavailable = http.post(request);
+  EXPECT_EQ(unavailable.status, 503);
+  EXPECT_EQ(unavailable.headers["retry-after"], "7");
+
+  // A gzip body arrives whole (the receiver answers 400 to one it cannot decode).
+  SXHttpRequest zipped = request;
+  zipped.body = *SXGzip(std::string(20000, 'z') + "end");
+  zipped.headers["Content-Encoding"] = "gzip";
+  EXPECT_LT(zipped.body.size(), 1000u);
+  EXPECT_EQ(http.post(zipped).status, 200);
+  EXPECT_EQ(receiver.requests().back().body, std::string(20000, 'z') + "end");
+
   // A kept-alive connection that dies unanswered is tried once more on a fresh one.
   receiver.dropNext(2);
   SXHttpResult dropped = http.post(request);
   EXPECT_FALSE(dropped.status);
   EXPECT_FALSE(dropped.error.empty());
   EXPECT_EQ(http.post(request).status, 200);  // a fresh connection after the drop
+  EXPECT_FALSE(dropped.timedOut);
+
+  receiver.answerAfter(2s);
+  SXHttpRequest hurried = request;
+  hurried.timeout = 100ms;
+  SXHttpResult late = http.post(hurried);
+  EXPECT_FALSE(late.status);
+  EXPECT_TRUE(late.timedOut);
 
   request.url = "ftp://127.0.0.1/x";
   EXPECT_FALSE(http.post(request).status);

@@ -2,7 +2,11 @@
 
 #include <curl/curl.h>
 #include <dlfcn.h>
+#include <zlib.h>
 
+#include <algorithm>
+#include <cctype>
+#include <ctime>
 #include <type_traits>
 
 namespace {
@@ -73,6 +77,26 @@ size_t KeepResponse(char* data, size_t size, size_t count, void* user) {
   return bytes;
 }
 
+// Keeps the headers of the last response: an interim one (1xx) starts the collection over.
+size_t KeepHeader(char* data, size_t size, size_t count, void* user) {
+  auto* headers = static_cast<std::map<std::string, std::string>*>(user);
+  std::string_view line(data, size * count);
+  if (line.starts_with("HTTP/")) headers->clear();
+  size_t colon = line.find(':');
+  if (colon != std::string_view::npos && colon > 0) {
+    std::string name(line.substr(0, colon));
+    std::transform(name.begin(), name.end(), name.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    std::string_view value = line.substr(colon + 1);
+    size_t first = value.find_first_not_of(" \t");
+    size_t last = value.find_last_not_of(" \t\r\n");
+    (*headers)[name] = first > last || first == std::string_view::npos
+                           ? std::string()
+                           : std::string(value.substr(first, last - first + 1));
+  }
+  return size * count;
+}
+
 int AbortWhenCancelled(void* user, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
   return static_cast<std::atomic<bool>*>(user)->load() ? 1 : 0;
 }
@@ -89,6 +113,43 @@ struct HeaderList {
 };
 
 }  // namespace
+
+std::optional<std::chrono::milliseconds> SXRetryAfter(const std::string& value, SXDate now) {
+  using std::chrono::milliseconds;
+  if (!value.empty() && value.find_first_not_of("0123456789") == std::string::npos) {
+    // More than a year is as good as forever; the caller caps it anyway.
+    return std::chrono::seconds(value.size() > 8 ? 99999999 : std::stoll(value));
+  }
+  // The preferred format, then the two obsolete ones that recipients still have to read.
+  for (const char* format :
+       {"%a, %d %b %Y %H:%M:%S GMT", "%A, %d-%b-%y %H:%M:%S GMT", "%a %b %e %H:%M:%S %Y"}) {
+    std::tm date{};
+    const char* end = ::strptime(value.c_str(), format, &date);
+    if (!end || *end != '\0') continue;
+    auto when = std::chrono::system_clock::from_time_t(::timegm(&date));
+    return std::max(milliseconds(0), std::chrono::duration_cast<milliseconds>(when - now));
+  }
+  return std::nullopt;
+}
+
+std::optional<std::string> SXGzip(std::string_view body) {
+  z_stream stream{};
+  // 15 window bits, +16 for a gzip header and trailer rather than a zlib one.
+  if (deflateInit2(&stream, Z_DEFAULT_COMPRESSION, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY) !=
+      Z_OK) {
+    return std::nullopt;
+  }
+  std::string zipped(deflateBound(&stream, body.size()), '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(body.data()));
+  stream.avail_in = static_cast<uInt>(body.size());
+  stream.next_out = reinterpret_cast<Bytef*>(zipped.data());
+  stream.avail_out = static_cast<uInt>(zipped.size());
+  int status = deflate(&stream, Z_FINISH);
+  zipped.resize(stream.total_out);
+  deflateEnd(&stream);
+  if (status != Z_STREAM_END) return std::nullopt;
+  return zipped;
+}
 
 struct SXCurlHttpPost::Handle {
   struct Cleanup {
@@ -144,6 +205,8 @@ SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
   api.easySetopt(curl, CURLOPT_TIMEOUT_MS, static_cast<long>(request.timeout.count()));
   api.easySetopt(curl, CURLOPT_WRITEFUNCTION, KeepResponse);
   api.easySetopt(curl, CURLOPT_WRITEDATA, &result.body);
+  api.easySetopt(curl, CURLOPT_HEADERFUNCTION, KeepHeader);
+  api.easySetopt(curl, CURLOPT_HEADERDATA, &result.headers);
   api.easySetopt(curl, CURLOPT_NOPROGRESS, 0L);
   api.easySetopt(curl, CURLOPT_XFERINFOFUNCTION, AbortWhenCancelled);
   api.easySetopt(curl, CURLOPT_XFERINFODATA, &cancelled_);
@@ -152,7 +215,9 @@ SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
   CURLcode code = api.easyPerform(curl);
   if (code != CURLE_OK) {
     result.error = *errorText ? errorText : api.easyStrerror(code);
+    result.timedOut = code == CURLE_OPERATION_TIMEDOUT;
     result.body.clear();
+    result.headers.clear();
     handle_->curl.reset();  // a broken connection is not reused
   } else {
     long status = 0;

@@ -1,5 +1,5 @@
-// HTTP POST: sends one request body to a URL and returns the response status, for uploaders
-// such as the OTLP exporter.
+// HTTP POST: sends one request body to a URL and returns the response status and headers, for
+// uploaders such as the OTLP exporter.
 //
 // post() may be called from any thread; an implementation serialises its own calls, so callers
 // normally post from one thread of their own. cancel() may be called from any thread, and makes
@@ -17,6 +17,9 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
+
+#include "platform/Clock.h"
 
 struct SXHttpRequest {
   std::string url;
@@ -26,10 +29,19 @@ struct SXHttpRequest {
 };
 
 struct SXHttpResult {
-  std::optional<int> status;  // none when no response came
-  std::string body;           // the start of the response body (the first 4 KiB)
-  std::string error;          // why no response came; empty when one did
+  std::optional<int> status;                   // none when no response came
+  std::map<std::string, std::string> headers;  // of the response; names in lower case
+  std::string body;                            // the start of the response body (the first 4 KiB)
+  std::string error;                           // why no response came; empty when one did
+  bool timedOut = false;                       // no response within the request's timeout
 };
+
+// The wait a Retry-After header's `value` asks for, in delta-seconds or as an HTTP-date (taken
+// relative to `now`; a date in the past is no wait); none when `value` is neither.
+std::optional<std::chrono::milliseconds> SXRetryAfter(const std::string& value, SXDate now);
+
+// `body` gzip-compressed (for "Content-Encoding: gzip"); none when zlib fails (out of memory).
+std::optional<std::string> SXGzip(std::string_view body);
 
 class SXHttpPost {
  public:

@@ -3,64 +3,14 @@
 #include <pthread.h>
 
 #include <algorithm>
-#include <fstream>
 
 #include "common/SXValueText.h"
 #include "platform/DiscardLog.h"
+#include "platform/OtlpProtobuf.h"
 
 namespace {
 
 using std::chrono::milliseconds;
-
-constexpr const char* kBackendName = "otlp-http";
-
-// A whole number of `key` in [low, high], when present.
-std::optional<std::string> ReadCount(const SXValue& section, const char* key, int64_t low,
-                                     int64_t high, int64_t& out) {
-  auto it = section.find(key);
-  if (it == section.end()) return std::nullopt;
-  if (!it->is_number_integer() || it->get<int64_t>() < low || it->get<int64_t>() > high) {
-    return SXFormat("\"%@\" must be a whole number from %lli to %lli", key, low, high);
-  }
-  out = it->get<int64_t>();
-  return std::nullopt;
-}
-
-std::optional<std::string> ReadMilliseconds(const SXValue& section, const char* key,
-                                            milliseconds& out) {
-  int64_t count = out.count();
-  constexpr int64_t kDay = 24 * 3600 * 1000;
-  if (auto bad = ReadCount(section, key, 1, kDay, count)) return bad;
-  out = milliseconds(count);
-  return std::nullopt;
-}
-
-std::optional<std::string> ReadEndpoint(const SXValue& section, std::string& endpoint) {
-  auto it = section.find("endpoint");
-  if (it == section.end()) return std::nullopt;
-  if (!it->is_string() || !(it->get<std::string>().starts_with("http://") ||
-                            it->get<std::string>().starts_with("https://"))) {
-    return std::string("\"endpoint\" must be an http:// or https:// URL");
-  }
-  endpoint = it->get<std::string>();
-  return std::nullopt;
-}
-
-std::optional<std::string> ReadHeaders(const SXValue& section,
-                                       std::map<std::string, std::string>& headers) {
-  auto it = section.find("headers");
-  if (it == section.end()) return std::nullopt;
-  if (!it->is_object()) return std::string("\"headers\" must be an object of strings");
-  for (const auto& [name, value] : it->items()) {
-    bool clean = name.find_first_of(":\r\n") == std::string::npos && !name.empty();
-    if (!clean || !value.is_string() ||
-        value.get_ref<const std::string&>().find_first_of("\r\n") != std::string::npos) {
-      return SXFormat("header \"%@\" must be a name with a one-line string value", name);
-    }
-    headers[name] = value.get<std::string>();
-  }
-  return std::nullopt;
-}
 
 bool IsRetried(int status) {
   if (status >= 500 || status < 400) return true;  // 1xx and 3xx are not answers either
@@ -95,61 +45,6 @@ void LogPartialSuccess(SXLogFacility& log, const std::string& responseBody, int6
 
 }  // namespace
 
-std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& section,
-                                                                 std::string& error) {
-  static const char* const kKnown[] = {"endpoint",      "headers",    "batchSize",
-                                       "maxBatchBytes", "intervalMs", "initialBackoffMs",
-                                       "maxBackoffMs",  "timeoutMs"};
-  if (!section.is_object()) {
-    error = "must be an object";
-    return std::nullopt;
-  }
-  for (const auto& [key, value] : section.items()) {
-    if (std::find(std::begin(kKnown), std::end(kKnown), key) == std::end(kKnown)) {
-      error = SXFormat("unknown key \"%@\"", key);
-      return std::nullopt;
-    }
-  }
-  SXOtlpExportOptions options;
-  int64_t batchSize = int64_t(options.batchSize), maxBytes = int64_t(options.maxBatchBytes);
-  std::optional<std::string> bad = ReadEndpoint(section, options.endpoint);
-  if (!bad) bad = ReadHeaders(section, options.headers);
-  if (!bad) bad = ReadCount(section, "batchSize", 1, 100000, batchSize);
-  if (!bad) bad = ReadCount(section, "maxBatchBytes", 1, int64_t(1) << 30, maxBytes);
-  if (!bad) bad = ReadMilliseconds(section, "intervalMs", options.interval);
-  if (!bad) bad = ReadMilliseconds(section, "initialBackoffMs", options.initialBackoff);
-  if (!bad) bad = ReadMilliseconds(section, "maxBackoffMs", options.maxBackoff);
-  if (!bad) bad = ReadMilliseconds(section, "timeoutMs", options.timeout);
-  if (!bad && options.maxBackoff < options.initialBackoff) {
-    bad = "\"maxBackoffMs\" must not be below \"initialBackoffMs\"";
-  }
-  if (bad) {
-    error = *bad;
-    return std::nullopt;
-  }
-  options.batchSize = size_t(batchSize);
-  options.maxBatchBytes = size_t(maxBytes);
-  return options;
-}
-
-std::optional<SXOtlpExportOptions> SXOtlpExportOptions::load(
-    const std::string& configPath, const std::vector<std::string>& backends, SXLogFacility& log) {
-  if (std::find(backends.begin(), backends.end(), kBackendName) == backends.end()) {
-    return std::nullopt;
-  }
-  std::ifstream in(configPath);
-  SXValue config = SXValue::parse(in, nullptr, false);
-  SXValue section = SXValue::object();  // no "otlp-http" object: every default
-  if (config.is_object() && config.contains(kBackendName)) section = config[kBackendName];
-  std::string error;
-  auto options = fromJson(section, error);
-  if (!options) {
-    SXLOG(log, nullptr, SXLogLevel::kError,
-          "%@: \"otlp-http\": %@; not exporting (messages stay in the spool)", configPath, error);
-  }
-  return options;
-}
-
 SXOtlpHttpExporter::SXOtlpHttpExporter(std::string dbPath, SXOtlpExportOptions options,
                                        std::shared_ptr<SXHttpPost> http,
                                        std::shared_ptr<SXClock> clock,
@@ -161,55 +56,116 @@ SXOtlpHttpExporter::SXOtlpHttpExporter(std::string dbPath, SXOtlpExportOptions o
       random_(std::move(random)),
       log_(SXLogOrDiscard(std::move(log))),
       spool_(std::move(dbPath)),
-      batchLimit_(options_.batchSize) {}
+      sizeLimit_(options_.batchSize),
+      paceLimit_(options_.batchSize),
+      timeout_(options_.timeout) {}
 
 SXOtlpHttpExporter::~SXOtlpHttpExporter() { stop(); }
 
 uint64_t SXOtlpHttpExporter::backlog() const { return spool_.backlog(); }
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::exportOnce() {
+  retryAfter_.reset();
   std::vector<SXValue> rows;
-  if (auto failed = spool_.read(batchLimit_, options_.maxBatchBytes, rows)) {
+  size_t limit = std::min(sizeLimit_, paceLimit_);
+  if (auto failed = spool_.read(limit, options_.maxBatchBytes, rows)) {
     return this->failed("cannot read the spool: " + *failed);
   }
   if (rows.empty()) {
-    batchLimit_ = options_.batchSize;  // the backlog that met a size limit is gone
-    return {Outcome::kIdle, 0};
+    // The backlog that met a size limit or a slow collector is gone.
+    sizeLimit_ = options_.batchSize;
+    timeout_ = options_.timeout;
+    return {Outcome::kIdle, 0, limit};
   }
-  return post(rows);
+  Pass pass = post(rows);
+  pass.limit = limit;
+  return pass;
+}
+
+std::optional<SXHttpRequest> SXOtlpHttpExporter::request(const std::vector<SXValue>& rows,
+                                                         std::string& error) const {
+  SXHttpRequest request{options_.endpoint, options_.headers, "", timeout_};
+  request.body = SXOtlpLogsRequest(rows, options_.resource, clock_->now())
+                     .dump(-1, ' ', false, SXValue::error_handler_t::replace);
+  request.headers["Content-Type"] = "application/json";
+  if (options_.encoding == SXOtlpExportOptions::Encoding::kProtobuf) {
+    auto bytes = SXOtlpRequestProtobuf(request.body, error);
+    if (!bytes) return std::nullopt;
+    request.body = std::move(*bytes);
+    request.headers["Content-Type"] = "application/x-protobuf";
+  }
+  if (options_.gzip) {
+    // Sent uncompressed in the unlikely case that zlib has no memory.
+    if (auto zipped = SXGzip(request.body)) {
+      request.body = std::move(*zipped);
+      request.headers["Content-Encoding"] = "gzip";
+    }
+  }
+  return request;
 }
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& rows) {
   int64_t first = RowId(rows.front()), last = RowId(rows.back());
-  SXHttpRequest request{options_.endpoint, options_.headers, "", options_.timeout};
-  request.headers["Content-Type"] = "application/json";
-  request.body = SXOtlpLogsRequest(rows, options_.resource, clock_->now())
-                     .dump(-1, ' ', false, SXValue::error_handler_t::replace);
-  SXHttpResult result = http_->post(request);
-  if (!result.status) return failed(result.error);
+  std::string error;
+  auto request = this->request(rows, error);
+  if (!request) return dropped(first, last, rows.size(), "cannot encode them: " + error);
+  SXHttpResult result = http_->post(*request);
+  if (!result.status) {
+    if (result.timedOut) slowedDown(rows.size());
+    return failed(result.error);
+  }
   int status = *result.status;
-  if (status >= 200 && status < 300) {
-    LogPartialSuccess(*log_, result.body, first, last);
-  } else if (IsRetried(status)) {
+  bool accepted = status >= 200 && status < 300;
+  if (!accepted && IsRetried(status)) {
+    if (status == 429 || status == 503) retryAfter_ = requestedWait(result);
     return failed(SXFormat("the collector answered %i %@", status, OneLine(result.body)));
-  } else if (status == 413 && rows.size() > 1) {
-    batchLimit_ = rows.size() / 2;
+  }
+  if (!accepted && status == 413 && rows.size() > 1) {
+    sizeLimit_ = rows.size() / 2;
     SXLOG(*log_, nullptr, SXLogLevel::kInfo,
           "the collector found %zu messages too large; trying %zu at a time", rows.size(),
-          batchLimit_);
+          sizeLimit_);
     return {Outcome::kShrunk, rows.size()};
-  } else {
-    SXLOG(*log_, nullptr, SXLogLevel::kError,
-          "dropping messages %lli to %lli: the collector rejected them with %i %@", first, last,
-          status, OneLine(result.body));
   }
-  Outcome outcome = status < 300 ? Outcome::kExported : Outcome::kDropped;
+  if (!accepted) {
+    return dropped(
+        first, last, rows.size(),
+        SXFormat("the collector rejected them with %i %@", status, OneLine(result.body)));
+  }
+  bool protobuf = result.headers["content-type"] == "application/x-protobuf";
+  LogPartialSuccess(*log_, protobuf ? SXOtlpResponseJson(result.body) : result.body, first, last);
+  paceLimit_ = std::min(options_.batchSize, paceLimit_ * 2);
+  return moved(last, Outcome::kExported, rows.size());
+}
+
+SXOtlpHttpExporter::Pass SXOtlpHttpExporter::dropped(int64_t first, int64_t last, size_t rows,
+                                                     const std::string& why) {
+  SXLOG(*log_, nullptr, SXLogLevel::kError, "dropping messages %lli to %lli: %@", first, last, why);
+  return moved(last, Outcome::kDropped, rows);
+}
+
+SXOtlpHttpExporter::Pass SXOtlpHttpExporter::moved(int64_t last, Outcome outcome, size_t rows) {
   if (auto failedWrite = spool_.advance(last)) {
     // The cursor moved in memory, so nothing goes twice while this process runs.
     SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot store the export cursor: %@", *failedWrite);
   }
   succeeded();
-  return {outcome, rows.size()};
+  return {outcome, rows};
+}
+
+void SXOtlpHttpExporter::slowedDown(size_t posted) {
+  // The collector may have taken the batch it did not answer in time: fewer messages and more
+  // patience next time, so that a slow collector gets each message only a few times.
+  paceLimit_ = std::max<size_t>(1, posted / 2);
+  timeout_ = std::min(timeout_ * 2, options_.timeout * kTimeoutGrowth);
+}
+
+std::optional<milliseconds> SXOtlpHttpExporter::requestedWait(const SXHttpResult& result) const {
+  auto header = result.headers.find("retry-after");
+  if (header == result.headers.end()) return std::nullopt;
+  auto wait = SXRetryAfter(header->second, clock_->now());
+  if (!wait) return std::nullopt;
+  return std::min(*wait, kMaxRetryAfter);
 }
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::failed(const std::string& why) {
@@ -237,15 +193,17 @@ milliseconds SXOtlpHttpExporter::delayAfter(const Pass& pass) {
       return milliseconds(0);
     case Outcome::kExported:
     case Outcome::kDropped:
-      return pass.rows >= batchLimit_ ? milliseconds(0) : options_.interval;
+      return pass.rows >= pass.limit ? milliseconds(0) : options_.interval;
     case Outcome::kFailed: {
       // Doubling from the initial back-off, capped; half of it is random so that many daemons
-      // that lost the same collector do not come back at the same moment.
+      // that lost the same collector do not come back at the same moment. A collector that
+      // asks for a longer wait gets it.
       int64_t base = options_.initialBackoff.count();
       for (unsigned i = 1; i < failures_ && base < options_.maxBackoff.count(); ++i) base *= 2;
       base = std::min(base, options_.maxBackoff.count());
       uint32_t half = static_cast<uint32_t>(base / 2);
-      return milliseconds(base - half + random_->uniform(half + 1));
+      milliseconds backoff(base - half + random_->uniform(half + 1));
+      return std::max(backoff, retryAfter_.value_or(milliseconds(0)));
     }
     case Outcome::kIdle:
       break;
@@ -256,8 +214,10 @@ milliseconds SXOtlpHttpExporter::delayAfter(const Pass& pass) {
 void SXOtlpHttpExporter::start() {
   if (started_) return;
   started_ = true;
-  SXLOG(*log_, nullptr, SXLogLevel::kDefault, "exporting spooled messages to %@ (OTLP/HTTP JSON)",
-        options_.endpoint);
+  SXLOG(*log_, nullptr, SXLogLevel::kDefault, "exporting spooled messages to %@ (OTLP/HTTP %@%@)",
+        options_.endpoint,
+        options_.encoding == SXOtlpExportOptions::Encoding::kProtobuf ? "protobuf" : "JSON",
+        options_.gzip ? ", gzip" : "");
   thread_ = std::thread([this] { run(); });
 }
 

@@ -1,15 +1,20 @@
 // The "otlp-http" server-reporting backend: a thread of its own that uploads the messages of
 // the spool (`<state-dir>/fernreporting.db`, see SqliteFernReporting.h), session messages and
-// standalone messages alike, as OpenTelemetry log records to a collector's OTLP/HTTP JSON
-// endpoint (body: OtlpLogsBody.h).
+// standalone messages alike, as OpenTelemetry log records to a collector's OTLP/HTTP endpoint
+// (body: OtlpLogsBody.h, in JSON or protobuf (OtlpProtobuf.h), gzip-compressed or not).
 //
 // It reads the spool's `messages` table in row-id order beyond a durable cursor kept in the
 // same database, in the table otlp_export(id = 1, last_message_id), and POSTs one request per
 // batch (at most `batchSize` rows and about `maxBatchBytes` of payload). The cursor moves, in
 // one statement, only after the collector answered 2xx: every message goes in exactly one
-// successful POST while the process runs. A batch posted but not yet acknowledged when the
-// process dies is posted again after the restart (at least once across crashes); each record
-// carries its row id (sxr.message.id) so that a collector can drop the repeat.
+// successful POST while the process runs. Delivery is at least once: a POST the collector took
+// but did not answer in time is posted again, and so is a batch posted but not yet
+// acknowledged when the process dies; each record carries its row id (sxr.message.id) so that
+// a collector can drop the repeats. Their number is bounded: after a time-out the next batch
+// is half as large (down to one message) and may take twice as long (up to kTimeoutGrowth
+// times `timeout`), until the backlog is drained; batches grow back by doubling after each
+// 2xx. A collector that answers within kTimeoutGrowth times `timeout` thus gets each message
+// at most 1 + log2(kTimeoutGrowth) = 4 times while the process runs.
 //
 // Answers:
 //   2xx                     the cursor moves past the batch; a partial success is logged.
@@ -17,6 +22,8 @@
 //                           retried after a back-off that doubles from `initialBackoff` up to
 //                           `maxBackoff`, with jitter (half fixed, half random); one error line
 //                           per failure streak and one line when exports go through again.
+//                           A 429 or 503 with Retry-After waits at least that long (at most
+//                           kMaxRetryAfter), never less than the back-off.
 //                           Unauthorised or missing endpoints are configuration faults that an
 //                           operator fixes; the messages wait in the spool meanwhile.
 //   413                     the batch is halved and retried at once, and batches keep that
@@ -44,32 +51,9 @@
 #include "platform/Clock.h"
 #include "platform/HttpPost.h"
 #include "platform/Log.h"
-#include "platform/OtlpLogsBody.h"
+#include "platform/OtlpExportOptions.h"
 #include "platform/OtlpSpoolReader.h"
 #include "platform/Random.h"
-
-struct SXOtlpExportOptions {
-  std::string endpoint = "http://127.0.0.1:4318/v1/logs";
-  std::map<std::string, std::string> headers;  // sent with every request
-  size_t batchSize = 256;
-  size_t maxBatchBytes = 4 << 20;
-  std::chrono::milliseconds interval{1000};  // between passes once the backlog is drained
-  std::chrono::milliseconds initialBackoff{1000};
-  std::chrono::milliseconds maxBackoff{60000};
-  std::chrono::milliseconds timeout{10000};  // for one POST
-  SXOtlpResource resource;
-
-  // The options of the "otlp-http" object of fernreporting.json: endpoint, headers, batchSize,
-  // maxBatchBytes, intervalMs, initialBackoffMs, maxBackoffMs, timeoutMs; absent keys keep
-  // their defaults. On a key it does not know or a bad value returns none and sets `error`.
-  static std::optional<SXOtlpExportOptions> fromJson(const SXValue& section, std::string& error);
-
-  // The options in the config file `configPath` when `backends` lists "otlp-http"; none when
-  // it does not, or after an error line on `log` when the file's "otlp-http" object is bad.
-  static std::optional<SXOtlpExportOptions> load(const std::string& configPath,
-                                                 const std::vector<std::string>& backends,
-                                                 SXLogFacility& log);
-};
 
 class SXOtlpHttpExporter {
  public:
@@ -82,8 +66,14 @@ class SXOtlpHttpExporter {
   };
   struct Pass {
     Outcome outcome = Outcome::kIdle;
-    size_t rows = 0;  // rows posted
+    size_t rows = 0;   // rows posted
+    size_t limit = 0;  // the most rows the pass could take
   };
+
+  // A time-out raises the time allowed for a request by doubling up to this factor.
+  static constexpr int kTimeoutGrowth = 8;
+  // The longest wait a Retry-After header can impose.
+  static constexpr std::chrono::milliseconds kMaxRetryAfter{5 * 60 * 1000};
 
   SXOtlpHttpExporter(std::string dbPath, SXOtlpExportOptions options,
                      std::shared_ptr<SXHttpPost> http, std::shared_ptr<SXClock> clock,
@@ -110,9 +100,15 @@ class SXOtlpHttpExporter {
   std::chrono::milliseconds delayAfter(const Pass& pass);
 
  private:
+  std::optional<SXHttpRequest> request(const std::vector<SXValue>& rows, std::string& error) const;
   Pass post(const std::vector<SXValue>& rows);
+  // Moves the cursor past `last` after an answer that settles the batch.
+  Pass moved(int64_t last, Outcome outcome, size_t rows);
+  Pass dropped(int64_t first, int64_t last, size_t rows, const std::string& why);
   Pass failed(const std::string& why);
   void succeeded();
+  void slowedDown(size_t posted);
+  std::optional<std::chrono::milliseconds> requestedWait(const SXHttpResult& result) const;
   void run();
 
   const SXOtlpExportOptions options_;
@@ -123,8 +119,11 @@ class SXOtlpHttpExporter {
   SXOtlpSpoolReader spool_;  // has its own lock: backlog() reads it from other threads
 
   // Used by the exporting thread only (or the one caller of exportOnce).
-  size_t batchLimit_;      // batchSize, halved after a 413, restored after a 2xx
-  unsigned failures_ = 0;  // failed attempts in the current streak
+  size_t sizeLimit_;  // batchSize, halved after a 413, restored once the backlog is drained
+  size_t paceLimit_;  // batchSize, halved after a time-out, doubled after each 2xx
+  std::chrono::milliseconds timeout_;  // doubled after a time-out, reset once drained
+  std::optional<std::chrono::milliseconds> retryAfter_;  // asked for by the last answer
+  unsigned failures_ = 0;                                // failed attempts in the current streak
 
   std::mutex mutex_;
   std::condition_variable wake_;  // with mutex_: stop() wakes the thread from its wait

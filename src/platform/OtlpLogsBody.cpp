@@ -2,6 +2,7 @@
 
 #include <cmath>
 #include <limits>
+#include <optional>
 
 #include "platform/FernReporting.h"
 
@@ -15,6 +16,41 @@ SXValue KeyValue(const std::string& key, SXValue anyValue) {
 
 SXValue StringValue(const std::string& text) { return {{"stringValue", text}}; }
 SXValue IntValue(int64_t value) { return {{"intValue", std::to_string(value)}}; }
+
+// JSON has no NaN or infinities; the protobuf JSON mapping writes them as strings.
+SXValue DoubleValue(double value) {
+  if (std::isnan(value)) return {{"doubleValue", "NaN"}};
+  if (std::isinf(value)) return {{"doubleValue", value > 0 ? "Infinity" : "-Infinity"}};
+  return {{"doubleValue", value}};
+}
+
+SXValue BytesValue(const std::vector<uint8_t>& bytes) {
+  static constexpr char kDigits[] =
+      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+  std::string text;
+  for (size_t i = 0; i < bytes.size(); i += 3) {
+    uint32_t group = uint32_t(bytes[i]) << 16;
+    if (i + 1 < bytes.size()) group |= uint32_t(bytes[i + 1]) << 8;
+    if (i + 2 < bytes.size()) group |= bytes[i + 2];
+    for (size_t digit = 0; digit < 4; ++digit) {
+      text += i + digit <= bytes.size() ? kDigits[(group >> (18 - 6 * digit)) & 63] : '=';
+    }
+  }
+  return {{"bytesValue", text}};
+}
+
+// The bytes of a binary value as a JSON store keeps it, {"bytes": [...], "subtype": ...}.
+std::optional<std::vector<uint8_t>> StoredBytes(const SXValue& object) {
+  if (object.size() != 2 || !object.contains("subtype")) return std::nullopt;
+  auto bytes = object.find("bytes");
+  if (bytes == object.end() || !bytes->is_array()) return std::nullopt;
+  std::vector<uint8_t> out;
+  for (const SXValue& byte : *bytes) {
+    if (!byte.is_number_unsigned() || byte.get<uint64_t>() > 255) return std::nullopt;
+    out.push_back(static_cast<uint8_t>(byte.get<uint64_t>()));
+  }
+  return out;
+}
 
 // Nanoseconds since the epoch of a time in seconds, as a decimal string; "0" when unknown.
 std::string UnixNano(const SXValue& seconds) {
@@ -77,14 +113,12 @@ SXValue LogRecord(const SXOtlpSpooledRow& row, const std::string& observedNano) 
 }
 
 SXValue ResourceAttributes(const SXOtlpResource& resource) {
-  SXValue attributes =
-      SXValue::array({KeyValue("service.name", StringValue(resource.serviceName))});
-  if (!resource.serviceVersion.empty()) {
-    attributes.push_back(KeyValue("service.version", StringValue(resource.serviceVersion)));
-  }
-  if (!resource.hostName.empty()) {
-    attributes.push_back(KeyValue("host.name", StringValue(resource.hostName)));
-  }
+  std::map<std::string, std::string> named = {{"service.name", resource.serviceName}};
+  if (!resource.serviceVersion.empty()) named["service.version"] = resource.serviceVersion;
+  if (!resource.hostName.empty()) named["host.name"] = resource.hostName;
+  for (const auto& [key, value] : resource.attributes) named[key] = value;
+  SXValue attributes = SXValue::array();
+  for (const auto& [key, value] : named) attributes.push_back(KeyValue(key, StringValue(value)));
   return attributes;
 }
 
@@ -107,13 +141,16 @@ SXValue SXOtlpAnyValue(const SXValue& value) {
       return IntValue(static_cast<int64_t>(number));
     }
     case SXValue::value_t::number_float:
-      return {{"doubleValue", value.get<double>()}};
+      return DoubleValue(value.get<double>());
+    case SXValue::value_t::binary:
+      return BytesValue(value.get_binary());
     case SXValue::value_t::array: {
       SXValue values = SXValue::array();
       for (const SXValue& element : value) values.push_back(SXOtlpAnyValue(element));
       return {{"arrayValue", {{"values", std::move(values)}}}};
     }
     case SXValue::value_t::object: {
+      if (auto bytes = StoredBytes(value)) return BytesValue(*bytes);
       SXValue values = SXValue::array();
       for (const auto& [key, element] : value.items()) {
         values.push_back(KeyValue(key, SXOtlpAnyValue(element)));

@@ -12,9 +12,13 @@
 //                         sxr.reporter_id (the session info's session ID), sxr.service_name,
 //                         sxr.client_name, and for session messages sxr.session.spool_id and
 //                         sxr.session.token; an attribute whose value is unknown is left out.
-// 64-bit integers travel as decimal strings, as the protobuf JSON mapping writes them.
+// The value mapping is the protobuf JSON mapping's: 64-bit integers travel as decimal strings,
+// NaN and infinities as the strings "NaN", "Infinity" and "-Infinity" in doubleValue, binary
+// values as base64 in bytesValue. A binary value read back from a JSON store, the object
+// {"bytes": [...], "subtype": ...}, is a bytesValue too.
 #pragma once
 
+#include <map>
 #include <string>
 #include <vector>
 
@@ -23,8 +27,9 @@
 
 struct SXOtlpResource {
   std::string serviceName = "sxreportingd";
-  std::string serviceVersion;  // left out when empty
-  std::string hostName;        // left out when empty
+  std::string serviceVersion;                     // left out when empty
+  std::string hostName;                           // left out when empty
+  std::map<std::string, std::string> attributes;  // more; these win over the three above
 };
 
 // A spooled message as the exporter reads it: an object with the columns id, time (seconds
@@ -35,6 +40,6 @@ using SXOtlpSpooledRow = SXValue;
 // The OTLP AnyValue of a JSON value (arrays and objects recursively).
 SXValue SXOtlpAnyValue(const SXValue& value);
 
-// The ExportLogsServiceRequest for `rows`, exported at `observed`.
+// The ExportLogsServiceRequest for `rows`, exported at `observed`, in the OTLP JSON form.
 SXValue SXOtlpLogsRequest(const std::vector<SXOtlpSpooledRow>& rows, const SXOtlpResource& resource,
                           SXDate observed);

@@ -1,5 +1,6 @@
 // The "otlp-http" backend of the real daemon: spooled messages reach a collector on loopback
-// as OTLP log records, survive a failing collector and a restart, and go exactly once.
+// as OTLP log records (gzip JSON by default, protobuf when asked), survive a failing collector
+// and a restart, and go exactly once.
 #include <gtest/gtest.h>
 #include <signal.h>
 
@@ -12,11 +13,12 @@ namespace {
 
 using namespace std::chrono_literals;
 
-TestDaemon::Options Exporting(const OtlpReceiver& receiver) {
+TestDaemon::Options Exporting(const OtlpReceiver& receiver, const char* encoding = "json") {
   TestDaemon::Options options;
   options.fernConfig = {{"backends", {"spool", "otlp-http"}},
                         {"otlp-http",
                          {{"endpoint", receiver.endpoint()},
+                          {"encoding", encoding},
                           {"intervalMs", 50},
                           {"initialBackoffMs", 20},
                           {"maxBackoffMs", 100},
@@ -60,7 +62,10 @@ bool AllDeliveredOnce(const OtlpReceiver& receiver, const std::vector<int64_t>& 
 
 TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   OtlpReceiver receiver;
-  TestDaemon daemon(Exporting(receiver));
+  TestDaemon::Options options = Exporting(receiver);
+  options.environment = {{"OTEL_EXPORTER_OTLP_HEADERS", "X-Test=env,X-Env=from%20env"},
+                         {"OTEL_RESOURCE_ATTRIBUTES", "deployment.environment=e2e"}};
+  TestDaemon daemon(options);
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
   ASSERT_TRUE(replied(client->setServiceType(2, 42)));
@@ -79,7 +84,18 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   EXPECT_EQ(request.method, "POST");
   EXPECT_EQ(request.target, "/v1/logs");
   EXPECT_EQ(request.headers["content-type"], "application/json");
-  EXPECT_EQ(request.headers["x-test"], "yes");
+  EXPECT_EQ(request.headers["content-encoding"], "gzip");  // decoded by the receiver
+  EXPECT_EQ(request.headers["x-test"], "yes");             // the file wins
+  EXPECT_EQ(request.headers["x-env"], "from env");         // the environment fills in
+  std::map<std::string, std::string> resource;
+  SXValue body = OtlpReceiver::json(request);
+  for (const SXValue& attribute : body["resourceLogs"][0]["resource"]["attributes"]) {
+    resource[attribute["key"]] = attribute["value"]["stringValue"];
+  }
+  EXPECT_EQ(resource["service.name"], "sxreportingd");
+  EXPECT_EQ(resource["deployment.environment"], "e2e");
+  EXPECT_FALSE(resource["service.version"].empty());
+  EXPECT_FALSE(resource["host.name"].empty());
 
   std::map<std::string, SXValue> byKind;  // "<kind> <category>" -> record
   for (const SXValue& record : receiver.acceptedRecords()) {
@@ -106,7 +122,7 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
 
 TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) {
   OtlpReceiver receiver;
-  TestDaemon first(Exporting(receiver));
+  TestDaemon first(Exporting(receiver, "protobuf"));
   auto client = first.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   SendStandalone(*client, 1, 3);
@@ -124,7 +140,7 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   ::kill(first.pid(), SIGKILL);
   first.waitForExit();
   receiver.dropNext(2);
-  TestDaemon::Options options = Exporting(receiver);
+  TestDaemon::Options options = Exporting(receiver, "protobuf");
   options.extraArgs = {"--state-dir", first.dir("lib")};
   TestDaemon second(options);
   auto again = second.client();
@@ -141,6 +157,7 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   for (const auto& request : receiver.requests()) dropped += request.status == 0;
   EXPECT_EQ(dropped, 2u);
   EXPECT_TRUE(second.waitForLog("again after"));
+  EXPECT_EQ(receiver.requests().back().headers["content-type"], "application/x-protobuf");
 }
 
 TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {

@@ -3,8 +3,8 @@
 SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
   std::lock_guard lock(mutex_);
   requests_.push_back(request);
-  if (cancelled_) return {std::nullopt, "", "cancelled"};
-  if (script_.empty()) return {200, "", ""};
+  if (cancelled_) return {std::nullopt, {}, "", "cancelled"};
+  if (script_.empty()) return {200, {}, "", ""};
   SXHttpResult result = script_.front();
   script_.pop_front();
   return result;
@@ -15,9 +15,10 @@ void FakeHttpPost::cancel() {
   cancelled_ = true;
 }
 
-void FakeHttpPost::answer(int status, std::string body) {
+void FakeHttpPost::answer(int status, std::string body,
+                          std::map<std::string, std::string> headers) {
   std::lock_guard lock(mutex_);
-  script_.push_back({status, std::move(body), ""});
+  script_.push_back({status, std::move(headers), std::move(body), ""});
 }
 
 void FakeHttpPost::answerTimes(size_t count, int status) {
@@ -26,7 +27,12 @@ void FakeHttpPost::answerTimes(size_t count, int status) {
 
 void FakeHttpPost::fail(std::string error) {
   std::lock_guard lock(mutex_);
-  script_.push_back({std::nullopt, "", std::move(error)});
+  script_.push_back({std::nullopt, {}, "", std::move(error)});
+}
+
+void FakeHttpPost::timeOut() {
+  std::lock_guard lock(mutex_);
+  script_.push_back({std::nullopt, {}, "", "timed out", true});
 }
 
 std::vector<SXHttpRequest> FakeHttpPost::requests() const {

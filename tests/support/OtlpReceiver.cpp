@@ -1,8 +1,13 @@
 #include "support/OtlpReceiver.h"
 
+#include <google/protobuf/util/json_util.h>
+#include <zlib.h>
+
 #include <algorithm>
 #include <cctype>
 #include <sstream>
+
+#include "opentelemetry/proto/collector/logs/v1/logs_service.pb.h"
 
 namespace {
 
@@ -33,10 +38,31 @@ OtlpReceiver::Request ParseHead(const std::string& head) {
   return request;
 }
 
-std::string Response(int status) {
+std::string Response(int status, const std::string& retryAfter) {
   std::string body = status / 100 == 2 ? "{}" : "";
+  std::string extra = retryAfter.empty() ? "" : "Retry-After: " + retryAfter + "\r\n";
   return "HTTP/1.1 " + std::to_string(status) + " Test\r\nContent-Type: application/json\r\n" +
-         "Content-Length: " + std::to_string(body.size()) + "\r\n\r\n" + body;
+         extra + "Content-Length: " + std::to_string(body.size()) + "\r\n\r\n" + body;
+}
+
+// A gzip body decompressed; none when it is not gzip.
+std::optional<std::string> Gunzip(const std::string& zipped) {
+  z_stream stream{};
+  if (inflateInit2(&stream, 15 + 16) != Z_OK) return std::nullopt;
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(zipped.data()));
+  stream.avail_in = static_cast<uInt>(zipped.size());
+  std::string out;
+  int status = Z_OK;
+  while (status == Z_OK) {
+    char chunk[16384];
+    stream.next_out = reinterpret_cast<Bytef*>(chunk);
+    stream.avail_out = sizeof chunk;
+    status = inflate(&stream, Z_NO_FLUSH);
+    out.append(chunk, sizeof chunk - stream.avail_out);
+  }
+  inflateEnd(&stream);
+  if (status != Z_STREAM_END) return std::nullopt;
+  return out;
 }
 
 }  // namespace
@@ -72,21 +98,26 @@ class OtlpReceiver::Connection : public std::enable_shared_from_this<Connection>
     auto begin = asio::buffers_begin(buffer_.data());
     request_.body.assign(begin, begin + static_cast<std::ptrdiff_t>(length));
     buffer_.consume(length);
-    int status = receiver_.judge(request_);
-    if (status == 0) {
+    request_.at = std::chrono::steady_clock::now();
+    Answer answer = receiver_.judge(request_);
+    if (answer.status == 0) {
       std::error_code ignored;
       socket_.close(ignored);
       return;
     }
-    response_ = Response(status);
-    asio::async_write(socket_, asio::buffer(response_),
-                      [self = shared_from_this()](std::error_code error, size_t) {
-                        if (!error) self->readHead();
-                      });
+    response_ = Response(answer.status, answer.retryAfter);
+    timer_.expires_after(answer.delay);
+    timer_.async_wait([self = shared_from_this()](std::error_code) {
+      asio::async_write(self->socket_, asio::buffer(self->response_),
+                        [self](std::error_code error, size_t) {
+                          if (!error) self->readHead();
+                        });
+    });
   }
 
   OtlpReceiver& receiver_;
   asio::ip::tcp::socket socket_;
+  asio::steady_timer timer_{socket_.get_executor()};
   asio::streambuf buffer_;
   Request request_;
   std::string response_;
@@ -120,21 +151,34 @@ void OtlpReceiver::accept() {
   });
 }
 
-int OtlpReceiver::judge(Request request) {
+OtlpReceiver::Answer OtlpReceiver::judge(Request request) {
   std::lock_guard lock(mutex_);
-  request.status = 200;
+  Answer answer{200, "", delay_};
+  if (request.headers["content-encoding"] == "gzip") {
+    auto body = Gunzip(request.body);
+    if (body) request.body = std::move(*body);
+    if (!body) answer.status = 400;
+  }
   if (faultsLeft_ > 0) {
     --faultsLeft_;
-    request.status = faultStatus_;
+    answer.status = faultStatus_;
+    answer.retryAfter = faultRetryAfter_;
   }
+  request.status = answer.status;
   requests_.push_back(std::move(request));
-  return requests_.back().status;
+  return answer;
 }
 
-void OtlpReceiver::failNext(size_t count, int status) {
+void OtlpReceiver::failNext(size_t count, int status, std::string retryAfter) {
   std::lock_guard lock(mutex_);
   faultsLeft_ = count;
   faultStatus_ = status;
+  faultRetryAfter_ = std::move(retryAfter);
+}
+
+void OtlpReceiver::answerAfter(std::chrono::milliseconds delay) {
+  std::lock_guard lock(mutex_);
+  delay_ = delay;
 }
 
 void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
@@ -150,7 +194,7 @@ std::vector<SXValue> OtlpReceiver::acceptedRecords() const {
   std::vector<SXValue> records;
   for (const Request& request : requests()) {
     if (request.status / 100 != 2) continue;
-    SXValue body = SXValue::parse(request.body, nullptr, false);
+    SXValue body = json(request);
     if (!body.is_object()) continue;
     for (const SXValue& resource : body.value("resourceLogs", SXValue::array())) {
       for (const SXValue& scope : resource.value("scopeLogs", SXValue::array())) {
@@ -161,6 +205,20 @@ std::vector<SXValue> OtlpReceiver::acceptedRecords() const {
     }
   }
   return records;
+}
+
+SXValue OtlpReceiver::json(const Request& request) {
+  auto contentType = request.headers.find("content-type");
+  if (contentType == request.headers.end() || contentType->second != "application/x-protobuf") {
+    return SXValue::parse(request.body, nullptr, false);
+  }
+  opentelemetry::proto::collector::logs::v1::ExportLogsServiceRequest message;
+  std::string text;
+  if (!message.ParseFromString(request.body) ||
+      !google::protobuf::util::MessageToJsonString(message, &text).ok()) {
+    return SXValue(SXValue::value_t::discarded);
+  }
+  return SXValue::parse(text, nullptr, false);
 }
 
 bool OtlpReceiver::waitFor(const std::function<bool()>& ready,

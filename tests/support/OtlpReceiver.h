@@ -1,7 +1,9 @@
 // A small OTLP/HTTP logs collector for tests: an HTTP/1.1 server (bodies by Content-Length,
 // keep-alive) on 127.0.0.1 at an ephemeral port, run by a thread of its own. It records every
-// request and answers 200 with "{}", unless told to answer the next requests with another
-// status or to drop their connections without an answer.
+// request, gzip bodies decoded (a body that does not decode is answered 400), and answers 200
+// with "{}", unless told to answer the next requests with another status (and Retry-After), to
+// drop their connections without an answer, or to answer late. JSON and protobuf bodies are
+// both read as OTLP logs requests.
 //
 // All methods may be called from any thread.
 #pragma once
@@ -25,8 +27,9 @@ class OtlpReceiver {
     std::string method;
     std::string target;
     std::map<std::string, std::string> headers;  // names in lower case
-    std::string body;
+    std::string body;                            // as sent, but decompressed
     int status = 0;  // the status it was answered with; 0 when its connection was dropped
+    std::chrono::steady_clock::time_point at;  // when it had come in whole
   };
 
   OtlpReceiver();
@@ -38,16 +41,22 @@ class OtlpReceiver {
   // "http://127.0.0.1:<port>/v1/logs"
   std::string endpoint() const;
 
-  // The next `count` requests are answered with `status` instead of 200.
-  void failNext(size_t count, int status);
+  // The next `count` requests are answered with `status` instead of 200, with a Retry-After
+  // header when `retryAfter` is not empty.
+  void failNext(size_t count, int status, std::string retryAfter = "");
+  // Every answer from now on comes `delay` after its request.
+  void answerAfter(std::chrono::milliseconds delay);
   // The next `count` requests are read and then their connection is closed, unanswered.
   void dropNext(size_t count);
   // Every request from now on is answered 200 again.
   void succeed();
 
   std::vector<Request> requests() const;
-  // The log records of the requests answered 2xx, in the order they came.
+  // The log records of the requests answered 2xx, in the order they came (whether or not the
+  // answer reached the client in time).
   std::vector<SXValue> acceptedRecords() const;
+  // The body of `request` as OTLP JSON, protobuf bodies converted; discarded when unreadable.
+  static SXValue json(const Request& request);
   // Waits until `ready` holds (it is called under no lock); false after `timeout`.
   bool waitFor(const std::function<bool()>& ready,
                std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
@@ -61,15 +70,22 @@ class OtlpReceiver {
   friend class Connection;
 
   void accept();
-  // The status to answer `request` with (0: drop), recorded with it.
-  int judge(Request request);
+  struct Answer {
+    int status = 200;  // 0: drop the connection
+    std::string retryAfter;
+    std::chrono::milliseconds delay{0};
+  };
+  // How to answer `request`, recorded with it.
+  Answer judge(Request request);
 
   asio::io_context io_;
   asio::ip::tcp::acceptor acceptor_{io_};
   uint16_t port_ = 0;
   mutable std::mutex mutex_;
-  std::vector<Request> requests_;  // guarded by mutex_
-  size_t faultsLeft_ = 0;          // guarded by mutex_
-  int faultStatus_ = 0;            // guarded by mutex_; 0: drop
+  std::vector<Request> requests_;       // guarded by mutex_
+  size_t faultsLeft_ = 0;               // guarded by mutex_
+  int faultStatus_ = 0;                 // guarded by mutex_; 0: drop
+  std::string faultRetryAfter_;         // guarded by mutex_
+  std::chrono::milliseconds delay_{0};  // guarded by mutex_
   std::thread thread_;
 };

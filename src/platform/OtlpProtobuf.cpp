@@ -1,0 +1,32 @@
+#include "platform/OtlpProtobuf.h"
+
+#include <google/protobuf/util/json_util.h>
+
+#include "opentelemetry/proto/collector/logs/v1/logs_service.pb.h"
+
+namespace otlp = opentelemetry::proto::collector::logs::v1;
+
+std::optional<std::string> SXOtlpRequestProtobuf(const std::string& json, std::string& error) {
+  otlp::ExportLogsServiceRequest request;
+  auto status = google::protobuf::util::JsonStringToMessage(json, &request);
+  if (!status.ok()) {
+    error = status.ToString();
+    return std::nullopt;
+  }
+  std::string bytes;
+  if (!request.SerializeToString(&bytes)) {
+    error = "cannot serialise the request";
+    return std::nullopt;
+  }
+  return bytes;
+}
+
+std::string SXOtlpResponseJson(const std::string& protobuf) {
+  otlp::ExportLogsServiceResponse response;
+  std::string json;
+  if (!response.ParseFromString(protobuf) ||
+      !google::protobuf::util::MessageToJsonString(response, &json).ok()) {
+    return "";
+  }
+  return json;
+}

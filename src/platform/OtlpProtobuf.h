@@ -1,0 +1,15 @@
+// The protobuf form of OTLP logs export messages, made with the classes generated from
+// third_party/opentelemetry-proto. The exporter builds every request in the OTLP JSON form
+// (OtlpLogsBody.h), which is the protobuf JSON mapping of the same messages, so one mapping
+// of the spool serves both encodings. Pure functions, callable from any thread.
+#pragma once
+
+#include <optional>
+#include <string>
+
+// The ExportLogsServiceRequest written as OTLP JSON in `json`, serialised as protobuf. On
+// failure (a field or value the message cannot hold) returns none and sets `error`.
+std::optional<std::string> SXOtlpRequestProtobuf(const std::string& json, std::string& error);
+
+// An ExportLogsServiceResponse in protobuf as OTLP JSON text; empty when it cannot be decoded.
+std::string SXOtlpResponseJson(const std::string& protobuf);
