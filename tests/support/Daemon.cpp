@@ -56,6 +56,7 @@ TestDaemon::TestDaemon(Options options) {
   if (!options.fernConfig.is_null()) {
     writeJson(dir_.file("etc/fernreporting.json"), options.fernConfig);
   }
+  if (!options.config.is_null()) writeJson(dir_.file("etc/sxreportingd.json"), options.config);
   for (const auto& [path, value] : options.counters) setCounter(path, value);
   stateDir_ = options.stateDir.empty() ? dir_.file("lib") : options.stateDir;
   socket_ = dir_.file("run/sxr.sock");

@@ -31,6 +31,7 @@ class TestDaemon {
     std::string stateDir = {};
     // Variables set for the daemon process alone (LD_PRELOAD, say), beside the test's own.
     std::map<std::string, std::string> environment = {};
+    SXValue config = {};  // sxreportingd.json, when not null
   };
 
   // Writes a driver counter file under the kestrel root.

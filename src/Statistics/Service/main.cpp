@@ -14,6 +14,7 @@
 #include "platform/InotifyNotifications.h"
 #include "platform/JsonPreferences.h"
 #include "platform/OtlpHttpExporter.h"
+#include "platform/Retention.h"
 #include "platform/SqliteFernReporting.h"
 #include "platform/SqliteJoulebook.h"
 #include "platform/SqliteTallyvane.h"
@@ -312,6 +313,21 @@ std::unique_ptr<SXOtlpHttpExporter> otlpExporter(const Options& options, const S
                                               platform.random, log);
 }
 
+// Retention of the stores and files, from the "retention" section of sxreportingd.json.
+std::shared_ptr<SXRetention> retentionRunner(const Options& options, const SXPlatform& platform,
+                                             bool spoolExported,
+                                             const std::shared_ptr<SXLogFacility>& log) {
+  const SXPaths& p = options.paths;
+  auto policy = SXRetentionPolicy::load(p.configDir + "/sxreportingd.json", *log);
+  SXLOG(*log, nullptr, SXLogLevel::kDefault, "retention: %s", policy.description());
+  return SXRetention::create({.stateDir = p.stateDir,
+                              .diagnosticLogsDir = p.diagnosticLogsDir,
+                              .spoolExported = spoolExported,
+                              .dispatch = platform.dispatch,
+                              .log = log},
+                             policy);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -338,6 +354,7 @@ int main(int argc, char** argv) {
   auto delegate = SXReportingServiceDelegate::init(environment);
   std::shared_ptr<SXOtlpHttpExporter> exporter =
       otlpExporter(options, environment->platform(), log);
+  auto retainer = retentionRunner(options, environment->platform(), exporter != nullptr, log);
   RpcLimits limits;
   limits.maxMessageBytes = options.maxMessageBytes;
   // Requests are handed to the server queue, so that queue tells when they have been handled.
@@ -361,7 +378,9 @@ int main(int argc, char** argv) {
                            ? std::function<uint64_t()>([exporter] { return exporter->backlog(); })
                            : std::function<uint64_t()>(),
        .partialFrames = [&listener] { return listener.partialFrameTimeouts(); },
-       .inflightBytes = [&listener] { return listener.inflightBytes(); }});
+       .inflightBytes = [&listener] { return listener.inflightBytes(); },
+       .retentionCounters = [retainer] { return retainer->counters(); },
+       .retentionGauges = [retainer] { return retainer->gauges(); }});
 
   std::string error;
   if (!listener.open(error)) {
@@ -388,7 +407,9 @@ int main(int argc, char** argv) {
       environment->platform().process->processIdentifier(), options.paths.socketPath,
       listener.socketActivated() ? " (socket activated)" : "", options.paths.socketPath);
   if (exporter) exporter->start();
+  retainer->start();
   listener.resume();
+  retainer->stop();
   if (exporter) exporter->stop();
   return 0;
 }
