@@ -246,7 +246,7 @@ TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
   EXPECT_EQ(sizes[0]["oldest"], 10.5);
   EXPECT_GT(sizes[0]["usedBytes"], 0);
   EXPECT_NE(
-      run({"sizes"}).out.find("tallyvane.db              3 rows  oldest 1970-01-01T00:00:10Z"),
+      run({"sizes"}).out.find("tallyvane.db               3 rows  oldest 1970-01-01T00:00:10Z"),
       std::string::npos);
 }
 
