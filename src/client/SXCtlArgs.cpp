@@ -180,7 +180,11 @@ std::optional<double> relativeSeconds(const std::string& text) {
 std::optional<double> utcSeconds(std::string text) {
   if (text.ends_with('Z')) text.pop_back();
   if (text.size() > 10 && text[10] == ' ') text[10] = 'T';
-  for (const char* format : {"%Y-%m-%d", "%Y-%m-%dT%H:%M", "%Y-%m-%dT%H:%M:%S"}) {
+  // get_time() stops quietly at the end of the text, so the length must match the format's.
+  const std::pair<const char*, size_t> formats[] = {
+      {"%Y-%m-%d", 10}, {"%Y-%m-%dT%H:%M", 16}, {"%Y-%m-%dT%H:%M:%S", 19}};
+  for (const auto& [format, length] : formats) {
+    if (text.size() != length) continue;
     std::tm utc{};
     std::istringstream in(text);
     in >> std::get_time(&utc, format);
