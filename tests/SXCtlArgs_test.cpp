@@ -135,6 +135,35 @@ TEST(SXCtlArgsTest, EventsFilters) {
   EXPECT_EQ(r.limit, 3);
   EXPECT_FALSE(parse({"events"}).limit.has_value());
   EXPECT_EQ(parseError({"events", "--limit", "-1"}), "--limit must not be negative");
+  EXPECT_EQ(parse({"events", "--since", "2026-11-25T06:30:15Z"}).since, 1795588215.0);
+  EXPECT_FALSE(parse({"events"}).since.has_value());
+}
+
+TEST(SXCtlArgsTest, SinceTakesUtcTimesAndAges) {
+  const double now = 1795588215.5;  // 2026-11-25T06:30:15.5Z
+  const std::pair<const char*, double> good[] = {
+      {"2026-11-25T06:30:15Z", 1795588215},
+      {"2026-11-25T06:30:15", 1795588215},
+      {"2026-11-25 06:30", 1795588200},
+      {"2026-11-25", 1795564800},
+      {"90s", now - 90},
+      {"10m", now - 600},
+      {"2h", now - 7200},
+      {"1.5d", now - 129600},
+  };
+  for (const auto& [text, expected] : good) {
+    double since = 0;
+    std::string error;
+    EXPECT_TRUE(SXCtlParseSince(text, now, since, error)) << text << ": " << error;
+    EXPECT_EQ(since, expected) << text;
+  }
+  for (const char* bad : {"", "yesterday", "10", "10w", "-5m", "2026-11-25T25:00", "2026-13-01",
+                          "2026-11-25T06:30:15+02:00", "2026-11-25x"}) {
+    double since = 0;
+    std::string error;
+    EXPECT_FALSE(SXCtlParseSince(bad, now, since, error)) << bad;
+    EXPECT_NE(error.find("not a time: '" + std::string(bad) + "'"), std::string::npos) << error;
+  }
 }
 
 TEST(SXCtlArgsTest, HelpForTheToolAndEachCommand) {

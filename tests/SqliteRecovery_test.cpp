@@ -1,4 +1,5 @@
-// Stores that cannot be opened: what is moved aside, what never is, and the write-error counts.
+// Opening stores: what is moved aside, what never is, the write-error counts, and the one-time
+// conversion to incremental vacuum.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <linux/fs.h>
@@ -209,4 +210,33 @@ TEST(SqliteRecovery, StoresLogTheMoveAndCountRowsTheyCouldNotWrite) {
   EXPECT_FALSE(spool.sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
   EXPECT_FALSE(spool.openSession({}, {}, {}));
   EXPECT_EQ(spool.writeErrors(), 2u);
+}
+
+TEST(SqliteRecovery, AStoreMadeWithoutIncrementalVacuumIsConvertedOnceByItsOwner) {
+  SXTestTempDir dir;
+  std::string path = dir.file("store.db");
+  sqlite3* raw = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &raw), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(raw, "CREATE TABLE t(x); INSERT INTO t VALUES (1), (2)", nullptr,
+                         nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(raw);
+  auto autoVacuum = [&](SXSqliteConnection& db) {
+    int64_t mode = -1;
+    EXPECT_EQ(db.queryInt("PRAGMA auto_vacuum", {}, mode), std::nullopt);
+    return mode;
+  };
+  std::string error, recovered;
+  // Other connections never convert: the copy would hold the store's writers up.
+  auto other = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadWrite, 1s, "", error);
+  ASSERT_TRUE(other) << error;
+  EXPECT_EQ(autoVacuum(*other), 0);
+  other.reset();
+  auto owner = SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered);
+  ASSERT_TRUE(owner) << error;
+  EXPECT_EQ(autoVacuum(*owner), 2);  // incremental
+  EXPECT_EQ(recovered, "");
+  int64_t rows = 0;
+  EXPECT_EQ(owner->queryInt("SELECT COUNT(*) FROM t", {}, rows), std::nullopt);
+  EXPECT_EQ(rows, 2);
 }

@@ -248,6 +248,21 @@ TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
   EXPECT_EQ(
       json,
       SXValue::array({{{"id", 2}, {"time", 11.0}, {"name", "b"}, {"payload", SXValue::object()}}}));
+  EXPECT_EQ(run({"events", "--since", "1970-01-01T00:00:11Z"}).out,
+            "2  11.000  b  {}\n3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(run({"events", "--since", "1970-01-01T00:00:11Z", "--name", "a"}).out,
+            "3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(run({"events", "--since", "1h"}).out, "(none)\n");
+
+  SXValue sizes = SXValue::parse(run({"--json", "sizes"}).out);
+  ASSERT_EQ(sizes.size(), 1u);  // only the analytics store is there
+  EXPECT_EQ(sizes[0]["store"], "tallyvane.db");
+  EXPECT_EQ(sizes[0]["rows"], 3);
+  EXPECT_EQ(sizes[0]["oldest"], 10.5);
+  EXPECT_GT(sizes[0]["usedBytes"], 0);
+  EXPECT_NE(
+      run({"sizes"}).out.find("tallyvane.db               3 rows  oldest 1970-01-01T00:00:10Z"),
+      std::string::npos);
 }
 
 }  // namespace

@@ -3,9 +3,13 @@
 #include <algorithm>
 #include <cctype>
 #include <charconv>
+#include <chrono>
 #include <cmath>
+#include <ctime>
+#include <iomanip>
 #include <map>
 #include <set>
+#include <sstream>
 #include <string_view>
 
 #include "client/SXServiceTypeNames.h"
@@ -142,6 +146,11 @@ bool buildSend(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
 
 bool buildEvents(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   if (auto it = raw.options.find("--name"); it != raw.options.end()) r.eventName = it->second;
+  if (auto it = raw.options.find("--since"); it != raw.options.end()) {
+    const double now =
+        std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+    if (!SXCtlParseSince(it->second, now, r.since.emplace(), error)) return false;
+  }
   if (auto it = raw.options.find("--limit"); it != raw.options.end()) {
     int64_t limit = 0;
     if (!parseInt64(it->second, "a count", limit, error)) return false;
@@ -152,6 +161,38 @@ bool buildEvents(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
     r.limit = limit;
   }
   return true;
+}
+
+// "10m": a number and one of s, m, h, d.
+std::optional<double> relativeSeconds(const std::string& text) {
+  static const std::map<char, double> kUnits = {{'s', 1}, {'m', 60}, {'h', 3600}, {'d', 86400}};
+  if (text.size() < 2 || !kUnits.contains(text.back())) return std::nullopt;
+  double amount = 0;
+  auto [end, ec] = std::from_chars(text.data(), text.data() + text.size() - 1, amount);
+  if (ec != std::errc() || end != text.data() + text.size() - 1 || !std::isfinite(amount) ||
+      amount < 0) {
+    return std::nullopt;
+  }
+  return amount * kUnits.at(text.back());
+}
+
+// "2026-11-25", "2026-11-25T06:30" or "2026-11-25T06:30:15", with an optional Z: UTC.
+std::optional<double> utcSeconds(std::string text) {
+  if (text.ends_with('Z')) text.pop_back();
+  if (text.size() > 10 && text[10] == ' ') text[10] = 'T';
+  // get_time() stops quietly at the end of the text, so the length must match the format's.
+  const std::pair<const char*, size_t> formats[] = {
+      {"%Y-%m-%d", 10}, {"%Y-%m-%dT%H:%M", 16}, {"%Y-%m-%dT%H:%M:%S", 19}};
+  for (const auto& [format, length] : formats) {
+    if (text.size() != length) continue;
+    std::tm utc{};
+    std::istringstream in(text);
+    in >> std::get_time(&utc, format);
+    if (!in.fail() && in.peek() == std::char_traits<char>::eof()) {
+      return static_cast<double>(::timegm(&utc));
+    }
+  }
+  return std::nullopt;
 }
 
 bool parseBool(const std::string& text, bool& out) {
@@ -317,6 +358,21 @@ bool sortArguments(const std::vector<std::string>& args, RawArgs& raw, SXCtlRequ
 
 }  // namespace
 
+bool SXCtlParseSince(const std::string& text, double now, double& since, std::string& error) {
+  if (auto ago = relativeSeconds(text)) {
+    since = now - *ago;
+    return true;
+  }
+  if (auto time = utcSeconds(text)) {
+    since = *time;
+    return true;
+  }
+  error = "not a time: '" + text +
+          "' (a UTC time such as 2026-11-25T06:30:00Z or 2026-11-25, or an age such as 90s, 10m, "
+          "2h, 3d)";
+  return false;
+}
+
 bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& r, std::string& error) {
   r = SXCtlRequest();
   RawArgs raw;
@@ -478,10 +534,18 @@ const std::vector<CommandSpec>& commandSpecs() {
        "gauges in the Prometheus text format (version 0.0.4) instead, for a metrics\n"
        "collector; --json does not apply to it.",
        0, 0, {}, {"--metrics"}, buildStatus},
-      {"events", "events [--name NAME] [--limit N]", "print the stored analytics events",
+      {"events", "events [--name NAME] [--since WHEN] [--limit N]",
+       "print the stored analytics events",
        "Reads <state-dir>/tallyvane.db: id, time, name and payload of each event, oldest\n"
-       "first. --name keeps one event name; --limit keeps the newest N.",
-       0, 0, {"--name", "--limit"}, {}, buildEvents},
+       "first. --name keeps one event name; --since keeps the events from WHEN on, a UTC time\n"
+       "(2026-11-25T06:30:00Z, 2026-11-25T06:30, 2026-11-25) or an age (90s, 10m, 2h, 3d);\n"
+       "--limit keeps the newest N of those.",
+       0, 0, {"--name", "--since", "--limit"}, {}, buildEvents},
+      {"sizes", "sizes", "show how much each local store holds",
+       "Reads tallyvane.db, joulebook.db and fernreporting.db in <state-dir>: rows, the oldest\n"
+       "row's time, the bytes their pages hold (what the retention caps) and the bytes of\n"
+       "the files and their write-ahead logs on disk.",
+       0, 0, {}, {}, buildNothing},
       {"defaults", "defaults read [KEY] | write [--bool|--int|--string] KEY VALUE | delete KEY",
        "read and change the preferences",
        "The domain com.vendra.sonex, kept in <preferences-dir>/com.vendra.sonex.json.\n"

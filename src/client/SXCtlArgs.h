@@ -33,6 +33,7 @@ struct SXCtlRequest {
   std::optional<std::vector<int64_t>> reporterIDs;  // send: nothing means broadcast
   std::optional<std::string> eventName;             // events
   std::optional<int64_t> limit;                     // events: the newest N only
+  std::optional<double> since;                      // events: seconds since the epoch
   std::string defaultsAction;                       // defaults: "read", "write" or "delete"
   std::optional<std::string> key;                   // defaults
   SXValue value;                                    // defaults write
@@ -64,6 +65,11 @@ bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& request, std
 // it. Global options anywhere apply to every command. After "--", "then" is an argument.
 bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
                      std::string& error);
+
+// The time `text` names, in seconds since the epoch: a UTC date and time in ISO 8601
+// ("2026-11-25", "2026-11-25T06:30", "2026-11-25T06:30:15Z"; a space may stand for the T),
+// or a time before `now` ("90s", "10m", "2h", "3d"). On failure returns false and says why.
+bool SXCtlParseSince(const std::string& text, double now, double& since, std::string& error);
 
 // The help of `command`, or the overview for an empty or unknown command.
 std::string SXCtlHelp(const std::string& command);

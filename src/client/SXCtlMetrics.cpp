@@ -25,12 +25,15 @@ constexpr Known kKnownCounters[] = {
     {"guardrail_dropped", "Sessions, entries or requests that each guardrail refused.",
      "guardrail"},
     {"store_write_errors", "Writes to each durable store that failed.", "store"},
+    {"rows_pruned", "Rows the retention deleted from each store.", "store"},
+    {"files_aged_out", "Summary files and damaged store copies the retention removed.", "kind"},
 };
 
 constexpr Known kKnownGauges[] = {
     {"sessions_live", "Reporting sessions that exist now.", "kind"},
     {"clients_live", "Client connections open now.", "kind"},
     {"spool_backlog", "Entries in the server-reporting spool waiting to be flushed.", "kind"},
+    {"store_bytes", "Bytes each store's pages hold, as the last retention pass measured.", "store"},
 };
 
 template <size_t N>

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -127,8 +128,12 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
     error = "cannot open " + path + ": " + sqlite3_errstr(SQLITE_READONLY);
     return nullptr;
   }
+  // auto_vacuum must come before the first table; on an existing store it is only a wish that
+  // convertToIncrementalVacuum() fulfils.
   for (const std::string& sql :
-       {std::string("PRAGMA journal_mode=WAL"), std::string("PRAGMA synchronous=NORMAL"), schema}) {
+       {std::string("PRAGMA auto_vacuum=INCREMENTAL"), std::string("PRAGMA journal_mode=WAL"),
+        std::string("PRAGMA synchronous=NORMAL"),
+        "PRAGMA journal_size_limit=" + std::to_string(kSXSqliteJournalSizeLimit), schema}) {
     if (auto failed = connection->exec(sql)) {
       code = sqlite3_errcode(db);
       error = "cannot open " + path + ": " + *failed;
@@ -221,7 +226,10 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openOrRecover(
     std::string& error, std::string& recovered) {
   int code = SQLITE_OK;
   auto connection = openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
-  if (connection) return connection;
+  if (connection) {
+    connection->convertToIncrementalVacuum();
+    return connection;
+  }
   SXSqliteFileProbe probe = SXSqliteProbeFile(path);
   switch (SXSqliteClassifyOpenFailure(code, probe)) {
     case SXSqliteOpenFailure::kNotWritable:
@@ -241,6 +249,42 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openOrRecover(
   error.clear();
   return openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
 }
+
+void SXSqliteConnection::convertToIncrementalVacuum() {
+  constexpr int64_t kIncremental = 2;
+  int64_t mode = 0;
+  if (queryInt("PRAGMA auto_vacuum", {}, mode) || mode == kIncremental) return;
+  // The copy holds the write lock and needs room for a second copy of the file. When it cannot
+  // be made (busy, disk full) the store works as before and the next open tries again.
+  exec("VACUUM");
+}
+
+std::optional<std::string> SXSqliteConnection::queryInt(const std::string& sql,
+                                                        const SXSqliteRow& params, int64_t& value) {
+  SXSqliteStatement statement;
+  std::vector<SXValue> rows;
+  if (auto failed = prepare(sql, statement)) return failed;
+  if (auto failed = statement.query(params, rows)) return failed;
+  value = 0;
+  if (!rows.empty() && !rows[0].empty() && rows[0].begin()->is_number_integer()) {
+    value = rows[0].begin()->get<int64_t>();
+  }
+  return std::nullopt;
+}
+
+std::optional<std::string> SXSqliteConnection::usedBytes(uint64_t& bytes) {
+  int64_t used = 0;
+  if (auto failed =
+          queryInt("SELECT (p.page_count - f.freelist_count) * s.page_size "
+                   "FROM pragma_page_count() p, pragma_freelist_count() f, pragma_page_size() s",
+                   {}, used)) {
+    return failed;
+  }
+  bytes = static_cast<uint64_t>(std::max<int64_t>(used, 0));
+  return std::nullopt;
+}
+
+int64_t SXSqliteConnection::changes() const { return sqlite3_changes64(db_); }
 
 SXSqliteConnection::~SXSqliteConnection() {
   // close_v2 defers the close until statements still alive are finalized.

@@ -26,6 +26,8 @@ using SXSqliteRow = std::vector<SXSqliteField>;
 
 // How long a write waits for another connection's lock before it fails.
 inline constexpr std::chrono::milliseconds kSXSqliteBusyTimeout{5000};
+// What a WAL file is cut back to after a checkpoint, so that one burst does not leave it large.
+inline constexpr int64_t kSXSqliteJournalSizeLimit = 4 << 20;
 
 class SXSqliteStatement {
  public:
@@ -59,8 +61,9 @@ class SXSqliteConnection {
  public:
   enum class Mode { kReadWrite, kReadOnly };
 
-  // Opens `path`. Read-write creates the file, switches it to WAL with synchronous=NORMAL
-  // (committed rows survive a crash of this process, not a power loss) and runs `schema`; a
+  // Opens `path`. Read-write creates the file (with incremental auto-vacuum), switches it to
+  // WAL with synchronous=NORMAL (committed rows survive a crash of this process, not a power
+  // loss), caps the WAL at kSXSqliteJournalSizeLimit after checkpoints and runs `schema`; a
   // file that can only be opened for reading is a failure (SQLITE_READONLY).
   // Both modes wait up to `busyTimeout` for another connection's lock. On failure returns
   // nullptr and sets `error`.
@@ -68,10 +71,12 @@ class SXSqliteConnection {
                                                   std::chrono::milliseconds busyTimeout,
                                                   const std::string& schema, std::string& error);
 
-  // Opens `path` read-write like open(). When the file is there but is no usable database (not
-  // a database, damaged, or not a regular file), it and its -wal and -shm files are renamed
-  // with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created; `recovered` then
-  // says what was moved where, for the owner's error line. A store this user may not write
+  // Opens `path` read-write like open(), and converts a store made without incremental
+  // auto-vacuum once (a VACUUM: it holds the write lock while it copies the file, so only the
+  // store's owner calls this, before others use the store). When the file is there but is no usable
+  // database (not a database, damaged, or not a regular file), it and its -wal and -shm files are
+  // renamed with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created; `recovered`
+  // then says what was moved where, for the owner's error line. A store this user may not write
   // (see SXSqliteClassifyOpenFailure), a busy store or a full disk is never moved aside. On
   // failure returns nullptr and sets `error` ("... not writable by this user ..." for the
   // permissions problem).
@@ -95,8 +100,18 @@ class SXSqliteConnection {
   std::optional<std::string> exec(const std::string& sql);
   std::optional<std::string> prepare(const std::string& sql, SXSqliteStatement& out);
   int64_t lastInsertRowId() const;
+  // Rows the last INSERT, UPDATE or DELETE changed.
+  int64_t changes() const;
+  // The integer that `sql`, a query of one column, returns in its first row (0 when there is
+  // no row or no integer). On failure returns why.
+  std::optional<std::string> queryInt(const std::string& sql, const SXSqliteRow& params,
+                                      int64_t& value);
+  // The bytes the database's pages hold: (page_count - freelist_count) * page_size.
+  std::optional<std::string> usedBytes(uint64_t& bytes);
 
  private:
+  void convertToIncrementalVacuum();
+
   // open(), also saying which SQLite result code made it fail (SQLITE_OK on success).
   static std::unique_ptr<SXSqliteConnection> openWithCode(const std::string& path, Mode mode,
                                                           std::chrono::milliseconds busyTimeout,

@@ -4,7 +4,9 @@ namespace {
 
 constexpr const char* kSchema =
     "CREATE TABLE IF NOT EXISTS entries(id INTEGER PRIMARY KEY, time REAL, client_id INTEGER, "
-    "event TEXT, payload_json TEXT)";
+    "event TEXT, payload_json TEXT);"
+    // Retention deletes by age.
+    "CREATE INDEX IF NOT EXISTS entries_time ON entries(time)";
 constexpr const char* kInsert =
     "INSERT INTO entries(time, client_id, event, payload_json) VALUES (?1, ?2, ?3, ?4)";
 

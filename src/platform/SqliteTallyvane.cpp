@@ -4,7 +4,9 @@ namespace {
 
 constexpr const char* kSchema =
     "CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, name TEXT, "
-    "payload_json TEXT)";
+    "payload_json TEXT);"
+    // Retention deletes by age.
+    "CREATE INDEX IF NOT EXISTS events_time ON events(time)";
 constexpr const char* kInsert = "INSERT INTO events(time, name, payload_json) VALUES (?1, ?2, ?3)";
 
 // The newest `limit` matches, put back in ascending order.

@@ -185,3 +185,33 @@ TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
   EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
   EXPECT_EQ(Deliveries(receiver).size(), 2u);
 }
+
+TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusAndSizesShowIt) {
+  OtlpReceiver receiver;
+  TestDaemon::Options options = Exporting(receiver);
+  options.daemonConfig = {{"retention", {{"intervalSeconds", 0.1}}}};
+  TestDaemon daemon(options);
+  auto client = daemon.client();
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
+  SendStandalone(*client, 1, 5);
+  ASSERT_TRUE(receiver.waitFor([&] { return Deliveries(receiver).size() == 5; }));
+
+  // Once exported they go, but for the newest (message ids must never come back).
+  EXPECT_TRUE(waitUntil([&] { return SpooledIds(daemon) == std::vector<int64_t>{5}; }))
+      << daemon.log();
+  std::string out;
+  ASSERT_EQ(daemon.ctl({"--json", "status"}, &out), 0);
+  SXValue status = SXValue::parse(out);
+  EXPECT_EQ(status["counters"]["rows_pruned"]["fernreporting"], 4);
+  EXPECT_GT(status["gauges"]["store_bytes"]["fernreporting"], 0);
+  ASSERT_EQ(daemon.ctl({"status", "--metrics"}, &out), 0);
+  EXPECT_NE(out.find("sxreporting_rows_pruned_total{store=\"fernreporting\"} 4\n"),
+            std::string::npos)
+      << out;
+  ASSERT_EQ(daemon.ctl({"--json", "sizes"}, &out), 0);
+  SXValue sizes = SXValue::parse(out);
+  ASSERT_EQ(sizes.size(), 3u) << out;
+  EXPECT_EQ(sizes[2]["store"], "fernreporting.db");
+  EXPECT_EQ(sizes[2]["rows"], 1);
+  EXPECT_TRUE(daemon.waitForLog("retention: analytics 30 days or 268435456 bytes"));
+}

@@ -26,6 +26,7 @@ class SXTestTempDir {
   SXTestTempDir(const SXTestTempDir&) = delete;
   SXTestTempDir& operator=(const SXTestTempDir&) = delete;
 
+  const std::string& path() const { return path_; }
   std::string file(const std::string& name) const { return path_ + "/" + name; }
 
  private:

@@ -258,6 +258,7 @@ SXValue SXReportingServiceDelegate::countersValue() const {
   if (p.joulebookWriteErrors) errors["joulebook"] = p.joulebookWriteErrors();
   if (p.fernReportingWriteErrors) errors["fernreporting"] = p.fernReportingWriteErrors();
   if (!errors.empty()) counters["store_write_errors"] = std::move(errors);
+  if (p.retentionCounters) counters.update(p.retentionCounters());
   return counters;
 }
 
@@ -269,5 +270,6 @@ SXValue SXReportingServiceDelegate::gaugesValue() const {
   std::lock_guard lock(providersMutex_);
   if (providers_.inflightBytes) gauges["inflight_bytes"] = providers_.inflightBytes();
   if (providers_.spoolBacklog) gauges["spool_backlog"] = providers_.spoolBacklog();
+  if (providers_.retentionGauges) gauges.update(providers_.retentionGauges());
   return gauges;
 }

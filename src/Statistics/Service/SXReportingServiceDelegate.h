@@ -34,6 +34,9 @@ struct SXReportingStatusProviders {
   std::function<uint64_t()> spoolBacklog{};   // spooled messages not yet uploaded
   std::function<uint64_t()> partialFrames{};  // connections ended by an unfinished request
   std::function<uint64_t()> inflightBytes{};  // what the connections make the service hold
+  // Objects of labelled counters and of gauges, merged into those of the status.
+  std::function<SXValue()> retentionCounters{};
+  std::function<SXValue()> retentionGauges{};
 };
 
 class SXReportingServiceDelegate final

@@ -26,6 +26,7 @@
 #include "platform/InotifyNotifications.h"
 #include "platform/JsonPreferences.h"
 #include "platform/OtlpHttpExporter.h"
+#include "platform/Retention.h"
 #include "platform/ServiceManager.h"
 #include "platform/SqliteFernReporting.h"
 #include "platform/SqliteJoulebook.h"
@@ -375,6 +376,7 @@ struct Service {
   SXReportingServiceDelegate& delegate;
   SXUnixSocketListener& listener;
   Exporter& exporter;
+  SXRetention& retention;
   SXReportingConfigFile& configFile;
 };
 
@@ -391,7 +393,10 @@ void setStatusProviders(Service& s) {
                            ? std::function<uint64_t()>([&exporter] { return exporter.backlog(); })
                            : std::function<uint64_t()>(),
        .partialFrames = [&listener] { return listener.partialFrameTimeouts(); },
-       .inflightBytes = [&listener] { return listener.inflightBytes(); }});
+       .inflightBytes = [&listener] { return listener.inflightBytes(); },
+       .retentionCounters = [&retention = s.retention] { return retention.counters(); },
+       .retentionGauges = [&retention = s.retention] { return retention.gauges(); }});
+  s.retention.setSpoolExported(exporter.active());
 }
 
 // SIGHUP, on the I/O thread: each file keeps its old values when the new ones are bad.
@@ -433,6 +438,7 @@ void waitUntilSettled(Service& s) {
 // what it drained.
 std::string drain(Service& s) {
   uint64_t inflight = s.listener.inflightBytes();
+  s.retention.stop();  // a pass gives way after its current chunk
   waitUntilSettled(s);  // the requests received have been handled and answered
   uint64_t sessions = s.environment.counters().sessionsLive();
   std::promise<size_t> closing;
@@ -527,6 +533,7 @@ int serve(Service& s) {
       manager, s.options.drainTimeout, s.environment.platform().log);
   lifecycle.start();
   if (s.exporter.reload()) setStatusProviders(s);
+  s.retention.start();
   manager.ready("serving on " + socket);
   s.listener.resume();
   return lifecycle.exitStatus();
@@ -560,8 +567,23 @@ int main(int argc, char** argv) {
   SXReportingConfigFile configFile(options.paths.configDir + "/sxreportingd.json", log);
   SXReportingLimitsSection limits(environment, options.fixedLimits);
   configFile.addSection([&limits](const SXValue& file) { return limits.read(file); });
-  // Further sections of sxreportingd.json hook in here, each with a reader of its own, e.g.
-  // configFile.addSection([&](const SXValue& file) { return retention.read(file); });
+  auto retention = SXRetention::create({.stateDir = options.paths.stateDir,
+                                        .diagnosticLogsDir = options.paths.diagnosticLogsDir,
+                                        .dispatch = environment->platform().dispatch,
+                                        .log = log},
+                                       SXRetentionPolicy());
+  configFile.addSection([&retention, &configFile, &log](const SXValue& file) {
+    std::string error;
+    auto policy = SXRetentionPolicy::fromConfigFile(file, error);
+    if (!policy) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "%@: %@; keeping the retention as it was",
+            configFile.path(), error);
+      return false;
+    }
+    SXLOG(*log, nullptr, SXLogLevel::kDefault, "retention: %@", policy->description());
+    retention->setPolicy(*policy);
+    return true;
+  });
   if (!configFile.load()) {
     SXLOG(*log, nullptr, SXLogLevel::kError, "cannot start: %@ is not valid (see above)",
           configFile.path());
@@ -570,7 +592,8 @@ int main(int argc, char** argv) {
   auto delegate = SXReportingServiceDelegate::init(environment);
   Exporter exporter(options, environment->platform(), log);
   SXUnixSocketListener listener(listenerOptions(options, *environment), log);
-  Service service{options, adapters, *environment, *delegate, listener, exporter, configFile};
+  Service service{options,  adapters, *environment, *delegate,
+                  listener, exporter, *retention, configFile};
   setStatusProviders(service);
   int status = serve(service);
   // After a drain everything is stored; tearing down the object graph would only repeat it.

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
@@ -14,6 +15,7 @@
 #include <sstream>
 
 #include "common/SXValueText.h"
+#include "platform/SqliteConnection.h"
 
 namespace fs = std::filesystem;
 
@@ -33,11 +35,15 @@ std::string columnText(sqlite3_stmt* statement, int column) {
   return text ? reinterpret_cast<const char*>(text) : "(null)";
 }
 
-// The newest `limit` events (all when no limit), oldest first.
+// The newest `limit` events (all when no limit) of the name and time asked for, oldest first.
 std::string eventsQuery(const SXCtlRequest& r) {
-  return std::string("SELECT id, time, name, payload_json FROM (SELECT * FROM events") +
-         (r.eventName ? " WHERE name = ?1" : "") + " ORDER BY id DESC" +
-         (r.limit ? " LIMIT " + std::to_string(*r.limit) : "") + ") ORDER BY id";
+  std::string where = r.eventName && r.since ? " WHERE name = ?1 AND time >= ?2"
+                      : r.eventName          ? " WHERE name = ?1"
+                      : r.since              ? " WHERE time >= ?2"
+                                             : "";
+  return "SELECT id, time, name, payload_json FROM (SELECT * FROM events" + where +
+         " ORDER BY id DESC" + (r.limit ? " LIMIT " + std::to_string(*r.limit) : "") +
+         ") ORDER BY id";
 }
 
 void printEvent(sqlite3_stmt* statement, bool json, SXValue& all) {
@@ -76,6 +82,7 @@ int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
   if (r.eventName) {
     sqlite3_bind_text(statement.get(), 1, r.eventName->c_str(), -1, SQLITE_TRANSIENT);
   }
+  if (r.since) sqlite3_bind_double(statement.get(), 2, *r.since);
   SXValue all = SXValue::array();
   size_t count = 0;
   while ((rc = sqlite3_step(statement.get())) == SQLITE_ROW) {
@@ -85,6 +92,98 @@ int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
   if (rc != SQLITE_DONE) return fail("events: cannot read " + path + ": " + sqlite3_errmsg(raw));
   if (r.json) std::cout << jsonText(all) << "\n";
   if (!r.json && count == 0) std::cout << "(none)\n";
+  return 0;
+}
+
+// ---- sizes
+
+namespace {
+
+struct StoreFile {
+  const char* file;
+  const char* table;  // the one that grows
+};
+
+constexpr StoreFile kStoreFiles[] = {
+    {"tallyvane.db", "events"}, {"joulebook.db", "entries"}, {"fernreporting.db", "messages"}};
+
+uint64_t fileBytes(const std::string& path) {
+  std::error_code ec;
+  const uintmax_t bytes = fs::file_size(path, ec);
+  return ec ? 0 : bytes;
+}
+
+// {"store", "rows", "oldest" (seconds since the epoch, or null), "usedBytes", "fileBytes",
+// "walBytes"}, or an error.
+std::optional<std::string> measureStore(const std::string& dir, const StoreFile& store,
+                                        SXValue& out) {
+  const std::string path = dir + "/" + store.file;
+  std::string error;
+  auto db = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadOnly,
+                                     std::chrono::seconds(2), "", error);
+  if (!db) return error;
+  SXSqliteStatement statement;
+  std::vector<SXValue> rows;
+  uint64_t used = 0;
+  const std::string table = store.table;
+  if (auto failed =
+          db->prepare("SELECT COUNT(*) AS rows, MIN(time) AS oldest FROM " + table, statement)) {
+    return path + ": " + *failed;
+  }
+  if (auto failed = statement.query({}, rows)) return path + ": " + *failed;
+  if (auto failed = db->usedBytes(used)) return path + ": " + *failed;
+  out = {{"store", store.file},
+         {"rows", rows.at(0)["rows"]},
+         {"oldest", rows.at(0)["oldest"]},
+         {"usedBytes", used},
+         {"fileBytes", fileBytes(path)},
+         {"walBytes", fileBytes(path + "-wal")}};
+  return std::nullopt;
+}
+
+std::string bytesText(uint64_t bytes) {
+  char text[32];
+  if (bytes < 1024) return std::to_string(bytes) + " B";
+  const char* unit = bytes < (1u << 20) ? "KiB" : bytes < (1u << 30) ? "MiB" : "GiB";
+  const double scale = bytes < (1u << 20) ? 1024.0 : bytes < (1u << 30) ? 1048576.0 : 1073741824.0;
+  std::snprintf(text, sizeof text, "%.1f %s", bytes / scale, unit);
+  return text;
+}
+
+std::string utcText(const SXValue& seconds) {
+  if (!seconds.is_number()) return "-";
+  const std::time_t time = static_cast<std::time_t>(seconds.get<double>());
+  std::tm utc{};
+  gmtime_r(&time, &utc);
+  char text[32];
+  std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &utc);
+  return text;
+}
+
+void printStore(const SXValue& store) {
+  auto bytes = [&](const char* key) { return bytesText(store.at(key).get<uint64_t>()); };
+  std::printf("%-17s %10llu rows  oldest %-20s  in use %-9s  file %-9s  log %s\n",
+              store.at("store").get<std::string>().c_str(),
+              store.at("rows").get<unsigned long long>(), utcText(store.at("oldest")).c_str(),
+              bytes("usedBytes").c_str(), bytes("fileBytes").c_str(), bytes("walBytes").c_str());
+}
+
+}  // namespace
+
+int SXCtlRunSizes(const SXCtlRequest& r, const SXPaths& paths) {
+  SXValue all = SXValue::array();
+  for (const StoreFile& store : kStoreFiles) {
+    const std::string path = paths.stateDir + "/" + store.file;
+    if (!fs::exists(path)) continue;
+    SXValue measured;
+    if (auto failed = measureStore(paths.stateDir, store, measured)) {
+      return fail("sizes: " + *failed);
+    }
+    if (!r.json) printStore(measured);
+    all.push_back(std::move(measured));
+  }
+  if (r.json) std::cout << jsonText(all) << "\n";
+  if (!r.json && all.empty()) std::cout << "(no stores in " << paths.stateDir << ")\n";
   return 0;
 }
 

@@ -7,6 +7,9 @@
 // `events`: the analytics events stored in <state-dir>/tallyvane.db.
 int SXCtlRunEvents(const SXCtlRequest& request, const SXPaths& paths);
 
+// `sizes`: rows, oldest row and bytes of each store in <state-dir>.
+int SXCtlRunSizes(const SXCtlRequest& request, const SXPaths& paths);
+
 // `defaults read|write|delete`: the preferences domain, one JSON object in
 // <preferences-dir>/com.vendra.sonex.json, replaced atomically on every change.
 int SXCtlRunDefaults(const SXCtlRequest& request, const SXPaths& paths);

@@ -12,13 +12,14 @@ namespace {
 
 int runLocal(const SXCtlRequest& request, const SXPaths& paths) {
   if (request.command == "events") return SXCtlRunEvents(request, paths);
+  if (request.command == "sizes") return SXCtlRunSizes(request, paths);
   if (request.command == "defaults") return SXCtlRunDefaults(request, paths);
   return SXCtlRunNotify(request, paths);
 }
 
 bool isLocal(const SXCtlRequest& request) {
-  return request.command == "events" || request.command == "defaults" ||
-         request.command == "notify";
+  return request.command == "events" || request.command == "sizes" ||
+         request.command == "defaults" || request.command == "notify";
 }
 
 // Runs the commands in order on one connection, made when the first command needs it.

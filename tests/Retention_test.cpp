@@ -1,0 +1,345 @@
+#include "platform/Retention.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <fstream>
+#include <set>
+#include <thread>
+
+#include "fakes/FakeLog.h"
+#include "platform/AsioDispatch.h"
+#include "platform/OtlpSpoolReader.h"
+#include "platform/SqliteFernReporting.h"
+#include "platform/SqliteJoulebook.h"
+#include "platform/SqliteTallyvane.h"
+#include "support/Daemon.h"
+#include "support/SqliteTestSupport.h"
+
+namespace {
+
+constexpr double kDay = 86400;
+
+void Exec(const std::string& db, const std::string& sql) {
+  std::string error;
+  auto connection = SXSqliteConnection::open(db, SXSqliteConnection::Mode::kReadWrite,
+                                             std::chrono::seconds(5), "", error);
+  ASSERT_TRUE(connection) << error;
+  EXPECT_EQ(connection->exec(sql), std::nullopt);
+}
+
+std::shared_ptr<SXRetention> Retention(const SXTestTempDir& dir, SXRetentionPolicy policy,
+                                       bool spoolExported = false,
+                                       std::shared_ptr<FakeLog> log = nullptr) {
+  auto retention = SXRetention::create({.stateDir = dir.path(),
+                                        .diagnosticLogsDir = dir.file("logs"),
+                                        .dispatch = std::make_shared<SXAsioDispatch>(),
+                                        .log = log,
+                                        .pruning = {.chunkRows = 50}},
+                                       policy);
+  retention->setSpoolExported(spoolExported);
+  return retention;
+}
+
+// ---- policy
+
+struct PolicyCase {
+  const char* json;
+  const char* error;  // "" when the section is good
+  std::function<void(SXRetentionPolicy&)> expected = [](SXRetentionPolicy&) {};
+};
+
+TEST(RetentionPolicy, TheSectionSetsWhatItNamesAndRefusesAnythingElse) {
+  const PolicyCase cases[] = {
+      {"null", ""},
+      {R"({"analytics": {"maxAgeDays": 7}})", "",
+       [](SXRetentionPolicy& p) { p.analytics.maxAgeDays = 7; }},
+      {R"({"intervalSeconds": 0.5, "spool": {"maxBytes": 1024}, "powerLog": {"maxAgeDays": 1.5},
+          "summaryFiles": {"maxFiles": 10}, "damagedCopies": {"maxAgeDays": 2}})",
+       "",
+       [](SXRetentionPolicy& p) {
+         p.intervalSeconds = 0.5;
+         p.spool.maxBytes = 1024;
+         p.powerLog.maxAgeDays = 1.5;
+         p.summaryFiles.maxFiles = 10;
+         p.damagedCopies.maxAgeDays = 2;
+       }},
+      {R"({"analytics": {"maxBytes": -1}})",
+       "retention.analytics.maxBytes: expected a positive integer, got -1"},
+      {R"({"analytics": {"maxBytes": 1.5}})",
+       "retention.analytics.maxBytes: expected a positive integer, got 1.5"},
+      {R"({"powerLog": {"maxAgeDays": 0}})",
+       "retention.powerLog.maxAgeDays: expected a positive number, got 0"},
+      {R"({"intervalSeconds": "60"})",
+       "retention.intervalSeconds: expected a positive number, got \"60\""},
+      {R"({"spool": {"maxAge": 3}})",
+       "retention.spool: unknown key \"maxAge\" (expected maxAgeDays, maxBytes)"},
+      {R"({"damagedCopies": {"maxFiles": 3}})",
+       "retention.damagedCopies: unknown key \"maxFiles\" (expected maxAgeDays)"},
+      {R"({"analytics": 5})", "retention.analytics: expected an object, got 5"},
+      {R"({"analytic": {}})",
+       "retention: unknown key \"analytic\" (expected intervalSeconds, analytics, powerLog, "
+       "spool, summaryFiles, damagedCopies)"},
+      {"[1]", "retention: expected an object, got [1]"},
+  };
+  for (const PolicyCase& c : cases) {
+    SCOPED_TRACE(c.json);
+    std::string error;
+    auto policy = SXRetentionPolicy::fromJson(SXValue::parse(c.json), error);
+    EXPECT_EQ(error, c.error);
+    EXPECT_EQ(policy.has_value(), *c.error == '\0');
+    SXRetentionPolicy expected;
+    c.expected(expected);
+    if (policy) {
+      EXPECT_EQ(*policy, expected);
+    }
+  }
+}
+
+TEST(RetentionPolicy, TheConfigFilesSectionOrTheDefaults) {
+  std::string error;
+  EXPECT_EQ(SXRetentionPolicy::fromConfigFile(SXValue::object(), error), SXRetentionPolicy());
+  auto policy = SXRetentionPolicy::fromConfigFile(
+      SXValue::parse(R"({"limits": {}, "retention": {"spool": {"maxBytes": 4096}}})"), error);
+  ASSERT_TRUE(policy);
+  EXPECT_EQ(policy->spool.maxBytes, 4096u);
+  EXPECT_FALSE(SXRetentionPolicy::fromConfigFile(
+      SXValue::parse(R"({"retention": {"spool": {"maxBytes": 0}}})"), error));
+  EXPECT_NE(error.find("retention.spool.maxBytes: expected a positive integer"), std::string::npos)
+      << error;
+}
+
+// ---- stores
+
+// Writes rows n .. n + count - 1 (payload {"n": n, "pad": ...}) through the store's adapter and
+// returns once they are committed; false when one could not be stored.
+using RowWriter = std::function<bool(int64_t n, int64_t count)>;
+
+struct StoreCase {
+  const char* name;  // as in status
+  const char* file;
+  const char* table;
+  SXStoreRetention SXRetentionPolicy::*limits;
+  std::function<RowWriter(const std::string& path)> open;
+};
+
+SXValue Row(int64_t n) { return {{"n", n}, {"pad", std::string(1000, 'x')}}; }
+
+const StoreCase kStoreCases[] = {
+    {"tallyvane", "tallyvane.db", "events", &SXRetentionPolicy::analytics,
+     [](const std::string& path) -> RowWriter {
+       auto store = std::make_shared<SXSqliteTallyvane>(path, nullptr);
+       return [store](int64_t n, int64_t count) {
+         for (int64_t i = n; i < n + count; ++i) {
+           store->sendEventLazy("e", [i] { return Row(i); });
+         }
+         store->flush();
+         return store->writeErrors() == 0;
+       };
+     }},
+    {"joulebook", "joulebook.db", "entries", &SXRetentionPolicy::powerLog,
+     [](const std::string& path) -> RowWriter {
+       auto store = std::make_shared<SXSqliteJoulebook>(path, nullptr);
+       return [store](int64_t n, int64_t count) {
+         for (int64_t i = n; i < n + count; ++i) store->logRegisteredEvent(1, "e", Row(i), {});
+         store->flush();
+         return store->writeErrors() == 0;
+       };
+     }},
+    {"fernreporting", "fernreporting.db", "messages", &SXRetentionPolicy::spool,
+     [](const std::string& path) -> RowWriter {
+       auto store = std::make_shared<SXSqliteFernReporting>(path, path + ".json", nullptr);
+       return [store](int64_t n, int64_t count) {
+         bool stored = true;
+         for (int64_t i = n; i < n + count; ++i) {
+           std::optional<FernError> error;
+           stored = store->sendOneMessage({}, {}, 3, 1, Row(i), error) && stored;
+         }
+         return stored;
+       };
+     }},
+};
+
+class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {};
+
+TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriterGoesOn) {
+  const StoreCase& store = GetParam();
+  SXTestTempDir dir;
+  const std::string db = dir.file(store.file);
+  RowWriter write = store.open(db);
+  // 20 rows from before the age limit, then about a megabyte: past both limits.
+  ASSERT_TRUE(write(0, 20));
+  Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
+  ASSERT_TRUE(write(20, 980));
+
+  constexpr uint64_t kCap = 256 * 1024;
+  SXRetentionPolicy policy;
+  policy.*store.limits = {30, kCap};
+  auto retention = Retention(dir, policy);
+  std::atomic<int64_t> written{1000};
+  std::atomic<bool> stop{false}, failed{false};
+  std::thread writer([&] {
+    while (!stop) {
+      if (!write(written, 1)) failed = true;
+      ++written;
+      // A steady stream rather than a flood, which would only make the next pass longer.
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+  });
+  const int64_t before = written;
+  retention->runPass();
+  const int64_t during = written - before;
+  stop = true;
+  writer.join();
+  retention->runPass();  // and what the writer added meanwhile
+
+  EXPECT_FALSE(failed);
+  EXPECT_GT(during, 0) << "the writer was held up for the whole pass";
+  auto rows = SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
+                                          "MAX(json_extract(payload_json, '$.n')) AS last, "
+                                          "COUNT(*) AS count FROM ") +
+                                  store.table);
+  ASSERT_EQ(rows.size(), 1u);
+  const int64_t first = rows[0]["first"], last = rows[0]["last"], count = rows[0]["count"];
+  EXPECT_EQ(last, written - 1);        // the newest are kept
+  EXPECT_EQ(count, last - first + 1);  // and only the oldest went
+  EXPECT_GT(first, 20);                // the aged rows among them
+  EXPECT_GT(count, 100);               // not more than the cap needs
+  std::string error;
+  auto connection = SXSqliteConnection::open(db, SXSqliteConnection::Mode::kReadOnly,
+                                             std::chrono::seconds(5), "", error);
+  ASSERT_TRUE(connection) << error;
+  uint64_t used = 0;
+  EXPECT_EQ(connection->usedBytes(used), std::nullopt);
+  EXPECT_LE(used, kCap);
+  EXPECT_EQ(retention->counters()["rows_pruned"][store.name], written - count);
+  EXPECT_EQ(retention->gauges()["store_bytes"][store.name], used);
+  // Incremental vacuum gave the pages back: the file is not much larger than what it holds.
+  EXPECT_LT(std::filesystem::file_size(db), 2 * kCap);
+}
+
+INSTANTIATE_TEST_SUITE_P(Stores, RetentionStoreTest, ::testing::ValuesIn(kStoreCases),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// ---- spool
+
+struct SpoolCase {
+  bool exported;   // "otlp-http" is a backend
+  int64_t cursor;  // how far the exporter has got
+  std::vector<int64_t> messagesLeft;
+};
+
+TEST(RetentionSpool, MessagesGoOnceTheExporterHasThemAndSessionsOnceNoMessageNeedsThem) {
+  const SpoolCase cases[] = {
+      {true, 6, {7, 8, 9, 10}},
+      {true, 10, {10}},  // the newest stays, so that message ids never come back
+      {false, 10, {1, 2, 3, 4, 5, 6, 7, 8, 9, 10}},  // nothing takes them: only the caps apply
+  };
+  for (const SpoolCase& c : cases) {
+    SCOPED_TRACE(testing::Message() << "exported " << c.exported << ", cursor " << c.cursor);
+    SXTestTempDir dir;
+    const std::string db = dir.file("fernreporting.db");
+    SXSqliteFernReporting spool(db, dir.file("fernreporting.json"), nullptr);
+    // Session 1 has the messages, 2 has none, 3 is new; 1 and 2 are old, and so is a flush.
+    auto withMessages = spool.openSession({}, {}, {});
+    auto without = spool.openSession({}, {}, {});
+    for (int i = 0; i < 10; ++i) {
+      std::optional<FernError> error;
+      ASSERT_TRUE(withMessages->sendMessage(3, 1, {{"n", i}}, error));
+    }
+    withMessages->flushMessages(nullptr);
+    withMessages->flushMessages(nullptr);
+    Exec(db,
+         "UPDATE sessions SET time = time - 40 * 86400; "
+         "UPDATE flushes SET time = time - 40 * 86400 WHERE id = 1");
+    auto fresh = spool.openSession({}, {}, {});
+    SXOtlpSpoolReader reader(db);
+    ASSERT_EQ(reader.advance(c.cursor), std::nullopt);
+
+    Retention(dir, SXRetentionPolicy(), c.exported)->runPass();
+
+    std::vector<int64_t> left;
+    for (const SXValue& row : SXTestQuery(db, "SELECT id FROM messages")) left.push_back(row["id"]);
+    EXPECT_EQ(left, c.messagesLeft);
+    EXPECT_EQ(SXTestQuery(db, "SELECT id FROM sessions"),
+              (std::vector<SXValue>{{{"id", 1}}, {{"id", 3}}}));
+    EXPECT_EQ(SXTestQuery(db, "SELECT id FROM flushes"), (std::vector<SXValue>{{{"id", 2}}}));
+    std::optional<FernError> error;
+    ASSERT_TRUE(withMessages->sendMessage(3, 1, {{"n", 10}}, error));
+    EXPECT_EQ(SXTestQuery(db, "SELECT MAX(id) AS id FROM messages")[0]["id"], 11);
+  }
+}
+
+// ---- files
+
+void WriteFile(const std::string& path, double ageSeconds) {
+  std::ofstream(path) << "{}";
+  const double when = SXSqliteNow() - ageSeconds;
+  timespec times[2];
+  times[0].tv_sec = times[1].tv_sec = static_cast<time_t>(when);
+  times[0].tv_nsec = times[1].tv_nsec = 0;
+  ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+}
+
+std::string DamagedName(const std::string& store, double ageSeconds) {
+  const time_t when = static_cast<time_t>(SXSqliteNow() - ageSeconds);
+  std::tm utc{};
+  gmtime_r(&when, &utc);
+  char stamp[32];
+  std::strftime(stamp, sizeof stamp, "%Y%m%d-%H%M%S", &utc);
+  return store + ".damaged-" + stamp;
+}
+
+TEST(RetentionFiles, OldSummariesAndDamagedCopiesGoAndSummariesAreCapped) {
+  SXTestTempDir dir;
+  std::filesystem::create_directories(dir.file("logs"));
+  WriteFile(dir.file("logs/20261001-000000-sonex-a-telephony.json"), 40 * kDay);
+  WriteFile(dir.file("logs/20261124-010000-sonex-a-alarms.json"), 3 * 3600);
+  WriteFile(dir.file("logs/20261124-020000-sonex-b-alarms.json"), 2 * 3600);
+  WriteFile(dir.file("logs/20261124-030000-sonex-c-alarms.json"), 1 * 3600);
+  WriteFile(dir.file("logs/notes.json"), 40 * kDay);  // not a summary: never touched
+  // Damaged copies are dated by their names, not by their files' times.
+  const std::string old = DamagedName("tallyvane.db", 31 * kDay);
+  WriteFile(dir.file(old), 0);
+  WriteFile(dir.file(old + "-wal"), 0);
+  WriteFile(dir.file(DamagedName("joulebook.db", 29 * kDay)), 40 * kDay);
+
+  SXRetentionPolicy policy;
+  policy.summaryFiles.maxFiles = 2;
+  auto log = std::make_shared<FakeLog>();
+  auto retention = Retention(dir, policy, false, log);
+  retention->runPass();
+
+  std::set<std::string> left;
+  for (const auto& sub : {dir.path(), dir.file("logs")}) {
+    for (const auto& entry : std::filesystem::directory_iterator(sub)) {
+      if (entry.is_regular_file()) left.insert(entry.path().filename().string());
+    }
+  }
+  EXPECT_EQ(left, (std::set<std::string>{"20261124-020000-sonex-b-alarms.json",
+                                         "20261124-030000-sonex-c-alarms.json", "notes.json",
+                                         DamagedName("joulebook.db", 29 * kDay)}));
+  EXPECT_EQ(retention->counters()["files_aged_out"], (SXValue{{"summary", 2}, {"damaged", 2}}));
+  EXPECT_TRUE(log->contains("retention: removed 2 summary files and 2 damaged store files"));
+}
+
+TEST(RetentionTimer, PassesRunOnTheirOwnAndANewPolicyAppliesToTheNext) {
+  SXTestTempDir dir;
+  RowWriter write = kStoreCases[0].open(dir.file("tallyvane.db"));
+  ASSERT_TRUE(write(0, 5));
+  Exec(dir.file("tallyvane.db"), "UPDATE events SET time = time - 40 * 86400");
+  SXRetentionPolicy policy;
+  policy.intervalSeconds = 0.05;
+  auto retention = Retention(dir, policy);
+  auto pruned = [&] { return retention->counters()["rows_pruned"]["tallyvane"].get<int64_t>(); };
+  retention->start();
+  EXPECT_TRUE(waitUntil([&] { return pruned() == 4; }));  // all but the newest
+
+  ASSERT_TRUE(write(5, 5));
+  policy.analytics.maxAgeDays = 1e-6;  // a tenth of a second
+  retention->setPolicy(policy);
+  EXPECT_TRUE(waitUntil([&] { return pruned() == 9; })) << pruned();
+  retention->stop();
+}
+
+}  // namespace
