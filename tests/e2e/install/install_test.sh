@@ -88,7 +88,7 @@ expect_completion() {  # EXPECTED WORDS...
 }
 expect_completion "defaults destroy" de
 expect_completion "delete read then write" defaults ""
-expect_completion "send set-type start status stop" --json create 42 "then" s
+expect_completion "send set-type sizes start status stop" --json create 42 "then" s
 expect_completion "--broadcast" send --b
 expect_completion "--state-dir" --socket /x/y --st
 expect_completion "kill" help k
