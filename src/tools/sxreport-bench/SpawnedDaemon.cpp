@@ -47,6 +47,11 @@ bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory,
   for (const char* sub : {"lib", "etc", "run", "kestrel", "diag"}) {
     std::filesystem::create_directories(dir_ + "/" + sub);
   }
+  // The stores' retention caps (256 MiB each by default) would delete rows that a long run
+  // then counts as missing, and the pruning would be counted in the run's CPU.
+  std::ofstream(dir_ + "/etc/sxreportingd.json")
+      << R"({"retention": {"analytics": {"maxBytes": 1099511627776},)"
+         R"( "powerLog": {"maxBytes": 1099511627776}, "spool": {"maxBytes": 1099511627776}}})";
   socket_ = dir_ + "/run/sxr.sock";
   std::vector<DaemonFlag> remaining = flags;
   // Each round either starts the daemon or drops one refused optional flag.
