@@ -23,12 +23,15 @@ int64_t countRows(const TestDaemon& daemon, const std::string& db, const std::st
   return rows.empty() ? 0 : rows[0]["n"].get<int64_t>();
 }
 
+// The sockets `pid` holds open: what a connection leaks. Files are left out, since the stores'
+// retention passes open and close them on their own schedule.
 size_t openDescriptors(pid_t pid) {
   size_t n = 0;
   std::error_code ec;
   for (auto it = std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/fd", ec);
        !ec && it != std::filesystem::directory_iterator(); it.increment(ec)) {
-    ++n;
+    std::error_code link;
+    if (std::filesystem::read_symlink(it->path(), link).string().rfind("socket:", 0) == 0) ++n;
   }
   return n;
 }
@@ -195,7 +198,7 @@ TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
     ::close(fd);
   }
   EXPECT_TRUE(waitUntil([&] { return openDescriptors(daemon.pid()) <= baseline; }, 30s))
-      << openDescriptors(daemon.pid()) << " descriptors open, " << baseline << " before";
+      << openDescriptors(daemon.pid()) << " sockets open, " << baseline << " before";
   auto client = daemon.client();
   EXPECT_TRUE(replied(client->getAllReporters()).empty());
 }
