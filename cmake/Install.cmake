@@ -55,7 +55,11 @@ target_compile_features(sxreporting_shared INTERFACE cxx_std_20)
 target_link_libraries(sxreporting_shared
   PUBLIC nlohmann_json::nlohmann_json Threads::Threads
   PRIVATE sxreporting_common)
-target_link_options(sxreporting_shared PRIVATE -Wl,--no-undefined)
+# Every symbol resolved at link time; a sanitizer build leaves the sanitizers' own to the
+# program that loads the library (clang links their runtimes into programs only).
+if(NOT SXR_SANITIZE AND NOT SXR_FUZZ)
+  target_link_options(sxreporting_shared PRIVATE -Wl,--no-undefined)
+endif()
 
 # --- Programs, library, headers -----------------------------------------------------------------
 install(TARGETS sxreportingd RUNTIME DESTINATION ${CMAKE_INSTALL_SBINDIR} COMPONENT daemon)

@@ -31,9 +31,12 @@ void Exec(const std::string& db, const std::string& sql) {
 std::shared_ptr<SXRetention> Retention(const SXTestTempDir& dir, SXRetentionPolicy policy,
                                        bool spoolExported = false,
                                        std::shared_ptr<FakeLog> log = nullptr) {
+  // One dispatch for the whole run, never destroyed: a timer task may hold the last reference
+  // to a retention, and a dispatch must not be destroyed from one of its own threads.
+  static auto* dispatch = new std::shared_ptr<SXDispatch>(std::make_shared<SXAsioDispatch>());
   auto retention = SXRetention::create({.stateDir = dir.path(),
                                         .diagnosticLogsDir = dir.file("logs"),
-                                        .dispatch = std::make_shared<SXAsioDispatch>(),
+                                        .dispatch = *dispatch,
                                         .log = log,
                                         .pruning = {.chunkRows = 50}},
                                        policy);

@@ -1,6 +1,7 @@
 #include "client/SXCtlArgs.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include "client/SXServiceTypeNames.h"
 
@@ -231,7 +232,9 @@ TEST(SXCtlArgsTest, SocketAndPreferencesFollowTheirDirectoriesUnlessGiven) {
   auto preferences = [](std::vector<std::string> args) {
     return SXCtlPaths(parse(std::move(args))).preferencesDirectory();
   };
-  EXPECT_EQ(preferences({"--config-dir", "/c", "list"}), "/c/preferences");
+  // Root's follow the state directory, where the system's service keeps them.
+  const std::string byDefault = ::geteuid() == 0 ? "/s/preferences" : "/c/preferences";
+  EXPECT_EQ(preferences({"--config-dir", "/c", "--state-dir", "/s", "list"}), byDefault);
   EXPECT_EQ(preferences({"--config-dir", "/c", "--preferences-dir", "/p", "list"}), "/p");
   ::setenv("SXREPORTING_PREFERENCES_DIR", "/env", 1);
   EXPECT_EQ(preferences({"--config-dir", "/c", "list"}), "/env");

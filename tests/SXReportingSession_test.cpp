@@ -85,8 +85,8 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   ASSERT_EQ(sent.size(), 1u);
   EXPECT_EQ(sent[0].payload, entries[0]["Playback_Start_3"]);
   // The stored text is made without the rewritten copy: same members, same order.
-  for (const SXValue& spaced : {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}},
-                                SXValue::array({1})}) {
+  for (const SXValue& spaced :
+       {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}}, SXValue::array({1})}) {
     EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced),
               SXValueText(SXReportingSessionUnderscoreKeys(spaced)));
   }
@@ -394,47 +394,57 @@ TEST(SXReportingSessionOrientation, ReportsRoundedTimesIntoTheSummary) {
   EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
 }
 
-TEST(SXReportingSessionLifecycle, OneSessionsBackendWaitNeverHoldsUpAnother) {
+TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) {
   TestEnvironment t;
-  auto dispatch = std::make_shared<SXAsioDispatch>();  // real queues: each wait blocks a thread
+  auto dispatch = std::make_shared<SXAsioDispatch>();  // real queues, pool and timers
   SXPlatform platform = t.platform();
   platform.dispatch = dispatch;
   auto environment = std::make_shared<SXReportingEnvironment>(platform);
   environment->setBackendWaitSeconds(30);
   t.fern->setConfigurationDelivery(FakeFernReporting::Delivery::kNever);
-  auto waiting = [&](size_t n) {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-    while (t.log->count("waiting for fernreportingd to find backends") < n) {
-      if (std::chrono::steady_clock::now() > deadline) return false;
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-    return true;
+  // Events of one kind, of one session (0: of all); `waitFor` hands its predicate the events.
+  using Events = std::vector<FakeFernReporting::Event>;
+  auto count = [](const Events& events, Kind kind, int session = 0) {
+    return std::count_if(events.begin(), events.end(), [&](const auto& e) {
+      return e.kind == kind && (session == 0 || e.session == session);
+    });
   };
+  auto eventually = [&](auto done) { return t.fern->waitFor(done, std::chrono::seconds(10)); };
 
-  auto first = SXReportingSession::initWithID(environment, 1, SXValue::array());
-  first->start();
-  first->sendMessage({{"k", 1}}, 3, 1, nullptr);
-  ASSERT_TRUE(waiting(1));
-  auto second = SXReportingSession::initWithID(environment, 2, SXValue::array());
-  second->start();  // its setup runs while the first still waits
-  second->sendMessage({{"k", 2}}, 3, 1, nullptr);
-  ASSERT_TRUE(waiting(2));
+  // More sessions wait at once than the pool has threads.
+  constexpr int kWaiting = 400;
+  std::vector<std::shared_ptr<SXReportingSession>> sessions;
+  for (int id = 1; id <= kWaiting; ++id) {
+    sessions.push_back(SXReportingSession::initWithID(environment, id, SXValue::array()));
+    sessions.back()->start();
+    sessions.back()->sendMessage({{"k", id}}, 3, 1, nullptr);
+  }
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (t.log->count("waiting for fernreportingd to find backends") < size_t(kWaiting) &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  ASSERT_EQ(t.log->count("waiting for fernreportingd to find backends"), size_t(kWaiting));
 
+  // One more, whose backends come at once: its send and its stop's flush go through while
+  // every other session still waits.
+  t.fern->setConfigurationDelivery(FakeFernReporting::Delivery::kInline);
+  auto last = SXReportingSession::initWithID(environment, kWaiting + 1, SXValue::array());
+  last->start();
+  last->sendMessage({{"k", 0}}, 3, 1, nullptr);
+  last->stop();
+  EXPECT_TRUE(eventually([&](const Events& e) { return count(e, Kind::kFlush, kWaiting + 1); }));
+  const Events before = t.fern->events();
+  EXPECT_GE(count(before, Kind::kMessage, kWaiting + 1), 1);
+  EXPECT_EQ(count(before, Kind::kMessage), count(before, Kind::kMessage, kWaiting + 1));
+
+  // The waits end with their backends; what waited behind them follows.
   t.fern->deliverHeld();
-  EXPECT_TRUE(t.fern->waitFor(
-      [](const auto& events) {
-        return std::count_if(events.begin(), events.end(), [](const auto& e) {
-                 return e.kind == FakeFernReporting::Event::Kind::kMessage;
-               }) == 2;
-      },
-      std::chrono::seconds(10)));
-  first->stop();
-  second->stop();
-  EXPECT_TRUE(t.fern->waitFor(
-      [](const auto& events) {
-        return std::count_if(events.begin(), events.end(), [](const auto& e) {
-                 return e.kind == FakeFernReporting::Event::Kind::kFlush;
-               }) == 2;
-      },
-      std::chrono::seconds(10)));
+  EXPECT_TRUE(eventually([&](const Events& e) {
+    return count(e, Kind::kMessage) == count(e, Kind::kMessage, kWaiting + 1) + kWaiting;
+  }));
+  for (auto& session : sessions) session->stop();
+  EXPECT_TRUE(eventually([&](const Events& e) { return count(e, Kind::kFlush) == kWaiting + 1; }));
+  EXPECT_EQ(t.log->count("continuing"), size_t(kWaiting));
+  EXPECT_EQ(t.log->count("failed to find backend"), 0u);
 }

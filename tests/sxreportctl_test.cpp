@@ -10,7 +10,10 @@
 #include <regex>
 #include <sstream>
 
+#include "fakes/FakeDispatch.h"
+#include "fakes/FakeLog.h"
 #include "fakes/FakeRpcServer.h"
+#include "platform/InotifyNotifications.h"
 
 using namespace sxr::method;
 using Answer = FakeRpcServer::Answer;
@@ -44,14 +47,17 @@ class SxreportctlTest : public ::testing::Test {
 
   // Runs the tool with every directory inside the server's temporary directory.
   CtlRun run(const std::vector<std::string>& args) {
+    const std::string out = server_.directory() + "/out", err = server_.directory() + "/err";
+    int raw = std::system((command(args) + " >" + out + " 2>" + err).c_str());
+    return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
+  }
+  std::string command(const std::vector<std::string>& args) {
     const std::string& dir = server_.directory();
     std::string command = std::string(SXR_CTL_PATH) + " --socket " + quoted(server_.socketPath()) +
                           " --state-dir " + quoted(dir) + " --config-dir " + quoted(dir) +
                           " --runtime-dir " + quoted(dir);
     for (const auto& arg : args) command += " " + quoted(arg);
-    const std::string out = dir + "/out", err = dir + "/err";
-    int raw = std::system((command + " >" + out + " 2>" + err).c_str());
-    return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
+    return command;
   }
 
   FakeRpcServer server_;
@@ -210,6 +216,14 @@ TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
   EXPECT_EQ(run({"defaults", "read", "ReportingEnabled"}).out, "0\n");
   EXPECT_EQ(run({"--json", "defaults", "read"}).out, "{\"Level\":3,\"ReportingEnabled\":false}\n");
 
+  // Writers in parallel: each one's key survives the others' replacements of the file.
+  std::string parallel;
+  for (int i = 0; i < 24; ++i) {
+    parallel += command({"defaults", "write", "--int", "K" + std::to_string(i), "1"}) + " & ";
+  }
+  ASSERT_EQ(std::system((parallel + "wait").c_str()), 0);
+  EXPECT_EQ(SXValue::parse(slurp(file)).size(), 26u);
+
   std::ofstream(file) << "[not an object";
   EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 7);
   EXPECT_EQ(slurp(file), "[not an object");  // left as it was
@@ -221,9 +235,19 @@ TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
   EXPECT_EQ(slurp(file), "[not an object");
 }
 
-TEST_F(SxreportctlTest, NotifyWritesTheNamedFile) {
+TEST_F(SxreportctlTest, NotifyReachesAWatcherOfTheName) {
+  std::promise<void> delivered;  // outlives the watcher, whose deliveries set it
+  std::once_flag once;
+  SXInotifyNotifications watcher(server_.directory(), std::make_shared<FakeLog>());
+  auto queue = std::make_shared<FakeWorkQueue>();
+  int token = 0;
+  ASSERT_EQ(
+      watcher.registerDispatch("com.vendra.sonex.changed", token, queue,
+                               [&](int) { std::call_once(once, [&] { delivered.set_value(); }); }),
+      0);
   EXPECT_EQ(run({"notify", "com.vendra.sonex.changed"}).status, 0);
-  EXPECT_EQ(slurp(server_.directory() + "/notify/com.vendra.sonex.changed").size(), 1u);
+  EXPECT_EQ(delivered.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_NE(run({"notify", "a/b"}).status, 0);
 }
 
 TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {

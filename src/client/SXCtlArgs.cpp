@@ -537,7 +537,8 @@ const std::vector<CommandSpec>& commandSpecs() {
       {"events", "events [--name NAME] [--since WHEN] [--limit N]",
        "print the stored analytics events",
        "Reads <state-dir>/tallyvane.db: id, time, name and payload of each event, oldest\n"
-       "first. --name keeps one event name; --since keeps the events from WHEN on, a UTC time\n"
+       "first. --name keeps one event name, or the names a shell-style pattern matches\n"
+       "(com.vendra.*); --since keeps the events from WHEN on, a UTC time\n"
        "(2026-11-25T06:30:00Z, 2026-11-25T06:30, 2026-11-25) or an age (90s, 10m, 2h, 3d);\n"
        "--limit keeps the newest N of those.",
        0, 0, {"--name", "--since", "--limit"}, {}, buildEvents},
@@ -570,7 +571,7 @@ constexpr std::string_view kOptionsHelp =
     "                      as root /etc/sxreportingd)\n"
     "  --preferences-dir DIR\n"
     "                      where the defaults domain is (default <config-dir>/preferences;\n"
-    "                      the packaged service uses /var/lib/sxreportingd/preferences)\n"
+    "                      as root <state-dir>/preferences, where the service keeps it)\n"
     "  --runtime-dir DIR   where the socket and notify/ are (default ./var/run;\n"
     "                      as root /run/sxreportingd)\n"
     "  --json              print the reply as JSON\n"

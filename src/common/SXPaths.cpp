@@ -25,6 +25,7 @@ SXPaths SXPaths::fromEnvironment() {
                    : "./var/log/DiagnosticLogs/Audio/Reporting");
   p.kestrelRoot = fromEnv("SXREPORTING_KESTREL_ROOT", root ? "/run/kestrel" : "./var/kestrel");
   if (auto dir = fromEnv("SXREPORTING_PREFERENCES_DIR", ""); !dir.empty()) p.preferencesDir = dir;
+  p.preferencesWithState = root;
   const char* socket = std::getenv("SXREPORTING_SOCKET");
   p.socketPathExplicit = socket && *socket;
   p.socketPath = p.socketPathExplicit ? std::string(socket) : std::string();

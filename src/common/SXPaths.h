@@ -13,12 +13,14 @@ struct SXPaths {
   std::string diagnosticLogsDir;  // session summary files of internal builds
   std::string kestrelRoot;        // driver counters
   std::string socketPath;
-  // The preferences domains; nothing means `<configDir>/preferences`. A packaged service keeps
-  // them with its state, since they change at run time and /etc is for the administrator.
+  // The preferences domains; nothing means `<configDir>/preferences`, or for root
+  // `<stateDir>/preferences`: the system's service keeps them with its state, since they change
+  // at run time and /etc is the administrator's.
   std::optional<std::string> preferencesDir;
+  bool preferencesWithState = false;
 
   std::string preferencesDirectory() const {
-    return preferencesDir.value_or(configDir + "/preferences");
+    return preferencesDir.value_or((preferencesWithState ? stateDir : configDir) + "/preferences");
   }
 
   // Defaults with the environment twins applied (SXREPORTING_STATE_DIR, SXREPORTING_CONFIG_DIR,

@@ -7,6 +7,7 @@
 
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
+#include <atomic>
 
 namespace {
 
@@ -40,21 +41,38 @@ class ThreadQueue final : public SXWorkQueue {
     wake_.notify_one();
   }
   const std::string& label() const override { return label_; }
+  void suspend() override {
+    std::lock_guard lock(mutex_);
+    ++suspended_;
+  }
+  void resume() override {
+    {
+      std::lock_guard lock(mutex_);
+      if (suspended_ > 0) --suspended_;
+    }
+    wake_.notify_one();
+  }
 
  private:
   void run() {
     nameThisThread("sxr-server");
     std::unique_lock lock(mutex_);
     for (;;) {
-      wake_.wait(lock, [this] { return stopping_ || !tasks_.empty(); });
-      if (tasks_.empty()) return;
+      wake_.wait(lock, [this] { return stopping_ || (!tasks_.empty() && suspended_ == 0); });
+      if (stopping_ && (tasks_.empty() || suspended_ > 0)) return;
       // Take everything queued so far: one lock round-trip per batch, not per task.
       std::deque<SXTask> batch;
       batch.swap(tasks_);
       lock.unlock();
-      for (auto& task : batch) task();
-      batch.clear();
+      while (!batch.empty()) {
+        SXTask task = std::move(batch.front());
+        batch.pop_front();
+        task();
+        if (suspended_.load() > 0) break;  // the rest goes back, ahead of newer tasks
+      }
       lock.lock();
+      tasks_.insert(tasks_.begin(), std::make_move_iterator(batch.begin()),
+                    std::make_move_iterator(batch.end()));
     }
   }
 
@@ -62,7 +80,9 @@ class ThreadQueue final : public SXWorkQueue {
   std::mutex mutex_;
   std::condition_variable wake_;
   std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
-  bool stopping_ = false;     // GUARDED_BY(mutex_)
+  // Changed under mutex_; the batch loop reads it without the lock between tasks.
+  std::atomic<int> suspended_{0};
+  bool stopping_ = false;  // GUARDED_BY(mutex_)
   std::thread thread_;
 };
 
@@ -76,20 +96,45 @@ class PoolSerialQueue final : public SXWorkQueue,
     {
       std::lock_guard lock(mutex_);
       tasks_.push_back(std::move(task));
-      schedule = !draining_;
-      draining_ = true;
+      schedule = startDrain();
     }
-    if (schedule) pool_.submit([self = shared_from_this()] { self->drain(); });
+    if (schedule) submitDrain();
   }
   const std::string& label() const override { return label_; }
+  // A suspended queue counts as busy in the pool's activity, as a thread blocked in a wait
+  // would: a stop's drain waits for what is held behind it.
+  void suspend() override {
+    std::lock_guard lock(mutex_);
+    if (suspended_++ == 0) pool_.hold(+1);
+  }
+  void resume() override {
+    bool schedule = false;
+    {
+      std::lock_guard lock(mutex_);
+      if (suspended_ == 0) return;
+      if (--suspended_ == 0) pool_.hold(-1);
+      schedule = startDrain();
+    }
+    if (schedule) submitDrain();
+  }
 
  private:
+  // REQUIRES(mutex_). Whether the caller must submit a drain.
+  bool startDrain() {
+    if (draining_ || suspended_ > 0 || tasks_.empty()) return false;
+    draining_ = true;
+    return true;
+  }
+  void submitDrain() {
+    pool_.submit([self = shared_from_this()] { self->drain(); });
+  }
+
   void drain() {
     for (;;) {
       SXTask task;
       {
         std::lock_guard lock(mutex_);
-        if (tasks_.empty()) {
+        if (tasks_.empty() || suspended_ > 0) {
           draining_ = false;
           return;
         }
@@ -105,6 +150,7 @@ class PoolSerialQueue final : public SXWorkQueue,
   std::mutex mutex_;
   std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
   bool draining_ = false;     // GUARDED_BY(mutex_)
+  int suspended_ = 0;         // GUARDED_BY(mutex_)
 };
 
 class PoolConcurrentQueue final : public SXWorkQueue {
@@ -113,6 +159,8 @@ class PoolConcurrentQueue final : public SXWorkQueue {
       : label_(std::move(label)), pool_(std::move(pool)) {}
   void async(SXTask task) override { pool_->submit(std::move(task)); }
   const std::string& label() const override { return label_; }
+  void suspend() override {}
+  void resume() override {}
 
  private:
   const std::string label_;
@@ -175,7 +223,12 @@ void SXElasticPool::work() {
 
 SXElasticPool::Activity SXElasticPool::activity() const {
   std::lock_guard lock(mutex_);
-  return {tasks_.size() + threads_.size() - idle_, begun_};
+  return {tasks_.size() + threads_.size() - idle_ + held_, begun_};
+}
+
+void SXElasticPool::hold(int delta) {
+  std::lock_guard lock(mutex_);
+  held_ += delta;
 }
 
 SXAsioDispatch::SXAsioDispatch()

@@ -34,6 +34,8 @@ class SXElasticPool {
     uint64_t begun = 0;
   };
   Activity activity() const;
+  // Work waiting outside the pool (a suspended queue's) that activity() counts as busy.
+  void hold(int delta);
 
  private:
   void work();
@@ -46,6 +48,7 @@ class SXElasticPool {
   std::deque<SXTask> tasks_;          // GUARDED_BY(mutex_)
   std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
   size_t idle_ = 0;                   // GUARDED_BY(mutex_)
+  size_t held_ = 0;                   // GUARDED_BY(mutex_)
   uint64_t begun_ = 0;                // GUARDED_BY(mutex_)
   bool stopping_ = false;             // GUARDED_BY(mutex_)
 };

@@ -19,6 +19,13 @@ class SXWorkQueue {
   virtual ~SXWorkQueue() = default;
   virtual void async(SXTask task) = 0;
   virtual const std::string& label() const = 0;
+
+  // Serial queues: once the task running now returns, no further task starts until resume()
+  // has been called as often as suspend(); tasks submitted meanwhile wait in their order. A
+  // task can thus wait for a completion or a timer without holding a thread. The concurrent
+  // queue ignores both.
+  virtual void suspend() = 0;
+  virtual void resume() = 0;
 };
 
 class SXDispatch {

@@ -30,6 +30,24 @@ void CloseIfOpen(int& fd) {
   fd = -1;
 }
 
+// Posting is opening `name` in `directory` for writing and closing it.
+int PostTo(const std::string& directory, const std::string& name) {
+  if (int status = SXInotifyNotifications::checkName(name)) return status;
+  std::string path = directory + "/" + name;
+  // O_NONBLOCK keeps a FIFO planted under the name from blocking the poster.
+  const int flags = O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK;
+  int fd = ::open(path.c_str(), flags, 0644);
+  if (fd < 0 && errno == ENOENT) {
+    // The directory is not there (yet, or any more); a post (re)creates it.
+    SXPosixFileSystem().createDirectory(directory, kDirectoryMode);
+    fd = ::open(path.c_str(), flags, 0644);
+  }
+  if (fd < 0) return errno;
+  // Closing a descriptor opened for writing is what watchers see (IN_CLOSE_WRITE).
+  ::close(fd);
+  return 0;
+}
+
 }  // namespace
 
 SXInotifyNotifications::SXInotifyNotifications(std::string runtimeDir,
@@ -96,21 +114,10 @@ int SXInotifyNotifications::registerDispatch(const std::string& name, int& token
   return 0;
 }
 
-int SXInotifyNotifications::post(const std::string& name) {
-  if (int status = checkName(name)) return status;
-  std::string path = directory_ + "/" + name;
-  // O_NONBLOCK keeps a FIFO planted under the name from blocking the poster.
-  const int flags = O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK;
-  int fd = ::open(path.c_str(), flags, 0644);
-  if (fd < 0 && errno == ENOENT) {
-    // Someone removed the directory since we started; a post recreates it.
-    SXPosixFileSystem().createDirectory(directory_, kDirectoryMode);
-    fd = ::open(path.c_str(), flags, 0644);
-  }
-  if (fd < 0) return errno;
-  // Closing a descriptor opened for writing is what watchers see (IN_CLOSE_WRITE).
-  ::close(fd);
-  return 0;
+int SXInotifyNotifications::post(const std::string& name) { return PostTo(directory_, name); }
+
+int SXInotifyNotifications::postIn(const std::string& runtimeDir, const std::string& name) {
+  return PostTo(runtimeDir + "/notify", name);
 }
 
 void SXInotifyNotifications::watch() {

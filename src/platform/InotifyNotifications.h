@@ -35,6 +35,8 @@ class SXInotifyNotifications final : public SXNotifications {
   int registerDispatch(const std::string& name, int& token, std::shared_ptr<SXWorkQueue> queue,
                        SXNotifyHandler handler) override;
   int post(const std::string& name) override;
+  // The same post from a process that watches nothing (the admin tool): no watcher is set up.
+  static int postIn(const std::string& runtimeDir, const std::string& name);
 
   // 0 when `name` can name a file in the notify directory, otherwise EINVAL or ENAMETOOLONG.
   static int checkName(const std::string& name);

@@ -76,18 +76,21 @@ std::string SXJsonPreferences::domainPath(const std::string& domain) const {
   return directory_ + "/" + domain + ".json";
 }
 
-SXValue SXJsonPreferences::readDomain(const std::string& path) {
+SXValue SXJsonPreferences::readDomain(const std::string& path, std::string* unusable) {
   FileRead file = ReadWholeFile(path);
   if (!file.contents) {
     if (file.error != ENOENT) {
-      SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot read preferences: %s",
-            SXPosixError(path, file.error));
+      std::string error = SXPosixError(path, file.error);
+      SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot read preferences: %s", error);
+      if (unusable) *unusable = "cannot read preferences: " + error;
     }
     return SXValue::object();
   }
   SXValue parsed = SXValue::parse(*file.contents, nullptr, false);
   if (!parsed.is_object()) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "preferences file %s is not a JSON object", path);
+    if (unusable)
+      *unusable = "preferences file " + path + " is not a JSON object; not replacing it";
     return SXValue::object();
   }
   return parsed;
@@ -125,7 +128,10 @@ std::optional<std::string> SXJsonPreferences::setValue(const std::string& domain
   if (lock.get() < 0) return SXPosixError(lockPath, errno);
   if (int err = LockExclusive(lock.get())) return SXPosixError(lockPath, err);
 
-  SXValue object = readDomain(path);
+  // A file we cannot read or parse may still be someone's: replacing it would lose it.
+  std::string unusable;
+  SXValue object = readDomain(path, &unusable);
+  if (!unusable.empty()) return unusable;
   if (value) {
     object[key] = *value;
   } else if (object.erase(key) == 0) {

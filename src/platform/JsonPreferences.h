@@ -1,5 +1,6 @@
 // Production preferences store: one JSON object per domain in `<directory>/<domain>.json`
-// (`<config-dir>/preferences/` unless --preferences-dir says otherwise).
+// (`<config-dir>/preferences/`, for root `<state-dir>/preferences/`, unless --preferences-dir
+// says otherwise).
 //
 // Every read opens the file afresh, because other processes (the admin tool, another daemon)
 // change it. Writes hold an exclusive flock on `<domain>.json.lock` across read-modify-write
@@ -8,7 +9,8 @@
 //
 // All methods may be called from any thread. On failure: reads give nothing (an empty
 // dictionary for copyDomain) and setValue returns the failure's description. A file that is
-// not a JSON object reads as empty and logs one error line per read on the default log. A
+// not a JSON object reads as empty and logs one error line per read on the default log;
+// setValue refuses to replace it (or a file it cannot read), so nothing in it is lost. A
 // domain name that is empty, "." or "..", or holds "/" or a NUL byte is refused.
 #pragma once
 
@@ -33,8 +35,9 @@ class SXJsonPreferences final : public SXPreferences {
 
  private:
   std::string domainPath(const std::string& domain) const;
-  // The domain's object; empty when the file is absent, unreadable or malformed.
-  SXValue readDomain(const std::string& path);
+  // The domain's object; empty when the file is absent, unreadable or malformed. An unreadable
+  // or malformed file also sets `unusable` (when given) to why.
+  SXValue readDomain(const std::string& path, std::string* unusable = nullptr);
 
   const std::string directory_;  // immutable
   const std::shared_ptr<SXLogFacility> log_;

@@ -12,7 +12,8 @@ constexpr const char* kInsert = "INSERT INTO events(time, name, payload_json) VA
 // The newest `limit` matches, put back in ascending order.
 constexpr const char* kSelect =
     "SELECT id, time, name, payload_json FROM (SELECT * FROM events "
-    "WHERE ?1 IS NULL OR name GLOB ?1 ORDER BY id DESC LIMIT ?2) ORDER BY id";
+    "WHERE (?1 IS NULL OR name GLOB ?1) AND (?3 IS NULL OR time >= ?3) "
+    "ORDER BY id DESC LIMIT ?2) ORDER BY id";
 
 }  // namespace
 
@@ -44,8 +45,9 @@ bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider
 void SXSqliteTallyvane::flush() { writer_.flush(); }
 
 std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
-                                                   std::optional<std::string> nameFilter, int limit,
-                                                   std::string& error) {
+                                                   std::optional<std::string> nameFilter,
+                                                   int64_t limit, std::string& error,
+                                                   std::optional<double> since) {
   auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
                                      kSXSqliteBusyTimeout, "", error);
   if (!db) return {};
@@ -57,7 +59,9 @@ std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
   }
   SXSqliteField filter = nullptr;
   if (nameFilter) filter = *nameFilter;
-  if (auto failed = select.query({filter, int64_t(limit > 0 ? limit : -1)}, rows)) {
+  SXSqliteField from = nullptr;
+  if (since) from = *since;
+  if (auto failed = select.query({filter, limit > 0 ? limit : int64_t(-1), from}, rows)) {
     error = dbPath + ": " + *failed;
     return {};
   }
@@ -74,7 +78,7 @@ std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
 
 std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
                                                    std::optional<std::string> nameFilter,
-                                                   int limit) {
+                                                   int64_t limit) {
   std::string ignored;
   return readEvents(dbPath, std::move(nameFilter), limit, ignored);
 }

@@ -43,15 +43,17 @@ class SXSqliteTallyvane final : public SXTallyvane {
   uint64_t writeErrors() const { return writer_.writeErrors(); }
 
   // The last `limit` events (all when `limit` <= 0) whose name matches the GLOB pattern
-  // `nameFilter` (an exact name matches itself), oldest first, as objects {"id", "time",
-  // "name", "payload"}; "payload" is the stored JSON parsed (its text when it does not parse).
+  // `nameFilter` (an exact name matches itself) and, with `since`, stored at or after that
+  // time (seconds since the epoch), oldest first, as objects {"id", "time", "name",
+  // "payload"}; "payload" is the stored JSON parsed (its text when it does not parse).
   // Opens `dbPath` read-only. On failure returns no rows and sets `error`.
   static std::vector<SXValue> readEvents(const std::string& dbPath,
-                                         std::optional<std::string> nameFilter, int limit,
-                                         std::string& error);
+                                         std::optional<std::string> nameFilter, int64_t limit,
+                                         std::string& error,
+                                         std::optional<double> since = std::nullopt);
   // The same, for callers that treat an unreadable store as an empty one.
   static std::vector<SXValue> readEvents(const std::string& dbPath,
-                                         std::optional<std::string> nameFilter, int limit);
+                                         std::optional<std::string> nameFilter, int64_t limit);
 
  private:
   SXSqliteBatchWriter writer_;

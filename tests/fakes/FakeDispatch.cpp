@@ -19,8 +19,10 @@ FakeWorkQueue::~FakeWorkQueue() {
 void FakeWorkQueue::Run(std::shared_ptr<State> state) {
   std::unique_lock lock(state->mutex);
   for (;;) {
-    state->changed.wait(lock, [&] { return state->stopping || !state->tasks.empty(); });
-    if (state->tasks.empty()) return;  // stopping, and nothing left to run
+    state->changed.wait(
+        lock, [&] { return state->stopping || (!state->tasks.empty() && state->suspended == 0); });
+    // Stopping, and nothing left to run (or nothing that may run).
+    if (state->tasks.empty() || state->suspended > 0) return;
     SXTask task = std::move(state->tasks.front());
     state->tasks.pop_front();
     lock.unlock();
@@ -37,6 +39,19 @@ void FakeWorkQueue::async(SXTask task) {
     std::lock_guard lock(state_->mutex);
     state_->tasks.push_back(std::move(task));
     ++state_->queued;
+  }
+  state_->changed.notify_all();
+}
+
+void FakeWorkQueue::suspend() {
+  std::lock_guard lock(state_->mutex);
+  ++state_->suspended;
+}
+
+void FakeWorkQueue::resume() {
+  {
+    std::lock_guard lock(state_->mutex);
+    if (state_->suspended > 0) --state_->suspended;
   }
   state_->changed.notify_all();
 }

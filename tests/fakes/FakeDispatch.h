@@ -26,6 +26,8 @@ class FakeWorkQueue final : public SXWorkQueue {
 
   void async(SXTask task) override;
   const std::string& label() const override { return label_; }
+  void suspend() override;
+  void resume() override;
 
   // Whether the caller runs on this queue's thread.
   bool isCurrent() const;
@@ -41,6 +43,7 @@ class FakeWorkQueue final : public SXWorkQueue {
     std::deque<SXTask> tasks;  // guarded by mutex
     size_t queued = 0;         // guarded by mutex
     size_t run = 0;            // guarded by mutex
+    int suspended = 0;         // guarded by mutex
     bool stopping = false;     // guarded by mutex
   };
   static void Run(std::shared_ptr<State> state);

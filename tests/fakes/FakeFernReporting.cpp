@@ -101,11 +101,16 @@ class FakeFernReporting::State {
   }
 
   void startConfiguration(int session, FernBackendsCompletion completion) {
-    std::lock_guard lock(mutex);
+    std::unique_lock lock(mutex);
     append({.kind = Kind::kStartConfiguration, .session = session});
-    complete(configurationDelivery, configurationDelay, [completion, found = backends] {
+    std::function<void()> deliver = [completion, found = backends] {
       if (completion) completion(found);
-    });
+    };
+    if (configurationDelivery != Delivery::kInline) {
+      return complete(configurationDelivery, configurationDelay, std::move(deliver));
+    }
+    lock.unlock();
+    deliver();
   }
 
   bool send(Kind kind, int session, const SXValue* sessionInfo, const SXValue* userInfo,

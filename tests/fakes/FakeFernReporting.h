@@ -20,7 +20,10 @@
 
 class FakeFernReporting final : public FernReporting {
  public:
-  enum class Delivery { kImmediate, kDelayed, kNever };
+  // kImmediate: from the fake's thread at once; kInline: on the caller's thread before the
+  // call returns; kDelayed: from the fake's thread after the delay; kNever: when the test calls
+  // deliverHeld().
+  enum class Delivery { kImmediate, kInline, kDelayed, kNever };
 
   struct Event {
     enum class Kind { kToken, kOpen, kStartConfiguration, kMessage, kSingleMessage, kFlush };

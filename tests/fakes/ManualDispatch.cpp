@@ -1,17 +1,26 @@
 #include "fakes/ManualDispatch.h"
 
+#include <algorithm>
+
 namespace {
 
 class ManualQueue final : public SXWorkQueue {
  public:
   ManualQueue(std::string label, ManualDispatch& dispatch)
       : label_(std::move(label)), dispatch_(dispatch) {}
-  void async(SXTask task) override { dispatch_.enqueue(label_, std::move(task)); }
+  void async(SXTask task) override { dispatch_.enqueue(label_, std::move(task), suspended_); }
   const std::string& label() const override { return label_; }
+  void suspend() override { ++*suspended_; }
+  void resume() override {
+    int count = suspended_->load();
+    while (count > 0 && !suspended_->compare_exchange_weak(count, count - 1)) {
+    }
+  }
 
  private:
   const std::string label_;
   ManualDispatch& dispatch_;
+  const std::shared_ptr<std::atomic<int>> suspended_ = std::make_shared<std::atomic<int>>(0);
 };
 
 }  // namespace
@@ -37,9 +46,10 @@ void ManualDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWor
   queue->async(std::move(task));
 }
 
-void ManualDispatch::enqueue(const std::string& label, SXTask task) {
+void ManualDispatch::enqueue(const std::string& label, SXTask task,
+                             std::shared_ptr<const std::atomic<int>> suspended) {
   std::lock_guard lock(mutex_);
-  tasks_.emplace_back(label, std::move(task));
+  tasks_.push_back({label, std::move(task), std::move(suspended)});
 }
 
 size_t ManualDispatch::runAll() {
@@ -48,9 +58,12 @@ size_t ManualDispatch::runAll() {
     SXTask task;
     {
       std::lock_guard lock(mutex_);
-      if (tasks_.empty()) return ran;
-      task = std::move(tasks_.front().second);
-      tasks_.pop_front();
+      auto next = std::find_if(tasks_.begin(), tasks_.end(), [](const Queued& queued) {
+        return !queued.suspended || queued.suspended->load() == 0;
+      });
+      if (next == tasks_.end()) return ran;
+      task = std::move(next->task);
+      tasks_.erase(next);
     }
     task();
     ++ran;

@@ -1,9 +1,11 @@
 // Queues that run nothing until the test says so. Every task of every queue goes into one
 // shared log in submission order; `runAll` runs tasks (including those that tasks submit)
-// until none is left. Delayed tasks are recorded with their delay and run by `runAll` too.
-// Thread-safe, so that tasks submitted from other threads are seen.
+// until none is left, skipping the tasks of suspended queues until they resume. Delayed tasks
+// are recorded with their delay and run by `runAll` too. Thread-safe, so that tasks submitted
+// from other threads are seen.
 #pragma once
 
+#include <atomic>
 #include <deque>
 #include <mutex>
 #include <vector>
@@ -27,12 +29,20 @@ class ManualDispatch final : public SXDispatch {
   // Labels of the queues created, in order.
   std::vector<std::string> createdQueues() const;
 
-  void enqueue(const std::string& label, SXTask task);
+  // `suspended`, when given, is the count of the queue's suspensions: the task waits while it
+  // is above zero.
+  void enqueue(const std::string& label, SXTask task,
+               std::shared_ptr<const std::atomic<int>> suspended = nullptr);
 
  private:
+  struct Queued {
+    std::string label;
+    SXTask task;
+    std::shared_ptr<const std::atomic<int>> suspended;
+  };
   mutable std::mutex mutex_;
-  std::deque<std::pair<std::string, SXTask>> tasks_;  // GUARDED_BY(mutex_)
-  std::vector<std::chrono::nanoseconds> delays_;      // GUARDED_BY(mutex_)
-  std::vector<std::string> created_;                  // GUARDED_BY(mutex_)
+  std::deque<Queued> tasks_;                      // GUARDED_BY(mutex_)
+  std::vector<std::chrono::nanoseconds> delays_;  // GUARDED_BY(mutex_)
+  std::vector<std::string> created_;              // GUARDED_BY(mutex_)
   std::shared_ptr<SXWorkQueue> lowPriority_;
 };

@@ -7,6 +7,9 @@ TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string>
   environment->setServerQueue(dispatch->createSerialQueue("com.vendra.sonex.reporting.server",
                                                           SXQualityOfService::kUserInteractive));
   environment->setBackendWaitSeconds(0.3);
+  // The manual dispatch runs a backend wait's timer as soon as it is set, so the backends must
+  // be known before the setup task looks for them.
+  fern->setConfigurationDelivery(FakeFernReporting::Delivery::kInline);
 }
 
 TestEnvironment::~TestEnvironment() {

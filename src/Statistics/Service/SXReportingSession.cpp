@@ -14,6 +14,8 @@ constexpr uint32_t kTraceDestroyed = 0x21042834;
 
 constexpr const char* kWaitingForBackends = "waiting for fernreportingd to find backends";
 constexpr const char* kNoBackendFound = "failed to find backend";
+// The wait's lines carry the name of the bounded wait they have always come from.
+constexpr const char* kWaitFunction = "SXReportingUtilityWait";
 
 void mergeInto(SXValue& target, const SXValue* source) {
   if (!source || !source->is_object()) return;
@@ -22,11 +24,13 @@ void mergeInto(SXValue& target, const SXValue* source) {
 
 }  // namespace
 
-// What the setup task and the configuration completion share: the backends-found flag and the
-// condition that guards it. Either may outlive the other.
+// What the setup task, the configuration completion and the wait's timer share. Any of them
+// may outlive the others.
 struct SXReportingSession::SetupState {
-  SXReportingCondition condition;
-  bool backendsFound = false;  // GUARDED_BY(condition.mutex)
+  std::mutex mutex;
+  bool backendsFound = false;  // GUARDED_BY(mutex)
+  // The session's queue is suspended until the backends come or the wait times out.
+  bool waiting = false;  // GUARDED_BY(mutex)
 };
 
 bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
@@ -228,31 +232,60 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
     fernReportingSession_ = fernSession;
   }
   if (fernSession) {
-    fernSession->startConfiguration([fn = __func__, environment = environment_,
-                                     setup](std::optional<std::vector<std::string>> backends) {
-      auto& log = environment->log();
-      auto* scope = environment->sessionLogScope();
-      if (!backends || backends->empty()) {
-        SXLOG_IN(fn, log, scope, SXLogLevel::kError,
-                 "No backends found, this session won't get sent to the server");
-        return;
-      }
-      SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
-      std::lock_guard lock(setup->condition.mutex);
-      setup->backendsFound = true;
-      setup->condition.signal();
-    });
+    fernSession->startConfiguration(
+        [fn = __func__, environment = environment_, setup,
+         queue = fernReportingQueue_](std::optional<std::vector<std::string>> backends) {
+          auto& log = environment->log();
+          auto* scope = environment->sessionLogScope();
+          if (!backends || backends->empty()) {
+            SXLOG_IN(fn, log, scope, SXLogLevel::kError,
+                     "No backends found, this session won't get sent to the server");
+            return;
+          }
+          SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
+          std::lock_guard lock(setup->mutex);
+          setup->backendsFound = true;
+          if (!setup->waiting) return;  // not waiting yet, or the wait is over
+          setup->waiting = false;
+          SXLOG_IN(kWaitFunction, log, scope, SXLogLevel::kDefault, "continuing");
+          queue->resume();
+        });
   }
-  bool found =
-      SXReportingUtilityWait(setup->condition, setup->backendsFound, kWaitingForBackends,
-                             kNoBackendFound, log(), scope(), environment_->backendWaitSeconds());
-  if (!found) {
-    {
-      std::lock_guard lock(mutex_);
-      fernReportingSession_ = nullptr;
-    }
-    fernReportingSessionStarted_.store(false);
+  awaitBackends(setup);
+}
+
+// The session's queue stays suspended, holding no thread, until the configuration completion
+// resumes it or the time-out does, whichever comes first; tasks queued meanwhile run after.
+void SXReportingSession::awaitBackends(const std::shared_ptr<SetupState>& setup) {
+  {
+    std::lock_guard lock(setup->mutex);
+    if (setup->backendsFound) return;
+    SXLOG_IN(kWaitFunction, log(), scope(), SXLogLevel::kDefault, "%@",
+             std::string(kWaitingForBackends));
+    setup->waiting = true;
+    fernReportingQueue_->suspend();
   }
+  const auto timeout = std::chrono::duration_cast<std::chrono::nanoseconds>(
+      std::chrono::duration<double>(environment_->backendWaitSeconds()));
+  auto& dispatch = *environment_->platform().dispatch;
+  dispatch.after(timeout, dispatch.lowPriorityConcurrentQueue(),
+                 [self = shared_from_this(), setup] { self->backendWaitTimedOut(*setup); });
+}
+
+void SXReportingSession::backendWaitTimedOut(SetupState& setup) {
+  {
+    std::lock_guard lock(setup.mutex);
+    if (!setup.waiting) return;  // the backends came in time
+    setup.waiting = false;
+    SXLOG_IN(kWaitFunction, log(), scope(), SXLogLevel::kError, "%@", std::string(kNoBackendFound));
+  }
+  // Backends reported from now on set the flag and change nothing else.
+  {
+    std::lock_guard lock(mutex_);
+    fernReportingSession_ = nullptr;
+  }
+  fernReportingSessionStarted_.store(false);
+  fernReportingQueue_->resume();
 }
 
 void SXReportingSession::stop() {

@@ -229,6 +229,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   };
 
   void runSetupTask(SXValue userInfo, std::string serviceName, std::shared_ptr<SetupState> setup);
+  void awaitBackends(const std::shared_ptr<SetupState>& setup);
+  void backendWaitTimedOut(SetupState& setup);
   // Queues the send task of one message, joining the batch still waiting on the queue if any.
   void queueSend(PendingSend send);
   // Queues any other task on the session's queue; messages accepted later go behind it.

@@ -1,21 +1,18 @@
 #include "CtlLocal.h"
 
-#include <fcntl.h>
-#include <sqlite3.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
 #include <filesystem>
-#include <fstream>
 #include <iostream>
 #include <memory>
-#include <sstream>
 
 #include "common/SXValueText.h"
+#include "platform/DiscardLog.h"
+#include "platform/InotifyNotifications.h"
+#include "platform/JsonPreferences.h"
 #include "platform/SqliteConnection.h"
+#include "platform/SqliteTallyvane.h"
 
 namespace fs = std::filesystem;
 
@@ -30,37 +27,13 @@ std::string jsonText(const SXValue& value, int indent = -1) {
   return value.dump(indent, ' ', false, SXValue::error_handler_t::replace);
 }
 
-std::string columnText(sqlite3_stmt* statement, int column) {
-  const auto* text = sqlite3_column_text(statement, column);
-  return text ? reinterpret_cast<const char*>(text) : "(null)";
-}
-
-// The newest `limit` events (all when no limit) of the name and time asked for, oldest first.
-std::string eventsQuery(const SXCtlRequest& r) {
-  std::string where = r.eventName && r.since ? " WHERE name = ?1 AND time >= ?2"
-                      : r.eventName          ? " WHERE name = ?1"
-                      : r.since              ? " WHERE time >= ?2"
-                                             : "";
-  return "SELECT id, time, name, payload_json FROM (SELECT * FROM events" + where +
-         " ORDER BY id DESC" + (r.limit ? " LIMIT " + std::to_string(*r.limit) : "") +
-         ") ORDER BY id";
-}
-
-void printEvent(sqlite3_stmt* statement, bool json, SXValue& all) {
-  const int64_t id = sqlite3_column_int64(statement, 0);
-  const double time = sqlite3_column_double(statement, 1);
-  const std::string name = columnText(statement, 2);
-  const std::string payload = columnText(statement, 3);
-  if (json) {
-    SXValue parsed = SXValue::parse(payload, nullptr, false);
-    all.push_back({{"id", id},
-                   {"time", time},
-                   {"name", name},
-                   {"payload", parsed.is_discarded() ? SXValue(payload) : parsed}});
-    return;
-  }
-  std::printf("%lld  %.3f  %s  %s\n", static_cast<long long>(id), time, name.c_str(),
-              payload.c_str());
+void printEvent(const SXValue& event) {
+  const SXValue& payload = event.at("payload");
+  // A payload that does not parse as JSON is shown as it was stored.
+  const std::string text = payload.is_string() ? payload.get<std::string>() : jsonText(payload);
+  std::printf("%lld  %.3f  %s  %s\n", static_cast<long long>(event.at("id").get<int64_t>()),
+              event.at("time").get<double>(), event.at("name").get<std::string>().c_str(),
+              text.c_str());
 }
 
 }  // namespace
@@ -68,30 +41,17 @@ void printEvent(sqlite3_stmt* statement, bool json, SXValue& all) {
 int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
   const std::string path = paths.stateDir + "/tallyvane.db";
   if (!fs::exists(path)) return fail("events: no analytics store at " + path);
-  sqlite3* raw = nullptr;
-  int rc = sqlite3_open_v2(path.c_str(), &raw, SQLITE_OPEN_READONLY, nullptr);
-  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> db(raw, sqlite3_close);
-  if (rc != SQLITE_OK) return fail("events: cannot open " + path + ": " + sqlite3_errmsg(raw));
-  sqlite3_busy_timeout(db.get(), 2000);
-
-  sqlite3_stmt* statementRaw = nullptr;
-  rc = sqlite3_prepare_v2(db.get(), eventsQuery(r).c_str(), -1, &statementRaw, nullptr);
-  std::unique_ptr<sqlite3_stmt, decltype(&sqlite3_finalize)> statement(statementRaw,
-                                                                       sqlite3_finalize);
-  if (rc != SQLITE_OK) return fail("events: cannot read " + path + ": " + sqlite3_errmsg(raw));
-  if (r.eventName) {
-    sqlite3_bind_text(statement.get(), 1, r.eventName->c_str(), -1, SQLITE_TRANSIENT);
+  std::string error;
+  std::vector<SXValue> events =
+      SXSqliteTallyvane::readEvents(path, r.eventName, r.limit.value_or(0), error, r.since);
+  if (!error.empty()) return fail("events: cannot read " + error);
+  if (r.json) {
+    std::cout << jsonText(SXValue(std::move(events))) << "\n";
+  } else if (events.empty()) {
+    std::cout << "(none)\n";
+  } else {
+    for (const SXValue& event : events) printEvent(event);
   }
-  if (r.since) sqlite3_bind_double(statement.get(), 2, *r.since);
-  SXValue all = SXValue::array();
-  size_t count = 0;
-  while ((rc = sqlite3_step(statement.get())) == SQLITE_ROW) {
-    printEvent(statement.get(), r.json, all);
-    ++count;
-  }
-  if (rc != SQLITE_DONE) return fail("events: cannot read " + path + ": " + sqlite3_errmsg(raw));
-  if (r.json) std::cout << jsonText(all) << "\n";
-  if (!r.json && count == 0) std::cout << "(none)\n";
   return 0;
 }
 
@@ -191,53 +151,6 @@ int SXCtlRunSizes(const SXCtlRequest& r, const SXPaths& paths) {
 
 namespace {
 
-std::string domainPath(const SXPaths& paths) {
-  return paths.preferencesDirectory() + "/" + kSXCtlPreferencesDomain + ".json";
-}
-
-// The stored domain; an absent file is an empty domain.
-bool loadDomain(const std::string& path, SXValue& domain, std::string& error) {
-  std::ifstream in(path);
-  if (!in) {
-    domain = SXValue::object();
-    if (!fs::exists(path)) return true;
-    error = "cannot read " + path + ": " + std::strerror(errno);
-    return false;
-  }
-  std::stringstream text;
-  text << in.rdbuf();
-  domain = SXValue::parse(text.str(), nullptr, false);
-  if (!domain.is_object()) {
-    error = path + " does not hold a JSON object; not touching it";
-    return false;
-  }
-  return true;
-}
-
-// Writes a temporary file beside the domain's file and renames it over, so that a reader
-// never sees half a file.
-bool storeDomain(const std::string& path, const SXValue& domain, std::string& error) {
-  std::error_code ec;
-  fs::create_directories(fs::path(path).parent_path(), ec);
-  const std::string temp = path + ".tmp." + std::to_string(::getpid());
-  {
-    std::ofstream out(temp, std::ios::trunc);
-    out << domain.dump(2, ' ', false, SXValue::error_handler_t::replace) << "\n";
-    out.flush();
-    if (!out) {
-      error = "cannot write " + temp + ": " + std::strerror(errno);
-      fs::remove(temp, ec);
-      return false;
-    }
-  }
-  if (std::rename(temp.c_str(), path.c_str()) != 0) {
-    error = "cannot replace " + path + ": " + std::strerror(errno);
-    fs::remove(temp, ec);
-    return false;
-  }
-  return true;
-}
-
 int readDefaults(const SXCtlRequest& r, const SXValue& domain) {
   if (!r.key) {
     std::cout << jsonText(domain, r.json ? -1 : 2) << "\n";
@@ -252,34 +165,48 @@ int readDefaults(const SXCtlRequest& r, const SXValue& domain) {
   return 0;
 }
 
+// Prints the preferences adapter's error lines as ours and remembers that there were some.
+class ErrorCountingLog final : public SXLogFacility {
+ public:
+  std::shared_ptr<const SXLogScope> registerScope(const SXLogScope& scope) override {
+    return std::make_shared<const SXLogScope>(scope);
+  }
+  bool isEnabled(const SXLogScope*, int level) const override {
+    return level == static_cast<int>(SXLogLevel::kError);
+  }
+  void write(const SXLogScope*, SXLogLevel level, std::string_view line) override {
+    if (level != SXLogLevel::kError) return;
+    ++errors_;
+    std::cerr << "defaults: " << line << "\n";
+  }
+  size_t errors() const { return errors_; }
+
+ private:
+  size_t errors_ = 0;
+};
+
 }  // namespace
 
 int SXCtlRunDefaults(const SXCtlRequest& r, const SXPaths& paths) {
-  const std::string path = domainPath(paths);
-  SXValue domain;
-  std::string error;
-  if (!loadDomain(path, domain, error)) return fail("defaults: " + error);
-  if (r.defaultsAction == "read") return readDefaults(r, domain);
-  if (r.defaultsAction == "write") {
-    domain[*r.key] = r.value;
-  } else if (domain.erase(*r.key) == 0) {
-    return 0;  // nothing to delete
+  if (r.defaultsAction == "read") {
+    auto log = std::make_shared<ErrorCountingLog>();
+    SXValue domain =
+        SXJsonPreferences(paths.preferencesDirectory(), log).copyDomain(kSXCtlPreferencesDomain);
+    return log->errors() ? kSXCtlLocalError : readDefaults(r, domain);
   }
-  if (!storeDomain(path, domain, error)) return fail("defaults: " + error);
+  // A write's failure comes back as its reply; the lines the adapter logs would repeat it.
+  SXJsonPreferences preferences(paths.preferencesDirectory(), std::make_shared<SXDiscardLog>());
+  std::optional<SXValue> value;
+  if (r.defaultsAction == "write") value = r.value;
+  if (auto error = preferences.setValue(kSXCtlPreferencesDomain, *r.key, value)) {
+    return fail("defaults: " + *error);
+  }
   return 0;
 }
 
 int SXCtlRunNotify(const SXCtlRequest& r, const SXPaths& paths) {
-  const fs::path dir = fs::path(paths.runtimeDir) / "notify";
-  std::error_code ec;
-  fs::create_directories(dir, ec);
-  const std::string path = (dir / r.notificationName).string();
-  // Watchers wait for a close after writing, so the file is written, not just opened.
-  const int fd = ::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644);
-  if (fd < 0) return fail("notify: cannot open " + path + ": " + std::strerror(errno));
-  const bool written = ::write(fd, "1", 1) == 1;
-  const int writeErrno = errno;
-  ::close(fd);
-  if (!written) return fail("notify: cannot write " + path + ": " + std::strerror(writeErrno));
+  if (int error = SXInotifyNotifications::postIn(paths.runtimeDir, r.notificationName)) {
+    return fail("notify: cannot post " + r.notificationName + ": " + std::strerror(error));
+  }
   return 0;
 }
