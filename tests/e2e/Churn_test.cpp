@@ -126,8 +126,7 @@ void churnBatch(const TestDaemon& daemon, SXReportingClient& observer, int64_t f
     raws.push_back(std::move(raw));
   }
   for (auto& raw : raws) EXPECT_TRUE(raw->awaitResponses(2));  // the create and the send
-  EXPECT_TRUE(waitUntil([&] { return startedSessions(replied(observer.status())) == kBatch; },
-                        30s))
+  EXPECT_TRUE(waitUntil([&] { return startedSessions(replied(observer.status())) == kBatch; }, 30s))
       << "batch from " << firstID << " did not start";
   // The processes sent before their start; give every started session something to summarise.
   EXPECT_FALSE(replied(observer.sendMessage({{"batch", firstID}}, 3, 1, std::nullopt)));
@@ -170,14 +169,15 @@ TEST(ChurnEndToEnd, AThousandVanishingClientsLeaveNothingBehind) {
   EXPECT_GE(daemon.countInLog("InterruptionHandler: connection exited"), kClients / 2u);
   // Every started session was stopped, so each sent its summary.
   EXPECT_EQ(daemon
-                .waitForRows("fernreporting.db",
-                             "SELECT id FROM messages WHERE category = 65535", kClients, 30s)
+                .waitForRows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535",
+                             kClients, 30s)
                 .size(),
             static_cast<size_t>(kClients));
-  std::printf("churn: %d clients in %.1f s; daemon RSS %ld KiB before, %ld KiB peak, %ld KiB after\n",
-              kClients, seconds, baseline, peak, after);
+  std::printf(
+      "churn: %d clients in %.1f s; daemon RSS %ld KiB before, %ld KiB peak, %ld KiB after\n",
+      kClients, seconds, baseline, peak, after);
   // Generous: allocator caches and the stores' page caches may keep some of the peak.
-#if defined(__SANITIZE_ADDRESS__)
+#if SXR_UNDER_ASAN
   const long allowance = 512 * 1024;  // the sanitizer's quarantine holds freed memory
 #else
   const long allowance = 64 * 1024;
