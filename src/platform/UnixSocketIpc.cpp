@@ -5,6 +5,7 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
 #include <asio/write.hpp>
@@ -121,7 +122,18 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   // the floor reads, and only up to it.
   size_t readAllowance() const {
     if (!listener_.reading()) return 0;
-    if (!budget_->poolOverLimit()) return kReadSize;
+    if (!budget_->poolOverLimit()) {
+      // Bytes read become at most 8 times as many bytes of charges (a 64-byte send request
+      // holds 512), so near its own limit or the pool's a connection reads less, and what one
+      // read adds stays within 8 x kMinRead of them. kMinRead lets a partly received request
+      // complete.
+      auto room = [](const SXByteBudget& budget) {
+        return budget.held() < budget.limit() ? budget.limit() - budget.held() : 0;
+      };
+      uint64_t free = room(*budget_);
+      if (const auto& pool = budget_->pool()) free = std::min(free, room(*pool));
+      return static_cast<size_t>(std::clamp<uint64_t>(free / 8, kMinRead, kReadSize));
+    }
     uint64_t held = budget_->held() + bufferedCharged_;
     uint64_t floor = budget_->floor();
     return held < floor ? static_cast<size_t>(floor - held) : 0;
@@ -327,6 +339,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   }
 
   static constexpr size_t kReadSize = 64 * 1024;
+  static constexpr size_t kMinRead = 4 * 1024;
 
   asio::local::stream_protocol::socket socket_;
   RpcStreamDecoder decoder_;  // I/O thread only
