@@ -419,12 +419,7 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
     sessions.back()->start();
     sessions.back()->sendMessage({{"k", id}}, 3, 1, nullptr);
   }
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (t.log->count("waiting for fernreportingd to find backends") < size_t(kWaiting) &&
-         std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  }
-  ASSERT_EQ(t.log->count("waiting for fernreportingd to find backends"), size_t(kWaiting));
+  ASSERT_TRUE(t.log->waitFor("waiting for fernreportingd to find backends", kWaiting));
 
   // One more, whose backends come at once: its send and its stop's flush go through while
   // every other session still waits.

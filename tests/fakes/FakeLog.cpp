@@ -18,8 +18,11 @@ void FakeLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view 
   size_t second = first == std::string::npos ? first : text.find(':', first + 1);
   size_t third = second == std::string::npos ? second : text.find(": ", second + 1);
   std::string message = third == std::string::npos ? text : text.substr(third + 2);
-  std::lock_guard lock(mutex_);
-  lines_.push_back({scope ? scope->shortName : "", level, std::move(text), std::move(message)});
+  {
+    std::lock_guard lock(mutex_);
+    lines_.push_back({scope ? scope->shortName : "", level, std::move(text), std::move(message)});
+  }
+  written_.notify_all();
 }
 
 std::vector<FakeLog::Line> FakeLog::lines() const {
@@ -41,9 +44,19 @@ std::vector<SXLogScope> FakeLog::registrations() const {
 
 size_t FakeLog::count(const std::string& message) const {
   std::lock_guard lock(mutex_);
+  return countLocked(message);
+}
+
+size_t FakeLog::countLocked(const std::string& message) const {
   size_t n = 0;
   for (const auto& l : lines_) n += l.message == message;
   return n;
+}
+
+bool FakeLog::waitFor(const std::string& message, size_t times,
+                      std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(mutex_);
+  return written_.wait_for(lock, timeout, [&] { return countLocked(message) >= times; });
 }
 
 size_t FakeLog::countContaining(const std::string& fragment) const {

@@ -2,6 +2,8 @@
 // enabled at the verbose level.
 #pragma once
 
+#include <chrono>
+#include <condition_variable>
 #include <mutex>
 #include <set>
 #include <string>
@@ -32,10 +34,16 @@ class FakeLog final : public SXLogFacility {
   // Number of lines whose message contains `fragment`, and whether there is one.
   size_t countContaining(const std::string& fragment) const;
   bool contains(const std::string& fragment) const;
+  // Waits until `times` lines have the message `message`; false when `timeout` passes first.
+  bool waitFor(const std::string& message, size_t times = 1,
+               std::chrono::milliseconds timeout = std::chrono::seconds(20)) const;
   void setVerbose(const std::string& scope, bool on);
 
  private:
+  size_t countLocked(const std::string& message) const;  // REQUIRES(mutex_)
+
   mutable std::mutex mutex_;
+  mutable std::condition_variable written_;
   std::set<std::string> verbose_;
   std::vector<Line> lines_;
   std::vector<SXLogScope> registrations_;
