@@ -7,6 +7,7 @@
 
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
+#include <algorithm>
 #include <atomic>
 
 namespace {
@@ -129,8 +130,9 @@ class PoolSerialQueue final : public SXWorkQueue,
     pool_.submit([self = shared_from_this()] { self->drain(); });
   }
 
+  // Runs a turn of tasks, then lets the other queues' drains have the thread before the next.
   void drain() {
-    for (;;) {
+    for (int ran = 0; ran < kTasksPerTurn; ++ran) {
       SXTask task;
       {
         std::lock_guard lock(mutex_);
@@ -143,7 +145,10 @@ class PoolSerialQueue final : public SXWorkQueue,
       }
       task();
     }
+    submitDrain();
   }
+
+  static constexpr int kTasksPerTurn = 64;
 
   const std::string label_;
   SXElasticPool& pool_;
@@ -169,8 +174,8 @@ class PoolConcurrentQueue final : public SXWorkQueue {
 
 }  // namespace
 
-SXElasticPool::SXElasticPool(std::string threadName, int niceness, size_t maxThreads)
-    : threadName_(std::move(threadName)), niceness_(niceness), maxThreads_(maxThreads) {}
+SXElasticPool::SXElasticPool(std::string threadName, int niceness, Options options)
+    : threadName_(std::move(threadName)), niceness_(niceness), options_(options) {}
 
 SXElasticPool::~SXElasticPool() {
   std::vector<std::thread> threads;
@@ -178,8 +183,10 @@ SXElasticPool::~SXElasticPool() {
     std::lock_guard lock(mutex_);
     stopping_ = true;
     threads.swap(threads_);
+    if (watcher_.joinable()) threads.push_back(std::move(watcher_));
   }
   wake_.notify_all();
+  waiting_.notify_all();
   for (auto& t : threads) {
     if (t.get_id() == std::this_thread::get_id()) {
       t.detach();
@@ -192,11 +199,45 @@ SXElasticPool::~SXElasticPool() {
 void SXElasticPool::submit(SXTask task) {
   std::lock_guard lock(mutex_);
   if (stopping_) return;
-  tasks_.push_back(std::move(task));
+  tasks_.push_back({std::move(task), std::chrono::steady_clock::now()});
   if (idle_ >= tasks_.size()) {
     wake_.notify_one();
-  } else if (threads_.size() < maxThreads_) {
-    threads_.emplace_back([this] { work(); });
+  } else if (threads_.size() < options_.eagerThreads) {
+    startWorker();
+  } else if (threads_.size() < options_.maxThreads) {
+    // Every worker is busy: the watcher adds one if this goes on.
+    if (!watcher_.joinable()) {
+      watcher_ = std::thread([this] { watchForStalls(); });
+    } else if (watcherAsleep_) {
+      waiting_.notify_one();
+    }
+  }
+}
+
+void SXElasticPool::startWorker() {
+  threads_.emplace_back([this] { work(); });
+}
+
+void SXElasticPool::watchForStalls() {
+  nameThisThread(threadName_ + "-w");
+  std::unique_lock lock(mutex_);
+  auto lastStart = std::chrono::steady_clock::time_point::min();
+  for (;;) {
+    watcherAsleep_ = true;
+    waiting_.wait(lock, [this] { return stopping_ || idle_ < tasks_.size(); });
+    watcherAsleep_ = false;
+    if (stopping_) return;
+    // Stalled: the oldest task has waited, and no worker has taken a task meanwhile (workers
+    // kept busy by the CPU still take tasks; blocked ones do not). A worker just started has
+    // not taken its task yet: the next one waits its own turn.
+    auto due = std::max({tasks_.front().since, lastBegin_, lastStart}) + options_.stallAfter;
+    if (waiting_.wait_until(lock, due, [this] { return stopping_; })) return;
+    auto now = std::chrono::steady_clock::now();
+    if (idle_ < tasks_.size() && tasks_.front().since + options_.stallAfter <= now &&
+        lastBegin_ + options_.stallAfter <= now && threads_.size() < options_.maxThreads) {
+      startWorker();
+      lastStart = now;
+    }
   }
 }
 
@@ -208,12 +249,28 @@ void SXElasticPool::work() {
   std::unique_lock lock(mutex_);
   for (;;) {
     ++idle_;
-    wake_.wait(lock, [this] { return stopping_ || !tasks_.empty(); });
+    bool woken = wake_.wait_for(lock, options_.idleExitAfter,
+                                [this] { return stopping_ || !tasks_.empty(); });
     --idle_;
-    if (tasks_.empty()) return;  // stopping, and nothing left to run
-    SXTask task = std::move(tasks_.front());
+    if (!woken && threads_.size() > options_.eagerThreads) {
+      // A worker added for a stall that is over.
+      auto self = std::find_if(threads_.begin(), threads_.end(), [](const std::thread& t) {
+        return t.get_id() == std::this_thread::get_id();
+      });
+      if (self != threads_.end()) {
+        self->detach();
+        threads_.erase(self);
+        return;
+      }
+    }
+    if (tasks_.empty()) {
+      if (stopping_) return;  // stopping, and nothing left to run
+      continue;
+    }
+    SXTask task = std::move(tasks_.front().task);
     tasks_.pop_front();
     ++begun_;
+    lastBegin_ = std::chrono::steady_clock::now();
     lock.unlock();
     task();
     task = nullptr;  // release what the task captured before we sleep again
@@ -232,8 +289,10 @@ void SXElasticPool::hold(int delta) {
 }
 
 SXAsioDispatch::SXAsioDispatch()
-    : utilityPool_("sxr-utility", 0, 256),
-      lowPriorityPool_(std::make_shared<SXElasticPool>("sxr-lowprio", 10, 2)),
+    : utilityPool_("sxr-utility", 0,
+                   {.eagerThreads = std::max(2u, std::thread::hardware_concurrency())}),
+      lowPriorityPool_(std::make_shared<SXElasticPool>(
+          "sxr-lowprio", 10, SXElasticPool::Options{.eagerThreads = 2, .maxThreads = 2})),
       timersWork_(asio::make_work_guard(timers_)) {
   lowPriorityQueue_ =
       std::make_shared<PoolConcurrentQueue>("com.vendra.sonex.lowpriority", lowPriorityPool_);

@@ -1,13 +1,16 @@
 // Production work queues.
 //
 // The server queue (user-interactive) is one thread of its own. Utility queues are serial
-// executors over a shared pool that adds a thread whenever a task waits and no worker is idle,
-// so a task blocked for seconds on one queue never holds up another. The low-priority
+// executors over a shared pool of one thread per core that adds a thread when a task has
+// waited for a worker for a while, so a task blocked for seconds on one queue never holds up
+// another, while tasks that wait a moment (a commit, a lock) do not fill the process with
+// threads. The low-priority
 // concurrent queue is a small pool whose threads run at nice 10. Delays are Asio timers on a
 // timer thread. Destruction stops every thread after the tasks already queued have run.
 #pragma once
 
 #include <asio/executor_work_guard.hpp>
+#include <chrono>
 #include <asio/io_context.hpp>
 #include <condition_variable>
 #include <deque>
@@ -17,10 +20,20 @@
 
 #include "platform/Dispatch.h"
 
-// A pool of threads that grows up to `maxThreads` while all of its workers are busy.
+// A pool of threads. Up to `eagerThreads` start as soon as a task finds every worker busy;
+// beyond them, up to `maxThreads`, one more starts each time the pool stalls: the oldest
+// waiting task has waited `stallAfter` and no worker has taken a task meanwhile (they are
+// blocked, not busy). Workers beyond `eagerThreads`
+// that stay idle for `idleExitAfter` end.
 class SXElasticPool {
  public:
-  SXElasticPool(std::string threadName, int niceness, size_t maxThreads);
+  struct Options {
+    size_t eagerThreads = 2;
+    size_t maxThreads = 256;
+    std::chrono::milliseconds stallAfter{100};
+    std::chrono::milliseconds idleExitAfter{30'000};
+  };
+  SXElasticPool(std::string threadName, int niceness, Options options);
   ~SXElasticPool();
   SXElasticPool(const SXElasticPool&) = delete;
   SXElasticPool& operator=(const SXElasticPool&) = delete;
@@ -38,18 +51,29 @@ class SXElasticPool {
   void hold(int delta);
 
  private:
+  struct Queued {
+    SXTask task;
+    std::chrono::steady_clock::time_point since;
+  };
   void work();
+  void watchForStalls();
+  // REQUIRES(mutex_).
+  void startWorker();
 
   const std::string threadName_;
   const int niceness_;
-  const size_t maxThreads_;
+  const Options options_;
   mutable std::mutex mutex_;
-  std::condition_variable wake_;
-  std::deque<SXTask> tasks_;          // GUARDED_BY(mutex_)
+  std::condition_variable wake_;      // a task queued, or stopping
+  std::condition_variable waiting_;   // a task waits with no idle worker, or stopping
+  std::deque<Queued> tasks_;          // GUARDED_BY(mutex_)
   std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
+  std::thread watcher_;               // GUARDED_BY(mutex_): started when first needed
+  bool watcherAsleep_ = false;        // GUARDED_BY(mutex_): waiting for a task to watch
   size_t idle_ = 0;                   // GUARDED_BY(mutex_)
   size_t held_ = 0;                   // GUARDED_BY(mutex_)
   uint64_t begun_ = 0;                // GUARDED_BY(mutex_)
+  std::chrono::steady_clock::time_point lastBegin_;  // GUARDED_BY(mutex_)
   bool stopping_ = false;             // GUARDED_BY(mutex_)
 };
 
