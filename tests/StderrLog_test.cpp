@@ -29,6 +29,7 @@ std::string writtenLine(SXStderrLog& log) {
   int saved = ::dup(STDERR_FILENO);
   ::dup2(pipeFds[1], STDERR_FILENO);
   log.write(nullptr, SXLogLevel::kError, "file.cpp:1:f: went wrong");
+  log.flush();
   ::dup2(saved, STDERR_FILENO);
   ::close(saved);
   ::close(pipeFds[1]);

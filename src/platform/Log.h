@@ -48,6 +48,10 @@ class SXLogFacility {
 
   // Writes one whole line (without a trailing newline).
   virtual void write(const SXLogScope* scope, SXLogLevel level, std::string_view line) = 0;
+
+  // Returns once every line written before the call is out: for a process about to end
+  // without unwinding. A facility that writes at once has nothing to do.
+  virtual void flush() {}
 };
 
 // Formats "<file>:<line>:<function>: " followed by the message and writes it. Debug lines are

@@ -1,10 +1,12 @@
 #include "platform/StderrLog.h"
 
+#include <pthread.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <charconv>
 #include <cstdio>
 #include <cstdlib>
@@ -36,10 +38,31 @@ bool JournalAttached(int fd) {
          inode == st.st_ino;
 }
 
+// A short write or an interrupted one is resumed; a failing stderr loses the rest.
+void WriteAll(int fd, std::string_view text) {
+  while (!text.empty()) {
+    ssize_t n = ::write(fd, text.data(), text.size());
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return;
+    text.remove_prefix(static_cast<size_t>(n));
+  }
+}
+
 }  // namespace
 
 SXStderrLog::SXStderrLog(std::string_view levels, Output output) : output_(output) {
   parseLevels(levels, levels_);
+}
+
+SXStderrLog::~SXStderrLog() {
+  std::thread writer;
+  {
+    std::lock_guard lock(mutex_);
+    stopping_ = true;
+    writer.swap(writer_);
+  }
+  wake_.notify_one();
+  if (writer.joinable()) writer.join();
 }
 
 SXStderrLog::Output SXStderrLog::outputFor(int fd) {
@@ -96,9 +119,56 @@ bool SXStderrLog::writeToJournal(const SXLogScope* scope, int priority, std::str
 void SXStderrLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view line) {
   int priority = SyslogPriority(level);
   if (output_ == Output::kJournal && writeToJournal(scope, priority, line)) return;
-  std::lock_guard lock(writeMutex_);
-  if (output_ != Output::kPlain) std::fprintf(stderr, "<%d>", priority);
-  std::fwrite(line.data(), 1, line.size(), stderr);
-  std::fputc('\n', stderr);
-  std::fflush(stderr);
+  std::string text;
+  text.reserve(line.size() + 5);
+  if (output_ != Output::kPlain) (text += '<') += std::to_string(priority) += '>';
+  (text += line) += '\n';
+  std::unique_lock lock(mutex_);
+  written_.wait(lock, [this] { return waiting_.size() < kMaxWaitingBytes || stopping_; });
+  if (stopping_) {  // the writer is gone or going: write it ourselves, after what it had
+    lock.unlock();
+    WriteAll(STDERR_FILENO, text);
+    return;
+  }
+  bool first = waiting_.empty();
+  bool filled = waiting_.size() < kBatchBytes && waiting_.size() + text.size() >= kBatchBytes;
+  waiting_ += text;
+  ++linesQueued_;
+  if (!writer_.joinable()) {
+    writer_ = std::thread([this] {
+      pthread_setname_np(pthread_self(), "sxr-log");
+      writeWaiting();
+    });
+  }
+  if (first || filled) wake_.notify_one();
+}
+
+void SXStderrLog::writeWaiting() {
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    wake_.wait(lock, [this] { return stopping_ || !waiting_.empty(); });
+    if (waiting_.empty()) return;  // stopping, and everything is out
+    // A line seldom comes alone: waiting a moment for the rest of a burst saves a wake-up
+    // and a write per line.
+    wake_.wait_for(lock, kLinger, [this] {
+      return stopping_ || flushWaiters_ > 0 || waiting_.size() >= kBatchBytes;
+    });
+    std::string batch;
+    batch.swap(waiting_);
+    uint64_t lines = linesQueued_;
+    lock.unlock();
+    WriteAll(STDERR_FILENO, batch);
+    lock.lock();
+    linesWritten_ = lines;
+    written_.notify_all();
+  }
+}
+
+void SXStderrLog::flush() {
+  std::unique_lock lock(mutex_);
+  uint64_t target = linesQueued_;
+  ++flushWaiters_;
+  wake_.notify_one();  // no lingering for lines someone waits for
+  written_.wait(lock, [&] { return linesWritten_ >= target || !writer_.joinable(); });
+  --flushWaiters_;
 }

@@ -81,6 +81,7 @@ void SXReportingLifecycle::beginStop(const char* signal) {
 void SXReportingLifecycle::cutShort(const std::string& why) {
   // Committed rows are safe in the stores' logs; what the drain had not reached is named here.
   SXLOG(*log_, nullptr, SXLogLevel::kError, "exiting now: %@; left: %@", why, hooks_.leftovers());
+  log_->flush();
   ::_exit(1);
 }
 

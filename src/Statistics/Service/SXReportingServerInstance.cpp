@@ -355,6 +355,7 @@ void SXReportingServerInstance::destroyReportingSession(int64_t reporterID, Repl
 
 void SXReportingServerInstance::killService(Reply<bool> /*never sent*/) {
   SXLOG(log(), scope(), SXLogLevel::kDefault, "DESTROYING SERVICE");
+  log().flush();
   environment_->platform().process->exitProcess(2);
 }
 

@@ -549,6 +549,11 @@ int main(int argc, char** argv) {
   // Stores, preferences and notification files hold client payloads: no access for others.
   ::umask(0027);
   auto log = std::make_shared<SXStderrLog>(options.logScopes);
+  // Whichever way main ends, the lines still waiting for the log's writer go out first.
+  struct FlushLog {
+    SXStderrLog& log;
+    ~FlushLog() { log.flush(); }
+  } flushLog{*log};
   SXPosixFileSystem fs;
   // The runtime directory has the group of the socket the daemon binds in it, so 0750 still
   // lets that group reach the socket and the notify directory.
@@ -598,6 +603,7 @@ int main(int argc, char** argv) {
   setStatusProviders(service);
   int status = serve(service);
   // After a drain everything is stored; tearing down the object graph would only repeat it.
+  log->flush();
   std::fflush(nullptr);
   std::_Exit(status);
 }
