@@ -1,5 +1,7 @@
 #include "SXReportingTallyvaneBridge.h"
 
+#include <algorithm>
+
 #include "SXReportingSession.h"
 #include "SXReportingUtility.h"
 #include "common/SXValueText.h"
@@ -14,21 +16,34 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
          SXReportingUtilityTypeName(type);
 }
 
+SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
+  auto it = std::find_if(texts_.begin(), texts_.end(),
+                         [&](const std::shared_ptr<Text>& text) { return text->host == host; });
+  std::shared_ptr<Text> text = it != texts_.end() ? *it : texts_.emplace_back(
+                                                              std::make_shared<Text>(host));
+  return [payload = payload_, text] {
+    std::call_once(text->once,
+                   [&] { text->text = SXValueTextWithMember(*payload, kHostKey, text->host); });
+    return text->text;
+  };
+}
+
 void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment,
-                                             std::shared_ptr<const SXValue> payload,
+                                             SXReportingEventTexts& texts,
                                              SXReportingCategory category,
                                              SXReportingMessageType type,
                                              const SXReportingSession& session) {
   thread_local SXReportingPairNameCache names;
   const std::string& name = names.get(category, type, [&] { return eventName(category, type); });
-  auto host = std::make_shared<const SXValue>(session.hostApplicationName());
+  SXValue host = session.hostApplicationName();
+  SXPayloadTextProvider text = texts.textForHost(host);
   environment.platform().tallyvane->sendEventLazy(
       name,
-      [payload, host] {
+      [payload = texts.payload(), host = std::move(host)] {
         SXValue copy = payload->is_object() ? *payload : SXValue::object();
-        copy[kHostKey] = *host;
+        copy[kHostKey] = host;
         return copy;
       },
       // A store of JSON text gets the same payload's text without the copy.
-      [payload, host] { return SXValueTextWithMember(*payload, kHostKey, *host); });
+      std::move(text));
 }

@@ -3,21 +3,41 @@
 // Stateless; runs on its caller's thread.
 #pragma once
 
+#include <mutex>
+#include <vector>
+
 #include "SXReportingEnvironment.h"
 
 class SXReportingSession;
 
+// The analytics events of one message: their payloads differ only in the host name, so each
+// distinct host's text is made once (when the analytics service first asks for it, on its
+// thread), however many sessions the message goes to. Used on the server queue.
+class SXReportingEventTexts {
+ public:
+  explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload)
+      : payload_(std::move(payload)) {}
+  const std::shared_ptr<const SXValue>& payload() const { return payload_; }
+  // The event text for a session whose host is `host`.
+  SXPayloadTextProvider textForHost(const SXValue& host);
+
+ private:
+  struct Text {
+    explicit Text(SXValue h) : host(std::move(h)) {}
+    const SXValue host;
+    std::once_flag once;
+    std::string text;  // written once, under `once`
+  };
+  std::shared_ptr<const SXValue> payload_;
+  std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few
+};
+
 class SXReportingTallyvaneBridge {
  public:
-  // `payload` is never changed by anyone, so the event's copy of it (with the host name) is
-  // made when the analytics service asks for it, on the service's thread.
-  static void handleEvent(SXReportingEnvironment& environment,
-                          std::shared_ptr<const SXValue> payload, SXReportingCategory category,
-                          SXReportingMessageType type, const SXReportingSession& session);
-  static void handleEvent(SXReportingEnvironment& environment, const SXValue& payload,
+  // `texts.payload()` is never changed by anyone, so the event's copy of it (with the host
+  // name) is made when the analytics service asks for it, on the service's thread.
+  static void handleEvent(SXReportingEnvironment& environment, SXReportingEventTexts& texts,
                           SXReportingCategory category, SXReportingMessageType type,
-                          const SXReportingSession& session) {
-    handleEvent(environment, std::make_shared<const SXValue>(payload), category, type, session);
-  }
+                          const SXReportingSession& session);
   static std::string eventName(SXReportingCategory category, SXReportingMessageType type);
 };

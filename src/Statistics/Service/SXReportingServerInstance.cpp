@@ -247,12 +247,14 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> me
   // Measured once for every delivery's charge and aggregate entry.
   size_t packedBytes = SXPackedSize(*message);
   message = chargeDeliveries(std::move(message), packedBytes, sessions.size());
+  SXReportingEventTexts events(message);
+  auto prepared = std::make_shared<SXReportingMessagePayload>(message);
   for (const auto& session : sessions) {
-    SXReportingTallyvaneBridge::handleEvent(*environment_, message, category, type, *session);
+    SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
                                              *session);
-    session->sendMessage(message, category, type, nullptr, packedBytes);
+    session->sendMessage(message, category, type, nullptr, packedBytes, prepared);
   }
 }
 
@@ -283,9 +285,11 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
   }
   size_t packedBytes = SXPackedSize(*message);
   auto charged = chargeDeliveries(message, packedBytes, active.size());
+  SXReportingEventTexts events(charged);
+  auto prepared = std::make_shared<SXReportingMessagePayload>(charged);
   for (const auto& session : active) {
-    session->sendMessage(charged, category, type, nullptr, packedBytes);
-    SXReportingTallyvaneBridge::handleEvent(*environment_, charged, category, type, *session);
+    session->sendMessage(charged, category, type, nullptr, packedBytes, prepared);
+    SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
     SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
                                              *session);

@@ -136,17 +136,23 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   std::string messageIdForCategory(SXReportingCategory category, SXReportingMessageType type);
   // `payload` is never changed; the shared form lets the send task read it without a copy.
   // `packedBytes`, its MessagePack size, is measured here when the caller has not.
+  // `prepared`: the payload's rewritten form, made once for every session a message goes to
+  // (a broadcast, a list of IDs), so that its text is made once and shared by their
+  // aggregates; made here when null.
   void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply,
-                   std::optional<size_t> packedBytes = std::nullopt);
+                   std::optional<size_t> packedBytes = std::nullopt,
+                   std::shared_ptr<SXReportingMessagePayload> prepared = nullptr);
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply) {
     sendMessage(std::make_shared<const SXValue>(payload), category, type, sync, std::move(reply));
   }
   void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
                    SXReportingMessageType type, SXReportingSendReply reply,
-                   std::optional<size_t> packedBytes = std::nullopt) {
-    sendMessage(std::move(payload), category, type, false, std::move(reply), packedBytes);
+                   std::optional<size_t> packedBytes = std::nullopt,
+                   std::shared_ptr<SXReportingMessagePayload> prepared = nullptr) {
+    sendMessage(std::move(payload), category, type, false, std::move(reply), packedBytes,
+                std::move(prepared));
   }
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, SXReportingSendReply reply) {

@@ -55,11 +55,13 @@ bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint
 void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
                                      SXReportingCategory category, SXReportingMessageType type,
                                      bool /*sync*/, SXReportingSendReply reply,
-                                     std::optional<size_t> packedBytes) {
+                                     std::optional<size_t> packedBytes,
+                                     std::shared_ptr<SXReportingMessagePayload> prepared) {
   SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
         reporterID());
   // The key rewrite is made once, where it is first needed (normally by the send task).
-  auto rewritten = std::make_shared<SXReportingMessagePayload>(payload);
+  auto rewritten = prepared ? std::move(prepared)
+                            : std::make_shared<SXReportingMessagePayload>(payload);
   std::string messageId = messageIdForCategory(category, type);
   bool aggregated = false;
   if (aggregate_.load()) {
