@@ -25,7 +25,7 @@ struct RawArgs {
 
 using Builder = bool (*)(const RawArgs&, SXCtlRequest&, std::string&);
 
-struct CommandSpec {
+struct CommandDefinition {
   std::string_view name;
   std::string_view usage;    // what follows "sxreportctl"
   std::string_view summary;  // one line in the overview
@@ -254,11 +254,11 @@ bool buildNotify(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   return true;
 }
 
-const std::vector<CommandSpec>& commandSpecs();
+const std::vector<CommandDefinition>& commandDefinitions();
 
-const CommandSpec* findSpec(std::string_view name) {
-  for (const auto& spec : commandSpecs()) {
-    if (spec.name == name) return &spec;
+const CommandDefinition* findDefinition(std::string_view name) {
+  for (const auto& definition : commandDefinitions()) {
+    if (definition.name == name) return &definition;
   }
   return nullptr;
 }
@@ -293,14 +293,16 @@ bool setGlobal(const std::string& name, const std::string& value, SXCtlRequest& 
 
 // One "--name[=value]" argument at `args[i]`; takes the next argument as the value when the
 // option wants one and none was attached.
-bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSpec* spec,
-                RawArgs& raw, SXCtlRequest& r, std::string& error) {
+bool takeOption(const std::vector<std::string>& args, size_t& i,
+                const CommandDefinition* definition, RawArgs& raw, SXCtlRequest& r,
+                std::string& error) {
   const std::string& arg = args[i];
   const size_t equals = arg.find('=');
   const std::string name = arg.substr(0, equals);
-  const bool wantsValue = isGlobalValueOption(name) || (spec && contains(spec->valueOptions, name));
+  const bool wantsValue =
+      isGlobalValueOption(name) || (definition && contains(definition->valueOptions, name));
   if (name == "--json" || name == "--help" || name == "--version" ||
-      (spec && contains(spec->flagOptions, name))) {
+      (definition && contains(definition->flagOptions, name))) {
     if (equals != std::string::npos) {
       error = name + " takes no value";
       return false;
@@ -312,8 +314,8 @@ bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSp
     return true;
   }
   if (!wantsValue) {
-    error = spec ? std::string(spec->name) + " has no option " + name
-                 : "unknown option " + name + " (subcommand options follow the subcommand)";
+    error = definition ? std::string(definition->name) + " has no option " + name
+                       : "unknown option " + name + " (subcommand options follow the subcommand)";
     return false;
   }
   std::string value;
@@ -332,7 +334,7 @@ bool takeOption(const std::vector<std::string>& args, size_t& i, const CommandSp
 
 bool sortArguments(const std::vector<std::string>& args, RawArgs& raw, SXCtlRequest& r,
                    std::string& error) {
-  const CommandSpec* spec = nullptr;
+  const CommandDefinition* definition = nullptr;
   bool onlyPositional = false;
   for (size_t i = 0; i < args.size(); ++i) {
     const std::string& arg = args[i];
@@ -341,11 +343,11 @@ bool sortArguments(const std::vector<std::string>& args, RawArgs& raw, SXCtlRequ
     } else if (!onlyPositional && arg == "-h") {
       r.help = true;
     } else if (!onlyPositional && arg.starts_with("--")) {
-      if (!takeOption(args, i, spec, raw, r, error)) return false;
+      if (!takeOption(args, i, definition, raw, r, error)) return false;
     } else if (r.command.empty()) {
       r.command = arg;
-      spec = findSpec(arg);
-      if (!spec && arg != "help") {
+      definition = findDefinition(arg);
+      if (!definition && arg != "help") {
         error = "unknown command '" + arg + "'";
         return false;
       }
@@ -387,12 +389,12 @@ bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& r, std::stri
     error = "no command given; see sxreportctl --help";
     return false;
   }
-  const CommandSpec& spec = *findSpec(r.command);
-  if (raw.positional.size() < spec.minArgs || raw.positional.size() > spec.maxArgs) {
-    error = "usage: sxreportctl " + std::string(spec.usage);
+  const CommandDefinition& definition = *findDefinition(r.command);
+  if (raw.positional.size() < definition.minArgs || raw.positional.size() > definition.maxArgs) {
+    error = "usage: sxreportctl " + std::string(definition.usage);
     return false;
   }
-  return spec.build(raw, r, error);
+  return definition.build(raw, r, error);
 }
 
 namespace {
@@ -480,9 +482,9 @@ SXPaths SXCtlPaths(const SXCtlRequest& request) {
 
 namespace {
 
-const std::vector<CommandSpec>& commandSpecs() {
+const std::vector<CommandDefinition>& commandDefinitions() {
   // clang-format off
-  static const std::vector<CommandSpec> specs = {
+  static const std::vector<CommandDefinition> definitions = {
       {"create", "create ID", "create a reporting session",
        "Creates a session with reporter ID ID (a signed 64-bit number of your choosing).\n"
        "Replies true. The session belongs to this connection and goes when it closes, so\n"
@@ -558,7 +560,7 @@ const std::vector<CommandSpec>& commandSpecs() {
        {}, {}, buildNotify},
   };
   // clang-format on
-  return specs;
+  return definitions;
 }
 
 constexpr std::string_view kOptionsHelp =
@@ -603,11 +605,11 @@ constexpr std::string_view kCommandOptionsHelp =
 }  // namespace
 
 std::string SXCtlHelp(const std::string& command) {
-  if (const CommandSpec* spec = findSpec(command)) {
-    std::string summary(spec->summary);
+  if (const CommandDefinition* definition = findDefinition(command)) {
+    std::string summary(definition->summary);
     summary[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(summary[0])));
-    return "usage: sxreportctl [options] " + std::string(spec->usage) + "\n\n" + summary + ".\n" +
-           std::string(spec->details) + "\n\n" + std::string(kCommandOptionsHelp);
+    return "usage: sxreportctl [options] " + std::string(definition->usage) + "\n\n" + summary +
+           ".\n" + std::string(definition->details) + "\n\n" + std::string(kCommandOptionsHelp);
   }
   std::string text =
       "Usage: sxreportctl [options] COMMAND [ARGS]\n\n"
@@ -616,12 +618,12 @@ std::string SXCtlHelp(const std::string& command) {
       "fails. A session lives as long as the connection that created it, so create and start\n"
       "it in one run: sxreportctl create 42 then set-type telephony 42 then start 42\n"
       "\nCommands:\n";
-  for (const auto& spec : commandSpecs()) {
-    std::string usage(spec.name == "send"       ? "send ... PAYLOAD_JSON"
-                      : spec.name == "defaults" ? "defaults read|write|delete ..."
-                                                : spec.usage);
+  for (const auto& definition : commandDefinitions()) {
+    std::string usage(definition.name == "send"       ? "send ... PAYLOAD_JSON"
+                      : definition.name == "defaults" ? "defaults read|write|delete ..."
+                                                      : definition.usage);
     usage.resize(std::max<size_t>(usage.size() + 2, 34), ' ');
-    text += "  " + usage + std::string(spec.summary) + "\n";
+    text += "  " + usage + std::string(definition.summary) + "\n";
   }
   return text + "\n" + std::string(kOptionsHelp);
 }

@@ -48,18 +48,18 @@ namespace {
 template <typename T>
 void appendNumber(std::string& out, std::string_view flags, const char* length, char conv,
                   T value) {
-  std::string spec = "%";
-  spec.append(flags);
-  spec.append(length);
-  spec.push_back(conv);
+  std::string conversion = "%";
+  conversion.append(flags);
+  conversion.append(length);
+  conversion.push_back(conv);
   char buf[128];
-  int n = std::snprintf(buf, sizeof buf, spec.c_str(), value);
+  int n = std::snprintf(buf, sizeof buf, conversion.c_str(), value);
   if (n < 0) return;
   if (static_cast<size_t>(n) < sizeof buf) {
     out.append(buf, static_cast<size_t>(n));
   } else {
     std::string big(static_cast<size_t>(n) + 1, '\0');
-    std::snprintf(big.data(), big.size(), spec.c_str(), value);
+    std::snprintf(big.data(), big.size(), conversion.c_str(), value);
     out.append(big.data(), static_cast<size_t>(n));
   }
 }

@@ -15,7 +15,7 @@ namespace fs = std::filesystem;
 
 namespace {
 
-struct StoreSpec {
+struct PrunedStore {
   const char* name;  // as in status
   const char* file;
   const char* table;  // the table pruned by age and size
@@ -23,7 +23,7 @@ struct StoreSpec {
 };
 
 constexpr size_t kSpool = 2;
-constexpr StoreSpec kStoreSpecs[] = {
+constexpr PrunedStore kPrunedStores[] = {
     {"tallyvane", "tallyvane.db", "events", &SXRetentionPolicy::analytics},
     {"joulebook", "joulebook.db", "entries", &SXRetentionPolicy::powerLog},
     {"fernreporting", "fernreporting.db", "messages", &SXRetentionPolicy::spool},
@@ -142,12 +142,12 @@ SXRetentionPolicy SXRetention::policy() const {
 void SXRetention::runPass() {
   std::lock_guard pass(passMutex_);
   const SXRetentionPolicy policy = this->policy();
-  for (size_t i = 0; i < kStores && !stopped_; ++i) pruneStore(i, policy.*kStoreSpecs[i].limits);
+  for (size_t i = 0; i < kStores && !stopped_; ++i) pruneStore(i, policy.*kPrunedStores[i].limits);
   if (!stopped_) ageOutFiles(policy);
 }
 
 void SXRetention::pruneStore(size_t index, const SXStoreRetention& limits) {
-  const StoreSpec& store = kStoreSpecs[index];
+  const PrunedStore& store = kPrunedStores[index];
   const std::string path = options_.stateDir + "/" + store.file;
   std::error_code ec;
   if (!fs::exists(path, ec)) return;  // its adapter has not made it (yet)
@@ -229,7 +229,7 @@ void SXRetention::reportError(size_t slot, const std::string& error) {
 
 SXValue SXRetention::counters() const {
   SXValue rows = SXValue::object();
-  for (size_t i = 0; i < kStores; ++i) rows[kStoreSpecs[i].name] = rowsPruned_[i].load();
+  for (size_t i = 0; i < kStores; ++i) rows[kPrunedStores[i].name] = rowsPruned_[i].load();
   return {{"rows_pruned", std::move(rows)},
           {"files_aged_out",
            {{"summary", summaryFilesRemoved_.load()}, {"damaged", damagedCopiesRemoved_.load()}}}};
@@ -239,7 +239,7 @@ SXValue SXRetention::gauges() const {
   SXValue bytes = SXValue::object();
   for (size_t i = 0; i < kStores; ++i) {
     if (int64_t measured = storeBytes_[i].load(); measured >= 0) {
-      bytes[kStoreSpecs[i].name] = measured;
+      bytes[kPrunedStores[i].name] = measured;
     }
   }
   if (bytes.empty()) return SXValue::object();
