@@ -88,7 +88,8 @@ TEST(RpcParseRequest, SaysWhatIsWrongAndKeepsAnyUsableMsgid) {
       {SXValue{0, 5, "m", SXValue::array(), 1}, 5u, notRequest},
       {SXValue{7, 5, "m", SXValue::array()}, 5u, notRequest},
       {SXValue{2, "m", SXValue::array()}, std::nullopt, notRequest},  // a notification
-      {SXValue{0, -1, "m", SXValue::array()}, std::nullopt, "msgid is not an unsigned 32-bit integer"},
+      {SXValue{0, -1, "m", SXValue::array()}, std::nullopt,
+       "msgid is not an unsigned 32-bit integer"},
       {SXValue{0, 4294967296ull, "m", SXValue::array()}, std::nullopt,
        "msgid is not an unsigned 32-bit integer"},
       {SXValue("m"), std::nullopt, notRequest},
@@ -123,12 +124,26 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndWithMemberIsThatOfTheMergedCop
         SXValue{{"Host", 1}, {"Hz", 2.5}, {"b", {{"c", "\xff\n"}}}},
         SXValue{{"q\"u\\o\te", "\x7f\x01"}, {"\xc3\xa9t\xc3\xa9", "caf\xc3\xa9"}, {"", ""}},
         SXValue{{"n", {nullptr, true, -1, 18446744073709551615ull, 1e300, 0.1, SXValue::object()}},
-                {"bin", SXValue::binary(bytes)}, {"arr", SXValue::array()}},
+                {"bin", SXValue::binary(bytes)},
+                {"arr", SXValue::array()}},
+        SXValue{{"A", "}\\\"{,]"}, {"Host", {{"x", {1, "]"}}}}, {"I", nullptr}, {"z", false}},
         SXValue::array({1}), SXValue()}) {
     SXValue merged = payload.is_object() ? payload : SXValue::object();
     merged["HostApplicationDisplayID"] = host;
     EXPECT_EQ(SXValueTextWithMember(payload, "HostApplicationDisplayID", host), SXValueText(merged))
         << payload.dump();
+    if (payload.is_object()) {
+      // Made from the dictionary's text instead: the same, or nothing when a key has an escape.
+      auto spliced =
+          SXDictionaryTextWithMember(SXValueText(payload), "HostApplicationDisplayID", host);
+      bool escapes = false;
+      for (const auto& [key, value] : payload.items()) {
+        for (char c : key) escapes |= c == '"' || c == '\\' || static_cast<unsigned char>(c) < 0x20;
+      }
+      if (spliced || !escapes) {
+        EXPECT_EQ(spliced, SXValueText(merged)) << payload.dump();
+      }
+    }
     EXPECT_EQ(SXValueText(merged), merged.dump(-1, ' ', false, SXValue::error_handler_t::replace));
   }
 }

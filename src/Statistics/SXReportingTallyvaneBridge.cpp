@@ -19,11 +19,16 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
 SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   auto it = std::find_if(texts_.begin(), texts_.end(),
                          [&](const std::shared_ptr<Text>& text) { return text->host == host; });
-  std::shared_ptr<Text> text = it != texts_.end() ? *it : texts_.emplace_back(
-                                                              std::make_shared<Text>(host));
-  return [payload = payload_, text] {
-    std::call_once(text->once,
-                   [&] { text->text = SXValueTextWithMember(*payload, kHostKey, text->host); });
+  std::shared_ptr<Text> text =
+      it != texts_.end() ? *it : texts_.emplace_back(std::make_shared<Text>(host));
+  return [payload = payload_, payloadText = payloadText_, text] {
+    std::call_once(text->once, [&] {
+      std::optional<std::string> made;
+      if (payloadText) {
+        if (auto own = payloadText()) made = SXDictionaryTextWithMember(*own, kHostKey, text->host);
+      }
+      text->text = made ? std::move(*made) : SXValueTextWithMember(*payload, kHostKey, text->host);
+    });
     return text->text;
   };
 }

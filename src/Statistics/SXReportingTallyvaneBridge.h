@@ -3,7 +3,9 @@
 // Stateless; runs on its caller's thread.
 #pragma once
 
+#include <functional>
 #include <mutex>
+#include <optional>
 #include <vector>
 
 #include "SXReportingEnvironment.h"
@@ -15,8 +17,12 @@ class SXReportingSession;
 // thread), however many sessions the message goes to. Used on the server queue.
 class SXReportingEventTexts {
  public:
-  explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload)
-      : payload_(std::move(payload)) {}
+  // `payloadText`, when given, may return the payload's own text (made for another store);
+  // the events' texts are then that text with the host added, not written again.
+  using PayloadText = std::function<std::optional<std::string>()>;
+  explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
+                                 PayloadText payloadText = nullptr)
+      : payload_(std::move(payload)), payloadText_(std::move(payloadText)) {}
   const std::shared_ptr<const SXValue>& payload() const { return payload_; }
   // The event text for a session whose host is `host`.
   SXPayloadTextProvider textForHost(const SXValue& host);
@@ -29,6 +35,7 @@ class SXReportingEventTexts {
     std::string text;  // written once, under `once`
   };
   std::shared_ptr<const SXValue> payload_;
+  PayloadText payloadText_;
   std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few
 };
 

@@ -150,3 +150,68 @@ std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& 
   text += '}';
   return text;
 }
+
+namespace {
+
+// The index just past the JSON value that starts at `at` in compact JSON text, or npos.
+size_t SkipJsonValue(std::string_view text, size_t at) {
+  int depth = 0;
+  for (size_t i = at; i < text.size(); ++i) {
+    char c = text[i];
+    if (c == '"') {
+      for (++i; i < text.size() && text[i] != '"'; ++i) {
+        if (text[i] == '\\') ++i;
+      }
+      if (i >= text.size()) return std::string_view::npos;
+      if (depth == 0) return i + 1;
+    } else if (c == '{' || c == '[') {
+      ++depth;
+    } else if (c == '}' || c == ']') {
+      if (depth == 0) return i;  // the end of the dictionary: a number or a literal ended
+      if (--depth == 0) return i + 1;
+    } else if (c == ',' && depth == 0) {
+      return i;
+    }
+  }
+  return std::string_view::npos;
+}
+
+}  // namespace
+
+std::optional<std::string> SXDictionaryTextWithMember(std::string_view text, const std::string& key,
+                                                      const SXValue& value) {
+  if (text.size() < 2 || text.front() != '{' || text.back() != '}') return std::nullopt;
+  const SXTextMember only[] = {{key, &value}};
+  const std::string single = SXDictionaryText(only);
+  const std::string_view member = std::string_view(single).substr(1, single.size() - 2);
+  const size_t end = text.size() - 1;
+  std::string out;
+  out.reserve(text.size() + member.size() + 1);
+  // Members come in key order: the new one goes before the first key not below it.
+  for (size_t at = 1; at < end;) {
+    if (text[at] != '"') return std::nullopt;
+    size_t close = text.find('"', at + 1);
+    if (close == std::string_view::npos || close + 1 >= end || text[close + 1] != ':') {
+      return std::nullopt;
+    }
+    std::string_view name = text.substr(at + 1, close - at - 1);
+    if (name.find('\\') != std::string_view::npos) return std::nullopt;
+    size_t next = SkipJsonValue(text, close + 2);
+    if (next == std::string_view::npos || next > end) return std::nullopt;
+    if (int order = name.compare(key); order >= 0) {
+      out.append(text.substr(0, at)).append(member);
+      if (order == 0) {
+        out.append(text.substr(next));  // the member replaced
+      } else {
+        out.append(",").append(text.substr(at));
+      }
+      return out;
+    }
+    if (next < end && text[next] != ',') return std::nullopt;
+    at = next + 1;
+  }
+  out.append(text.substr(0, end));
+  if (end > 1) out += ',';
+  out.append(member).append("}");
+  return out;
+}

@@ -1,6 +1,7 @@
 // The text of a value, as log lines ("%@") and the summary event print it.
 #pragma once
 
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -26,6 +27,13 @@ std::string SXDictionaryText(std::span<const SXTextMember> members);
 // member `key` is set to `value`, made without the copy.
 std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& key,
                                   const SXValue& value);
+
+// The same, made from the SXValueText of a dictionary instead of the dictionary itself: the
+// text is copied around the member, not written again. Nothing when the text cannot be read
+// that way (a key with an escape in it, or not a dictionary's text); the caller then builds it
+// from the dictionary.
+std::optional<std::string> SXDictionaryTextWithMember(std::string_view dictionaryText,
+                                                      const std::string& key, const SXValue& value);
 
 // Shortest decimal text of a double that reads back to the same double.
 std::string SXDoubleText(double value);

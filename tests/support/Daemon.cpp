@@ -158,8 +158,9 @@ std::string TestDaemon::log() const {
   return text.str();
 }
 
-size_t TestDaemon::countInLog(const std::string& fragment) const {
-  std::string text = log();
+namespace {
+
+size_t Occurrences(const std::string& text, const std::string& fragment) {
   size_t count = 0;
   for (size_t pos = text.find(fragment); pos != std::string::npos;
        pos = text.find(fragment, pos + fragment.size())) {
@@ -168,9 +169,26 @@ size_t TestDaemon::countInLog(const std::string& fragment) const {
   return count;
 }
 
+}  // namespace
+
+size_t TestDaemon::countInLog(const std::string& fragment) const {
+  // The daemon's log thread writes lines a moment after the work that logs them: count once
+  // the log has stopped growing for a while (or has grown for a second).
+  std::error_code ignored;
+  auto size = [&] { return std::filesystem::file_size(dir_.file("daemon.log"), ignored); };
+  auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(1);
+  for (auto seen = size(); std::chrono::steady_clock::now() < giveUp;) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    auto now = size();
+    if (now == seen) break;
+    seen = now;
+  }
+  return Occurrences(log(), fragment);
+}
+
 bool TestDaemon::waitForLog(const std::string& fragment, size_t times,
                             std::chrono::milliseconds timeout) const {
-  return waitUntil([&] { return countInLog(fragment) >= times; }, timeout);
+  return waitUntil([&] { return Occurrences(log(), fragment) >= times; }, timeout);
 }
 
 std::optional<int> TestDaemon::waitForExit(std::chrono::milliseconds timeout) {

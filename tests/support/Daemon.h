@@ -59,6 +59,7 @@ class TestDaemon {
   // Waits until the log holds `fragment` `times` times; false after `timeout`.
   bool waitForLog(const std::string& fragment, size_t times = 1,
                   std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
+  // How often `fragment` is in the log once the lines already logged are written.
   size_t countInLog(const std::string& fragment) const;
 
   // Waits for the daemon to exit; its exit status, or nothing after `timeout`.

@@ -247,8 +247,8 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> me
   // Measured once for every delivery's charge and aggregate entry.
   size_t packedBytes = SXPackedSize(*message);
   message = chargeDeliveries(std::move(message), packedBytes, sessions.size());
-  SXReportingEventTexts events(message);
   auto prepared = std::make_shared<SXReportingMessagePayload>(message);
+  SXReportingEventTexts events(message, [prepared] { return prepared->callerDictionaryText(); });
   for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
@@ -285,8 +285,8 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
   }
   size_t packedBytes = SXPackedSize(*message);
   auto charged = chargeDeliveries(message, packedBytes, active.size());
-  SXReportingEventTexts events(charged);
   auto prepared = std::make_shared<SXReportingMessagePayload>(charged);
+  SXReportingEventTexts events(charged, [prepared] { return prepared->callerDictionaryText(); });
   for (const auto& session : active) {
     session->sendMessage(charged, category, type, nullptr, packedBytes, prepared);
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);

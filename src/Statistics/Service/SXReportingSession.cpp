@@ -82,12 +82,20 @@ std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload) {
   return SXDictionaryText(text);
 }
 
+bool SXReportingMessagePayload::rewritesLocked() {
+  if (!rewrites_) {
+    rewrites_ = SXReportingSessionHasSpacedKeys(*caller_);
+    callerIsDictionary_ = caller_->is_object();
+  }
+  return *rewrites_;
+}
+
 std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
   if (!rewritten_) {
     // A payload without spaced keys is its own rewrite: shared, not copied. A copy holds the
     // caller's payload, so that whatever the caller's payload carries (its client's charge of
     // bytes) lasts as long as either.
-    if (SXReportingSessionHasSpacedKeys(*caller_)) {
+    if (rewritesLocked()) {
       struct Rewrite {
         SXValue value;
         std::shared_ptr<const SXValue> caller;
@@ -116,7 +124,7 @@ const std::string& SXReportingMessagePayload::textLocked() {
     // Without a rewritten dictionary, the rewrite's text comes straight from the caller's.
     if (rewritten_) {
       text_ = SXValueText(*rewritten_);
-    } else if (SXReportingSessionHasSpacedKeys(*caller_)) {
+    } else if (rewritesLocked()) {
       text_ = SXReportingSessionUnderscoreKeysText(*caller_);
     } else {
       text_ = SXValueText(*caller_);
@@ -135,6 +143,13 @@ std::string SXReportingMessagePayload::text() {
 void SXReportingMessagePayload::keepOnlyText() {
   std::lock_guard lock(mutex_);
   textLocked();
+}
+
+std::optional<std::string> SXReportingMessagePayload::callerDictionaryText() {
+  std::lock_guard lock(mutex_);
+  // Made here, the text would release the dictionaries that a standalone send reads.
+  if (!text_ || *rewrites_ || !callerIsDictionary_) return std::nullopt;
+  return *text_;
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

@@ -35,8 +35,13 @@ class SXReportingMessagePayload {
   std::string text();
   // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
   void keepOnlyText();
+  // The text, when it has been made and is also that of the caller's own payload: a
+  // dictionary with no space in its keys, which the rewrite leaves as it is.
+  std::optional<std::string> callerDictionaryText();
 
  private:
+  // REQUIRES: mutex_ held. Whether the rewrite changes the caller's payload; made once.
+  bool rewritesLocked();
   // REQUIRES: mutex_ held.
   std::shared_ptr<const SXValue> rewrittenLocked();
   // REQUIRES: mutex_ held. Makes the text once and releases the dictionaries.
@@ -46,6 +51,8 @@ class SXReportingMessagePayload {
   std::shared_ptr<const SXValue> caller_;     // GUARDED_BY(mutex_); released with the text
   std::shared_ptr<const SXValue> rewritten_;  // GUARDED_BY(mutex_); released with the text
   std::optional<std::string> text_;           // GUARDED_BY(mutex_)
+  std::optional<bool> rewrites_;              // GUARDED_BY(mutex_)
+  bool callerIsDictionary_ = false;           // GUARDED_BY(mutex_); set with rewrites_
 };
 
 // One entry of a session's aggregate: a message entry ({message id: rewritten payload}) or
