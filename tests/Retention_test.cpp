@@ -305,7 +305,8 @@ TEST(RetentionFiles, OldSummariesAndDamagedCopiesGoAndSummariesAreCapped) {
   const std::string old = DamagedName("tallyvane.db", 31 * kDay);
   WriteFile(dir.file(old), 0);
   WriteFile(dir.file(old + "-wal"), 0);
-  WriteFile(dir.file(DamagedName("joulebook.db", 29 * kDay)), 40 * kDay);
+  const std::string recent = DamagedName("joulebook.db", 29 * kDay);  // named once: the clock moves
+  WriteFile(dir.file(recent), 40 * kDay);
 
   SXRetentionPolicy policy;
   policy.summaryFiles.maxFiles = 2;
@@ -319,9 +320,9 @@ TEST(RetentionFiles, OldSummariesAndDamagedCopiesGoAndSummariesAreCapped) {
       if (entry.is_regular_file()) left.insert(entry.path().filename().string());
     }
   }
-  EXPECT_EQ(left, (std::set<std::string>{"20261124-020000-sonex-b-alarms.json",
-                                         "20261124-030000-sonex-c-alarms.json", "notes.json",
-                                         DamagedName("joulebook.db", 29 * kDay)}));
+  EXPECT_EQ(left,
+            (std::set<std::string>{"20261124-020000-sonex-b-alarms.json",
+                                   "20261124-030000-sonex-c-alarms.json", "notes.json", recent}));
   EXPECT_EQ(retention->counters()["files_aged_out"], (SXValue{{"summary", 2}, {"damaged", 2}}));
   EXPECT_TRUE(log->contains("retention: removed 2 summary files and 2 damaged store files"));
 }

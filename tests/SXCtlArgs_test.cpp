@@ -3,7 +3,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include "client/SXServiceTypeNames.h"
+#include "common/SXServiceTypes.h"
 
 using namespace std::chrono_literals;
 
@@ -66,10 +66,10 @@ TEST(SXCtlArgsTest, ServiceTypesByNumberOrName) {
   EXPECT_NE(parseError({"set-type", "-1", "1"}).find("not a service type"), std::string::npos);
   EXPECT_NE(parseError({"set-type", "bogus", "1"}).find("not a service type"), std::string::npos);
 
-  EXPECT_EQ(SXClientServiceTypeName(1), "vokira");
-  EXPECT_EQ(SXClientServiceTypeName(11), "test");
-  EXPECT_EQ(SXClientServiceTypeName(65535), "unknown");
-  EXPECT_EQ(SXClientServiceTypeName(12), "servicetype12");
+  for (SXReportingServiceType type : {0, 1, 11, 12, 65534, 65535}) {
+    EXPECT_EQ(SXServiceTypeFromText(SXServiceTypeName(type)), type);
+  }
+  EXPECT_EQ(SXServiceTypeName(12), "servicetype12");
 }
 
 TEST(SXCtlArgsTest, SendTakesDefaultsIdListsAndBroadcast) {

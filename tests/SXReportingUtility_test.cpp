@@ -8,16 +8,6 @@
 #include "fakes/FakeDevice.h"
 #include "fakes/FakeLog.h"
 
-TEST(SXReportingUtilityNames, ServiceTypes) {
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(0), "generic");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(1), "vokira");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(7), "longformaudio");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(11), "test");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(65535), "unknown");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(12), "servicetype12");
-  EXPECT_EQ(SXReportingUtilityServiceTypeName(65534), "servicetype65534");
-}
-
 TEST(SXReportingUtilityNames, CategoriesComposeComponentAndCategory) {
   EXPECT_EQ(SXReportingUtilityCategoryName(0x00000003), "Playback");
   EXPECT_EQ(SXReportingUtilityCategoryName(0x08000003), "Session_Playback");

@@ -8,11 +8,6 @@
 
 namespace {
 
-const std::array<std::string, 12> kServiceTypeNames = {
-    "generic",          "vokira",           "telephony",       "haptics",
-    "alarms",           "standalone",       "soundautoconfig", "longformaudio",
-    "nonlongformaudio", "audiodeviceusage", "alerts",          "test"};
-
 const std::array<std::string, 12> kCategoryNames = {
     "Undefined",     "Generic",     "Record", "Playback",     "PlaybackAndRecord", "Setup",
     "ClientRequest", "RouteChange", "Error",  "KestrelStats", "Performance",       "Volume"};
@@ -37,24 +32,7 @@ const char* componentName(uint32_t upperMask) {
   }
 }
 
-// Names of codes outside the table, made on first use and kept so callers can hold references.
-const std::string& outOfTableServiceTypeName(SXReportingServiceType serviceType) {
-  static std::mutex mutex;
-  static std::map<SXReportingServiceType, std::string> names;
-  std::lock_guard lock(mutex);
-  auto [it, inserted] = names.try_emplace(serviceType);
-  if (inserted) it->second = "servicetype" + std::to_string(serviceType);
-  return it->second;
-}
-
 }  // namespace
-
-const std::string& SXReportingUtilityServiceTypeName(SXReportingServiceType serviceType) {
-  static const std::string kUnknown = "unknown";
-  if (serviceType < kServiceTypeNames.size()) return kServiceTypeNames[serviceType];
-  if (serviceType == kSXReportingServiceTypeUnknown) return kUnknown;
-  return outOfTableServiceTypeName(serviceType);
-}
 
 std::string SXReportingUtilityCategoryName(SXReportingCategory category) {
   std::string name;

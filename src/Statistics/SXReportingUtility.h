@@ -1,4 +1,5 @@
-// The reporting vocabulary: names of service types, categories and message types, the host
+// The reporting vocabulary: names of categories and message types (service types: in
+// common/SXServiceTypes.h), the host
 // application name of a configuration, and the bounded wait on a condition.
 #pragma once
 
@@ -13,8 +14,6 @@
 
 class SXReportingEnvironment;
 
-// "generic" ... "test", "unknown"; codes 12-65534 are named "servicetype<code>".
-const std::string& SXReportingUtilityServiceTypeName(SXReportingServiceType serviceType);
 // Component prefix and category proper, for example "Session_Playback".
 std::string SXReportingUtilityCategoryName(SXReportingCategory category);
 const std::string& SXReportingUtilityTypeName(SXReportingMessageType type);

@@ -12,7 +12,7 @@
 #include <sstream>
 #include <string_view>
 
-#include "client/SXServiceTypeNames.h"
+#include "common/SXServiceTypes.h"
 
 namespace {
 
@@ -92,7 +92,7 @@ bool buildReporterID(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
 }
 
 bool buildSetType(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
-  auto type = SXClientServiceTypeFromText(raw.positional[0]);
+  auto type = SXServiceTypeFromText(raw.positional[0]);
   if (!type) {
     error = "not a service type: '" + raw.positional[0] + "' (0-65535 or a name: generic, " +
             "vokira, telephony, haptics, alarms, standalone, soundautoconfig, longformaudio, " +
@@ -493,7 +493,7 @@ const std::vector<CommandDefinition>& commandDefinitions() {
       {"set-type", "set-type TYPE ID", "set a session's service type",
        "TYPE is a number (0-65535) or a name: generic, vokira, telephony, haptics, alarms,\n"
        "standalone, soundautoconfig, longformaudio, nonlongformaudio, audiodeviceusage,\n"
-       "alerts, test. Replies true; sends no reply for ID 0.",
+       "alerts, test, unknown (65535), or servicetype<N>. Replies true; sends no reply for ID 0.",
        2, 2, {}, {}, buildSetType},
       {"get-type", "get-type ID", "print a session's service type",
        "Prints the service type and its name, e.g. \"2 (telephony)\";\n"

@@ -4,6 +4,7 @@
 #include <algorithm>
 
 #include "SXReportingUtility.h"
+#include "common/SXServiceTypes.h"
 
 namespace {
 
@@ -188,7 +189,7 @@ SXReportingSession::~SXReportingSession() {
 
 void SXReportingSession::setServiceType(SXReportingServiceType serviceType) {
   serviceType_.store(serviceType);
-  std::string name = SXReportingUtilityServiceTypeName(serviceType);
+  std::string name = SXServiceTypeName(serviceType);
   {
     std::lock_guard lock(mutex_);
     serviceName_ = name;

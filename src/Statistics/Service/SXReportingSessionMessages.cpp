@@ -2,6 +2,7 @@
 #include "SXReportingSession.h"
 #include "SXReportingUtility.h"
 #include "common/MsgpackValue.h"
+#include "common/SXServiceTypes.h"
 
 namespace {
 
@@ -60,8 +61,8 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
         reporterID());
   // The key rewrite is made once, where it is first needed (normally by the send task).
-  auto rewritten = prepared ? std::move(prepared)
-                            : std::make_shared<SXReportingMessagePayload>(payload);
+  auto rewritten =
+      prepared ? std::move(prepared) : std::make_shared<SXReportingMessagePayload>(payload);
   std::string messageId = messageIdForCategory(category, type);
   bool aggregated = false;
   if (aggregate_.load()) {
@@ -197,7 +198,7 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
                          {fern::kSessionInfoClientVersion, static_cast<double>(1.0f)},
                          {fern::kSessionInfoSessionID, int32_t{-1}}};
   SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
-                      {fern::kUserInfoServiceName, SXReportingUtilityServiceTypeName(serviceType)}};
+                      {fern::kUserInfoServiceName, SXServiceTypeName(serviceType)}};
   // A payload the session already rewrote needs no second copy.
   auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
                        ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))

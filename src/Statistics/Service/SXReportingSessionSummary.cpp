@@ -5,6 +5,7 @@
 
 #include "SXReportingSession.h"
 #include "SXReportingUtility.h"
+#include "common/SXServiceTypes.h"
 #include "common/SXValueText.h"
 
 namespace {
@@ -25,7 +26,8 @@ constexpr int kMaxSameNameFiles = 1000;
 // A name as it stands inside a file name: unchanged, but for the two bytes no file name can
 // hold, "/" and NUL, which become "_".
 std::string fileNameComponent(std::string name) {
-  std::replace_if(name.begin(), name.end(), [](char c) { return c == '/' || c == '\0'; }, '_');
+  std::replace_if(
+      name.begin(), name.end(), [](char c) { return c == '/' || c == '\0'; }, '_');
   return name;
 }
 
@@ -116,7 +118,7 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
   }
   auto host = info.find("HostApplicationDisplayID");
   std::string hostName = fileNameComponent(host != info.end() ? SXValueText(*host) : "unknown");
-  std::string typeName = fileNameComponent(SXReportingUtilityServiceTypeName(serviceType()));
+  std::string typeName = fileNameComponent(SXServiceTypeName(serviceType()));
   std::string stamp = summaryTimeStamp(environment_->platform().clock->now());
   // Sessions of one host and type that stop within the same second each keep their own file.
   for (int n = 1; n <= kMaxSameNameFiles; ++n) {

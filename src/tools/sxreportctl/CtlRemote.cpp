@@ -5,7 +5,7 @@
 
 #include "CtlMetrics.h"
 #include "CtlStatus.h"
-#include "client/SXServiceTypeNames.h"
+#include "common/SXServiceTypes.h"
 
 namespace {
 
@@ -22,7 +22,7 @@ std::string jsonText(const SXValue& value, int indent = -1) {
 }
 
 std::string typeText(SXReportingServiceType type) {
-  return std::to_string(type) + " (" + SXClientServiceTypeName(type) + ")";
+  return std::to_string(type) + " (" + SXServiceTypeName(type) + ")";
 }
 
 // The wire form of each reply type, for --json.

@@ -3,7 +3,7 @@
 #include <cmath>
 #include <cstdio>
 
-#include "client/SXServiceTypeNames.h"
+#include "common/SXServiceTypes.h"
 #include "common/SXValueText.h"
 
 namespace {
@@ -38,7 +38,7 @@ std::string sessionText(const SXValue& session) {
   if (field(session, "serviceName").is_string()) {
     typeName = field(session, "serviceName").get<std::string>();
   } else if (type.is_number_unsigned() && type.get<uint64_t>() <= 0xFFFF) {
-    typeName = SXClientServiceTypeName(type.get<SXReportingServiceType>());
+    typeName = SXServiceTypeName(type.get<SXReportingServiceType>());
   }
   return "    session " + SXValueText(field(session, "reporterID")) + ": " + typeName + " (" +
          SXValueText(type) + "), " +
