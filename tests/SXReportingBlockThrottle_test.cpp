@@ -45,8 +45,11 @@ struct Rig {
   }
 
   void add(int id, const SXValue& payload, int64_t reporterID = 42) {
-    throttle->addMessageBlock([this, id] { sends.push_back({id, now()}); }, reporterID, payload,
-                              kPlayback, kStart);
+    throttle->addMessageBlock(
+        [this, id] {
+          sends.push_back({id, now()});
+        },
+        reporterID, payload, kPlayback, kStart);
   }
   double now() const { return SXSecondsBetween(start, clock->now()); }
   void advance(double seconds) {
@@ -306,8 +309,9 @@ TEST(SXReportingBlockThrottleTest, WaitForCompletionEndsWhenIdleOrAfterFiveSecon
     EXPECT_EQ(rig.log->messages().at(0), c.firstLine);
     EXPECT_EQ(rig.log->contains("Waiting up to"), waits);
     bool givesUp = c.duplicateEveryMs > 0;
-    EXPECT_EQ(rig.log->count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"),
-              givesUp ? 1u : 0u);
+    EXPECT_EQ(
+        rig.log->count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"),
+        givesUp ? 1u : 0u);
     EXPECT_EQ(rig.log->countContaining("Giving up"), givesUp ? 1u : 0u);
     for (const auto& line : rig.log->lines()) {
       if (line.message.starts_with("Giving up")) {

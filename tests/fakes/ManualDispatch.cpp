@@ -61,8 +61,9 @@ size_t ManualDispatch::advance(std::chrono::nanoseconds delay) {
     {
       std::lock_guard lock(mutex_);
       // The earliest due; among equal due times the first submitted.
-      auto earliest = std::min_element(delayed_.begin(), delayed_.end(),
-                                       [](const Delayed& a, const Delayed& b) { return a.due < b.due; });
+      auto earliest =
+          std::min_element(delayed_.begin(), delayed_.end(),
+                           [](const Delayed& a, const Delayed& b) { return a.due < b.due; });
       if (earliest == delayed_.end() || earliest->due > target) break;
       next = std::move(*earliest);
       delayed_.erase(earliest);

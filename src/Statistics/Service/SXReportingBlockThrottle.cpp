@@ -285,19 +285,9 @@ void SXReportingBlockThrottleTimer::setFireDate(SXDate due) {
   if (queueWakeUp) queueWakeUp();
 }
 
-SXDate SXReportingBlockThrottleTimer::fireDate() const {
-  std::lock_guard lock(state_->mutex);
-  return due_;
-}
-
 void SXReportingBlockThrottleTimer::invalidate() {
   std::lock_guard lock(state_->mutex);
   valid_ = false;
-}
-
-bool SXReportingBlockThrottleTimer::isValid() const {
-  std::lock_guard lock(state_->mutex);
-  return valid_;
 }
 
 // ---- SXReportingBlockThrottleTimerWrapper ----

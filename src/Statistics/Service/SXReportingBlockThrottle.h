@@ -72,10 +72,8 @@ class SXReportingBlockThrottleTimer {
 
   // Any thread; a running schedule picks the new due time up at once.
   void setFireDate(SXDate due);
-  SXDate fireDate() const;
   // Any thread; a timer that has not fired yet never fires.
   void invalidate();
-  bool isValid() const;
 
  private:
   friend struct SXReportingBlockThrottleSchedule::State;
@@ -177,7 +175,7 @@ class SXReportingBlockThrottle : public std::enable_shared_from_this<SXReporting
 
   mutable std::mutex inFlightMutex_;
   std::unordered_map<std::string, std::shared_ptr<SXReportingBlockThrottleTimerWrapper>>
-      timersInFlight_;                   // guarded by inFlightMutex_
+      timersInFlight_;                       // guarded by inFlightMutex_
   std::condition_variable inFlightChanged_;  // with inFlightMutex_: emptied, or a wait timed out
 
   mutable std::mutex unscheduledMutex_;
