@@ -4,104 +4,65 @@
 
 #include <chrono>
 #include <cmath>
-#include <condition_variable>
+#include <future>
 #include <limits>
-#include <mutex>
+#include <optional>
 #include <stdexcept>
-#include <thread>
 #include <vector>
 
+#include "fakes/FakeClock.h"
 #include "fakes/FakeLog.h"
+#include "fakes/ManualDispatch.h"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using std::chrono::milliseconds;
 
 constexpr SXReportingCategory kPlayback = 3;
 constexpr SXReportingMessageType kStart = 1;
 
-double secondsSince(Clock::time_point start) {
-  return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
 std::string key(const SXValue& payload, int64_t reporterID = 42) {
   return SXReportingBlockThrottle::buildMessageKey(payload, reporterID, kPlayback, kStart);
 }
 
-// Records which operations ran and when, and lets a test wait for them.
-class SendRecorder {
- public:
+// A throttle on a manual dispatch and clock. Sends run on the test thread, inside `advance`,
+// and record the manual time at which they ran.
+struct Rig {
   struct Send {
     int id;
-    Clock::time_point at;
+    double at;  // seconds since the rig was made
   };
 
-  std::function<void()> operation(int id) {
-    return [this, id] {
-      {
-        std::lock_guard lock(mutex_);
-        sends_.push_back({id, Clock::now()});
-      }
-      changed_.notify_all();
-    };
-  }
-
-  // Waits (generously) until `count` sends have happened; returns them all.
-  std::vector<Send> waitFor(size_t count, double timeoutSeconds = 10) {
-    std::unique_lock lock(mutex_);
-    changed_.wait_for(lock, std::chrono::duration<double>(timeoutSeconds),
-                      [&] { return sends_.size() >= count; });
-    return sends_;
-  }
-
-  std::vector<Send> sends() const {
-    std::lock_guard lock(mutex_);
-    return sends_;
-  }
-
- private:
-  mutable std::mutex mutex_;
-  std::condition_variable changed_;
-  std::vector<Send> sends_;
-};
-
-class SXReportingBlockThrottleTest : public ::testing::Test {
- protected:
-  void SetUp() override {
+  Rig() {
     SXLogScope scope;
     scope.shortName = "thrt";
-    scope_ = log_->registerScope(scope);
-    throttle_ = SXReportingBlockThrottle::create(log_, scope_);
+    throttle = SXReportingBlockThrottle::create(dispatch, clock, log, log->registerScope(scope));
   }
-  // The worker would otherwise hold the throttle, and its thread, for the rest of the process.
-  void TearDown() override { throttle_->stop(); }
+  // Lets the worker end, so that its queued pass lets go of the throttle.
+  ~Rig() {
+    if (throttle) throttle->stop();
+    advance(10);
+  }
 
   void add(int id, const SXValue& payload, int64_t reporterID = 42) {
-    throttle_->addMessageBlock(recorder_.operation(id), reporterID, payload, kPlayback, kStart);
+    throttle->addMessageBlock(
+        [this, id] {
+          sends.push_back({id, now()});
+        },
+        reporterID, payload, kPlayback, kStart);
+  }
+  double now() const { return SXSecondsBetween(start, clock->now()); }
+  void advance(double seconds) {
+    dispatch->advance(std::chrono::duration_cast<std::chrono::nanoseconds>(
+        std::chrono::duration<double>(seconds)));
   }
 
-  // Waits until the worker has taken every new entry onto its schedule.
-  void waitUntilScheduled() {
-    auto deadline = Clock::now() + std::chrono::seconds(5);
-    while (throttle_->unscheduledTimerKeysCount() > 0 && Clock::now() < deadline) {
-      std::this_thread::sleep_for(milliseconds(2));
-    }
-    ASSERT_EQ(throttle_->unscheduledTimerKeysCount(), 0u);
-  }
-
-  void waitUntilIdle() {
-    auto deadline = Clock::now() + std::chrono::seconds(10);
-    while (throttle_->timersInFlightCount() > 0 && Clock::now() < deadline) {
-      std::this_thread::sleep_for(milliseconds(5));
-    }
-    ASSERT_EQ(throttle_->timersInFlightCount(), 0u);
-  }
-
-  std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>(std::set<std::string>{"thrt"});
-  std::shared_ptr<const SXLogScope> scope_;
-  SendRecorder recorder_;
-  std::shared_ptr<SXReportingBlockThrottle> throttle_;
+  std::shared_ptr<FakeLog> log = std::make_shared<FakeLog>(std::set<std::string>{"thrt"});
+  std::shared_ptr<FakeClock> clock = std::make_shared<FakeClock>();
+  std::shared_ptr<ManualDispatch> dispatch = std::make_shared<ManualDispatch>(clock);
+  const SXDate start = clock->now();
+  std::vector<Send> sends;
+  std::shared_ptr<SXReportingBlockThrottle> throttle;
 };
 
 // ---- Message keys ----
@@ -220,164 +181,165 @@ TEST(SXReportingBlockThrottleSleepTimeTest, RejectedValuesFallBackWithOneInfoLin
 
 // ---- The throttle ----
 
-TEST_F(SXReportingBlockThrottleTest, MessageIsSentOnceAfterItsThrottleTime) {
-  auto start = Clock::now();
-  add(1, {{"a", 1}});
-  auto sends = recorder_.waitFor(1);
-  ASSERT_EQ(sends.size(), 1u);
-  double after = std::chrono::duration<double>(sends[0].at - start).count();
-  EXPECT_GE(after, 0.49);
-  EXPECT_LT(after, 1.5);
-  waitUntilIdle();
-  EXPECT_EQ(recorder_.sends().size(), 1u);
-  EXPECT_GE(log_->count("calling workingRunLoop run from inside thread block"), 1u);
-  // The worker logs its sleep after the last timer has run, so the line may come just after.
-  EXPECT_TRUE(log_->waitFor("sleeping in thread"));
-  for (const auto& line : log_->lines()) {
-    if (line.level == SXLogLevel::kDebug) {
-      EXPECT_EQ(line.scope, "thrt") << line.message;
+// The worker looks for new entries every 0.1 s; a message is sent once its time has passed, or
+// at the worker's next look when it is due at once.
+TEST(SXReportingBlockThrottleTest, MessageIsSentOnceAtItsDueTime) {
+  struct Case {
+    std::optional<double> throttleSeconds;
+    double idleBefore;  // how long the worker has idled before the message arrives
+    double earliest, latest;
+  };
+  for (const Case& c : std::vector<Case>{{std::nullopt, 0, 0.5, 0.5},
+                                         {0, 0.15, 0, 0.1},
+                                         {-1, 0.15, 0, 0.1},
+                                         {4.99, 0, 4.98, 4.99}}) {
+    SCOPED_TRACE(c.throttleSeconds.value_or(-99));
+    Rig rig;
+    rig.advance(c.idleBefore);
+    SXValue payload = {{"a", 1}};
+    if (c.throttleSeconds) payload["_throttle_seconds"] = *c.throttleSeconds;
+    double addedAt = rig.now();
+    rig.add(1, payload);
+    EXPECT_TRUE(rig.sends.empty());  // never on the caller's thread
+    rig.advance(c.latest);
+    ASSERT_EQ(rig.sends.size(), 1u);
+    EXPECT_GE(rig.sends[0].at - addedAt, c.earliest);
+    EXPECT_EQ(rig.throttle->timersInFlightCount(), 0u);
+    rig.advance(5);
+    EXPECT_EQ(rig.sends.size(), 1u);
+    EXPECT_GE(rig.log->count("calling workingRunLoop run from inside thread block"), 1u);
+    EXPECT_GE(rig.log->count("sleeping in thread"), 1u);
+    for (const auto& line : rig.log->lines()) {
+      if (line.level == SXLogLevel::kDebug) {
+        EXPECT_EQ(line.scope, "thrt") << line.message;
+      }
     }
   }
 }
 
-TEST_F(SXReportingBlockThrottleTest, ZeroOrNegativeThrottleTimeSendsAtNextLook) {
-  std::this_thread::sleep_for(milliseconds(150));  // let the worker settle into its idle poll
-  for (int id : {1, 2}) {
-    auto start = Clock::now();
-    add(id, {{"id", id}, {"_throttle_seconds", id == 1 ? 0 : -1}});
-    auto sends = recorder_.waitFor(id);
-    ASSERT_EQ(sends.size(), size_t(id));
-    EXPECT_LT(std::chrono::duration<double>(sends.back().at - start).count(), 0.4);
-  }
-}
-
-TEST_F(SXReportingBlockThrottleTest, BurstOfEqualMessagesSendsOnlyTheNewest) {
-  Clock::time_point lastAdd;
-  for (int id : {1, 2, 3}) {
-    if (id > 1) std::this_thread::sleep_for(milliseconds(200));
-    lastAdd = Clock::now();
-    add(id, {{"a", 1}, {"sxreporting_timestamp", id}});  // equal: the time stamp is excluded
-  }
-  auto sends = recorder_.waitFor(1);
-  ASSERT_EQ(sends.size(), 1u);
-  EXPECT_EQ(sends[0].id, 3);
-  double after = std::chrono::duration<double>(sends[0].at - lastAdd).count();
-  EXPECT_GE(after, 0.49);
-  EXPECT_LT(after, 1.5);
-  waitUntilIdle();
-  EXPECT_EQ(recorder_.sends().size(), 1u);
-  EXPECT_EQ(log_->count("Dropping duplicate message for "
-                        "a|1|sxreporting_timestamp|^|reporterID|42|Playback|Start"),
-            2u);
-}
-
-// A duplicate re-arms from its own arrival with its own throttle time, and a message added
-// while that timer runs joins the worker's schedule only after it has fired.
-TEST_F(SXReportingBlockThrottleTest, DuplicateReArmsAndHoldsBackTheNextBatch) {
-  add(1, {{"a", 1}, {"_throttle_seconds", 1}});
-  waitUntilScheduled();
-  auto duplicateAt = Clock::now();
-  add(2, {{"a", 1}, {"_throttle_seconds", 3}});
-  add(3, {{"b", 1}, {"_throttle_seconds", 0}});
-  auto sends = recorder_.waitFor(2);
-  ASSERT_EQ(sends.size(), 2u);
-  EXPECT_EQ(sends[0].id, 2);
-  EXPECT_EQ(sends[1].id, 3);
-  double after = std::chrono::duration<double>(sends[0].at - duplicateAt).count();
-  EXPECT_GE(after, 2.99);
-  EXPECT_LT(after, 4.0);
-  waitUntilIdle();
-  EXPECT_EQ(recorder_.sends().size(), 2u);
-}
-
-TEST_F(SXReportingBlockThrottleTest, DuplicateCanBringADueTimeForward) {
-  add(1, {{"a", 1}, {"_throttle_seconds", 4}});
-  waitUntilScheduled();
-  auto duplicateAt = Clock::now();
-  add(2, {{"a", 1}, {"_throttle_seconds", 0}});
-  auto sends = recorder_.waitFor(1);
-  ASSERT_EQ(sends.size(), 1u);
-  EXPECT_EQ(sends[0].id, 2);
-  EXPECT_LT(std::chrono::duration<double>(sends[0].at - duplicateAt).count(), 1.0);
-}
-
-TEST_F(SXReportingBlockThrottleTest, ThrowingOperationDoesNotStopTheWorker) {
-  throttle_->addMessageBlock([] { throw std::runtime_error("boom"); }, 1,
-                             {{"_throttle_seconds", 0}}, kPlayback, kStart);
-  throttle_->addMessageBlock(nullptr, 2, {{"_throttle_seconds", 0}}, kPlayback, kStart);
-  add(3, {{"_throttle_seconds", 0}}, 3);
-  EXPECT_EQ(recorder_.waitFor(1).size(), 1u);
-  waitUntilIdle();
-  EXPECT_EQ(log_->count("Send operation failed: boom"), 1u);
-}
-
-TEST_F(SXReportingBlockThrottleTest, WaitForCompletionOnIdleThrottleReturnsAtOnce) {
-  auto start = Clock::now();
-  throttle_->waitForCompletion();
-  EXPECT_LT(secondsSince(start), 0.4);
-  EXPECT_EQ(log_->count("waitForCompletion. timersInFlight=0 unscheduledTimerKeys=0"), 1u);
-  EXPECT_FALSE(log_->contains("Waiting up to"));
-}
-
-TEST_F(SXReportingBlockThrottleTest, WaitForCompletionReturnsOnceTheEntryHasFired) {
-  auto start = Clock::now();
-  add(1, {{"_throttle_seconds", 1}});
-  throttle_->waitForCompletion();
-  double waited = secondsSince(start);
-  EXPECT_GE(waited, 0.99);
-  EXPECT_LT(waited, 2.5);
-  EXPECT_EQ(recorder_.sends().size(), 1u);
-  EXPECT_TRUE(log_->contains("waitForCompletion. timersInFlight=1 unscheduledTimerKeys="));
-  EXPECT_EQ(log_->count("Waiting up to 5 seconds for blockThrottle queue to be empty."), 1u);
-  EXPECT_FALSE(log_->contains("Giving up"));
-}
-
-TEST_F(SXReportingBlockThrottleTest, WaitForCompletionGivesUpWhileDuplicatesKeepArriving) {
-  std::atomic<bool> waiting{true};
-  std::atomic<int> added{0};
-  Clock::time_point lastAdd;  // written by the adder, read after it is joined
-  std::thread adder([&] {
-    while (waiting.load()) {
-      lastAdd = Clock::now();
-      int id = added.load() + 1;
-      add(id, {{"a", 1}});
-      added = id;  // only once the entry is in the table
-      std::this_thread::sleep_for(milliseconds(200));
+// Equal messages (here they differ only in excluded fields) give one send: the newest's
+// operation, due its own throttle time after its own arrival, earlier or later than the time
+// it replaces. A message of another key that arrives meanwhile joins the worker's schedule only
+// once the re-armed entry has fired.
+TEST(SXReportingBlockThrottleTest, DuplicateReArmsFromItsArrivalWithItsOwnTime) {
+  struct Arrival {
+    double after;  // seconds since the previous one
+    std::optional<double> throttleSeconds;
+  };
+  struct Case {
+    std::vector<Arrival> arrivals;
+    double sentAfterLast;
+  };
+  for (const Case& c : std::vector<Case>{
+           {{{0, std::nullopt}, {0.2, std::nullopt}, {0.2, std::nullopt}}, 0.5},
+           {{{0, 1}, {0.1, 3}}, 3},
+           {{{0, 4}, {0.1, 0}}, 0},
+       }) {
+    SCOPED_TRACE(c.sentAfterLast);
+    Rig rig;
+    int id = 0;
+    SXValue payload;
+    for (const Arrival& arrival : c.arrivals) {
+      rig.advance(arrival.after);
+      payload = {{"a", 1}, {"sxreporting_timestamp", ++id}};
+      if (arrival.throttleSeconds) payload["_throttle_seconds"] = *arrival.throttleSeconds;
+      rig.add(id, payload);
     }
-  });
-  while (added.load() == 0) std::this_thread::yield();
-  auto start = Clock::now();
-  throttle_->waitForCompletion();
-  double waited = secondsSince(start);
-  waiting = false;
-  adder.join();
-  EXPECT_GE(waited, 4.99);
-  EXPECT_LT(waited, 7.0);
-  EXPECT_EQ(log_->count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"),
-            1u);
-  for (const auto& line : log_->lines()) {
-    if (line.message.starts_with("Giving up")) {
-      EXPECT_EQ(line.level, SXLogLevel::kDefault);
+    double lastAt = rig.now();
+    rig.add(100, {{"b", 1}, {"_throttle_seconds", 0}});
+    rig.advance(6);
+    ASSERT_EQ(rig.sends.size(), 2u);
+    EXPECT_EQ(rig.sends[0].id, id);
+    EXPECT_NEAR(rig.sends[0].at - lastAt, c.sentAfterLast, 1e-6);
+    EXPECT_EQ(rig.sends[1].id, 100);
+    EXPECT_GT(rig.sends[1].at, rig.sends[0].at);
+    EXPECT_LE(rig.sends[1].at - rig.sends[0].at, 0.1 + 1e-9);
+    EXPECT_EQ(rig.log->count("Dropping duplicate message for " + key(payload)),
+              c.arrivals.size() - 1);
+  }
+}
+
+TEST(SXReportingBlockThrottleTest, ThrowingOperationDoesNotStopTheWorker) {
+  Rig rig;
+  rig.throttle->addMessageBlock([] { throw std::runtime_error("boom"); }, 1,
+                                {{"_throttle_seconds", 0}}, kPlayback, kStart);
+  rig.throttle->addMessageBlock(nullptr, 2, {{"_throttle_seconds", 0}}, kPlayback, kStart);
+  rig.add(3, {{"_throttle_seconds", 0}}, 3);
+  rig.advance(0.1);
+  EXPECT_EQ(rig.sends.size(), 1u);
+  EXPECT_EQ(rig.throttle->timersInFlightCount(), 0u);
+  EXPECT_EQ(rig.log->count("Send operation failed: boom"), 1u);
+}
+
+// The wait ends when the last entry has fired, or after 5 seconds while duplicates keep
+// re-arming the entry, which is then still sent after the last of them.
+TEST(SXReportingBlockThrottleTest, WaitForCompletionEndsWhenIdleOrAfterFiveSeconds) {
+  struct Case {
+    std::optional<double> entrySeconds;  // none: idle
+    int duplicateEveryMs;                // 0: none
+    int returnsAtMs;
+    std::string firstLine;
+  };
+  for (const Case& c : std::vector<Case>{
+           {std::nullopt, 0, 0, "waitForCompletion. timersInFlight=0 unscheduledTimerKeys=0"},
+           {1, 0, 1000, "waitForCompletion. timersInFlight=1 unscheduledTimerKeys=1"},
+           {0.5, 300, 5000, "waitForCompletion. timersInFlight=1 unscheduledTimerKeys=1"},
+       }) {
+    SCOPED_TRACE(c.returnsAtMs);
+    Rig rig;
+    int added = 0;
+    auto addEntry = [&] { rig.add(++added, {{"a", 1}, {"_throttle_seconds", *c.entrySeconds}}); };
+    if (c.entrySeconds) addEntry();
+    auto waiter = std::async(std::launch::async, [&] { rig.throttle->waitForCompletion(); });
+    bool waits = c.returnsAtMs > 0;
+    // The time limit starts before this line, so time may move once it is written.
+    if (waits) {
+      ASSERT_TRUE(rig.log->waitFor("Waiting up to 5 seconds for blockThrottle queue to be empty."));
+    }
+    double lastAddedAt = 0;
+    for (int ms = 100; ms <= c.returnsAtMs; ms += 100) {
+      EXPECT_NE(waiter.wait_for(milliseconds(0)), std::future_status::ready) << ms;
+      rig.advance(0.1);
+      if (c.duplicateEveryMs && ms % c.duplicateEveryMs == 0 && ms < c.returnsAtMs) {
+        addEntry();
+        lastAddedAt = rig.now();
+      }
+    }
+    ASSERT_EQ(waiter.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+    EXPECT_EQ(rig.log->messages().at(0), c.firstLine);
+    EXPECT_EQ(rig.log->contains("Waiting up to"), waits);
+    bool givesUp = c.duplicateEveryMs > 0;
+    EXPECT_EQ(
+        rig.log->count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"),
+        givesUp ? 1u : 0u);
+    EXPECT_EQ(rig.log->countContaining("Giving up"), givesUp ? 1u : 0u);
+    for (const auto& line : rig.log->lines()) {
+      if (line.message.starts_with("Giving up")) {
+        EXPECT_EQ(line.level, SXLogLevel::kDefault);
+      }
+    }
+    if (givesUp) {
+      rig.advance(1);
+      ASSERT_EQ(rig.sends.size(), 1u);
+      EXPECT_EQ(rig.sends[0].id, added);
+      EXPECT_NEAR(rig.sends[0].at - lastAddedAt, 0.5, 1e-6);
+    } else {
+      EXPECT_EQ(rig.sends.size(), size_t(added));
     }
   }
-  // The entry is still sent, once, after the last duplicate.
-  auto sends = recorder_.waitFor(1);
-  ASSERT_EQ(sends.size(), 1u);
-  EXPECT_EQ(sends[0].id, added.load());
-  double after = std::chrono::duration<double>(sends[0].at - lastAdd).count();
-  EXPECT_GE(after, 0.49);
-  EXPECT_LT(after, 1.5);
 }
 
-TEST_F(SXReportingBlockThrottleTest, StopEndsTheWorkerAndReleasesTheThrottle) {
-  add(1, {{"_throttle_seconds", 0}});
-  recorder_.waitFor(1);
-  std::weak_ptr<SXReportingBlockThrottle> weak = throttle_;
-  throttle_->stop();
-  EXPECT_FALSE(throttle_->shouldKeepRunning());
-  throttle_.reset();
+TEST(SXReportingBlockThrottleTest, WorkerHoldsTheThrottleUntilStopped) {
+  Rig rig;
+  std::weak_ptr<SXReportingBlockThrottle> weak = rig.throttle;
+  rig.add(1, {{"a", 1}});
+  rig.throttle.reset();
+  rig.advance(0.5);
+  EXPECT_EQ(rig.sends.size(), 1u);
+  ASSERT_FALSE(weak.expired());
+  weak.lock()->stop();
+  rig.advance(0.1);
   EXPECT_TRUE(weak.expired());
-  throttle_ = SXReportingBlockThrottle::create(log_, nullptr);  // for TearDown
 }
 
 }  // namespace

@@ -25,8 +25,10 @@ class ManualQueue final : public SXWorkQueue {
 
 }  // namespace
 
-ManualDispatch::ManualDispatch()
-    : lowPriority_(std::make_shared<ManualQueue>("lowpriority", *this)) {}
+ManualDispatch::ManualDispatch() : ManualDispatch(nullptr) {}
+
+ManualDispatch::ManualDispatch(std::shared_ptr<FakeClock> clock)
+    : clock_(std::move(clock)), lowPriority_(std::make_shared<ManualQueue>("lowpriority", *this)) {}
 
 std::shared_ptr<SXWorkQueue> ManualDispatch::createSerialQueue(std::string label,
                                                                SXQualityOfService) {
@@ -42,8 +44,36 @@ void ManualDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWor
   {
     std::lock_guard lock(mutex_);
     delays_.push_back(delay);
+    if (clock_) {
+      delayed_.push_back({clock_->now() + std::chrono::duration_cast<SXDate::duration>(delay),
+                          std::move(queue), std::move(task)});
+      return;
+    }
   }
   queue->async(std::move(task));
+}
+
+size_t ManualDispatch::advance(std::chrono::nanoseconds delay) {
+  SXDate target = clock_->now() + std::chrono::duration_cast<SXDate::duration>(delay);
+  size_t ran = runAll();
+  for (;;) {
+    Delayed next;
+    {
+      std::lock_guard lock(mutex_);
+      // The earliest due; among equal due times the first submitted.
+      auto earliest =
+          std::min_element(delayed_.begin(), delayed_.end(),
+                           [](const Delayed& a, const Delayed& b) { return a.due < b.due; });
+      if (earliest == delayed_.end() || earliest->due > target) break;
+      next = std::move(*earliest);
+      delayed_.erase(earliest);
+    }
+    if (next.due > clock_->now()) clock_->set(next.due);
+    next.queue->async(std::move(next.task));
+    ran += runAll();
+  }
+  if (target > clock_->now()) clock_->set(target);
+  return ran + runAll();
 }
 
 void ManualDispatch::enqueue(const std::string& label, SXTask task,

@@ -1,8 +1,9 @@
 // Queues that run nothing until the test says so. Every task of every queue goes into one
 // shared log in submission order; `runAll` runs tasks (including those that tasks submit)
 // until none is left, skipping the tasks of suspended queues until they resume. Delayed tasks
-// are recorded with their delay and run by `runAll` too. Thread-safe, so that tasks submitted
-// from other threads are seen.
+// are recorded with their delay and run by `runAll` too, unless the dispatch keeps a manual
+// time: then each waits until `advance` moves the clock to its due time. Thread-safe, so that
+// tasks submitted from other threads are seen.
 #pragma once
 
 #include <atomic>
@@ -10,11 +11,14 @@
 #include <mutex>
 #include <vector>
 
+#include "fakes/FakeClock.h"
 #include "platform/Dispatch.h"
 
 class ManualDispatch final : public SXDispatch {
  public:
   ManualDispatch();
+  // Delayed tasks wait for `clock` to reach their due time (see `advance`).
+  explicit ManualDispatch(std::shared_ptr<FakeClock> clock);
   std::shared_ptr<SXWorkQueue> createSerialQueue(std::string label,
                                                  SXQualityOfService qos) override;
   std::shared_ptr<SXWorkQueue> lowPriorityConcurrentQueue() override { return lowPriority_; }
@@ -23,6 +27,9 @@ class ManualDispatch final : public SXDispatch {
 
   // Runs queued tasks in submission order until none is left; returns how many ran.
   size_t runAll();
+  // Manual time only: moves the clock forward by `delay`, stopping at each delayed task's due
+  // time (earliest first) to hand it to its queue and `runAll`; returns how many tasks ran.
+  size_t advance(std::chrono::nanoseconds delay);
   size_t pending() const;
   // Delays passed to `after`, in order.
   std::vector<std::chrono::nanoseconds> delays() const;
@@ -40,9 +47,16 @@ class ManualDispatch final : public SXDispatch {
     SXTask task;
     std::shared_ptr<const std::atomic<int>> suspended;
   };
+  struct Delayed {
+    SXDate due;
+    std::shared_ptr<SXWorkQueue> queue;
+    SXTask task;
+  };
+  const std::shared_ptr<FakeClock> clock_;  // null: delays are not waited for
   mutable std::mutex mutex_;
   std::deque<Queued> tasks_;                      // GUARDED_BY(mutex_)
   std::vector<std::chrono::nanoseconds> delays_;  // GUARDED_BY(mutex_)
   std::vector<std::string> created_;              // GUARDED_BY(mutex_)
+  std::vector<Delayed> delayed_;                  // GUARDED_BY(mutex_), in order of `after`
   std::shared_ptr<SXWorkQueue> lowPriority_;
 };

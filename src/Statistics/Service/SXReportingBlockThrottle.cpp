@@ -6,14 +6,13 @@
 #include <cmath>
 #include <exception>
 #include <limits>
+#include <optional>
 #include <string_view>
 #include <unordered_set>
 
 #include "SXReportingUtility.h"
 
 namespace {
-
-using Clock = SXReportingBlockThrottleSchedule::Clock;
 
 // Keys whose values never take part in the comparison: three time stamps and the two control
 // keys, so that neither a time stamp nor a control value makes two messages differ. Constant
@@ -27,17 +26,16 @@ constexpr std::string_view kThrottleSecondsKey = "_throttle_seconds";
 constexpr double kDefaultSleepTime = 0.5;
 constexpr double kMaxSleepTime = 5.0;
 constexpr unsigned kCompletionWaitSeconds = 5;
-constexpr int kCompletionPolls = 10;
-constexpr auto kCompletionPollInterval = std::chrono::milliseconds(500);
-constexpr auto kIdlePollInterval = std::chrono::milliseconds(100);
+constexpr auto kIdlePause = std::chrono::milliseconds(100);
+constexpr const char* kWorkerLabel = "com.vendra.sonex.reporting.blockthrottle";
 // Far enough for any throttle time, near enough that the clock arithmetic cannot overflow.
 constexpr double kMaxDelaySeconds = 1e9;
 
-Clock::time_point dueIn(double seconds) {
-  Clock::time_point now = Clock::now();
+SXDate dueIn(const SXClock& clock, double seconds) {
+  SXDate now = clock.now();
   if (!(seconds > 0)) return now;  // zero, negative and not-a-number: due at once
   seconds = std::min(seconds, kMaxDelaySeconds);
-  return now + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
+  return now + std::chrono::duration_cast<SXDate::duration>(std::chrono::duration<double>(seconds));
 }
 
 // Plain decimal: integral values (of any number kind) as exact integers, so that 1, 1u and 1.0
@@ -177,71 +175,119 @@ double narrowedToFloat(double seconds) {
 
 // ---- SXReportingBlockThrottleSchedule ----
 
-void SXReportingBlockThrottleSchedule::add(std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
-  if (timer) timers_.push_back(std::move(timer));
+struct SXReportingBlockThrottleSchedule::State : std::enable_shared_from_this<State> {
+  State(std::shared_ptr<SXDispatch> dispatch, std::shared_ptr<SXWorkQueue> queue,
+        std::shared_ptr<SXClock> clock)
+      : dispatch(std::move(dispatch)), queue(std::move(queue)), clock(std::move(clock)) {}
+
+  // Fires the timers due by now, then either ends the run or arranges the next wake-up. Only
+  // the wake-up holding the current token acts; the others were replaced by a re-arm.
+  void step(uint64_t token);
+  // Makes a wake-up at `due` the only one that acts and returns the call that queues it, to be
+  // made once `mutex` is released. REQUIRES: mutex held.
+  std::function<void()> wakeAtLocked(SXDate due);
+
+  const std::shared_ptr<SXDispatch> dispatch;
+  const std::shared_ptr<SXWorkQueue> queue;
+  const std::shared_ptr<SXClock> clock;
+
+  std::mutex mutex;
+  std::vector<std::shared_ptr<SXReportingBlockThrottleTimer>> timers;  // guarded by mutex
+  std::function<void()> done;    // guarded by mutex; set while a run is in progress
+  bool running = false;          // guarded by mutex
+  uint64_t wakeToken = 0;        // guarded by mutex
+  std::optional<SXDate> wakeAt;  // guarded by mutex; empty while a step fires timers
+};
+
+std::function<void()> SXReportingBlockThrottleSchedule::State::wakeAtLocked(SXDate due) {
+  uint64_t token = ++wakeToken;
+  wakeAt = due;
+  auto delay = std::max(std::chrono::nanoseconds::zero(),
+                        std::chrono::duration_cast<std::chrono::nanoseconds>(due - clock->now()));
+  return [self = shared_from_this(), delay, token] {
+    self->dispatch->after(delay, self->queue, [self, token] { self->step(token); });
+  };
 }
 
-void SXReportingBlockThrottleSchedule::run() {
-  std::unique_lock lock(timerLock_->mutex);
-  while (auto timer = nextDueTimer(lock)) {
+void SXReportingBlockThrottleSchedule::State::step(uint64_t token) {
+  std::unique_lock lock(mutex);
+  if (token != wakeToken) return;
+  wakeAt.reset();  // a re-arm while timers fire queues a fresh wake-up
+  for (;;) {
+    std::erase_if(timers, [](const auto& timer) { return !timer->valid_; });
+    if (timers.empty()) {
+      running = false;
+      auto finished = std::move(done);
+      done = nullptr;
+      lock.unlock();
+      if (finished) finished();
+      return;
+    }
+    auto earliest =
+        std::min_element(timers.begin(), timers.end(),
+                         [](const auto& a, const auto& b) { return a->due_ < b->due_; });
+    if ((*earliest)->due_ > clock->now()) {
+      auto queueWakeUp = wakeAtLocked((*earliest)->due_);
+      lock.unlock();
+      queueWakeUp();
+      return;
+    }
+    auto timer = std::move(*earliest);
+    timers.erase(earliest);
+    timer->valid_ = false;  // one-shot
     lock.unlock();
     if (timer->action_) timer->action_();
     lock.lock();
+    // A re-arm during the action queued a wake-up of its own, which carries on from here.
+    if (token != wakeToken) return;
   }
 }
 
-std::shared_ptr<SXReportingBlockThrottleTimer> SXReportingBlockThrottleSchedule::nextDueTimer(
-    std::unique_lock<std::mutex>& lock) {
-  for (;;) {
-    std::erase_if(timers_, [](const auto& timer) { return !timer->valid_; });
-    if (timers_.empty()) return nullptr;
-    auto earliest =
-        std::min_element(timers_.begin(), timers_.end(),
-                         [](const auto& a, const auto& b) { return a->due_ < b->due_; });
-    Clock::time_point due = (*earliest)->due_;
-    if (due <= Clock::now()) {
-      auto timer = std::move(*earliest);
-      timers_.erase(earliest);
-      timer->valid_ = false;  // one-shot
-      return timer;
-    }
-    // Woken early when some thread moves a due time or invalidates a timer; due times are
-    // then read afresh.
-    timerLock_->changed.wait_until(lock, due);
+SXReportingBlockThrottleSchedule::SXReportingBlockThrottleSchedule(
+    std::shared_ptr<SXDispatch> dispatch, std::shared_ptr<SXWorkQueue> queue,
+    std::shared_ptr<SXClock> clock)
+    : state_(std::make_shared<State>(std::move(dispatch), std::move(queue), std::move(clock))) {}
+
+void SXReportingBlockThrottleSchedule::add(std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
+  if (!timer) return;
+  std::lock_guard lock(state_->mutex);
+  state_->timers.push_back(std::move(timer));
+}
+
+void SXReportingBlockThrottleSchedule::run(std::function<void()> done) {
+  uint64_t token;
+  {
+    std::lock_guard lock(state_->mutex);
+    state_->running = true;
+    state_->done = std::move(done);
+    token = ++state_->wakeToken;
   }
+  state_->step(token);
 }
 
 // ---- SXReportingBlockThrottleTimer ----
 
 SXReportingBlockThrottleTimer::SXReportingBlockThrottleTimer(
-    const SXReportingBlockThrottleSchedule& schedule, Clock::time_point due,
-    std::function<void()> action)
-    : lock_(schedule.timerLock_), due_(due), action_(std::move(action)) {}
+    const SXReportingBlockThrottleSchedule& schedule, SXDate due, std::function<void()> action)
+    : state_(schedule.state_), due_(due), action_(std::move(action)) {}
 
-void SXReportingBlockThrottleTimer::setFireDate(Clock::time_point due) {
+void SXReportingBlockThrottleTimer::setFireDate(SXDate due) {
+  std::function<void()> queueWakeUp;
   {
-    std::lock_guard lock(lock_->mutex);
+    std::lock_guard lock(state_->mutex);
     due_ = due;
+    // Only an earlier time needs a wake-up of its own: a wake-up that comes too early finds
+    // nothing due and waits again for the earliest time.
+    if (state_->running && valid_ && (!state_->wakeAt || due < *state_->wakeAt)) {
+      queueWakeUp = state_->wakeAtLocked(due);
+    }
   }
-  lock_->changed.notify_all();
-}
-
-SXReportingBlockThrottleTimer::Clock::time_point SXReportingBlockThrottleTimer::fireDate() const {
-  std::lock_guard lock(lock_->mutex);
-  return due_;
+  if (queueWakeUp) queueWakeUp();
 }
 
 void SXReportingBlockThrottleTimer::invalidate() {
-  {
-    std::lock_guard lock(lock_->mutex);
-    valid_ = false;
-  }
-  lock_->changed.notify_all();
-}
-
-bool SXReportingBlockThrottleTimer::isValid() const {
-  std::lock_guard lock(lock_->mutex);
-  return valid_;
+  std::lock_guard lock(state_->mutex);
+  valid_ = false;
 }
 
 // ---- SXReportingBlockThrottleTimerWrapper ----
@@ -274,7 +320,7 @@ void SXReportingBlockThrottleTimerWrapper::setTimer(
 }
 
 void SXReportingBlockThrottleTimerWrapper::sleepFor(double seconds) {
-  if (auto current = timer()) current->setFireDate(dueIn(seconds));
+  if (auto current = timer()) current->setFireDate(dueIn(*clock_, seconds));
 }
 
 // ---- SXReportingBlockThrottle: message keys and throttle time ----
@@ -318,28 +364,27 @@ double SXReportingBlockThrottle::determineSleepTime(const SXValue& payload, SXLo
 // ---- SXReportingBlockThrottle: the throttle ----
 
 std::shared_ptr<SXReportingBlockThrottle> SXReportingBlockThrottle::create(
+    std::shared_ptr<SXDispatch> dispatch, std::shared_ptr<SXClock> clock,
     std::shared_ptr<SXLogFacility> log, std::shared_ptr<const SXLogScope> verboseScope) {
-  auto throttle = std::make_shared<SXReportingBlockThrottle>(Passkey{}, std::move(log),
-                                                             std::move(verboseScope));
-  throttle->queueThread_ = std::thread([self = throttle] { self->workerLoop(); });
+  auto throttle = std::make_shared<SXReportingBlockThrottle>(
+      Passkey{}, std::move(dispatch), std::move(clock), std::move(log), std::move(verboseScope));
+  throttle->queue_->async([self = throttle] { self->workerPass(); });
   return throttle;
 }
 
-SXReportingBlockThrottle::SXReportingBlockThrottle(Passkey, std::shared_ptr<SXLogFacility> log,
+// User-interactive: the platform gives such a queue a thread of its own, which is the worker
+// thread, so sends never wait behind other work of the process nor it behind them.
+SXReportingBlockThrottle::SXReportingBlockThrottle(Passkey, std::shared_ptr<SXDispatch> dispatch,
+                                                   std::shared_ptr<SXClock> clock,
+                                                   std::shared_ptr<SXLogFacility> log,
                                                    std::shared_ptr<const SXLogScope> verboseScope)
-    : log_(std::move(log)), verboseScope_(std::move(verboseScope)) {
+    : dispatch_(std::move(dispatch)),
+      clock_(std::move(clock)),
+      log_(std::move(log)),
+      verboseScope_(std::move(verboseScope)),
+      queue_(dispatch_->createSerialQueue(kWorkerLabel, SXQualityOfService::kUserInteractive)),
+      schedule_(dispatch_, queue_, clock_) {
   unscheduledTimerKeys_.reserve(6);
-}
-
-SXReportingBlockThrottle::~SXReportingBlockThrottle() {
-  if (!queueThread_.joinable()) return;
-  // While the worker runs it holds the throttle, so only the worker itself can get here with a
-  // joinable thread, as it lets go of the throttle on its way out.
-  if (queueThread_.get_id() == std::this_thread::get_id()) {
-    queueThread_.detach();
-  } else {
-    queueThread_.join();
-  }
 }
 
 void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int64_t reporterID,
@@ -357,7 +402,7 @@ void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int6
     inFlight.unlock();
     return;
   }
-  auto wrapper = std::make_shared<SXReportingBlockThrottleTimerWrapper>();
+  auto wrapper = std::make_shared<SXReportingBlockThrottleTimerWrapper>(clock_);
   wrapper->setBlock(std::move(block));
   // Weak captures: the wrapper owns the timer, and the throttle outlives every timer it runs.
   auto action = [weakThrottle = weak_from_this(),
@@ -366,8 +411,8 @@ void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int6
     auto entry = weakWrapper.lock();
     if (throttle && entry) throttle->fire(key, entry);
   };
-  wrapper->setTimer(std::make_shared<SXReportingBlockThrottleTimer>(schedule_, dueIn(sleepTime),
-                                                                    std::move(action)));
+  wrapper->setTimer(std::make_shared<SXReportingBlockThrottleTimer>(
+      schedule_, dueIn(*clock_, sleepTime), std::move(action)));
   timersInFlight_.emplace(key, std::move(wrapper));
   inFlight.unlock();
 
@@ -395,23 +440,33 @@ void SXReportingBlockThrottle::fire(
       SXLOG(*log_, nullptr, SXLogLevel::kError, "Send operation failed");
     }
   }
-  std::lock_guard inFlight(inFlightMutex_);
-  if (auto timer = entry->timer()) timer->invalidate();
-  auto it = timersInFlight_.find(key);
-  if (it != timersInFlight_.end() && it->second == entry) timersInFlight_.erase(it);
+  {
+    std::lock_guard inFlight(inFlightMutex_);
+    if (auto timer = entry->timer()) timer->invalidate();
+    auto it = timersInFlight_.find(key);
+    if (it != timersInFlight_.end() && it->second == entry) timersInFlight_.erase(it);
+    if (!timersInFlight_.empty()) return;
+  }
+  inFlightChanged_.notify_all();
 }
 
-void SXReportingBlockThrottle::workerLoop() {
-  while (shouldKeepRunning_.load()) {
-    if (unscheduledTimerKeysCount() > 0) {
-      SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug,
-            "calling workingRunLoop run from inside thread block");
-      scheduleUnscheduledTimers();
-      schedule_.run();
-    }
-    SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "sleeping in thread");
+// The loop of the worker thread, one pass per task: the flag is tested once per pass, so a run
+// phase in progress finishes first, and new entries join the schedule only between phases.
+void SXReportingBlockThrottle::workerPass() {
+  if (!shouldKeepRunning_.load()) return;
+  if (unscheduledTimerKeysCount() == 0) {
     idleSleep();
+    return;
   }
+  SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug,
+        "calling workingRunLoop run from inside thread block");
+  scheduleUnscheduledTimers();
+  schedule_.run([self = shared_from_this()] { self->idleSleep(); });
+}
+
+void SXReportingBlockThrottle::idleSleep() {
+  SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "sleeping in thread");
+  dispatch_->after(kIdlePause, queue_, [self = shared_from_this()] { self->workerPass(); });
 }
 
 void SXReportingBlockThrottle::scheduleUnscheduledTimers() {
@@ -426,33 +481,35 @@ void SXReportingBlockThrottle::scheduleUnscheduledTimers() {
   unscheduledTimerKeys_.clear();
 }
 
-void SXReportingBlockThrottle::idleSleep() {
-  std::unique_lock lock(idleMutex_);
-  idleCondition_.wait_for(lock, kIdlePollInterval, [this] { return !shouldKeepRunning_.load(); });
-}
-
-void SXReportingBlockThrottle::stop() {
-  {
-    std::lock_guard lock(idleMutex_);
-    shouldKeepRunning_.store(false);
-  }
-  idleCondition_.notify_all();
-  if (queueThread_.joinable() && queueThread_.get_id() != std::this_thread::get_id()) {
-    queueThread_.join();
-  }
-}
-
 void SXReportingBlockThrottle::waitForCompletion() {
   SXLOG(*log_, nullptr, SXLogLevel::kInfo,
         "waitForCompletion. timersInFlight=%u unscheduledTimerKeys=%u", timersInFlightCount(),
         unscheduledTimerKeysCount());
   if (timersInFlightCount() == 0) return;
+  // The time limit is a task of the platform's dispatch, so it runs on the platform clock, and
+  // on the concurrent queue, so it ends the wait even when the caller is a send holding up the
+  // worker.
+  auto expired = std::make_shared<bool>(false);  // guarded by inFlightMutex_
+  dispatch_->after(std::chrono::seconds(kCompletionWaitSeconds),
+                   dispatch_->lowPriorityConcurrentQueue(),
+                   [weakThrottle = weak_from_this(), expired] {
+                     auto throttle = weakThrottle.lock();
+                     if (!throttle) return;
+                     {
+                       std::lock_guard lock(throttle->inFlightMutex_);
+                       *expired = true;
+                     }
+                     throttle->inFlightChanged_.notify_all();
+                   });
   SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug,
         "Waiting up to %u seconds for blockThrottle queue to be empty.", kCompletionWaitSeconds);
-  for (int poll = 0; poll < kCompletionPolls && timersInFlightCount() > 0; ++poll) {
-    std::this_thread::sleep_for(kCompletionPollInterval);
+  size_t pending;
+  {
+    std::unique_lock lock(inFlightMutex_);
+    inFlightChanged_.wait(lock, [&] { return timersInFlight_.empty() || *expired; });
+    pending = timersInFlight_.size();
   }
-  if (size_t pending = timersInFlightCount()) {
+  if (pending) {
     SXLOG(*log_, nullptr, SXLogLevel::kDefault,
           "Giving up on waiting for completion after %u seconds. timersInFlight=%u",
           kCompletionWaitSeconds, pending);
