@@ -22,14 +22,14 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   std::shared_ptr<Text> text =
       it != texts_.end() ? *it : texts_.emplace_back(std::make_shared<Text>(host));
   return [payload = payload_, payloadText = payloadText_, text] {
-    std::call_once(text->once, [&] {
-      std::optional<std::string> made;
-      if (payloadText) {
-        if (auto own = payloadText()) made = SXDictionaryTextWithMember(*own, kHostKey, text->host);
+    std::lock_guard lock(text->mutex);
+    if (!text->text && payloadText) {
+      if (auto own = payloadText()) {
+        text->text = SXDictionaryTextWithMember(*own, kHostKey, text->host);
       }
-      text->text = made ? std::move(*made) : SXValueTextWithMember(*payload, kHostKey, text->host);
-    });
-    return text->text;
+    }
+    if (!text->text) text->text = SXValueTextWithMember(*payload, kHostKey, text->host);
+    return *text->text;
   };
 }
 

@@ -31,8 +31,8 @@ class SXReportingEventTexts {
   struct Text {
     explicit Text(SXValue h) : host(std::move(h)) {}
     const SXValue host;
-    std::once_flag once;
-    std::string text;  // written once, under `once`
+    std::mutex mutex;
+    std::optional<std::string> text;  // GUARDED_BY(mutex): made by the first event to ask
   };
   std::shared_ptr<const SXValue> payload_;
   PayloadText payloadText_;

@@ -113,14 +113,14 @@ std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
 
 std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
   std::lock_guard lock(mutex_);
-  if (text_ && !rewritten_) {
+  if (!caller_ && !rewritten_) {
     // Asked for after the dictionaries were released: the text is a dump, so it parses.
     return std::make_shared<const SXValue>(SXValue::parse(*text_));
   }
   return rewrittenLocked();
 }
 
-const std::string& SXReportingMessagePayload::textLocked() {
+const std::string& SXReportingMessagePayload::makeTextLocked() {
   if (!text_) {
     // Without a rewritten dictionary, the rewrite's text comes straight from the caller's.
     if (rewritten_) {
@@ -130,9 +130,14 @@ const std::string& SXReportingMessagePayload::textLocked() {
     } else {
       text_ = SXValueText(*caller_);
     }
-    caller_ = nullptr;
-    rewritten_ = nullptr;
   }
+  return *text_;
+}
+
+const std::string& SXReportingMessagePayload::textLocked() {
+  makeTextLocked();
+  caller_ = nullptr;
+  rewritten_ = nullptr;
   return *text_;
 }
 
@@ -148,9 +153,9 @@ void SXReportingMessagePayload::keepOnlyText() {
 
 std::optional<std::string> SXReportingMessagePayload::callerDictionaryText() {
   std::lock_guard lock(mutex_);
-  // Made here, the text would release the dictionaries that a standalone send reads.
-  if (!text_ || *rewrites_ || !callerIsDictionary_) return std::nullopt;
-  return *text_;
+  if (rewritesLocked() || !callerIsDictionary_) return std::nullopt;
+  // The dictionaries stay: a standalone send of a session not started reads them.
+  return makeTextLocked();
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

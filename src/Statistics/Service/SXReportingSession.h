@@ -35,8 +35,9 @@ class SXReportingMessagePayload {
   std::string text();
   // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
   void keepOnlyText();
-  // The text, when it has been made and is also that of the caller's own payload: a
-  // dictionary with no space in its keys, which the rewrite leaves as it is.
+  // The text, made now if need be, when it is also that of the caller's own payload: a
+  // dictionary with no space in its keys, which the rewrite leaves as it is. Whichever store
+  // asks first makes it for both.
   std::optional<std::string> callerDictionaryText();
 
  private:
@@ -44,6 +45,8 @@ class SXReportingMessagePayload {
   bool rewritesLocked();
   // REQUIRES: mutex_ held.
   std::shared_ptr<const SXValue> rewrittenLocked();
+  // REQUIRES: mutex_ held. Makes the text once.
+  const std::string& makeTextLocked();
   // REQUIRES: mutex_ held. Makes the text once and releases the dictionaries.
   const std::string& textLocked();
 
