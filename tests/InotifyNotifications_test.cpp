@@ -18,7 +18,6 @@
 
 #include "fakes/FakeDispatch.h"
 #include "fakes/FakeLog.h"
-#include "fakes/FakeNotifications.h"
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
@@ -214,24 +213,6 @@ TEST_F(InotifyNotificationsTest, ThrowingHandlerIsLoggedAndDeliveryGoesOn) {
   EXPECT_TRUE(log_->contains("threw"));
   ASSERT_EQ(notify->post(kName), 0);
   EXPECT_TRUE(deliveries_.waitFor(1));
-}
-
-TEST_F(InotifyNotificationsTest, FakeDeliversLikeTheAdapter) {
-  FakeNotifications notify;
-  int token = subscribe(notify, kName, queue1_, "fake");
-  EXPECT_EQ(notify.post("nobody.listens"), 0);
-  EXPECT_EQ(notify.post(kName), 0);
-  ASSERT_TRUE(deliveries_.waitFor(1));
-  ASSERT_TRUE(queue1_->drain());
-  auto all = deliveries_.all();
-  ASSERT_EQ(all.size(), 1u);
-  EXPECT_EQ(all[0].token, token);
-  EXPECT_TRUE(all[0].onQueue);
-  EXPECT_NE(notify.post("a/b"), 0);
-  notify.failRegistrations(5);
-  int ignored = 0;
-  EXPECT_EQ(notify.registerDispatch(kName, ignored, queue1_, [](int) {}), 5);
-  EXPECT_EQ(notify.registrationCount(kName), 1u);
 }
 
 }  // namespace

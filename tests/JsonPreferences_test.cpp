@@ -11,7 +11,6 @@
 #include <vector>
 
 #include "fakes/FakeLog.h"
-#include "fakes/FakePreferences.h"
 
 namespace fs = std::filesystem;
 
@@ -216,18 +215,6 @@ TEST_F(JsonPreferencesTest, ConcurrentWritersKeepEachOthersKeys) {
     for (int i = 0; i < kKeys; ++i) EXPECT_EQ(domain[prefix + std::to_string(i)], i);
   }
   EXPECT_EQ(errorLines(), 0u);
-}
-
-TEST(FakePreferencesTest, BehavesLikeTheStore) {
-  FakePreferences prefs;
-  EXPECT_EQ(prefs.setValue(kDomain, "a", SXValue(1)), std::nullopt);
-  EXPECT_EQ(prefs.copyValue(kDomain, "a"), SXValue(1));
-  EXPECT_EQ(prefs.setValue(kDomain, "a", std::nullopt), std::nullopt);
-  EXPECT_EQ(prefs.copyDomain(kDomain), SXValue::object());
-  EXPECT_NE(prefs.setValue("a/b", "a", SXValue(1)), std::nullopt);
-  prefs.failWrites("disk full");
-  EXPECT_EQ(prefs.setValue(kDomain, "a", SXValue(1)), "disk full");
-  EXPECT_EQ(prefs.reads(), 2u);
 }
 
 }  // namespace
