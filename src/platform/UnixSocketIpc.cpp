@@ -165,12 +165,9 @@ class SXUnixSocketConnection final : public SXIpcConnection,
           return;
         }
       }
-      // Room may have been made between the test and the flag: look again after raising it,
-      // so that a wake-up is never missed.
       paused_.store(true);
-      budget_->armWake();
-      if (const auto& pool = budget_->pool()) pool->armWake();
-      if (mustWait() || (dispatched == Dispatched::kDrained && readAllowance() == 0)) {
+      if (armWakesAndMustWait() ||
+          (dispatched == Dispatched::kDrained && readAllowance() == 0)) {
         listener_.connectionPaused();
         return;
       }
@@ -207,15 +204,25 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     end(true);
   }
 
+  // Room may be made between a test and the arming: look again after arming, so that a
+  // wake-up is never missed.
+  bool armWakesAndMustWait() {
+    budget_->armWake();
+    if (const auto& pool = budget_->pool()) pool->armWake();
+    return mustWait();
+  }
+
   bool mustWait() const {
     return queued_.load() >= maxQueuedRequests_ ||
            pendingReplyBytes_.load() > maxPendingReplyBytes_ || budget_->overLimit();
   }
 
  public:
-  // I/O thread, after a marker ran, a write finished or budget was released.
+  // I/O thread, after a marker ran, a write finished or budget was released. A wake-up is
+  // spent once it fires, and the pool may have filled again before this runs: a connection
+  // that must go on waiting arms its wake-ups again, or no later release would resume it.
   void resumeIfAllowed() {
-    if (ended_ || !paused_.load() || mustWait()) return;
+    if (ended_ || !paused_.load() || armWakesAndMustWait()) return;
     paused_.store(false);
     serve();
   }
