@@ -221,6 +221,24 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
   EXPECT_LT(std::filesystem::file_size(db), 2 * kCap);
 }
 
+// Age alone, over more old rows than one chunk holds.
+TEST_P(RetentionStoreTest, AgedRowsGoChunkByChunkAndYoungerOnesStay) {
+  const StoreCase& store = GetParam();
+  SXTestTempDir dir;
+  const std::string db = dir.file(store.file);
+  RowWriter write = store.open(db);
+  ASSERT_TRUE(write(0, 120));
+  Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
+  ASSERT_TRUE(write(120, 10));
+  Retention(dir, SXRetentionPolicy())->runPass();
+  auto rows = SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
+                                          "COUNT(*) AS count FROM ") +
+                                  store.table);
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["first"], 120);
+  EXPECT_EQ(rows[0]["count"], 10);
+}
+
 INSTANTIATE_TEST_SUITE_P(Stores, RetentionStoreTest, ::testing::ValuesIn(kStoreCases),
                          [](const auto& info) { return std::string(info.param.name); });
 

@@ -19,6 +19,14 @@ std::string SXFormatArg::text() const {
   return std::visit(Visitor{}, v_);
 }
 
+void SXFormatArg::appendText(std::string& out) const {
+  if (const auto* t = std::get_if<Text>(&v_); t && t->present) {
+    out.append(t->view);
+  } else {
+    out.append(text());
+  }
+}
+
 int64_t SXFormatArg::asSigned() const {
   if (auto* i = std::get_if<int64_t>(&v_)) return *i;
   if (auto* u = std::get_if<uint64_t>(&v_)) return static_cast<int64_t>(*u);
@@ -67,9 +75,15 @@ void appendNumber(std::string& out, std::string_view flags, const char* length, 
 }  // namespace
 
 std::string SXFormatV(std::string_view format, std::initializer_list<SXFormatArg> args) {
-  static const SXFormatArg kMissing(nullptr);
   std::string out;
-  out.reserve(format.size() + 32);
+  SXFormatAppendV(out, format, args);
+  return out;
+}
+
+void SXFormatAppendV(std::string& out, std::string_view format,
+                     std::initializer_list<SXFormatArg> args) {
+  static const SXFormatArg kMissing(nullptr);
+  out.reserve(out.size() + format.size() + 32);
   auto next = args.begin();
   auto take = [&]() -> const SXFormatArg& { return next != args.end() ? *next++ : kMissing; };
 
@@ -103,7 +117,7 @@ std::string SXFormatV(std::string_view format, std::initializer_list<SXFormatArg
     switch (conv) {
       case '@':
       case 's':
-        out.append(arg.text());
+        arg.appendText(out);
         break;
       case 'd':
       case 'i':
@@ -132,5 +146,4 @@ std::string SXFormatV(std::string_view format, std::initializer_list<SXFormatArg
     }
     i = j;
   }
-  return out;
 }

@@ -35,6 +35,7 @@ class SXFormatArg {
   SXFormatArg(const std::optional<SXValue>& v) : v_(v ? Variant(&*v) : Variant(std::monostate())) {}
 
   std::string text() const;  // as "%@" prints it
+  void appendText(std::string& out) const;
   bool isNull() const { return std::holds_alternative<std::monostate>(v_); }
   int64_t asSigned() const;
   uint64_t asUnsigned() const;
@@ -55,6 +56,9 @@ class SXFormatArg {
 // flags, width, precision and length modifiers (which only say how the caller's value was typed;
 // the argument keeps its own width). Missing arguments print as "(null)".
 std::string SXFormatV(std::string_view format, std::initializer_list<SXFormatArg> args);
+// The same, appended to `out`.
+void SXFormatAppendV(std::string& out, std::string_view format,
+                     std::initializer_list<SXFormatArg> args);
 
 template <typename... Args>
 std::string SXFormat(std::string_view format, const Args&... args) {

@@ -6,7 +6,10 @@ void SXLogWriteV(SXLogFacility& facility, const SXLogScope* scope, SXLogLevel le
                  const char* file, int line, const char* function, std::string_view format,
                  std::initializer_list<SXFormatArg> args) {
   const char* slash = std::strrchr(file, '/');
-  std::string text = SXFormat("%s:%d:%s: ", slash ? slash + 1 : file, line, function);
-  text += SXFormatV(format, args);
+  std::string text;
+  text.reserve(256);
+  ((text += slash ? slash + 1 : file) += ':') += std::to_string(line);
+  ((text += ':') += function) += ": ";
+  SXFormatAppendV(text, format, args);
   facility.write(scope, level, text);
 }

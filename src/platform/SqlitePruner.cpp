@@ -47,9 +47,36 @@ std::optional<std::string> SXSqlitePruner::deleteInChunks(const std::string& tab
 std::optional<std::string> SXSqlitePruner::deleteOlderThan(const std::string& table, double cutoff,
                                                            const std::string& condition,
                                                            uint64_t& deleted) {
-  // By time, through the time index: the oldest rows of a long backlog are found at once.
-  return deleteInChunks(table, "time < ?1 AND (" + condition + ")", "time", {cutoff}, kAllRows,
-                        deleted);
+  // No index on time: every insert would pay for it. Rows are appended as they happen, so the
+  // old ones are a table's first: walk it by id a chunk at a time, deleting what is old, and
+  // stop at the first chunk that holds nothing older than the cutoff.
+  SXSqliteStatement scan;
+  SXSqliteStatement remove;
+  if (auto failed = db_.prepare("SELECT MAX(id) AS last, TOTAL(time < ?2) AS old FROM (SELECT id, "
+                                "time FROM " + table + " WHERE id > ?1 AND id < (SELECT MAX(id) "
+                                "FROM " + table + ") ORDER BY id LIMIT ?3)",
+                                scan)) {
+    return failed;
+  }
+  if (auto failed = db_.prepare("DELETE FROM " + table + " WHERE id > ?1 AND id <= ?2 AND " +
+                                    "time < ?3 AND (" + condition + ")",
+                                remove)) {
+    return failed;
+  }
+  int64_t after = std::numeric_limits<int64_t>::min();
+  while (!cancelled()) {
+    const auto start = std::chrono::steady_clock::now();
+    std::vector<SXValue> rows;
+    if (auto failed = scan.query({after, cutoff, options_.chunkRows}, rows)) return failed;
+    if (rows.empty() || !rows[0]["last"].is_number_integer()) break;  // no row left to look at
+    const auto last = rows[0]["last"].get<int64_t>();
+    if (auto failed = remove.run({after, last, cutoff})) return failed;
+    deleted += static_cast<uint64_t>(db_.changes());
+    if (rows[0]["old"].get<double>() == 0) break;
+    after = last;
+    pauseAfter(start);
+  }
+  return std::nullopt;
 }
 
 std::optional<std::string> SXSqlitePruner::deleteThrough(const std::string& table, int64_t lastId,

@@ -32,7 +32,9 @@ class SXSqlitePruner {
   SXSqlitePruner(SXSqliteConnection& db, Options options) : db_(db), options_(options) {}
 
   // Deletes the rows of `table` whose `time` is before `cutoff` (seconds since the epoch) and
-  // that also meet `condition` (SQL over the table's columns, "1" for all), oldest first.
+  // that also meet `condition` (SQL over the table's columns, "1" for all), oldest first. Rows
+  // are taken in the order they were added, up to the first `chunkRows` of them that are all
+  // younger than the cutoff: a row stamped older after a clock went back waits for its turn.
   std::optional<std::string> deleteOlderThan(const std::string& table, double cutoff,
                                              const std::string& condition, uint64_t& deleted);
 

@@ -10,6 +10,7 @@
 #include <charconv>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <vector>
 
 namespace {
@@ -119,20 +120,19 @@ bool SXStderrLog::writeToJournal(const SXLogScope* scope, int priority, std::str
 void SXStderrLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view line) {
   int priority = SyslogPriority(level);
   if (output_ == Output::kJournal && writeToJournal(scope, priority, line)) return;
-  std::string text;
-  text.reserve(line.size() + 5);
-  if (output_ != Output::kPlain) (text += '<') += std::to_string(priority) += '>';
-  (text += line) += '\n';
+  char prefix[8] = "";
+  if (output_ != Output::kPlain) std::snprintf(prefix, sizeof prefix, "<%d>", priority);
+  size_t size = std::strlen(prefix) + line.size() + 1;
   std::unique_lock lock(mutex_);
   written_.wait(lock, [this] { return waiting_.size() < kMaxWaitingBytes || stopping_; });
   if (stopping_) {  // the writer is gone or going: write it ourselves, after what it had
     lock.unlock();
-    WriteAll(STDERR_FILENO, text);
+    WriteAll(STDERR_FILENO, (prefix + std::string(line)) += '\n');
     return;
   }
   bool first = waiting_.empty();
-  bool filled = waiting_.size() < kBatchBytes && waiting_.size() + text.size() >= kBatchBytes;
-  waiting_ += text;
+  bool filled = waiting_.size() < kBatchBytes && waiting_.size() + size >= kBatchBytes;
+  ((waiting_ += prefix) += line) += '\n';
   ++linesQueued_;
   if (!writer_.joinable()) {
     writer_ = std::thread([this] {

@@ -17,14 +17,21 @@ constexpr uint32_t kTraceSend = 0x21042824;
 constexpr SXReportingServiceType kStandaloneServiceType = 5;
 constexpr SXReportingCategory kDriverStatisticsCategory = 9;
 
-std::string describe(const std::vector<std::shared_ptr<SXReportingSession>>& sessions) {
-  std::string text = "(";
-  for (size_t i = 0; i < sessions.size(); ++i) {
-    if (i) text += ", ";
-    text += sessions[i]->description();
+// "(a, b, ...)": how a list of sessions prints.
+class SessionListText {
+ public:
+  void add(std::string_view description) {
+    (text_ += text_.size() > 1 ? ", " : "") += description;
   }
-  return text + ")";
-}
+  // The finished list; called once.
+  std::string_view finish() {
+    text_ += ')';
+    return text_;
+  }
+
+ private:
+  std::string text_ = "(";
+};
 
 }  // namespace
 
@@ -262,18 +269,24 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
                                                SXReportingCategory category,
                                                SXReportingMessageType type) {
   auto delegate = delegate_.lock();
+  // Every broadcast lists every session twice: each description is made once.
   std::vector<std::shared_ptr<SXReportingSession>> active;
+  SessionListText activeText;
   for (const auto& client : delegate->getAllClients()) {
-    std::vector<std::shared_ptr<SXReportingSession>> all;
-    for (const auto& [id, session] : client->sessions_) all.push_back(session);
-    SXLOG(log(), scope(), SXLogLevel::kDefault, "sessions for client %i : %@",
-          client->processIdentifier_, describe(all));
-    for (auto& session : all) {
-      if (session->started()) active.push_back(std::move(session));
+    SessionListText clientText;
+    for (const auto& [id, session] : client->sessions_) {
+      std::string description = session->description();
+      clientText.add(description);
+      if (session->started()) {
+        active.push_back(session);
+        activeText.add(description);
+      }
     }
+    SXLOG(log(), scope(), SXLogLevel::kDefault, "sessions for client %i : %@",
+          client->processIdentifier_, clientText.finish());
   }
   SXLOG(log(), scope(), SXLogLevel::kDefault, "active reporting sessions %lu : %@",
-        static_cast<uint64_t>(active.size()), describe(active));
+        static_cast<uint64_t>(active.size()), activeText.finish());
   if (active.empty()) {
     SXLOG(log(), scope(), SXLogLevel::kDefault,
           "no active reporting sessions found, sending as standalone");
