@@ -163,17 +163,24 @@ const StoreCase kStoreCases[] = {
      }},
 };
 
-class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {};
+class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {
+ protected:
+  // `aged` rows from before the age limit, then `young` ones; their "n" counts from 0.
+  void fill(int64_t aged, int64_t young) {
+    ASSERT_TRUE(write(0, aged));
+    Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
+    ASSERT_TRUE(write(aged, young));
+  }
 
-TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriterGoesOn) {
   const StoreCase& store = GetParam();
   SXTestTempDir dir;
   const std::string db = dir.file(store.file);
   RowWriter write = store.open(db);
-  // 20 rows from before the age limit, then about a megabyte: past both limits.
-  ASSERT_TRUE(write(0, 20));
-  Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
-  ASSERT_TRUE(write(20, 980));
+};
+
+TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriterGoesOn) {
+  // About a megabyte: past both limits.
+  ASSERT_NO_FATAL_FAILURE(fill(20, 980));
 
   constexpr uint64_t kCap = 256 * 1024;
   SXRetentionPolicy policy;
@@ -223,13 +230,7 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
 
 // Age alone, over more old rows than one chunk holds.
 TEST_P(RetentionStoreTest, AgedRowsGoChunkByChunkAndYoungerOnesStay) {
-  const StoreCase& store = GetParam();
-  SXTestTempDir dir;
-  const std::string db = dir.file(store.file);
-  RowWriter write = store.open(db);
-  ASSERT_TRUE(write(0, 120));
-  Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
-  ASSERT_TRUE(write(120, 10));
+  ASSERT_NO_FATAL_FAILURE(fill(120, 10));
   Retention(dir, SXRetentionPolicy())->runPass();
   auto rows = SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
                                           "COUNT(*) AS count FROM ") +
