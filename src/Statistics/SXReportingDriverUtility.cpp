@@ -47,22 +47,22 @@ std::shared_ptr<SXReportingDriver> SXReportingDriver::driverWithGroupName(
 }
 
 std::optional<std::string> SXReportingDriver::groupName() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return groupName_;
 }
 
 void SXReportingDriver::setGroupName(std::optional<std::string> groupName) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   groupName_ = std::move(groupName);
 }
 
 std::optional<std::string> SXReportingDriver::subGroupName() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return subGroupName_;
 }
 
 void SXReportingDriver::setSubGroupName(std::optional<std::string> subGroupName) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   subGroupName_ = std::move(subGroupName);
 }
 
@@ -75,34 +75,34 @@ SXReportingIOChannelSubscription::SXReportingIOChannelSubscription(
     : driver_(std::move(driver)) {}
 
 std::shared_ptr<KestrelSubscription> SXReportingIOChannelSubscription::subscription() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return subscription_;
 }
 
 void SXReportingIOChannelSubscription::setSubscription(
     std::shared_ptr<KestrelSubscription> subscription) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   subscription_ = std::move(subscription);
 }
 
 std::optional<SXValue> SXReportingIOChannelSubscription::subscribedChannels() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return subscribedChannels_;
 }
 
 void SXReportingIOChannelSubscription::setSubscribedChannels(
     std::optional<SXValue> subscribedChannels) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   subscribedChannels_ = std::move(subscribedChannels);
 }
 
 std::shared_ptr<SXReportingDriver> SXReportingIOChannelSubscription::driver() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return driver_;
 }
 
 void SXReportingIOChannelSubscription::setDriver(std::shared_ptr<SXReportingDriver> driver) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   driver_ = std::move(driver);
 }
 
@@ -153,12 +153,12 @@ void SXReportingDriverUtility::subscribe(Kestrel& kestrel,
 }
 
 SXReportingDriverUtility::Subscriptions SXReportingDriverUtility::ioChannelSubscriptions() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return subscriptions_;
 }
 
 void SXReportingDriverUtility::setIoChannelSubscriptions(Subscriptions subscriptions) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   subscriptions_ = std::move(subscriptions);
 }
 

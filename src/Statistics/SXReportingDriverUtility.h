@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "SXReportingEnvironment.h"
+#include "common/SXThreadSafety.h"
 #include "platform/Kestrel.h"
 
 // One driver group to subscribe to; an absent name matches any.
@@ -31,9 +32,9 @@ class SXReportingDriver {
   std::string description() const;
 
  private:
-  mutable std::mutex mutex_;
-  std::optional<std::string> groupName_;     // guarded by mutex_
-  std::optional<std::string> subGroupName_;  // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::optional<std::string> groupName_ SX_GUARDED_BY(mutex_);
+  std::optional<std::string> subGroupName_ SX_GUARDED_BY(mutex_);
 };
 
 // One live subscription of the driver-statistics library.
@@ -52,10 +53,10 @@ class SXReportingIOChannelSubscription {
   void setDriver(std::shared_ptr<SXReportingDriver> driver);
 
  private:
-  mutable std::mutex mutex_;
-  std::shared_ptr<KestrelSubscription> subscription_;  // guarded by mutex_
-  std::optional<SXValue> subscribedChannels_;          // guarded by mutex_
-  std::shared_ptr<SXReportingDriver> driver_;          // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::shared_ptr<KestrelSubscription> subscription_ SX_GUARDED_BY(mutex_);
+  std::optional<SXValue> subscribedChannels_ SX_GUARDED_BY(mutex_);
+  std::shared_ptr<SXReportingDriver> driver_ SX_GUARDED_BY(mutex_);
 };
 
 class SXReportingDriverUtility {
@@ -96,6 +97,6 @@ class SXReportingDriverUtility {
                                          const SXValue& current);
 
   SXReportingEnvironment& environment_;
-  mutable std::mutex mutex_;
-  Subscriptions subscriptions_;  // guarded by mutex_
+  mutable SXMutex mutex_;
+  Subscriptions subscriptions_ SX_GUARDED_BY(mutex_);
 };

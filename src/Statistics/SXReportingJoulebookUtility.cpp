@@ -1,11 +1,9 @@
 #include "SXReportingJoulebookUtility.h"
 
-#include "SXReportingSession.h"
-
 void SXReportingJoulebookUtility::handleEvent(SXReportingEnvironment& environment,
                                               const SXValue* payload, SXReportingCategory,
                                               SXReportingMessageType,
-                                              const SXReportingSession& session) {
+                                              const SXReportingEventSession& session) {
   if (!payload || !payload->is_object()) return;
   auto onTime = payload->find("EngineOnTime");
   if (onTime == payload->end()) return;

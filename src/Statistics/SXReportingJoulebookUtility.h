@@ -3,12 +3,12 @@
 #pragma once
 
 #include "SXReportingEnvironment.h"
+#include "SXReportingEventSession.h"
 
-class SXReportingSession;
 
 class SXReportingJoulebookUtility {
  public:
   static void handleEvent(SXReportingEnvironment& environment, const SXValue* payload,
                           SXReportingCategory category, SXReportingMessageType type,
-                          const SXReportingSession& session);
+                          const SXReportingEventSession& session);
 };

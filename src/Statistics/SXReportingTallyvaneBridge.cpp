@@ -2,7 +2,6 @@
 
 #include <algorithm>
 
-#include "SXReportingSession.h"
 #include "SXReportingUtility.h"
 #include "common/SXValueText.h"
 
@@ -22,7 +21,7 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   std::shared_ptr<Text> text =
       it != texts_.end() ? *it : texts_.emplace_back(std::make_shared<Text>(host));
   return [payload = payload_, payloadText = payloadText_, text] {
-    std::lock_guard lock(text->mutex);
+    SXMutexLock lock(text->mutex);
     if (!text->text && payloadText) {
       if (auto own = payloadText()) {
         text->text = SXDictionaryTextWithMember(*own, kHostKey, text->host);
@@ -37,7 +36,7 @@ void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment
                                              SXReportingEventTexts& texts,
                                              SXReportingCategory category,
                                              SXReportingMessageType type,
-                                             const SXReportingSession& session) {
+                                             const SXReportingEventSession& session) {
   thread_local SXReportingPairNameCache names;
   const std::string& name = names.get(category, type, [&] { return eventName(category, type); });
   SXValue host = session.hostApplicationName();

@@ -9,8 +9,9 @@
 #include <vector>
 
 #include "SXReportingEnvironment.h"
+#include "SXReportingEventSession.h"
+#include "common/SXThreadSafety.h"
 
-class SXReportingSession;
 
 // The analytics events of one message: their payloads differ only in the host name, so each
 // distinct host's text is made once (when the analytics service first asks for it, on its
@@ -31,8 +32,8 @@ class SXReportingEventTexts {
   struct Text {
     explicit Text(SXValue h) : host(std::move(h)) {}
     const SXValue host;
-    std::mutex mutex;
-    std::optional<std::string> text;  // GUARDED_BY(mutex): made by the first event to ask
+    SXMutex mutex;
+    std::optional<std::string> text SX_GUARDED_BY(mutex);  // made by the first event to ask
   };
   std::shared_ptr<const SXValue> payload_;
   PayloadText payloadText_;
@@ -45,6 +46,6 @@ class SXReportingTallyvaneBridge {
   // name) is made when the analytics service asks for it, on the service's thread.
   static void handleEvent(SXReportingEnvironment& environment, SXReportingEventTexts& texts,
                           SXReportingCategory category, SXReportingMessageType type,
-                          const SXReportingSession& session);
+                          const SXReportingEventSession& session);
   static std::string eventName(SXReportingCategory category, SXReportingMessageType type);
 };

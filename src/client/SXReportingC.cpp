@@ -9,6 +9,7 @@
 #include <string>
 #include <thread>
 
+#include "common/SXThreadSafety.h"
 #include "sxreporting/client.h"
 #include "sxreporting/sxreporting.h"
 
@@ -16,10 +17,10 @@ struct sxr_client {
   explicit sxr_client(std::string socketPath) : client(SXClientOptions{std::move(socketPath)}) {}
 
   SXReportingClient client;
-  std::mutex mutex;
+  SXMutex mutex;
   // One entry per thread that has called, so that threads sharing a client never read each
   // other's errors. A thread writes only its own entry; std::map never moves its nodes.
-  std::map<std::thread::id, std::string> lastErrors;  // GUARDED_BY(mutex)
+  std::map<std::thread::id, std::string> lastErrors SX_GUARDED_BY(mutex);
 };
 
 namespace {
@@ -31,7 +32,7 @@ const char kOutOfMemory[] = "out of memory";
 const char kNoClient[] = "no client (memory or threads ran out)";
 
 std::string* errorSlot(sxr_client* c) {
-  std::lock_guard<std::mutex> lock(c->mutex);
+  SXMutexLock lock(c->mutex);
   return &c->lastErrors[std::this_thread::get_id()];
 }
 

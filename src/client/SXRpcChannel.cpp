@@ -51,7 +51,7 @@ void SXRpcChannel::shutdown() {
 bool SXRpcChannel::connect(std::string* error) {
   std::promise<std::string> result;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (state_ != State::kIdle) {
       if (state_ == State::kConnected) return true;
       if (error) *error = closeReason_.empty() ? "already connecting" : closeReason_;
@@ -76,7 +76,7 @@ bool SXRpcChannel::connect(std::string* error) {
 void SXRpcChannel::onConnected(const asio::error_code& ec, std::promise<std::string>& result) {
   std::string why;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (state_ != State::kConnecting) {
       why = closeReason_;
     } else if (ec) {
@@ -96,7 +96,7 @@ void SXRpcChannel::close() {
 }
 
 bool SXRpcChannel::connected() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return state_ == State::kConnected;
 }
 
@@ -106,7 +106,7 @@ void SXRpcChannel::call(std::string_view method, const SXValue& params, SXTimeou
   const bool hasDeadline = limit < kLongestTimeout;
   const auto deadline = hasDeadline ? Clock::now() + limit : Clock::time_point::max();
 
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (state_ != State::kConnected) {
     std::string why = closeReason_.empty() ? "not connected" : closeReason_;
     lock.unlock();
@@ -137,7 +137,7 @@ void SXRpcChannel::call(std::string_view method, const SXValue& params, SXTimeou
 // next one, so a burst of calls costs few system calls.
 void SXRpcChannel::flush() {
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (outbox_.size() == 0 || state_ != State::kConnected) {
       writeScheduled_ = false;
       return;
@@ -192,7 +192,7 @@ void SXRpcChannel::handleMessage(const SXValue& message) {
   if (!response) return;
   Completion done;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     auto it = pending_.find(response->msgid);
     if (it == pending_.end()) return;
     done = std::move(it->second.done);
@@ -213,7 +213,7 @@ void SXRpcChannel::forget(Pending& pending) {
 void SXRpcChannel::armTimer() {
   Clock::time_point next;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     next = deadlines_.empty() ? Clock::time_point::max() : deadlines_.begin()->first;
     timerArmedFor_ = next;
   }
@@ -230,7 +230,7 @@ void SXRpcChannel::armTimer() {
 void SXRpcChannel::expireCalls() {
   std::vector<std::pair<Completion, std::chrono::milliseconds>> expired;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     const auto now = Clock::now();
     while (!deadlines_.empty() && deadlines_.begin()->first <= now) {
       auto it = pending_.find(deadlines_.begin()->second);
@@ -249,7 +249,7 @@ void SXRpcChannel::expireCalls() {
 void SXRpcChannel::fail(const std::string& reason) {
   std::vector<std::pair<uint32_t, Completion>> pending;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (state_ == State::kClosed) return;
     state_ = State::kClosed;
     closeReason_ = reason;

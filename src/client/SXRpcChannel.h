@@ -17,6 +17,7 @@
 #include <unordered_map>
 
 #include "common/RpcCodec.h"
+#include "common/SXThreadSafety.h"
 #include "sxreporting/client.h"
 
 class SXRpcChannel {
@@ -61,7 +62,7 @@ class SXRpcChannel {
   void expireCalls();
   // Ends the connection: every pending call completes with kConnectionLost and `reason`.
   void fail(const std::string& reason);
-  void forget(Pending& pending);  // REQUIRES: mutex_ held
+  void forget(Pending& pending) SX_REQUIRES(mutex_);
   static void complete(const Completion& done, SXCallResult<SXValue> result);
 
   const std::string socketPath_;
@@ -74,13 +75,13 @@ class SXRpcChannel {
   RpcStreamDecoder decoder_;                                         // I/O thread only
   msgpack::sbuffer writing_;  // I/O thread only: the bytes of the write in flight
 
-  mutable std::mutex mutex_;
-  State state_ = State::kIdle;                                  // GUARDED_BY(mutex_)
-  std::string closeReason_;                                     // GUARDED_BY(mutex_)
-  uint32_t nextMsgid_ = 1;                                      // GUARDED_BY(mutex_)
-  std::unordered_map<uint32_t, Pending> pending_;               // GUARDED_BY(mutex_)
-  std::multimap<Clock::time_point, uint32_t> deadlines_;        // GUARDED_BY(mutex_)
-  Clock::time_point timerArmedFor_ = Clock::time_point::max();  // GUARDED_BY(mutex_)
-  msgpack::sbuffer outbox_;      // GUARDED_BY(mutex_): requests not yet handed to a write
-  bool writeScheduled_ = false;  // GUARDED_BY(mutex_): a write is in flight or a flush posted
+  mutable SXMutex mutex_;
+  State state_ SX_GUARDED_BY(mutex_) = State::kIdle;
+  std::string closeReason_ SX_GUARDED_BY(mutex_);
+  uint32_t nextMsgid_ SX_GUARDED_BY(mutex_) = 1;
+  std::unordered_map<uint32_t, Pending> pending_ SX_GUARDED_BY(mutex_);
+  std::multimap<Clock::time_point, uint32_t> deadlines_ SX_GUARDED_BY(mutex_);
+  Clock::time_point timerArmedFor_ SX_GUARDED_BY(mutex_) = Clock::time_point::max();
+  msgpack::sbuffer outbox_ SX_GUARDED_BY(mutex_);      // requests not yet handed to a write
+  bool writeScheduled_ SX_GUARDED_BY(mutex_) = false;  // a write is in flight or a flush posted
 };

@@ -5,9 +5,9 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
-#include <algorithm>
 #include <atomic>
 
 namespace {
@@ -24,7 +24,7 @@ class ThreadQueue final : public SXWorkQueue {
   }
   ~ThreadQueue() override {
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       stopping_ = true;
     }
     wake_.notify_one();
@@ -36,19 +36,19 @@ class ThreadQueue final : public SXWorkQueue {
   }
   void async(SXTask task) override {
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       tasks_.push_back(std::move(task));
     }
     wake_.notify_one();
   }
   const std::string& label() const override { return label_; }
   void suspend() override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     ++suspended_;
   }
   void resume() override {
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       if (suspended_ > 0) --suspended_;
     }
     wake_.notify_one();
@@ -57,9 +57,11 @@ class ThreadQueue final : public SXWorkQueue {
  private:
   void run() {
     nameThisThread("sxr-server");
-    std::unique_lock lock(mutex_);
+    SXMutexLock lock(mutex_);
     for (;;) {
-      wake_.wait(lock, [this] { return stopping_ || (!tasks_.empty() && suspended_ == 0); });
+      lock.wait(wake_, [this]() SX_REQUIRES(mutex_) {
+        return stopping_ || (!tasks_.empty() && suspended_ == 0);
+      });
       if (stopping_ && (tasks_.empty() || suspended_ > 0)) return;
       // Take everything queued so far: one lock round-trip per batch, not per task.
       std::deque<SXTask> batch;
@@ -78,12 +80,12 @@ class ThreadQueue final : public SXWorkQueue {
   }
 
   const std::string label_;
-  std::mutex mutex_;
+  SXMutex mutex_;
   std::condition_variable wake_;
-  std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
+  std::deque<SXTask> tasks_ SX_GUARDED_BY(mutex_);
   // Changed under mutex_; the batch loop reads it without the lock between tasks.
   std::atomic<int> suspended_{0};
-  bool stopping_ = false;  // GUARDED_BY(mutex_)
+  bool stopping_ SX_GUARDED_BY(mutex_) = false;
   std::thread thread_;
 };
 
@@ -95,7 +97,7 @@ class PoolSerialQueue final : public SXWorkQueue,
   void async(SXTask task) override {
     bool schedule = false;
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       tasks_.push_back(std::move(task));
       schedule = startDrain();
     }
@@ -105,13 +107,13 @@ class PoolSerialQueue final : public SXWorkQueue,
   // A suspended queue counts as busy in the pool's activity, as a thread blocked in a wait
   // would: a stop's drain waits for what is held behind it.
   void suspend() override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (suspended_++ == 0) pool_.hold(+1);
   }
   void resume() override {
     bool schedule = false;
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       if (suspended_ == 0) return;
       if (--suspended_ == 0) pool_.hold(-1);
       schedule = startDrain();
@@ -120,8 +122,8 @@ class PoolSerialQueue final : public SXWorkQueue,
   }
 
  private:
-  // REQUIRES(mutex_). Whether the caller must submit a drain.
-  bool startDrain() {
+  // Whether the caller must submit a drain.
+  bool startDrain() SX_REQUIRES(mutex_) {
     if (draining_ || suspended_ > 0 || tasks_.empty()) return false;
     draining_ = true;
     return true;
@@ -135,7 +137,7 @@ class PoolSerialQueue final : public SXWorkQueue,
     for (int ran = 0; ran < kTasksPerTurn; ++ran) {
       SXTask task;
       {
-        std::lock_guard lock(mutex_);
+        SXMutexLock lock(mutex_);
         if (tasks_.empty() || suspended_ > 0) {
           draining_ = false;
           return;
@@ -152,10 +154,10 @@ class PoolSerialQueue final : public SXWorkQueue,
 
   const std::string label_;
   SXElasticPool& pool_;
-  std::mutex mutex_;
-  std::deque<SXTask> tasks_;  // GUARDED_BY(mutex_)
-  bool draining_ = false;     // GUARDED_BY(mutex_)
-  int suspended_ = 0;         // GUARDED_BY(mutex_)
+  SXMutex mutex_;
+  std::deque<SXTask> tasks_ SX_GUARDED_BY(mutex_);
+  bool draining_ SX_GUARDED_BY(mutex_) = false;
+  int suspended_ SX_GUARDED_BY(mutex_) = 0;
 };
 
 class PoolConcurrentQueue final : public SXWorkQueue {
@@ -180,7 +182,7 @@ SXElasticPool::SXElasticPool(std::string threadName, int niceness, Options optio
 SXElasticPool::~SXElasticPool() {
   std::vector<std::thread> threads;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     stopping_ = true;
     threads.swap(threads_);
     if (watcher_.joinable()) threads.push_back(std::move(watcher_));
@@ -197,7 +199,7 @@ SXElasticPool::~SXElasticPool() {
 }
 
 void SXElasticPool::submit(SXTask task) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (stopping_) return;
   tasks_.push_back({std::move(task), std::chrono::steady_clock::now()});
   if (idle_ >= tasks_.size()) {
@@ -220,18 +222,19 @@ void SXElasticPool::startWorker() {
 
 void SXElasticPool::watchForStalls() {
   nameThisThread(threadName_ + "-w");
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   auto lastStart = std::chrono::steady_clock::time_point::min();
   for (;;) {
     watcherAsleep_ = true;
-    waiting_.wait(lock, [this] { return stopping_ || idle_ < tasks_.size(); });
+    lock.wait(waiting_,
+              [this]() SX_REQUIRES(mutex_) { return stopping_ || idle_ < tasks_.size(); });
     watcherAsleep_ = false;
     if (stopping_) return;
     // Stalled: the oldest task has waited, and no worker has taken a task meanwhile (workers
     // kept busy by the CPU still take tasks; blocked ones do not). A worker just started has
     // not taken its task yet: the next one waits its own turn.
     auto due = std::max({tasks_.front().since, lastBegin_, lastStart}) + options_.stallAfter;
-    if (waiting_.wait_until(lock, due, [this] { return stopping_; })) return;
+    if (lock.waitUntil(waiting_, due, [this]() SX_REQUIRES(mutex_) { return stopping_; })) return;
     auto now = std::chrono::steady_clock::now();
     if (idle_ < tasks_.size() && tasks_.front().since + options_.stallAfter <= now &&
         lastBegin_ + options_.stallAfter <= now && threads_.size() < options_.maxThreads) {
@@ -246,11 +249,12 @@ void SXElasticPool::work() {
   if (niceness_ != 0) {
     ::setpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)), niceness_);
   }
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   for (;;) {
     ++idle_;
-    bool woken = wake_.wait_for(lock, options_.idleExitAfter,
-                                [this] { return stopping_ || !tasks_.empty(); });
+    bool woken = lock.waitFor(wake_, options_.idleExitAfter, [this]() SX_REQUIRES(mutex_) {
+      return stopping_ || !tasks_.empty();
+    });
     --idle_;
     if (!woken && threads_.size() > options_.eagerThreads) {
       // A worker added for a stall that is over.
@@ -279,12 +283,12 @@ void SXElasticPool::work() {
 }
 
 SXElasticPool::Activity SXElasticPool::activity() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return {tasks_.size() + threads_.size() - idle_ + held_, begun_};
 }
 
 void SXElasticPool::hold(int delta) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   held_ += delta;
 }
 

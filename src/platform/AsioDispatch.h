@@ -10,14 +10,14 @@
 #pragma once
 
 #include <asio/executor_work_guard.hpp>
-#include <chrono>
 #include <asio/io_context.hpp>
+#include <chrono>
 #include <condition_variable>
 #include <deque>
-#include <mutex>
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Dispatch.h"
 
 // A pool of threads. Up to `eagerThreads` start as soon as a task finds every worker busy;
@@ -57,24 +57,23 @@ class SXElasticPool {
   };
   void work();
   void watchForStalls();
-  // REQUIRES(mutex_).
-  void startWorker();
+  void startWorker() SX_REQUIRES(mutex_);
 
   const std::string threadName_;
   const int niceness_;
   const Options options_;
-  mutable std::mutex mutex_;
-  std::condition_variable wake_;      // a task queued, or stopping
-  std::condition_variable waiting_;   // a task waits with no idle worker, or stopping
-  std::deque<Queued> tasks_;          // GUARDED_BY(mutex_)
-  std::vector<std::thread> threads_;  // GUARDED_BY(mutex_)
-  std::thread watcher_;               // GUARDED_BY(mutex_): started when first needed
-  bool watcherAsleep_ = false;        // GUARDED_BY(mutex_): waiting for a task to watch
-  size_t idle_ = 0;                   // GUARDED_BY(mutex_)
-  size_t held_ = 0;                   // GUARDED_BY(mutex_)
-  uint64_t begun_ = 0;                // GUARDED_BY(mutex_)
-  std::chrono::steady_clock::time_point lastBegin_;  // GUARDED_BY(mutex_)
-  bool stopping_ = false;             // GUARDED_BY(mutex_)
+  mutable SXMutex mutex_;
+  std::condition_variable wake_;     // a task queued, or stopping
+  std::condition_variable waiting_;  // a task waits with no idle worker, or stopping
+  std::deque<Queued> tasks_ SX_GUARDED_BY(mutex_);
+  std::vector<std::thread> threads_ SX_GUARDED_BY(mutex_);
+  std::thread watcher_ SX_GUARDED_BY(mutex_);         // started when first needed
+  bool watcherAsleep_ SX_GUARDED_BY(mutex_) = false;  // waiting for a task to watch
+  size_t idle_ SX_GUARDED_BY(mutex_) = 0;
+  size_t held_ SX_GUARDED_BY(mutex_) = 0;
+  uint64_t begun_ SX_GUARDED_BY(mutex_) = 0;
+  std::chrono::steady_clock::time_point lastBegin_ SX_GUARDED_BY(mutex_);
+  bool stopping_ SX_GUARDED_BY(mutex_) = false;
 };
 
 class SXAsioDispatch final : public SXDispatch {

@@ -7,24 +7,25 @@
 #include <exception>
 #include <mutex>
 
+#include "common/SXThreadSafety.h"
 #include "platform/DiscardLog.h"
 
 struct SXCompletionThread::State {
   void run();
 
   std::shared_ptr<SXLogFacility> log;
-  std::mutex mutex;
-  std::condition_variable wake;             // guarded by `mutex`
-  std::deque<std::function<void()>> tasks;  // guarded by `mutex`
-  bool stopping = false;                    // guarded by `mutex`
+  SXMutex mutex;
+  std::condition_variable wake;  // guarded by `mutex`
+  std::deque<std::function<void()>> tasks SX_GUARDED_BY(mutex);
+  bool stopping SX_GUARDED_BY(mutex) = false;
 };
 
 void SXCompletionThread::State::run() {
   for (;;) {
     std::function<void()> task;
     {
-      std::unique_lock lock(mutex);
-      wake.wait(lock, [&] { return stopping || !tasks.empty(); });
+      SXMutexLock lock(mutex);
+      lock.wait(wake, [&]() SX_REQUIRES(mutex) { return stopping || !tasks.empty(); });
       if (tasks.empty()) return;
       task = std::move(tasks.front());
       tasks.pop_front();
@@ -50,7 +51,7 @@ SXCompletionThread::SXCompletionThread(std::string name, std::shared_ptr<SXLogFa
 
 SXCompletionThread::~SXCompletionThread() {
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     state_->stopping = true;
   }
   state_->wake.notify_all();
@@ -63,7 +64,7 @@ SXCompletionThread::~SXCompletionThread() {
 
 void SXCompletionThread::post(std::function<void()> task) {
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     state_->tasks.push_back(std::move(task));
   }
   state_->wake.notify_one();

@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 
+#include "common/SXThreadSafety.h"
 #include "sxreporting/types.h"
 
 class SXDeviceProperties {
@@ -25,6 +26,6 @@ class SXJsonDeviceProperties final : public SXDeviceProperties {
 
  private:
   const std::string path_;
-  mutable std::mutex mutex_;
-  SXValue properties_;  // GUARDED_BY(mutex_)
+  mutable SXMutex mutex_;
+  SXValue properties_ SX_GUARDED_BY(mutex_);
 };

@@ -166,7 +166,7 @@ SXCurlHttpPost::SXCurlHttpPost() = default;
 SXCurlHttpPost::~SXCurlHttpPost() = default;
 
 SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   SXHttpResult result;
   if (cancelled_) {
     result.error = "cancelled";

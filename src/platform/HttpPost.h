@@ -19,6 +19,7 @@
 #include <string>
 #include <string_view>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Clock.h"
 
 struct SXHttpRequest {
@@ -64,7 +65,7 @@ class SXCurlHttpPost final : public SXHttpPost {
 
  private:
   struct Handle;
-  std::mutex mutex_;
-  std::unique_ptr<Handle> handle_;  // guarded by mutex_
+  SXMutex mutex_;
+  std::unique_ptr<Handle> handle_ SX_GUARDED_BY(mutex_);
   std::atomic<bool> cancelled_{false};
 };

@@ -107,7 +107,7 @@ int SXInotifyNotifications::registerDispatch(const std::string& name, int& token
   if (setupError_ != 0) return setupError_;
   int newToken = gNextToken.fetch_add(1);
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     registrations_.emplace(name, Registration{newToken, std::move(queue), std::move(handler)});
   }
   token = newToken;
@@ -187,7 +187,7 @@ SXInotifyNotifications::WatchState SXInotifyNotifications::rewatch() {
 void SXInotifyNotifications::deliver(const std::vector<std::string>& names, bool everything) {
   std::vector<Registration> due;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (everything) {
       for (const auto& [name, registration] : registrations_) due.push_back(registration);
     } else {

@@ -21,6 +21,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Log.h"
 #include "platform/Notify.h"
 
@@ -66,6 +67,6 @@ class SXInotifyNotifications final : public SXNotifications {
   int setupError_ = 0;                        // immutable after construction
   std::thread watcher_;
 
-  std::mutex mutex_;
-  std::multimap<std::string, Registration> registrations_;  // guarded by mutex_
+  SXMutex mutex_;
+  std::multimap<std::string, Registration> registrations_ SX_GUARDED_BY(mutex_);
 };

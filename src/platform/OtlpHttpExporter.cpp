@@ -224,7 +224,7 @@ void SXOtlpHttpExporter::start() {
 void SXOtlpHttpExporter::stop(bool cancelPost) {
   if (!thread_.joinable()) return;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     stopping_ = true;
   }
   wake_.notify_all();
@@ -234,7 +234,7 @@ void SXOtlpHttpExporter::stop(bool cancelPost) {
 
 void SXOtlpHttpExporter::run() {
   pthread_setname_np(pthread_self(), "sxr-otlp");
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   while (!stopping_) {
     lock.unlock();
     milliseconds delay = options_.interval;
@@ -244,6 +244,6 @@ void SXOtlpHttpExporter::run() {
       SXLOG(*log_, nullptr, SXLogLevel::kError, "export pass failed: %@", error.what());
     }
     lock.lock();
-    wake_.wait_for(lock, delay, [this] { return stopping_; });
+    lock.waitFor(wake_, delay, [this]() SX_REQUIRES(mutex_) { return stopping_; });
   }
 }

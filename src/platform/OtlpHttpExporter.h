@@ -48,6 +48,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Clock.h"
 #include "platform/HttpPost.h"
 #include "platform/Log.h"
@@ -125,9 +126,9 @@ class SXOtlpHttpExporter {
   std::optional<std::chrono::milliseconds> retryAfter_;  // asked for by the last answer
   unsigned failures_ = 0;                                // failed attempts in the current streak
 
-  std::mutex mutex_;
+  SXMutex mutex_;
   std::condition_variable wake_;  // with mutex_: stop() wakes the thread from its wait
-  bool stopping_ = false;         // guarded by mutex_
-  bool started_ = false;          // start() and stop() belong to the owner's thread
-  std::thread thread_;            // started and joined under no lock, by the owner only
+  bool stopping_ SX_GUARDED_BY(mutex_) = false;
+  bool started_ = false;  // start() and stop() belong to the owner's thread
+  std::thread thread_;    // started and joined under no lock, by the owner only
 };

@@ -92,7 +92,7 @@ std::optional<std::string> SXOtlpSpoolReader::persistCursor() {
 
 std::optional<std::string> SXOtlpSpoolReader::read(size_t limit, size_t maxBytes,
                                                    std::vector<SXValue>& rows) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (auto failed = ensureOpen()) return failed;
   if (auto failed = persistCursor()) return failed;
   std::vector<SXValue> sizes;
@@ -107,7 +107,7 @@ std::optional<std::string> SXOtlpSpoolReader::read(size_t limit, size_t maxBytes
 }
 
 std::optional<std::string> SXOtlpSpoolReader::advance(int64_t lastMessageId) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (lastMessageId > cursor_) {
     cursor_ = lastMessageId;
     cursorDirty_ = true;
@@ -117,12 +117,12 @@ std::optional<std::string> SXOtlpSpoolReader::advance(int64_t lastMessageId) {
 }
 
 int64_t SXOtlpSpoolReader::cursor() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return cursor_;
 }
 
 uint64_t SXOtlpSpoolReader::backlog() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (!db_) return lastBacklog_;  // opening is left to the exporting thread
   std::vector<SXValue> rows;
   if (!db_->countBeyond.query({cursor_}, rows) && !rows.empty() && rows[0]["n"].is_number()) {

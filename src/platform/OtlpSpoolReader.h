@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/SqliteConnection.h"
 
 class SXOtlpSpoolReader {
@@ -48,17 +49,16 @@ class SXOtlpSpoolReader {
  private:
   struct Db;
 
-  // REQUIRES: mutex_ held.
-  std::optional<std::string> ensureOpen();
-  std::optional<std::string> persistCursor();
-  std::optional<std::string> fail(const std::string& what);
+  std::optional<std::string> ensureOpen() SX_REQUIRES(mutex_);
+  std::optional<std::string> persistCursor() SX_REQUIRES(mutex_);
+  std::optional<std::string> fail(const std::string& what) SX_REQUIRES(mutex_);
 
   const std::string path_;
   const std::chrono::milliseconds busyTimeout_;
-  mutable std::mutex mutex_;
-  std::unique_ptr<Db> db_;            // guarded by mutex_; null while closed
-  int64_t cursor_ = 0;                // guarded by mutex_
-  bool cursorLoaded_ = false;         // guarded by mutex_: read from the database once
-  bool cursorDirty_ = false;          // guarded by mutex_: moved, not yet stored
-  mutable uint64_t lastBacklog_ = 0;  // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::unique_ptr<Db> db_ SX_GUARDED_BY(mutex_);  // null while closed
+  int64_t cursor_ SX_GUARDED_BY(mutex_) = 0;
+  bool cursorLoaded_ SX_GUARDED_BY(mutex_) = false;  // read from the database once
+  bool cursorDirty_ SX_GUARDED_BY(mutex_) = false;   // moved, not yet stored
+  mutable uint64_t lastBacklog_ SX_GUARDED_BY(mutex_) = 0;
 };

@@ -5,6 +5,8 @@
 #include <mutex>
 #include <random>
 
+#include "common/SXThreadSafety.h"
+
 class SXRandom {
  public:
   virtual ~SXRandom() = default;
@@ -16,11 +18,11 @@ class SXSystemRandom final : public SXRandom {
  public:
   uint32_t uniform(uint32_t upperBound) override {
     if (upperBound == 0) return 0;
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     return std::uniform_int_distribution<uint32_t>(0, upperBound - 1)(engine_);
   }
 
  private:
-  std::mutex mutex_;
-  std::mt19937 engine_{std::random_device{}()};
+  SXMutex mutex_;
+  std::mt19937 engine_ SX_GUARDED_BY(mutex_){std::random_device{}()};
 };

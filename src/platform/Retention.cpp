@@ -130,17 +130,17 @@ void SXRetention::scheduleNext(std::chrono::nanoseconds delay) {
 }
 
 void SXRetention::setPolicy(const SXRetentionPolicy& policy) {
-  std::lock_guard lock(policyMutex_);
+  SXMutexLock lock(policyMutex_);
   policy_ = policy;
 }
 
 SXRetentionPolicy SXRetention::policy() const {
-  std::lock_guard lock(policyMutex_);
+  SXMutexLock lock(policyMutex_);
   return policy_;
 }
 
 void SXRetention::runPass() {
-  std::lock_guard pass(passMutex_);
+  SXMutexLock pass(passMutex_);
   const SXRetentionPolicy policy = this->policy();
   for (size_t i = 0; i < kStores && !stopped_; ++i) pruneStore(i, policy.*kPrunedStores[i].limits);
   if (!stopped_) ageOutFiles(policy);

@@ -25,6 +25,7 @@
 #include <mutex>
 #include <string>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Dispatch.h"
 #include "platform/Log.h"
 #include "platform/RetentionPolicy.h"
@@ -71,20 +72,20 @@ class SXRetention : public std::enable_shared_from_this<SXRetention> {
 
   explicit SXRetention(Options options, SXRetentionPolicy policy);
   void scheduleNext(std::chrono::nanoseconds delay);
-  void pruneStore(size_t index, const SXStoreRetention& limits);
+  void pruneStore(size_t index, const SXStoreRetention& limits) SX_REQUIRES(passMutex_);
   std::optional<std::string> pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff,
                                               SXSqliteConnection& db, uint64_t& deleted);
-  void ageOutFiles(const SXRetentionPolicy& policy);
-  void reportError(size_t slot, const std::string& error);
+  void ageOutFiles(const SXRetentionPolicy& policy) SX_REQUIRES(passMutex_);
+  void reportError(size_t slot, const std::string& error) SX_REQUIRES(passMutex_);
 
   Options options_;
   const std::shared_ptr<SXWorkQueue> queue_;
   std::atomic<bool> stopped_{false};
   std::atomic<bool> spoolExported_{false};
-  mutable std::mutex policyMutex_;
-  SXRetentionPolicy policy_;                         // GUARDED_BY(policyMutex_)
-  std::mutex passMutex_;                             // held for a whole pass
-  std::array<std::string, kStores + 1> lastErrors_;  // GUARDED_BY(passMutex_); the last: files
+  mutable SXMutex policyMutex_;
+  SXRetentionPolicy policy_ SX_GUARDED_BY(policyMutex_);
+  SXMutex passMutex_;  // held for a whole pass
+  std::array<std::string, kStores + 1> lastErrors_ SX_GUARDED_BY(passMutex_);  // the last: files
   std::array<std::atomic<uint64_t>, kStores> rowsPruned_{};
   std::array<std::atomic<int64_t>, kStores> storeBytes_{};  // -1 until measured
   std::atomic<uint64_t> summaryFilesRemoved_{0};

@@ -8,6 +8,7 @@
 #include <exception>
 #include <mutex>
 
+#include "common/SXThreadSafety.h"
 #include "platform/DiscardLog.h"
 
 struct SXSqliteBatchWriter::Core {
@@ -24,16 +25,16 @@ struct SXSqliteBatchWriter::Core {
   const Options options;
   const std::shared_ptr<SXLogFacility> log;
 
-  std::mutex mutex;
-  std::condition_variable wake;          // rows queued or stopping; guarded by `mutex`
-  std::condition_variable progress;      // `done` advanced; guarded by `mutex`
-  std::deque<RowProducer> queue;         // guarded by `mutex`
-  uint64_t enqueued = 0;                 // guarded by `mutex`: rows ever accepted
-  uint64_t done = 0;                     // guarded by `mutex`: rows committed or dropped
-  bool full = false;                     // guarded by `mutex`: rows are being refused
-  bool stopping = false;                 // guarded by `mutex`
-  int flushWaiters = 0;                  // guarded by `mutex`: flush() calls waiting
-  std::atomic<uint64_t> writeErrors{0};  // rows lost to a store that failed; any thread reads
+  SXMutex mutex;
+  std::condition_variable wake;      // rows queued or stopping; guarded by `mutex`
+  std::condition_variable progress;  // `done` advanced; guarded by `mutex`
+  std::deque<RowProducer> queue SX_GUARDED_BY(mutex);
+  uint64_t enqueued SX_GUARDED_BY(mutex) = 0;  // rows ever accepted
+  uint64_t done SX_GUARDED_BY(mutex) = 0;      // rows committed or dropped
+  bool full SX_GUARDED_BY(mutex) = false;      // rows are being refused
+  bool stopping SX_GUARDED_BY(mutex) = false;
+  int flushWaiters SX_GUARDED_BY(mutex) = 0;  // flush() calls waiting
+  std::atomic<uint64_t> writeErrors{0};       // rows lost to a store that failed; any thread reads
 
   // Writer thread only. The statement is declared after the connection it belongs to, so it
   // is finalized first.
@@ -114,12 +115,12 @@ void SXSqliteBatchWriter::Core::run() {
   for (;;) {
     std::vector<RowProducer> batch;
     {
-      std::unique_lock lock(mutex);
-      wake.wait(lock, [&] { return stopping || !queue.empty(); });
+      SXMutexLock lock(mutex);
+      lock.wait(wake, [&]() SX_REQUIRES(mutex) { return stopping || !queue.empty(); });
       if (queue.empty()) return;  // stopping, and everything is written
       // Rows come one at a time; waiting a moment for more turns a stream of them into a few
       // large transactions, at a fraction of the cost per row (and of the wake-ups).
-      wake.wait_for(lock, options.linger, [&] {
+      lock.waitFor(wake, options.linger, [&]() SX_REQUIRES(mutex) {
         return stopping || flushWaiters > 0 || queue.size() >= options.maxBatch;
       });
       size_t n = std::min(queue.size(), options.maxBatch);
@@ -132,7 +133,7 @@ void SXSqliteBatchWriter::Core::run() {
     writeBatch(batch);
     batch.clear();  // producers release what they hold before flush() learns of it
     {
-      std::lock_guard lock(mutex);
+      SXMutexLock lock(mutex);
       done += n;
     }
     progress.notify_all();
@@ -151,7 +152,7 @@ SXSqliteBatchWriter::SXSqliteBatchWriter(Options options, std::shared_ptr<SXLogF
 
 SXSqliteBatchWriter::~SXSqliteBatchWriter() {
   {
-    std::lock_guard lock(core_->mutex);
+    SXMutexLock lock(core_->mutex);
     core_->stopping = true;
   }
   core_->wake.notify_all();
@@ -167,7 +168,7 @@ SXSqliteBatchWriter::~SXSqliteBatchWriter() {
 bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
   Core& core = *core_;
   {
-    std::unique_lock lock(core.mutex);
+    SXMutexLock lock(core.mutex);
     if (core.stopping) return false;
     if (core.queue.size() >= core.options.maxQueued) {
       core.writeErrors++;
@@ -191,11 +192,11 @@ bool SXSqliteBatchWriter::enqueue(RowProducer producer) {
 }
 
 void SXSqliteBatchWriter::flush() {
-  std::unique_lock lock(core_->mutex);
+  SXMutexLock lock(core_->mutex);
   uint64_t target = core_->enqueued;
   ++core_->flushWaiters;
   core_->wake.notify_one();  // no lingering for rows that someone waits for
-  core_->progress.wait(lock, [&] { return core_->done >= target; });
+  lock.wait(core_->progress, [&]() SX_REQUIRES(core_->mutex) { return core_->done >= target; });
   --core_->flushWaiters;
 }
 

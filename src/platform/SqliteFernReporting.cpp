@@ -9,6 +9,7 @@
 #include <mutex>
 #include <span>
 
+#include "common/SXThreadSafety.h"
 #include "common/SXValueText.h"
 #include "platform/CompletionThread.h"
 #include "platform/DiscardLog.h"
@@ -97,11 +98,11 @@ class SXSqliteFernReporting::Spool {
 
   void post(std::function<void()> task) { completions_.post(std::move(task)); }
   std::vector<std::string> backends() const {
-    std::lock_guard lock(backendsMutex_);
+    SXMutexLock lock(backendsMutex_);
     return backends_;
   }
   void setBackends(std::vector<std::string> backends) {
-    std::lock_guard lock(backendsMutex_);
+    SXMutexLock lock(backendsMutex_);
     backends_ = std::move(backends);
   }
   uint64_t writeErrors() const { return writeErrors_.load(); }
@@ -129,20 +130,20 @@ class SXSqliteFernReporting::Spool {
     const SXSqliteRow* row;
     int64_t* rowId;
     std::optional<std::string> result;  // written by the committer before `done`
-    bool done = false;                  // guarded by mutex_
+    bool done = false;                  // under the spool's mutex_
   };
 
   // Holds the connection for one caller that is not committing rows.
   class Exclusive {
    public:
     explicit Exclusive(Spool& spool) : spool_(spool) {
-      std::unique_lock lock(spool_.mutex_);
-      spool_.idle_.wait(lock, [&] { return !spool_.busy_; });
+      SXMutexLock lock(spool_.mutex_);
+      lock.wait(spool_.idle_, [&]() SX_REQUIRES(spool_.mutex_) { return !spool_.busy_; });
       spool_.busy_ = true;
     }
     ~Exclusive() {
       {
-        std::lock_guard lock(spool_.mutex_);
+        SXMutexLock lock(spool_.mutex_);
         spool_.busy_ = false;
       }
       spool_.idle_.notify_all();
@@ -156,11 +157,11 @@ class SXSqliteFernReporting::Spool {
   // everything queued so far itself. Returns once every row of `mine` is done.
   void insertAll(std::span<PendingRow* const> mine) {
     if (mine.empty()) return;
-    std::unique_lock lock(mutex_);
+    SXMutexLock lock(mutex_);
     queued_.insert(queued_.end(), mine.begin(), mine.end());
     // Rows queued in one go are taken by one committer, so the last tells of all of them.
     PendingRow& last = *mine.back();
-    idle_.wait(lock, [&] { return last.done || !busy_; });
+    lock.wait(idle_, [&]() SX_REQUIRES(mutex_) { return last.done || !busy_; });
     if (last.done) return;
     busy_ = true;
     std::vector<PendingRow*> batch;
@@ -216,14 +217,14 @@ class SXSqliteFernReporting::Spool {
   }
 
   const std::string path_;
-  mutable std::mutex backendsMutex_;
-  std::vector<std::string> backends_;  // GUARDED_BY(backendsMutex_)
+  mutable SXMutex backendsMutex_;
+  std::vector<std::string> backends_ SX_GUARDED_BY(backendsMutex_);
   const std::shared_ptr<SXLogFacility> log_;
   const std::chrono::milliseconds busyTimeout_;
-  std::mutex mutex_;
-  std::condition_variable idle_;     // busy_ cleared or rows done; guarded by mutex_
-  std::vector<PendingRow*> queued_;  // guarded by mutex_: rows waiting for a transaction
-  bool busy_ = false;                // guarded by mutex_: a thread owns the connection
+  SXMutex mutex_;
+  std::condition_variable idle_;  // busy_ cleared or rows done; guarded by mutex_
+  std::vector<PendingRow*> queued_ SX_GUARDED_BY(mutex_);  // rows waiting for a transaction
+  bool busy_ SX_GUARDED_BY(mutex_) = false;                // a thread owns the connection
   // Owned by the thread that set busy_ (or the constructor, before the spool is shared).
   std::unique_ptr<SXSqliteConnection> db_;
   SXSqliteStatement insert_[kKinds];

@@ -58,7 +58,7 @@ SXStderrLog::SXStderrLog(std::string_view levels, Output output) : output_(outpu
 SXStderrLog::~SXStderrLog() {
   std::thread writer;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     stopping_ = true;
     writer.swap(writer_);
   }
@@ -123,8 +123,10 @@ void SXStderrLog::write(const SXLogScope* scope, SXLogLevel level, std::string_v
   char prefix[8] = "";
   if (output_ != Output::kPlain) std::snprintf(prefix, sizeof prefix, "<%d>", priority);
   size_t size = std::strlen(prefix) + line.size() + 1;
-  std::unique_lock lock(mutex_);
-  written_.wait(lock, [this] { return waiting_.size() < kMaxWaitingBytes || stopping_; });
+  SXMutexLock lock(mutex_);
+  lock.wait(written_, [this]() SX_REQUIRES(mutex_) {
+    return waiting_.size() < kMaxWaitingBytes || stopping_;
+  });
   if (stopping_) {  // the writer is gone or going: write it ourselves, after what it had
     lock.unlock();
     WriteAll(STDERR_FILENO, (prefix + std::string(line)) += '\n');
@@ -144,13 +146,13 @@ void SXStderrLog::write(const SXLogScope* scope, SXLogLevel level, std::string_v
 }
 
 void SXStderrLog::writeWaiting() {
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   for (;;) {
-    wake_.wait(lock, [this] { return stopping_ || !waiting_.empty(); });
+    lock.wait(wake_, [this]() SX_REQUIRES(mutex_) { return stopping_ || !waiting_.empty(); });
     if (waiting_.empty()) return;  // stopping, and everything is out
     // A line seldom comes alone: waiting a moment for the rest of a burst saves a wake-up
     // and a write per line.
-    wake_.wait_for(lock, kLinger, [this] {
+    lock.waitFor(wake_, kLinger, [this]() SX_REQUIRES(mutex_) {
       return stopping_ || flushWaiters_ > 0 || waiting_.size() >= kBatchBytes;
     });
     std::string batch;
@@ -165,10 +167,11 @@ void SXStderrLog::writeWaiting() {
 }
 
 void SXStderrLog::flush() {
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   uint64_t target = linesQueued_;
   ++flushWaiters_;
   wake_.notify_one();  // no lingering for lines someone waits for
-  written_.wait(lock, [&] { return linesWritten_ >= target || !writer_.joinable(); });
+  lock.wait(written_,
+            [&]() SX_REQUIRES(mutex_) { return linesWritten_ >= target || !writer_.joinable(); });
   --flushWaiters_;
 }

@@ -21,6 +21,7 @@
 #include <string>
 #include <thread>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Log.h"
 
 class SXStderrLog final : public SXLogFacility {
@@ -53,13 +54,13 @@ class SXStderrLog final : public SXLogFacility {
 
   std::map<std::string, int> levels_;  // immutable after construction
   const Output output_;
-  std::mutex mutex_;
+  SXMutex mutex_;
   std::condition_variable wake_;     // lines waiting, or stopping
   std::condition_variable written_;  // a batch is out
-  std::string waiting_;              // GUARDED_BY(mutex_)
-  uint64_t linesQueued_ = 0;         // GUARDED_BY(mutex_)
-  uint64_t linesWritten_ = 0;        // GUARDED_BY(mutex_)
-  int flushWaiters_ = 0;             // GUARDED_BY(mutex_)
-  bool stopping_ = false;            // GUARDED_BY(mutex_)
-  std::thread writer_;               // GUARDED_BY(mutex_): started by the first line
+  std::string waiting_ SX_GUARDED_BY(mutex_);
+  uint64_t linesQueued_ SX_GUARDED_BY(mutex_) = 0;
+  uint64_t linesWritten_ SX_GUARDED_BY(mutex_) = 0;
+  int flushWaiters_ SX_GUARDED_BY(mutex_) = 0;
+  bool stopping_ SX_GUARDED_BY(mutex_) = false;
+  std::thread writer_ SX_GUARDED_BY(mutex_);  // started by the first line
 };

@@ -68,7 +68,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   void send(uint32_t msgid, const SXValue& error, const SXValue& result) {
     bool startWriting = false;
     {
-      std::lock_guard lock(outMutex_);
+      SXMutexLock lock(outMutex_);
       if (closed_) return;
       size_t before = outPending_.size();
       RpcEncodeResponse(outPending_, msgid, error, result);
@@ -86,7 +86,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     if (ended_) return;
     ended_ = true;
     {
-      std::lock_guard lock(outMutex_);
+      SXMutexLock lock(outMutex_);
       closed_ = true;
     }
     std::error_code ignored;
@@ -166,8 +166,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
         }
       }
       paused_.store(true);
-      if (armWakesAndMustWait() ||
-          (dispatched == Dispatched::kDrained && readAllowance() == 0)) {
+      if (armWakesAndMustWait() || (dispatched == Dispatched::kDrained && readAllowance() == 0)) {
         listener_.connectionPaused();
         return;
       }
@@ -325,7 +324,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
 
   void write() {
     {
-      std::lock_guard lock(outMutex_);
+      SXMutexLock lock(outMutex_);
       if (closed_ || outPending_.empty()) {
         writing_ = false;
         return;
@@ -375,11 +374,11 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   std::atomic<bool> markerPending_{false};    // a marker is on the request queue
   std::atomic<bool> paused_{false};           // set by the I/O thread, read by markers
   std::atomic<size_t> pendingReplyBytes_{0};  // outPending_ plus outFlight_
-  std::mutex outMutex_;
-  std::string outPending_;  // GUARDED_BY(outMutex_)
-  bool writing_ = false;    // GUARDED_BY(outMutex_)
-  bool closed_ = false;     // GUARDED_BY(outMutex_)
-  std::string outFlight_;   // I/O thread only, while a write is in flight
+  SXMutex outMutex_;
+  std::string outPending_ SX_GUARDED_BY(outMutex_);
+  bool writing_ SX_GUARDED_BY(outMutex_) = false;
+  bool closed_ SX_GUARDED_BY(outMutex_) = false;
+  std::string outFlight_;  // I/O thread only, while a write is in flight
 };
 
 SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLogFacility> log)
@@ -390,7 +389,7 @@ SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLo
       wakeTarget_(std::make_shared<WakeTarget>()) {
   wakeTarget_->listener = this;
   pool_->setWaker([target = wakeTarget_] {
-    std::lock_guard lock(target->mutex);
+    SXMutexLock lock(target->mutex);
     if (auto* listener = target->listener) {
       asio::post(listener->io_, [listener] { listener->resumePaused(); });
     }
@@ -398,7 +397,7 @@ SXUnixSocketListener::SXUnixSocketListener(Options options, std::shared_ptr<SXLo
 }
 
 SXUnixSocketListener::~SXUnixSocketListener() {
-  std::lock_guard lock(wakeTarget_->mutex);
+  SXMutexLock lock(wakeTarget_->mutex);
   wakeTarget_->listener = nullptr;
 }
 

@@ -35,6 +35,7 @@
 #include <set>
 
 #include "common/RpcCodec.h"
+#include "common/SXThreadSafety.h"
 #include "platform/Dispatch.h"
 #include "platform/Ipc.h"
 #include "platform/Log.h"
@@ -99,8 +100,8 @@ class SXUnixSocketListener final : public SXIpcListener {
 
   // The pool's waker may run on any thread after the listener is gone.
   struct WakeTarget {
-    std::mutex mutex;
-    SXUnixSocketListener* listener = nullptr;  // GUARDED_BY(mutex)
+    SXMutex mutex;
+    SXUnixSocketListener* listener SX_GUARDED_BY(mutex) = nullptr;
   };
 
   Options options_;

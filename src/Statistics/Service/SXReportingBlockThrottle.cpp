@@ -11,6 +11,7 @@
 #include <unordered_set>
 
 #include "SXReportingUtility.h"
+#include "common/SXThreadSafety.h"
 
 namespace {
 
@@ -184,19 +185,19 @@ struct SXReportingBlockThrottleSchedule::State : std::enable_shared_from_this<St
   // the wake-up holding the current token acts; the others were replaced by a re-arm.
   void step(uint64_t token);
   // Makes a wake-up at `due` the only one that acts and returns the call that queues it, to be
-  // made once `mutex` is released. REQUIRES: mutex held.
-  std::function<void()> wakeAtLocked(SXDate due);
+  // made once `mutex` is released.
+  std::function<void()> wakeAtLocked(SXDate due) SX_REQUIRES(mutex);
 
   const std::shared_ptr<SXDispatch> dispatch;
   const std::shared_ptr<SXWorkQueue> queue;
   const std::shared_ptr<SXClock> clock;
 
-  std::mutex mutex;
-  std::vector<std::shared_ptr<SXReportingBlockThrottleTimer>> timers;  // guarded by mutex
-  std::function<void()> done;    // guarded by mutex; set while a run is in progress
-  bool running = false;          // guarded by mutex
-  uint64_t wakeToken = 0;        // guarded by mutex
-  std::optional<SXDate> wakeAt;  // guarded by mutex; empty while a step fires timers
+  SXMutex mutex;
+  std::vector<std::shared_ptr<SXReportingBlockThrottleTimer>> timers SX_GUARDED_BY(mutex);
+  std::function<void()> done SX_GUARDED_BY(mutex);  // set while a run is in progress
+  bool running SX_GUARDED_BY(mutex) = false;
+  uint64_t wakeToken SX_GUARDED_BY(mutex) = 0;
+  std::optional<SXDate> wakeAt SX_GUARDED_BY(mutex);  // empty while a step fires timers
 };
 
 std::function<void()> SXReportingBlockThrottleSchedule::State::wakeAtLocked(SXDate due) {
@@ -210,7 +211,7 @@ std::function<void()> SXReportingBlockThrottleSchedule::State::wakeAtLocked(SXDa
 }
 
 void SXReportingBlockThrottleSchedule::State::step(uint64_t token) {
-  std::unique_lock lock(mutex);
+  SXMutexLock lock(mutex);
   if (token != wakeToken) return;
   wakeAt.reset();  // a re-arm while timers fire queues a fresh wake-up
   for (;;) {
@@ -250,14 +251,14 @@ SXReportingBlockThrottleSchedule::SXReportingBlockThrottleSchedule(
 
 void SXReportingBlockThrottleSchedule::add(std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
   if (!timer) return;
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->timers.push_back(std::move(timer));
 }
 
 void SXReportingBlockThrottleSchedule::run(std::function<void()> done) {
   uint64_t token;
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     state_->running = true;
     state_->done = std::move(done);
     token = ++state_->wakeToken;
@@ -274,7 +275,7 @@ SXReportingBlockThrottleTimer::SXReportingBlockThrottleTimer(
 void SXReportingBlockThrottleTimer::setFireDate(SXDate due) {
   std::function<void()> queueWakeUp;
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     due_ = due;
     // Only an earlier time needs a wake-up of its own: a wake-up that comes too early finds
     // nothing due and waits again for the earliest time.
@@ -286,14 +287,14 @@ void SXReportingBlockThrottleTimer::setFireDate(SXDate due) {
 }
 
 void SXReportingBlockThrottleTimer::invalidate() {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   valid_ = false;
 }
 
 // ---- SXReportingBlockThrottleTimerWrapper ----
 
 std::function<void()> SXReportingBlockThrottleTimerWrapper::block() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return block_;
 }
 
@@ -304,18 +305,18 @@ void SXReportingBlockThrottleTimerWrapper::setBlock(std::function<void()> block)
 
 std::function<void()> SXReportingBlockThrottleTimerWrapper::exchangeBlock(
     std::function<void()> block) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return std::exchange(block_, std::move(block));
 }
 
 std::shared_ptr<SXReportingBlockThrottleTimer> SXReportingBlockThrottleTimerWrapper::timer() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return timer_;
 }
 
 void SXReportingBlockThrottleTimerWrapper::setTimer(
     std::shared_ptr<SXReportingBlockThrottleTimer> timer) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   timer_ = std::move(timer);
 }
 
@@ -393,7 +394,7 @@ void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int6
   std::string key = buildMessageKey(message, reporterID, category, type);
   double sleepTime = determineSleepTime(message, *log_);
 
-  std::unique_lock inFlight(inFlightMutex_);
+  SXMutexLock inFlight(inFlightMutex_);
   if (auto it = timersInFlight_.find(key); it != timersInFlight_.end()) {
     SXLOG(*log_, verboseScope_.get(), SXLogLevel::kDebug, "Dropping duplicate message for %@", key);
     it->second->sleepFor(sleepTime);
@@ -416,7 +417,7 @@ void SXReportingBlockThrottle::addMessageBlock(std::function<void()> block, int6
   timersInFlight_.emplace(key, std::move(wrapper));
   inFlight.unlock();
 
-  std::lock_guard unscheduled(unscheduledMutex_);
+  SXMutexLock unscheduled(unscheduledMutex_);
   unscheduledTimerKeys_.push_back(std::move(key));
 }
 
@@ -427,7 +428,7 @@ void SXReportingBlockThrottle::fire(
     // Read under the in-flight lock so that a duplicate's re-arm and replacement, which form one
     // critical section, are seen whole: a duplicate whose re-arm makes the entry due at once
     // must have its own operation sent, not the one it replaces.
-    std::lock_guard inFlight(inFlightMutex_);
+    SXMutexLock inFlight(inFlightMutex_);
     block = entry->block();
   }
   if (block) {
@@ -441,7 +442,7 @@ void SXReportingBlockThrottle::fire(
     }
   }
   {
-    std::lock_guard inFlight(inFlightMutex_);
+    SXMutexLock inFlight(inFlightMutex_);
     if (auto timer = entry->timer()) timer->invalidate();
     auto it = timersInFlight_.find(key);
     if (it != timersInFlight_.end() && it->second == entry) timersInFlight_.erase(it);
@@ -470,9 +471,9 @@ void SXReportingBlockThrottle::idleSleep() {
 }
 
 void SXReportingBlockThrottle::scheduleUnscheduledTimers() {
-  std::lock_guard unscheduled(unscheduledMutex_);
+  SXMutexLock unscheduled(unscheduledMutex_);
   {
-    std::lock_guard inFlight(inFlightMutex_);
+    SXMutexLock inFlight(inFlightMutex_);
     for (const auto& key : unscheduledTimerKeys_) {
       auto it = timersInFlight_.find(key);
       if (it != timersInFlight_.end()) schedule_.add(it->second->timer());
@@ -489,14 +490,14 @@ void SXReportingBlockThrottle::waitForCompletion() {
   // The time limit is a task of the platform's dispatch, so it runs on the platform clock, and
   // on the concurrent queue, so it ends the wait even when the caller is a send holding up the
   // worker.
-  auto expired = std::make_shared<bool>(false);  // guarded by inFlightMutex_
+  auto expired = std::make_shared<bool>(false);  // under inFlightMutex_
   dispatch_->after(std::chrono::seconds(kCompletionWaitSeconds),
                    dispatch_->lowPriorityConcurrentQueue(),
                    [weakThrottle = weak_from_this(), expired] {
                      auto throttle = weakThrottle.lock();
                      if (!throttle) return;
                      {
-                       std::lock_guard lock(throttle->inFlightMutex_);
+                       SXMutexLock lock(throttle->inFlightMutex_);
                        *expired = true;
                      }
                      throttle->inFlightChanged_.notify_all();
@@ -505,8 +506,9 @@ void SXReportingBlockThrottle::waitForCompletion() {
         "Waiting up to %u seconds for blockThrottle queue to be empty.", kCompletionWaitSeconds);
   size_t pending;
   {
-    std::unique_lock lock(inFlightMutex_);
-    inFlightChanged_.wait(lock, [&] { return timersInFlight_.empty() || *expired; });
+    SXMutexLock lock(inFlightMutex_);
+    lock.wait(inFlightChanged_,
+              [&]() SX_REQUIRES(inFlightMutex_) { return timersInFlight_.empty() || *expired; });
     pending = timersInFlight_.size();
   }
   if (pending) {
@@ -517,11 +519,11 @@ void SXReportingBlockThrottle::waitForCompletion() {
 }
 
 size_t SXReportingBlockThrottle::timersInFlightCount() const {
-  std::lock_guard lock(inFlightMutex_);
+  SXMutexLock lock(inFlightMutex_);
   return timersInFlight_.size();
 }
 
 size_t SXReportingBlockThrottle::unscheduledTimerKeysCount() const {
-  std::lock_guard lock(unscheduledMutex_);
+  SXMutexLock lock(unscheduledMutex_);
   return unscheduledTimerKeys_.size();
 }

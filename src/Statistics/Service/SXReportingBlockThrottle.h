@@ -27,6 +27,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Clock.h"
 #include "platform/Dispatch.h"
 #include "platform/Log.h"
@@ -78,8 +79,8 @@ class SXReportingBlockThrottleTimer {
  private:
   friend struct SXReportingBlockThrottleSchedule::State;
   std::shared_ptr<SXReportingBlockThrottleSchedule::State> state_;
-  SXDate due_;                          // guarded by state_->mutex
-  bool valid_ = true;                   // guarded by state_->mutex
+  SXDate due_;                          // under the schedule's mutex
+  bool valid_ = true;                   // under the schedule's mutex
   const std::function<void()> action_;  // run by the worker only
 };
 
@@ -102,9 +103,9 @@ class SXReportingBlockThrottleTimerWrapper {
 
  private:
   const std::shared_ptr<SXClock> clock_;
-  mutable std::mutex mutex_;
-  std::function<void()> block_;                           // guarded by mutex_
-  std::shared_ptr<SXReportingBlockThrottleTimer> timer_;  // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::function<void()> block_ SX_GUARDED_BY(mutex_);
+  std::shared_ptr<SXReportingBlockThrottleTimer> timer_ SX_GUARDED_BY(mutex_);
 };
 
 class SXReportingBlockThrottle : public std::enable_shared_from_this<SXReportingBlockThrottle> {
@@ -173,13 +174,13 @@ class SXReportingBlockThrottle : public std::enable_shared_from_this<SXReporting
   const std::shared_ptr<const SXLogScope> verboseScope_;
   const std::shared_ptr<SXWorkQueue> queue_;  // the worker
 
-  mutable std::mutex inFlightMutex_;
+  mutable SXMutex inFlightMutex_;
   std::unordered_map<std::string, std::shared_ptr<SXReportingBlockThrottleTimerWrapper>>
-      timersInFlight_;                       // guarded by inFlightMutex_
+      timersInFlight_ SX_GUARDED_BY(inFlightMutex_);
   std::condition_variable inFlightChanged_;  // with inFlightMutex_: emptied, or a wait timed out
 
-  mutable std::mutex unscheduledMutex_;
-  std::vector<std::string> unscheduledTimerKeys_;  // guarded by unscheduledMutex_
+  mutable SXMutex unscheduledMutex_;
+  std::vector<std::string> unscheduledTimerKeys_ SX_GUARDED_BY(unscheduledMutex_);
 
   SXReportingBlockThrottleSchedule schedule_;  // run by the worker only; timers refer to it
 

@@ -20,9 +20,7 @@ constexpr SXReportingCategory kDriverStatisticsCategory = 9;
 // "(a, b, ...)": how a list of sessions prints.
 class SessionListText {
  public:
-  void add(std::string_view description) {
-    (text_ += text_.size() > 1 ? ", " : "") += description;
-  }
+  void add(std::string_view description) { (text_ += text_.size() > 1 ? ", " : "") += description; }
   // The finished list; called once.
   std::string_view finish() {
     text_ += ')';
@@ -393,21 +391,21 @@ void SXReportingServerInstance::handleConnectionError() {
 }
 
 std::optional<SXDate> SXReportingServerInstance::clientStartDate() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return clientStartDate_;
 }
 
 void SXReportingServerInstance::setClientStartDate(std::optional<SXDate> date) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   clientStartDate_ = date;
 }
 
 std::optional<std::string> SXReportingServerInstance::clientProcessName() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return clientProcessName_;
 }
 
 void SXReportingServerInstance::setClientProcessName(std::optional<std::string> name) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   clientProcessName_ = std::move(name);
 }

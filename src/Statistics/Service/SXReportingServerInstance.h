@@ -16,6 +16,7 @@
 #include "SXReportingErrorLines.h"
 #include "SXReportingServiceProtocol.h"
 #include "SXReportingSession.h"
+#include "common/SXThreadSafety.h"
 #include "platform/ByteBudget.h"
 
 class SXReportingServerInstance final
@@ -94,7 +95,7 @@ class SXReportingServerInstance final
   // Standalone sends of this client's sessions waiting for their delay.
   const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;
   SXReportingErrorLines errorLines_;  // server queue only
-  mutable std::mutex mutex_;
-  std::optional<SXDate> clientStartDate_;         // GUARDED_BY(mutex_)
-  std::optional<std::string> clientProcessName_;  // GUARDED_BY(mutex_)
+  mutable SXMutex mutex_;
+  std::optional<SXDate> clientStartDate_ SX_GUARDED_BY(mutex_);
+  std::optional<std::string> clientProcessName_ SX_GUARDED_BY(mutex_);
 };

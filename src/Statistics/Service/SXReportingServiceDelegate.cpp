@@ -104,7 +104,7 @@ void SXReportingServiceDelegate::defaultsChanged(int token) {
   SXLOG(log(), scope(), SXLogLevel::kDefault, "re-reading sonex defaults");
   SXValue defaults = SXReportingDefaults(*environment_->platform().preferences);
   {
-    std::lock_guard lock(defaultsMutex_);
+    SXMutexLock lock(defaultsMutex_);
     defaults_ = defaults;
   }
   SXLOG(log(), scope(), SXLogLevel::kInfo, "defaults %@", defaults);
@@ -119,12 +119,12 @@ void SXReportingServiceDelegate::defaultsChanged(int token) {
 }
 
 std::optional<SXValue> SXReportingServiceDelegate::getDefaults() {
-  std::lock_guard lock(defaultsMutex_);
+  SXMutexLock lock(defaultsMutex_);
   return defaults_;
 }
 
 bool SXReportingServiceDelegate::admitConnection(int32_t pid) {
-  std::lock_guard lock(connectionsMutex_);
+  SXMutexLock lock(connectionsMutex_);
   uint64_t& live = connectionsPerProcess_[pid];
   uint64_t limit = environment_->limits().maxConnectionsPerClient;
   if (live < limit) {
@@ -141,7 +141,7 @@ bool SXReportingServiceDelegate::admitConnection(int32_t pid) {
 }
 
 void SXReportingServiceDelegate::connectionEnded(int32_t pid) {
-  std::lock_guard lock(connectionsMutex_);
+  SXMutexLock lock(connectionsMutex_);
   auto it = connectionsPerProcess_.find(pid);
   if (it != connectionsPerProcess_.end() && --it->second == 0) connectionsPerProcess_.erase(it);
 }
@@ -153,7 +153,7 @@ bool SXReportingServiceDelegate::shouldAcceptNewConnection(
   SXLOG(log(), scope(), SXLogLevel::kDefault, "newConnection: %@", connection->description());
   std::shared_ptr<SXReportingServerInstance> instance;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     instance = SXReportingServerInstance::initWithPID(environment_, pid, weak_from_this(),
                                                       connection->budget());
     connection->setExportedObject(std::make_shared<SXReportingServiceExport>(
@@ -192,7 +192,7 @@ void SXReportingServiceDelegate::registerClient(
 
 std::shared_ptr<SXReportingSession> SXReportingServiceDelegate::findReportingSessionForID(
     int64_t reporterID, SXReportingErrorLines* errorLines) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (reporterID == 0 || !reportingEnabled_.load()) return nullptr;
   for (const auto& client : clients_) {
     const auto& sessions = client->clientReportingSessionMap();
@@ -236,19 +236,19 @@ SXValue SXReportingServiceDelegate::statusSnapshot() const {
                     {"reportingEnabled", reportingEnabled_.load()},
                     {"counters", countersValue()},
                     {"gauges", gaugesValue()}};
-  std::lock_guard lock(defaultsMutex_);
+  SXMutexLock lock(defaultsMutex_);
   status["defaults"] = defaults_ ? *defaults_ : SXValue();
   return status;
 }
 
 void SXReportingServiceDelegate::setStatusProviders(SXReportingStatusProviders providers) {
-  std::lock_guard lock(providersMutex_);
+  SXMutexLock lock(providersMutex_);
   providers_ = std::move(providers);
 }
 
 SXValue SXReportingServiceDelegate::countersValue() const {
   SXValue counters = environment_->counters().toValue();
-  std::lock_guard lock(providersMutex_);
+  SXMutexLock lock(providersMutex_);
   const auto& p = providers_;
   counters["guardrail_dropped"]["requests_backpressure"] =
       p.requestsBackpressure ? p.requestsBackpressure() : 0;
@@ -267,7 +267,7 @@ SXValue SXReportingServiceDelegate::gaugesValue() const {
   SXValue gauges = {{"sessions_live", environment_->counters().sessionsLive()},
                     {"clients_live", static_cast<uint64_t>(clients_.size())},
                     {"aggregate_bytes", environment_->counters().aggregateBytes()}};
-  std::lock_guard lock(providersMutex_);
+  SXMutexLock lock(providersMutex_);
   if (providers_.inflightBytes) gauges["inflight_bytes"] = providers_.inflightBytes();
   if (providers_.spoolBacklog) gauges["spool_backlog"] = providers_.spoolBacklog();
   if (providers_.retentionGauges) gauges.update(providers_.retentionGauges());

@@ -18,6 +18,7 @@
 #include "SXReportingEnvironment.h"
 #include "SXReportingServerInstance.h"
 #include "SXReportingServiceProtocol.h"
+#include "common/SXThreadSafety.h"
 #include "platform/Ipc.h"
 
 // The defaults dictionary read from the preferences domain "com.vendra.sonex".
@@ -89,15 +90,15 @@ class SXReportingServiceDelegate final
   const SXLogScope* scope() const { return environment_->serviceLogScope(); }
 
   const std::shared_ptr<SXReportingEnvironment> environment_;
-  std::mutex mutex_;  // the delegate's own lock
+  SXMutex mutex_;  // the delegate's own lock
   std::atomic<bool> reportingEnabled_{true};
   SXReportingClientList clients_;  // server queue only
   std::unique_ptr<SXReportingDriverUtility> driverUtility_;
-  mutable std::mutex defaultsMutex_;
-  std::optional<SXValue> defaults_;  // GUARDED_BY(defaultsMutex_)
-  std::mutex connectionsMutex_;
-  std::map<int32_t, uint64_t> connectionsPerProcess_;  // GUARDED_BY(connectionsMutex_)
-  SXReportingErrorLines refusalLines_;                 // GUARDED_BY(connectionsMutex_)
-  mutable std::mutex providersMutex_;
-  SXReportingStatusProviders providers_;  // GUARDED_BY(providersMutex_)
+  mutable SXMutex defaultsMutex_;
+  std::optional<SXValue> defaults_ SX_GUARDED_BY(defaultsMutex_);
+  SXMutex connectionsMutex_;
+  std::map<int32_t, uint64_t> connectionsPerProcess_ SX_GUARDED_BY(connectionsMutex_);
+  SXReportingErrorLines refusalLines_ SX_GUARDED_BY(connectionsMutex_);
+  mutable SXMutex providersMutex_;
+  SXReportingStatusProviders providers_ SX_GUARDED_BY(providersMutex_);
 };

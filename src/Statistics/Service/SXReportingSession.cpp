@@ -5,6 +5,7 @@
 
 #include "SXReportingUtility.h"
 #include "common/SXServiceTypes.h"
+#include "common/SXThreadSafety.h"
 
 namespace {
 
@@ -28,10 +29,12 @@ void mergeInto(SXValue& target, const SXValue* source) {
 // What the setup task, the configuration completion and the wait's timer share. Any of them
 // may outlive the others.
 struct SXReportingSession::SetupState {
-  std::mutex mutex;
-  bool backendsFound = false;  // GUARDED_BY(mutex)
+  explicit SetupState(bool found) : backendsFound(found) {}
+
+  SXMutex mutex;
+  bool backendsFound SX_GUARDED_BY(mutex);
   // The session's queue is suspended until the backends come or the wait times out.
-  bool waiting = false;  // GUARDED_BY(mutex)
+  bool waiting SX_GUARDED_BY(mutex) = false;
 };
 
 bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
@@ -112,7 +115,7 @@ std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
 }
 
 std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (!caller_ && !rewritten_) {
     // Asked for after the dictionaries were released: the text is a dump, so it parses.
     return std::make_shared<const SXValue>(SXValue::parse(*text_));
@@ -142,17 +145,17 @@ const std::string& SXReportingMessagePayload::textLocked() {
 }
 
 std::string SXReportingMessagePayload::text() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return textLocked();
 }
 
 void SXReportingMessagePayload::keepOnlyText() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   textLocked();
 }
 
 std::optional<std::string> SXReportingMessagePayload::callerDictionaryText() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (rewritesLocked() || !callerIsDictionary_) return std::nullopt;
   // The dictionaries stay: a standalone send of a session not started reads them.
   return makeTextLocked();
@@ -196,19 +199,19 @@ void SXReportingSession::setServiceType(SXReportingServiceType serviceType) {
   serviceType_.store(serviceType);
   std::string name = SXServiceTypeName(serviceType);
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     serviceName_ = name;
   }
   SXLOG(log(), scope(), SXLogLevel::kInfo, "setting service type %@", name);
 }
 
 void SXReportingSession::setConfiguration(const SXValue* configuration) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   mergeInto(userInfo_, configuration);
 }
 
 void SXReportingSession::updateDefaults(const SXValue* defaults) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   mergeInto(userInfo_, defaults);
 }
 
@@ -223,8 +226,7 @@ void SXReportingSession::start() {
   environment_->tracer().trace(kTraceStarted);
   if (shouldReportOrientation()) registerOrientationCallbacks();
 
-  auto setup = std::make_shared<SetupState>();
-  setup->backendsFound = fernReportingSessionStarted();
+  auto setup = std::make_shared<SetupState>(fernReportingSessionStarted());
   queueTask([self = shared_from_this(), userInfo = this->userInfo(), name = serviceName(), setup] {
     self->runSetupTask(userInfo, name, setup);
   });
@@ -248,7 +250,7 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
 
   auto fernSession = fern.openSession(sessionInfo, fernUserInfo, SXValue::array());
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     fernReportingAgentToken_ = token;
     fernReportingSession_ = fernSession;
   }
@@ -264,7 +266,7 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
             return;
           }
           SXLOG_IN(fn, log, scope, SXLogLevel::kDefault, "List of backends %@", SXValue(*backends));
-          std::lock_guard lock(setup->mutex);
+          SXMutexLock lock(setup->mutex);
           setup->backendsFound = true;
           if (!setup->waiting) return;  // not waiting yet, or the wait is over
           setup->waiting = false;
@@ -279,7 +281,7 @@ void SXReportingSession::runSetupTask(SXValue userInfo, std::string serviceName,
 // resumes it or the time-out does, whichever comes first; tasks queued meanwhile run after.
 void SXReportingSession::awaitBackends(const std::shared_ptr<SetupState>& setup) {
   {
-    std::lock_guard lock(setup->mutex);
+    SXMutexLock lock(setup->mutex);
     if (setup->backendsFound) return;
     SXLOG_IN(kWaitFunction, log(), scope(), SXLogLevel::kDefault, "%@",
              std::string(kWaitingForBackends));
@@ -295,14 +297,14 @@ void SXReportingSession::awaitBackends(const std::shared_ptr<SetupState>& setup)
 
 void SXReportingSession::backendWaitTimedOut(SetupState& setup) {
   {
-    std::lock_guard lock(setup.mutex);
+    SXMutexLock lock(setup.mutex);
     if (!setup.waiting) return;  // the backends came in time
     setup.waiting = false;
     SXLOG_IN(kWaitFunction, log(), scope(), SXLogLevel::kError, "%@", std::string(kNoBackendFound));
   }
   // Backends reported from now on set the flag and change nothing else.
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     fernReportingSession_ = nullptr;
   }
   fernReportingSessionStarted_.store(false);
@@ -323,7 +325,7 @@ void SXReportingSession::stop() {
   }
   queueTask([self = shared_from_this()] { self->runTeardownTask(); });
   if (auto aggregate = aggregate_.load()) {
-    std::lock_guard lock(aggregate->mutex);
+    SXMutexLock lock(aggregate->mutex);
     aggregate_.store(nullptr);
   } else {
     aggregate_.store(nullptr);
@@ -332,7 +334,7 @@ void SXReportingSession::stop() {
 
   Reply<bool> complete;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     complete = std::move(transactionCompleteBlock_);
     transactionCompleteBlock_ = nullptr;
   }
@@ -343,7 +345,7 @@ void SXReportingSession::runTeardownTask() {
   if (serviceType() == kTestServiceType) return;
   std::shared_ptr<FernReportingSession> fernSession;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     fernSession = std::exchange(fernReportingSession_, nullptr);
   }
   if (!fernSession) return;
@@ -357,32 +359,32 @@ void SXReportingSession::runTeardownTask() {
 }
 
 std::string SXReportingSession::serviceName() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return serviceName_;
 }
 
 SXValue SXReportingSession::userInfo() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return userInfo_;
 }
 
 SXValue SXReportingSession::hostApplicationName() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return SXReportingUtilityHostApplicationName(&userInfo_);
 }
 
 std::optional<SXValue> SXReportingSession::driverSnapShot() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return driverSnapShot_;
 }
 
 void SXReportingSession::setDriverSnapShot(std::optional<SXValue> snapshot) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   driverSnapShot_ = std::move(snapshot);
 }
 
 void SXReportingSession::setTransactionCompleteBlock(Reply<bool> block) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   transactionCompleteBlock_ = std::move(block);
 }
 
@@ -390,28 +392,28 @@ std::vector<SXValue> SXReportingSession::aggregatedPayloadEntries() const {
   std::vector<SXValue> out;
   auto aggregate = aggregate_.load();
   if (!aggregate) return out;
-  std::lock_guard lock(aggregate->mutex);
+  SXMutexLock lock(aggregate->mutex);
   for (const auto& entry : aggregate->entries) out.push_back(entry.toValue());
   return out;
 }
 
 std::optional<std::string> SXReportingSession::orientationCallbackID() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return orientationCallbackID_;
 }
 
 std::optional<SXDate> SXReportingSession::startDate() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return startDate_;
 }
 
 std::shared_ptr<FernReportingSession> SXReportingSession::fernReportingSession() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return fernReportingSession_;
 }
 
 std::shared_ptr<FernSecureHierarchyToken> SXReportingSession::fernReportingAgentToken() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return fernReportingAgentToken_;
 }
 

@@ -16,6 +16,8 @@
 #include <vector>
 
 #include "SXReportingEnvironment.h"
+#include "SXReportingEventSession.h"
+#include "common/SXThreadSafety.h"
 #include "common/SXValueText.h"
 #include "platform/FernReporting.h"
 
@@ -41,21 +43,20 @@ class SXReportingMessagePayload {
   std::optional<std::string> callerDictionaryText();
 
  private:
-  // REQUIRES: mutex_ held. Whether the rewrite changes the caller's payload; made once.
-  bool rewritesLocked();
-  // REQUIRES: mutex_ held.
-  std::shared_ptr<const SXValue> rewrittenLocked();
-  // REQUIRES: mutex_ held. Makes the text once.
-  const std::string& makeTextLocked();
-  // REQUIRES: mutex_ held. Makes the text once and releases the dictionaries.
-  const std::string& textLocked();
+  // Whether the rewrite changes the caller's payload; made once.
+  bool rewritesLocked() SX_REQUIRES(mutex_);
+  std::shared_ptr<const SXValue> rewrittenLocked() SX_REQUIRES(mutex_);
+  // Makes the text once.
+  const std::string& makeTextLocked() SX_REQUIRES(mutex_);
+  // Makes the text once and releases the dictionaries.
+  const std::string& textLocked() SX_REQUIRES(mutex_);
 
-  std::mutex mutex_;
-  std::shared_ptr<const SXValue> caller_;     // GUARDED_BY(mutex_); released with the text
-  std::shared_ptr<const SXValue> rewritten_;  // GUARDED_BY(mutex_); released with the text
-  std::optional<std::string> text_;           // GUARDED_BY(mutex_)
-  std::optional<bool> rewrites_;              // GUARDED_BY(mutex_)
-  bool callerIsDictionary_ = false;           // GUARDED_BY(mutex_); set with rewrites_
+  SXMutex mutex_;
+  std::shared_ptr<const SXValue> caller_ SX_GUARDED_BY(mutex_);     // released with the text
+  std::shared_ptr<const SXValue> rewritten_ SX_GUARDED_BY(mutex_);  // released with the text
+  std::optional<std::string> text_ SX_GUARDED_BY(mutex_);
+  std::optional<bool> rewrites_ SX_GUARDED_BY(mutex_);
+  bool callerIsDictionary_ SX_GUARDED_BY(mutex_) = false;  // set with rewrites_
 };
 
 // One entry of a session's aggregate: a message entry ({message id: rewritten payload}) or
@@ -104,9 +105,9 @@ struct SXReportingAggregate {
     if (counters) counters->aggregateBytesAdded(n);
   }
 
-  std::recursive_mutex mutex;
-  std::vector<SXReportingAggregateEntry> entries;  // GUARDED_BY(mutex)
-  uint64_t dropped = 0;                            // GUARDED_BY(mutex)
+  SXRecursiveMutex mutex;
+  std::vector<SXReportingAggregateEntry> entries SX_GUARDED_BY(mutex);
+  uint64_t dropped SX_GUARDED_BY(mutex) = 0;
   std::atomic<uint64_t> bytes{0};
   SXReportingCounters* const counters;  // the environment's, which outlives every session
 };
@@ -120,7 +121,8 @@ std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload);
 // Whether the rewrite would change `payload`.
 bool SXReportingSessionHasSpacedKeys(const SXValue& payload);
 
-class SXReportingSession : public std::enable_shared_from_this<SXReportingSession> {
+class SXReportingSession : public std::enable_shared_from_this<SXReportingSession>,
+                           public SXReportingEventSession {
  public:
   static constexpr SXReportingServiceType kTestServiceType = 11;
   static constexpr SXReportingCategory kSummaryCategory = 0xFFFFFFFF;
@@ -200,7 +202,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   SXValue userInfo() const;
   // The configuration's host application name ("Unknown" when unset), without copying the
   // whole configuration: the bridges ask for it on every delivered message.
-  SXValue hostApplicationName() const;
+  SXValue hostApplicationName() const override;
   std::optional<SXValue> driverSnapShot() const;
   void setDriverSnapShot(std::optional<SXValue> snapshot);
   void setTransactionCompleteBlock(Reply<bool> block);
@@ -281,16 +283,16 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   const std::shared_ptr<SXReportingPendingBudget> standaloneBudget_;  // may be null
   std::atomic<std::shared_ptr<SXReportingAggregate>> aggregate_;
   std::map<std::string, int64_t> messageTypeCounts_;  // server queue only
-  std::mutex batchMutex_;
-  std::shared_ptr<SendBatch> openBatch_;  // GUARDED_BY(batchMutex_): its task has not run yet
+  SXMutex batchMutex_;
+  std::shared_ptr<SendBatch> openBatch_ SX_GUARDED_BY(batchMutex_);  // its task has not run yet
 
-  mutable std::mutex mutex_;
-  std::string serviceName_ = "unknown";                                // GUARDED_BY(mutex_)
-  SXValue userInfo_ = SXValue::object();                               // GUARDED_BY(mutex_)
-  std::optional<SXValue> driverSnapShot_;                              // GUARDED_BY(mutex_)
-  Reply<bool> transactionCompleteBlock_;                               // GUARDED_BY(mutex_)
-  std::optional<std::string> orientationCallbackID_;                   // GUARDED_BY(mutex_)
-  std::optional<SXDate> startDate_;                                    // GUARDED_BY(mutex_)
-  std::shared_ptr<FernReportingSession> fernReportingSession_;         // GUARDED_BY(mutex_)
-  std::shared_ptr<FernSecureHierarchyToken> fernReportingAgentToken_;  // GUARDED_BY(mutex_)
+  mutable SXMutex mutex_;
+  std::string serviceName_ SX_GUARDED_BY(mutex_) = "unknown";
+  SXValue userInfo_ SX_GUARDED_BY(mutex_) = SXValue::object();
+  std::optional<SXValue> driverSnapShot_ SX_GUARDED_BY(mutex_);
+  Reply<bool> transactionCompleteBlock_ SX_GUARDED_BY(mutex_);
+  std::optional<std::string> orientationCallbackID_ SX_GUARDED_BY(mutex_);
+  std::optional<SXDate> startDate_ SX_GUARDED_BY(mutex_);
+  std::shared_ptr<FernReportingSession> fernReportingSession_ SX_GUARDED_BY(mutex_);
+  std::shared_ptr<FernSecureHierarchyToken> fernReportingAgentToken_ SX_GUARDED_BY(mutex_);
 };

@@ -22,7 +22,7 @@ std::string SXReportingSession::messageIdForCategory(SXReportingCategory categor
 bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint64_t bytes) {
   auto aggregate = aggregate_.load();
   if (!aggregate) return false;
-  std::lock_guard lock(aggregate->mutex);
+  SXMutexLock lock(aggregate->mutex);
   // Stop may have dropped this array while we waited for its lock.
   if (aggregate_.load() != aggregate) return false;
   const SXReportingLimits& limits = environment_->limits();
@@ -84,7 +84,7 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
 void SXReportingSession::queueSend(PendingSend send) {
   std::shared_ptr<SendBatch> fresh;
   {
-    std::lock_guard lock(batchMutex_);
+    SXMutexLock lock(batchMutex_);
     if (!openBatch_) openBatch_ = fresh = std::make_shared<SendBatch>();
     openBatch_->sends.push_back(std::move(send));
   }
@@ -96,7 +96,7 @@ void SXReportingSession::queueSend(PendingSend send) {
 
 void SXReportingSession::queueTask(SXTask task) {
   {
-    std::lock_guard lock(batchMutex_);
+    SXMutexLock lock(batchMutex_);
     openBatch_ = nullptr;  // its task is ahead of this one; later sends start a new batch
   }
   fernReportingQueue_->async(std::move(task));
@@ -105,7 +105,7 @@ void SXReportingSession::queueTask(SXTask task) {
 void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
   std::vector<PendingSend> sends;
   {
-    std::lock_guard lock(batchMutex_);
+    SXMutexLock lock(batchMutex_);
     sends.swap(batch->sends);
     if (openBatch_ == batch) openBatch_ = nullptr;
   }

@@ -69,7 +69,7 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
   // aggregate's text rather than two.
   std::map<std::string, std::string> joined;
   {
-    std::lock_guard lock(aggregate->mutex);
+    SXMutexLock lock(aggregate->mutex);
     if (aggregate->entries.empty()) return std::nullopt;
     joined[kSummaryKey] = std::to_string(serviceType());
     for (const auto& entry : aggregate->entries) {
@@ -85,7 +85,7 @@ std::optional<SXValue> SXReportingSession::createSummaryEventForSession() {
 
   SXValue info = userInfo();
   {
-    std::lock_guard lock(aggregate->mutex);
+    SXMutexLock lock(aggregate->mutex);
     aggregate->entries.insert(aggregate->entries.begin(), SXReportingAggregateEntry(info));
   }
   if (SXReportingUtilityIsInternalBuild(*environment_)) writeSummaryFile(aggregate, info);
@@ -96,7 +96,7 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
                                           const SXValue& info) {
   SXValue list = SXValue::array();
   {
-    std::lock_guard lock(aggregate->mutex);
+    SXMutexLock lock(aggregate->mutex);
     for (const auto& entry : aggregate->entries) list.push_back(entry.toValue());
   }
   std::string json;
@@ -152,7 +152,7 @@ bool SXReportingSession::shouldReportOrientation() {
 void SXReportingSession::registerOrientationCallbacks() {
   std::string id = SXFormat("SXReportingService %lli", reporterID());
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     orientationCallbackID_ = id;
     startDate_ = environment_->platform().clock->now();
   }
@@ -169,7 +169,7 @@ void SXReportingSession::registerOrientationCallbacks() {
 void SXReportingSession::unregisterOrientationCallbacks() {
   std::optional<std::string> id;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     id = std::exchange(orientationCallbackID_, std::nullopt);
   }
   if (!id) return;

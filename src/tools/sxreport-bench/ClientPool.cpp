@@ -5,6 +5,8 @@
 #include <future>
 #include <mutex>
 
+#include "common/SXThreadSafety.h"
+
 namespace {
 
 // Counts the clients that have not finished the phase.
@@ -12,18 +14,18 @@ class Latch {
  public:
   explicit Latch(size_t count) : remaining_(count) {}
   void countDown() {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (remaining_ > 0 && --remaining_ == 0) done_.notify_all();
   }
   bool waitFor(std::chrono::milliseconds timeout) {
-    std::unique_lock lock(mutex_);
-    return done_.wait_for(lock, timeout, [&] { return remaining_ == 0; });
+    SXMutexLock lock(mutex_);
+    return lock.waitFor(done_, timeout, [&]() SX_REQUIRES(mutex_) { return remaining_ == 0; });
   }
 
  private:
-  std::mutex mutex_;
+  SXMutex mutex_;
   std::condition_variable done_;
-  size_t remaining_;  // GUARDED_BY(mutex_)
+  size_t remaining_ SX_GUARDED_BY(mutex_);
 };
 
 }  // namespace
