@@ -16,6 +16,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "fakes/FakeDispatch.h"
 #include "fakes/FakeLog.h"
 
@@ -38,25 +39,26 @@ class Deliveries {
 
   SXNotifyHandler handler(std::shared_ptr<FakeWorkQueue> queue, std::string tag) {
     return [this, queue, tag](int token) {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       delivered_.push_back({tag, token, queue->isCurrent()});
       changed_.notify_all();
     };
   }
   bool waitFor(size_t count) {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kDeadline, [&] { return delivered_.size() >= count; });
+    SXMutexLock lock(mutex_);
+    return lock.waitFor(changed_, kDeadline,
+                        [&]() SX_REQUIRES(mutex_) { return delivered_.size() >= count; });
   }
   std::vector<Delivery> all() const {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     return delivered_;
   }
   size_t count() const { return all().size(); }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   std::condition_variable changed_;
-  std::vector<Delivery> delivered_;  // guarded by mutex_
+  std::vector<Delivery> delivered_ SX_GUARDED_BY(mutex_);
 };
 
 class InotifyNotificationsTest : public ::testing::Test {

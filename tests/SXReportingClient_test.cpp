@@ -3,6 +3,7 @@
 #include <atomic>
 #include <condition_variable>
 
+#include "common/SXThreadSafety.h"
 #include "fakes/FakeRpcServer.h"
 #include "sxreporting/client.h"
 
@@ -228,7 +229,7 @@ TEST_F(SXReportingClientTest, CallsFromManyThreadsAllComplete) {
   server_.on(kSendMessage, [](auto&) { return Answer::reply(nullptr); });
   constexpr int kThreads = 4;
   constexpr int kCallsEach = 2000;
-  std::mutex mutex;
+  SXMutex mutex;
   std::condition_variable done;
   int completed = 0;
   std::atomic<int> delivered = 0;
@@ -239,15 +240,16 @@ TEST_F(SXReportingClientTest, CallsFromManyThreadsAllComplete) {
         client_->sendMessage({{"i", i}}, 3, 1, std::vector<int64_t>{t},
                              [&](SXCallResult<std::optional<SXError>> result) {
                                if (result.replied() && !result.value) ++delivered;
-                               std::lock_guard lock(mutex);
+                               SXMutexLock lock(mutex);
                                if (++completed == kThreads * kCallsEach) done.notify_one();
                              });
       }
     });
   }
   for (auto& thread : threads) thread.join();
-  std::unique_lock lock(mutex);
-  ASSERT_TRUE(done.wait_for(lock, 60s, [&] { return completed == kThreads * kCallsEach; }));
+  SXMutexLock lock(mutex);
+  ASSERT_TRUE(lock.waitFor(
+      done, 60s, [&]() SX_REQUIRES(mutex) { return completed == kThreads * kCallsEach; }));
   EXPECT_EQ(delivered, kThreads * kCallsEach);
 }
 

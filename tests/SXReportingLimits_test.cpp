@@ -9,6 +9,7 @@
 
 #include "SXReportingDaemonConfig.h"
 #include "SXReportingServiceDelegate.h"
+#include "common/SXThreadSafety.h"
 #include "fakes/FakeIpc.h"
 #include "support/TestEnvironment.h"
 
@@ -184,14 +185,14 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
   auto budget = std::make_shared<SXReportingPendingBudget>(100, 1);
   std::vector<std::thread> threads;
   std::atomic<int> granted{0};
-  std::mutex mutex;
+  SXMutex mutex;
   std::vector<std::shared_ptr<SXReportingPendingBudget::Slot>> held;
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&] {
       for (int j = 0; j < 1000; ++j) {
         if (auto slot = budget->tryAcquire(1)) {
           ++granted;
-          std::lock_guard lock(mutex);
+          SXMutexLock lock(mutex);
           held.push_back(std::move(slot));
         }
       }
@@ -300,23 +301,21 @@ TEST(SXReportingLimitsFile, SectionAppliesOverTheFlagsAndABadOneChangesNothing) 
   SXReportingLimitsSection section(environment, {"max-reporter-ids"});
   auto limits = [&] { return environment->limits(); };
 
-  ASSERT_TRUE(section.read({{"limits",
-                             {{"max-payload-bytes", 100},
-                              {"max-reporter-ids", 50},
-                              {"max-inflight-bytes", 4096}}}}));
+  ASSERT_TRUE(section.read(
+      {{"limits",
+        {{"max-payload-bytes", 100}, {"max-reporter-ids", 50}, {"max-inflight-bytes", 4096}}}}));
   EXPECT_EQ(limits().maxPayloadBytes, 100u);
-  EXPECT_EQ(limits().maxReporterIDs, 3u);  // the flag wins
+  EXPECT_EQ(limits().maxReporterIDs, 3u);       // the flag wins
   EXPECT_EQ(limits().maxInflightBytes, 4096u);  // at start, the listener takes it
 
   ASSERT_TRUE(section.read({{"limits", {{"max-inflight-bytes", 8192}}}}));
   EXPECT_EQ(limits().maxPayloadBytes, SXReportingLimits{}.maxPayloadBytes);  // key gone: default
-  EXPECT_EQ(limits().maxInflightBytes, 4096u);  // until the next start
+  EXPECT_EQ(limits().maxInflightBytes, 4096u);                               // until the next start
   EXPECT_EQ(t.log->countContaining("limit max-inflight-bytes changed to 8192; it applies at the "
                                    "next start"),
             1u);
 
-  for (const SXValue& bad : {SXValue{{"limits", 5}},
-                             SXValue{{"limits", {{"max-payload", 5}}}},
+  for (const SXValue& bad : {SXValue{{"limits", 5}}, SXValue{{"limits", {{"max-payload", 5}}}},
                              SXValue{{"limits", {{"max-payload-bytes", 0}}}},
                              SXValue{{"limits", {{"max-payload-bytes", -5}}}},
                              SXValue{{"limits", {{"max-payload-bytes", 5.5}}}}}) {

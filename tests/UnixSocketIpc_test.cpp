@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "common/RpcCodec.h"
+#include "common/SXThreadSafety.h"
 #include "platform/AsioDispatch.h"
 #include "support/SqliteTestSupport.h"
 
@@ -38,8 +39,8 @@ class QueueingObject final : public SXIpcExportedObject {
  public:
   explicit QueueingObject(std::shared_ptr<SXWorkQueue> queue) : queue_(std::move(queue)) {
     queue_->async([this] {
-      std::unique_lock lock(mutex_);
-      gate_.wait(lock, [this] { return open_; });
+      SXMutexLock lock(mutex_);
+      lock.wait(gate_, [this]() SX_REQUIRES(mutex_) { return open_; });
     });
   }
   void handleRequest(std::string_view, SXValue params, size_t, SXIpcReplyFn reply) override {
@@ -52,7 +53,7 @@ class QueueingObject final : public SXIpcExportedObject {
   }
   void open() {
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       open_ = true;
     }
     gate_.notify_all();
@@ -62,9 +63,9 @@ class QueueingObject final : public SXIpcExportedObject {
 
  private:
   std::shared_ptr<SXWorkQueue> queue_;
-  std::mutex mutex_;
+  SXMutex mutex_;
   std::condition_variable gate_;
-  bool open_ = false;  // guarded by mutex_
+  bool open_ SX_GUARDED_BY(mutex_) = false;
   std::atomic<int64_t> handedOn_{0};
   std::atomic<int64_t> handled_{0};
   std::atomic<int64_t> maxWaiting_{0};

@@ -54,6 +54,7 @@ class SX_SCOPED_CAPABILITY SXMutexLock {
   void unlock() SX_RELEASE() { lock_.unlock(); }
   void lock() SX_ACQUIRE() { lock_.lock(); }
 
+  void wait(std::condition_variable& condition) { condition.wait(lock_); }
   template <typename Ready>
   void wait(std::condition_variable& condition, Ready ready) {
     condition.wait(lock_, ready);
@@ -63,6 +64,11 @@ class SX_SCOPED_CAPABILITY SXMutexLock {
   bool waitFor(std::condition_variable& condition, std::chrono::duration<Rep, Period> timeout,
                Ready ready) {
     return condition.wait_for(lock_, timeout, ready);
+  }
+  template <typename Clock, typename Duration>
+  std::cv_status waitUntil(std::condition_variable& condition,
+                           std::chrono::time_point<Clock, Duration> due) {
+    return condition.wait_until(lock_, due);
   }
   template <typename Clock, typename Duration, typename Ready>
   bool waitUntil(std::condition_variable& condition, std::chrono::time_point<Clock, Duration> due,

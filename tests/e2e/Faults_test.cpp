@@ -199,8 +199,10 @@ TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
   }
   EXPECT_TRUE(waitUntil([&] { return openDescriptors(daemon.pid()) <= baseline; }, 30s))
       << openDescriptors(daemon.pid()) << " sockets open, " << baseline << " before";
+  // Still answering, once through the teardown of 10,000 clients (each logged and reported),
+  // which a sanitizer build sharing two cores with another test takes tens of seconds for.
   auto client = daemon.client();
-  EXPECT_TRUE(replied(client->getAllReporters()).empty());
+  EXPECT_TRUE(replied(client->getAllReporters(std::chrono::seconds(60))).empty());
 }
 
 TEST(FaultsEndToEnd, ASlowStoreHoldsBackOnlyTheClientThatFloodsIt) {

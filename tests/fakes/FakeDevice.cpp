@@ -1,22 +1,23 @@
 #include "fakes/FakeDevice.h"
 
+
 void FakeOrientationService::registerDeviceOrientationCallback(const std::string& id,
                                                                SXOrientationCallback cb) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   device_[id] = std::move(cb);
   calls_.push_back("registerDevice " + id);
 }
 
 void FakeOrientationService::registerInterfaceOrientationCallback(const std::string& id,
                                                                   SXOrientationCallback cb) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   interface_[id] = std::move(cb);
   calls_.push_back("registerInterface " + id);
 }
 
 void FakeOrientationService::unregisterDeviceOrientationCallback(const std::string& id) {
   SXOrientationCallback dropped;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (auto it = device_.find(id); it != device_.end()) {
     dropped = std::move(it->second);
     device_.erase(it);
@@ -26,7 +27,7 @@ void FakeOrientationService::unregisterDeviceOrientationCallback(const std::stri
 
 void FakeOrientationService::unregisterInterfaceOrientationCallback(const std::string& id) {
   SXOrientationCallback dropped;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (auto it = interface_.find(id); it != interface_.end()) {
     dropped = std::move(it->second);
     interface_.erase(it);
@@ -37,7 +38,7 @@ void FakeOrientationService::unregisterInterfaceOrientationCallback(const std::s
 bool FakeOrientationService::fireDevice(const std::string& id, int32_t orientation) {
   SXOrientationCallback cb;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     auto it = device_.find(id);
     if (it == device_.end()) return false;
     cb = it->second;
@@ -49,7 +50,7 @@ bool FakeOrientationService::fireDevice(const std::string& id, int32_t orientati
 bool FakeOrientationService::fireInterface(const std::string& id, int32_t orientation) {
   SXOrientationCallback cb;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     auto it = interface_.find(id);
     if (it == interface_.end()) return false;
     cb = it->second;
@@ -59,13 +60,13 @@ bool FakeOrientationService::fireInterface(const std::string& id, int32_t orient
 }
 
 std::vector<std::string> FakeOrientationService::calls() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return calls_;
 }
 
 void FakeOrientationService::clear() {
   std::map<std::string, SXOrientationCallback> device, interface;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   device.swap(device_);
   interface.swap(interface_);
 }

@@ -7,6 +7,7 @@
 #include <set>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/DeviceProperties.h"
 #include "platform/FileSystem.h"
 #include "platform/Orientation.h"
@@ -17,19 +18,19 @@ class FakeDeviceProperties final : public SXDeviceProperties {
   explicit FakeDeviceProperties(SXValue properties = SXValue::object())
       : properties_(std::move(properties)) {}
   std::optional<SXValue> property(const std::string& key) const override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     queries_[key]++;
     auto it = properties_.find(key);
     if (it == properties_.end()) return std::nullopt;
     return *it;
   }
   int queries(const std::string& key) const {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     return queries_[key];
   }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   SXValue properties_;
   mutable std::map<std::string, int> queries_;
 };
@@ -53,14 +54,14 @@ class FakeProcessInfo final : public SXProcessInfo {
 class FakeFileSystem final : public SXFileSystem {
  public:
   std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (failDirectories) return "mkdir " + path + ": Permission denied";
     directories[path] = mode;
     return std::nullopt;
   }
   std::optional<std::string> writeFileAtomically(const std::string& path,
                                                  const std::string& contents) override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (failWrites) return "open " + path + ": Permission denied";
     files[path] = contents;
     return std::nullopt;
@@ -69,13 +70,13 @@ class FakeFileSystem final : public SXFileSystem {
   std::optional<std::string> writeNewFileAtomically(const std::string& path,
                                                     const std::string& contents,
                                                     bool& taken) override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     if (failWrites) return "open " + path + ": Permission denied";
     taken = !files.try_emplace(path, contents).second;
     return std::nullopt;
   }
 
-  std::mutex mutex_;
+  SXMutex mutex_;
   bool failDirectories = false;
   bool failWrites = false;
   std::map<std::string, unsigned> directories;
@@ -102,8 +103,8 @@ class FakeOrientationService final : public SXOrientationService {
   void clear();
 
  private:
-  mutable std::mutex mutex_;
-  std::map<std::string, SXOrientationCallback> device_;     // GUARDED_BY(mutex_)
-  std::map<std::string, SXOrientationCallback> interface_;  // GUARDED_BY(mutex_)
-  std::vector<std::string> calls_;                          // GUARDED_BY(mutex_)
+  mutable SXMutex mutex_;
+  std::map<std::string, SXOrientationCallback> device_ SX_GUARDED_BY(mutex_);
+  std::map<std::string, SXOrientationCallback> interface_ SX_GUARDED_BY(mutex_);
+  std::vector<std::string> calls_ SX_GUARDED_BY(mutex_);
 };

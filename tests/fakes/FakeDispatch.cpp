@@ -5,7 +5,7 @@ FakeWorkQueue::FakeWorkQueue(std::string label)
 
 FakeWorkQueue::~FakeWorkQueue() {
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     state_->stopping = true;
   }
   state_->changed.notify_all();
@@ -17,10 +17,11 @@ FakeWorkQueue::~FakeWorkQueue() {
 }
 
 void FakeWorkQueue::Run(std::shared_ptr<State> state) {
-  std::unique_lock lock(state->mutex);
+  SXMutexLock lock(state->mutex);
   for (;;) {
-    state->changed.wait(
-        lock, [&] { return state->stopping || (!state->tasks.empty() && state->suspended == 0); });
+    lock.wait(state->changed, [&]() SX_REQUIRES(state->mutex) {
+      return state->stopping || (!state->tasks.empty() && state->suspended == 0);
+    });
     // Stopping, and nothing left to run (or nothing that may run).
     if (state->tasks.empty() || state->suspended > 0) return;
     SXTask task = std::move(state->tasks.front());
@@ -36,7 +37,7 @@ void FakeWorkQueue::Run(std::shared_ptr<State> state) {
 
 void FakeWorkQueue::async(SXTask task) {
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     state_->tasks.push_back(std::move(task));
     ++state_->queued;
   }
@@ -44,13 +45,13 @@ void FakeWorkQueue::async(SXTask task) {
 }
 
 void FakeWorkQueue::suspend() {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   ++state_->suspended;
 }
 
 void FakeWorkQueue::resume() {
   {
-    std::lock_guard lock(state_->mutex);
+    SXMutexLock lock(state_->mutex);
     if (state_->suspended > 0) --state_->suspended;
   }
   state_->changed.notify_all();
@@ -59,13 +60,14 @@ void FakeWorkQueue::resume() {
 bool FakeWorkQueue::isCurrent() const { return thread_.get_id() == std::this_thread::get_id(); }
 
 bool FakeWorkQueue::drain(std::chrono::milliseconds timeout) {
-  std::unique_lock lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   size_t target = state_->queued;
-  return state_->changed.wait_for(lock, timeout, [&] { return state_->run >= target; });
+  return lock.waitFor(state_->changed, timeout,
+                      [&]() SX_REQUIRES(state_->mutex) { return state_->run >= target; });
 }
 
 size_t FakeWorkQueue::tasksRun() const {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   return state_->run;
 }
 
@@ -75,7 +77,7 @@ FakeDispatch::FakeDispatch()
 
 FakeDispatch::~FakeDispatch() {
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     stopping_ = true;
   }
   timersChanged_.notify_all();
@@ -85,7 +87,7 @@ FakeDispatch::~FakeDispatch() {
 std::shared_ptr<SXWorkQueue> FakeDispatch::createSerialQueue(std::string label,
                                                              SXQualityOfService qos) {
   auto queue = std::make_shared<FakeWorkQueue>(std::move(label));
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   created_.emplace_back(queue, qos);
   return queue;
 }
@@ -96,7 +98,7 @@ void FakeDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQ
                          SXTask task) {
   auto due = Clock::now() + std::chrono::duration_cast<Clock::duration>(delay);
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     timers_.emplace(due, Timer{std::move(queue), std::move(task)});
   }
   timersChanged_.notify_all();
@@ -104,20 +106,20 @@ void FakeDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQ
 
 std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>>
 FakeDispatch::createdQueues() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return created_;
 }
 
 void FakeDispatch::runTimers() {
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   while (!stopping_) {
     if (timers_.empty()) {
-      timersChanged_.wait(lock);
+      lock.wait(timersChanged_);
       continue;
     }
     auto first = timers_.begin();
     if (first->first > Clock::now()) {
-      timersChanged_.wait_until(lock, first->first);
+      lock.waitUntil(timersChanged_, first->first);
       continue;
     }
     Timer timer = std::move(first->second);

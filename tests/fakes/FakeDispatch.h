@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Dispatch.h"
 
 class FakeWorkQueue final : public SXWorkQueue {
@@ -38,13 +39,13 @@ class FakeWorkQueue final : public SXWorkQueue {
  private:
   // Shared with the thread, so a queue released by its own task can let the thread finish.
   struct State {
-    std::mutex mutex;
+    SXMutex mutex;
     std::condition_variable changed;
-    std::deque<SXTask> tasks;  // guarded by mutex
-    size_t queued = 0;         // guarded by mutex
-    size_t run = 0;            // guarded by mutex
-    int suspended = 0;         // guarded by mutex
-    bool stopping = false;     // guarded by mutex
+    std::deque<SXTask> tasks SX_GUARDED_BY(mutex);
+    size_t queued SX_GUARDED_BY(mutex) = 0;
+    size_t run SX_GUARDED_BY(mutex) = 0;
+    int suspended SX_GUARDED_BY(mutex) = 0;
+    bool stopping SX_GUARDED_BY(mutex) = false;
   };
   static void Run(std::shared_ptr<State> state);
 
@@ -80,11 +81,11 @@ class FakeDispatch final : public SXDispatch {
   void runTimers();
 
   const std::shared_ptr<FakeWorkQueue> lowPriority_;
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   std::condition_variable timersChanged_;
-  std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>>
-      created_;                                     // guarded by mutex_
-  std::multimap<Clock::time_point, Timer> timers_;  // guarded by mutex_
-  bool stopping_ = false;                           // guarded by mutex_
+  std::vector<std::pair<std::shared_ptr<FakeWorkQueue>, SXQualityOfService>> created_
+      SX_GUARDED_BY(mutex_);
+  std::multimap<Clock::time_point, Timer> timers_ SX_GUARDED_BY(mutex_);
+  bool stopping_ SX_GUARDED_BY(mutex_) = false;
   std::thread timerThread_;
 };

@@ -5,6 +5,8 @@
 #include <mutex>
 #include <thread>
 
+#include "common/SXThreadSafety.h"
+
 namespace {
 
 using Clock = std::chrono::steady_clock;
@@ -18,7 +20,7 @@ class Deliverer {
   }
   ~Deliverer() {
     {
-      std::lock_guard lock(shared_->mutex);
+      SXMutexLock lock(shared_->mutex);
       shared_->stopping = true;
     }
     shared_->wake.notify_all();
@@ -34,7 +36,7 @@ class Deliverer {
 
   void post(std::chrono::milliseconds delay, std::function<void()> task) {
     {
-      std::lock_guard lock(shared_->mutex);
+      SXMutexLock lock(shared_->mutex);
       shared_->due.emplace(Clock::now() + delay, std::move(task));
     }
     shared_->wake.notify_all();
@@ -43,12 +45,12 @@ class Deliverer {
  private:
   struct Shared {
     void run() {
-      std::unique_lock lock(mutex);
+      SXMutexLock lock(mutex);
       while (!stopping) {
         if (due.empty()) {
-          wake.wait(lock);
+          lock.wait(wake);
         } else if (due.begin()->first > Clock::now()) {
-          wake.wait_until(lock, due.begin()->first);
+          lock.waitUntil(wake, due.begin()->first);
         } else {
           auto task = std::move(due.begin()->second);
           due.erase(due.begin());
@@ -59,10 +61,10 @@ class Deliverer {
         }
       }
     }
-    std::mutex mutex;
-    std::condition_variable wake;                                 // guarded by `mutex`
-    std::multimap<Clock::time_point, std::function<void()>> due;  // guarded by `mutex`
-    bool stopping = false;                                        // guarded by `mutex`
+    SXMutex mutex;
+    std::condition_variable wake;  // guarded by `mutex`
+    std::multimap<Clock::time_point, std::function<void()>> due SX_GUARDED_BY(mutex);
+    bool stopping SX_GUARDED_BY(mutex) = false;
   };
   std::shared_ptr<Shared> shared_;
   std::thread thread_;
@@ -76,7 +78,7 @@ class FakeFernReporting::State {
 
   std::shared_ptr<FernSecureHierarchyToken> token(
       const std::shared_ptr<FernSecureHierarchyToken>& parent) {
-    std::lock_guard lock(mutex);
+    SXMutexLock lock(mutex);
     Event& e = append({.kind = Kind::kToken, .accepted = !tokenFails});
     if (tokenFails) return nullptr;
     e.token = "fake-token-" + std::to_string(++tokens);
@@ -86,7 +88,7 @@ class FakeFernReporting::State {
 
   // Returns the new session's number, or 0 when opening fails.
   int open(const SXValue& sessionInfo, const SXValue& userInfo) {
-    std::lock_guard lock(mutex);
+    SXMutexLock lock(mutex);
     int number = openFails ? 0 : ++sessions;
     Event& e = append({.kind = Kind::kOpen,
                        .session = number,
@@ -101,7 +103,7 @@ class FakeFernReporting::State {
   }
 
   void startConfiguration(int session, FernBackendsCompletion completion) {
-    std::unique_lock lock(mutex);
+    SXMutexLock lock(mutex);
     append({.kind = Kind::kStartConfiguration, .session = session});
     std::function<void()> deliver = [completion, found = backends] {
       if (completion) completion(found);
@@ -116,7 +118,7 @@ class FakeFernReporting::State {
   bool send(Kind kind, int session, const SXValue* sessionInfo, const SXValue* userInfo,
             uint16_t category, uint16_t type, const SXValue& payload,
             std::optional<FernError>& error) {
-    std::lock_guard lock(mutex);
+    SXMutexLock lock(mutex);
     const SendFailure& failure = kind == Kind::kMessage ? messageFailure : singleFailure;
     append({.kind = kind,
             .session = session,
@@ -131,7 +133,7 @@ class FakeFernReporting::State {
   }
 
   void flush(int session, FernFlushCompletion completion) {
-    std::lock_guard lock(mutex);
+    SXMutexLock lock(mutex);
     append({.kind = Kind::kFlush, .session = session});
     complete(flushDelivery, flushDelay, [completion, error = flushError] {
       if (completion) completion(error);
@@ -139,22 +141,22 @@ class FakeFernReporting::State {
   }
 
   void deliverHeld() {
-    std::lock_guard lock(mutex);
+    SXMutexLock lock(mutex);
     for (auto& task : held) deliverer.post(std::chrono::milliseconds(0), std::move(task));
     held.clear();
   }
 
   bool waitFor(const std::function<bool(const std::vector<Event>&)>& ready,
                std::chrono::milliseconds timeout) {
-    std::unique_lock lock(mutex);
-    return changed.wait_for(lock, timeout, [&] { return ready(events); });
+    SXMutexLock lock(mutex);
+    return lock.waitFor(changed, timeout, [&]() SX_REQUIRES(mutex) { return ready(events); });
   }
 
-  std::mutex mutex;
+  SXMutex mutex;
   std::condition_variable changed;  // guarded by `mutex`
-  std::vector<Event> events;        // guarded by `mutex`
+  std::vector<Event> events SX_GUARDED_BY(mutex);
   std::optional<std::vector<std::string>> backends = std::vector<std::string>{"fake"};
-  Delivery configurationDelivery = Delivery::kImmediate;  // guarded by `mutex`, like the rest
+  Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kImmediate;  // like the rest
   std::chrono::milliseconds configurationDelay{0};
   Delivery flushDelivery = Delivery::kImmediate;
   std::chrono::milliseconds flushDelay{0};
@@ -169,15 +171,14 @@ class FakeFernReporting::State {
   Deliverer deliverer;                      // declared last: stopped before the rest goes
 
  private:
-  // REQUIRES: mutex held.
-  Event& append(Event event) {
+  Event& append(Event event) SX_REQUIRES(mutex) {
     events.push_back(std::move(event));
     changed.notify_all();
     return events.back();
   }
 
-  // REQUIRES: mutex held.
-  void complete(Delivery delivery, std::chrono::milliseconds delay, std::function<void()> task) {
+  void complete(Delivery delivery, std::chrono::milliseconds delay, std::function<void()> task)
+      SX_REQUIRES(mutex) {
     if (delivery == Delivery::kNever) {
       held.push_back(std::move(task));
     } else {
@@ -241,52 +242,52 @@ bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue
 }
 
 void FakeFernReporting::setBackends(std::optional<std::vector<std::string>> backends) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->backends = std::move(backends);
 }
 
 void FakeFernReporting::setConfigurationDelivery(Delivery delivery,
                                                  std::chrono::milliseconds delay) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->configurationDelivery = delivery;
   state_->configurationDelay = delay;
 }
 
 void FakeFernReporting::setFlushDelivery(Delivery delivery, std::chrono::milliseconds delay) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->flushDelivery = delivery;
   state_->flushDelay = delay;
 }
 
 void FakeFernReporting::setFlushError(std::optional<FernError> error) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->flushError = std::move(error);
 }
 
 void FakeFernReporting::setMessageFailure(SendFailure failure) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->messageFailure = std::move(failure);
 }
 
 void FakeFernReporting::setSingleMessageFailure(SendFailure failure) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->singleFailure = std::move(failure);
 }
 
 void FakeFernReporting::setOpenFails(bool fails) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->openFails = fails;
 }
 
 void FakeFernReporting::setTokenFails(bool fails) {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   state_->tokenFails = fails;
 }
 
 void FakeFernReporting::deliverHeld() { state_->deliverHeld(); }
 
 std::vector<FakeFernReporting::Event> FakeFernReporting::events() const {
-  std::lock_guard lock(state_->mutex);
+  SXMutexLock lock(state_->mutex);
   return state_->events;
 }
 

@@ -1,7 +1,8 @@
 #include "fakes/FakeHttpPost.h"
 
+
 SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   requests_.push_back(request);
   if (cancelled_) return {std::nullopt, {}, "", "cancelled"};
   if (script_.empty()) return {200, {}, "", ""};
@@ -11,13 +12,13 @@ SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
 }
 
 void FakeHttpPost::cancel() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   cancelled_ = true;
 }
 
 void FakeHttpPost::answer(int status, std::string body,
                           std::map<std::string, std::string> headers) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   script_.push_back({status, std::move(headers), std::move(body), ""});
 }
 
@@ -26,17 +27,17 @@ void FakeHttpPost::answerTimes(size_t count, int status) {
 }
 
 void FakeHttpPost::fail(std::string error) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   script_.push_back({std::nullopt, {}, "", std::move(error)});
 }
 
 void FakeHttpPost::timeOut() {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   script_.push_back({std::nullopt, {}, "", "timed out", true});
 }
 
 std::vector<SXHttpRequest> FakeHttpPost::requests() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return requests_;
 }
 
@@ -49,6 +50,6 @@ std::vector<SXValue> FakeHttpPost::bodies() const {
 }
 
 bool FakeHttpPost::cancelled() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return cancelled_;
 }

@@ -7,6 +7,7 @@
 #include <mutex>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/HttpPost.h"
 #include "sxreporting/types.h"
 
@@ -30,8 +31,8 @@ class FakeHttpPost final : public SXHttpPost {
   bool cancelled() const;
 
  private:
-  mutable std::mutex mutex_;
-  std::deque<SXHttpResult> script_;      // guarded by mutex_
-  std::vector<SXHttpRequest> requests_;  // guarded by mutex_
-  bool cancelled_ = false;               // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::deque<SXHttpResult> script_ SX_GUARDED_BY(mutex_);
+  std::vector<SXHttpRequest> requests_ SX_GUARDED_BY(mutex_);
+  bool cancelled_ SX_GUARDED_BY(mutex_) = false;
 };

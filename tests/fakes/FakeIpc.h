@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "common/MsgpackValue.h"
+#include "common/SXThreadSafety.h"
 #include "platform/Ipc.h"
 
 class FakeIpcConnection final : public SXIpcConnection {
@@ -31,12 +32,12 @@ class FakeIpcConnection final : public SXIpcConnection {
   void request(std::string_view method, SXValue params) {
     size_t wireBytes = SXPackedSize(params) + method.size() + 8;
     exported_->handleRequest(method, params, wireBytes, [this](const SXValue& e, const SXValue& r) {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       responses_.push_back({e, r});
     });
   }
   std::vector<Response> responses() const {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     return responses_;
   }
   // Ends the connection as the IPC layer would: interruption (when `interrupted`), then
@@ -54,6 +55,6 @@ class FakeIpcConnection final : public SXIpcConnection {
   std::function<void()> interruption_;
   std::function<void()> invalidation_;
   bool resumed_ = false;
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   std::vector<Response> responses_;
 };

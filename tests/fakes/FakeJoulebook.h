@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Joulebook.h"
 
 class FakeJoulebook final : public SXJoulebook {
@@ -24,6 +25,6 @@ class FakeJoulebook final : public SXJoulebook {
   void clear();
 
  private:
-  mutable std::mutex mutex_;
-  std::vector<Entry> entries_;  // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::vector<Entry> entries_ SX_GUARDED_BY(mutex_);
 };

@@ -1,5 +1,6 @@
 #include "fakes/FakeKestrel.h"
 
+
 namespace {
 
 using Name = FakeKestrel::Name;
@@ -56,62 +57,62 @@ const SXValue* channelsOf(const SXValue& value) {
 
 void FakeKestrel::setValue(const Name& group, const Name& subgroup, const Name& channel,
                            int64_t value) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   groups_.insert({group, subgroup});
   values_[{group, subgroup, channel}] = value;
 }
 
 void FakeKestrel::removeChannel(const Name& group, const Name& subgroup, const Name& channel) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   values_.erase({group, subgroup, channel});
 }
 
 void FakeKestrel::addGroup(const Name& group, const Name& subgroup) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   groups_.insert({group, subgroup});
 }
 
 void FakeKestrel::failChannelQuery(const Name& group, const Name& subgroup,
                                    std::optional<int64_t> code, bool returnChannels) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   queryFaults_[{group, subgroup}] = QueryFault{code, returnChannels};
 }
 
 void FakeKestrel::failSampling(const Name& group, const Name& subgroup,
                                std::optional<int64_t> code) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   samplingFaults_[{group, subgroup}] = code;
 }
 
 void FakeKestrel::restoreSampling(const Name& group, const Name& subgroup) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   samplingFaults_.erase({group, subgroup});
 }
 
 void FakeKestrel::failDelta(const Name& group, const Name& subgroup, int64_t code) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   deltaFaults_[{group, subgroup}] = code;
 }
 
 void FakeKestrel::setSubscriptionReturnsNull(bool on) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   nullSubscriptions_ = on;
 }
 
 int FakeKestrel::samplingCalls() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return samplingCalls_;
 }
 
 int FakeKestrel::deltaCalls() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return deltaCalls_;
 }
 
 std::optional<SXValue> FakeKestrel::copyChannelsInGroup(const Name& group, const Name& subgroup,
                                                         int /*options*/,
                                                         std::optional<KestrelError>& error) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   auto fault = queryFaults_.find({group, subgroup});
   if (fault != queryFaults_.end()) {
     if (fault->second.code) error = KestrelError{*fault->second.code};
@@ -138,7 +139,7 @@ int64_t FakeKestrel::getChannelCount(const SXValue& channels) {
 std::shared_ptr<KestrelSubscription> FakeKestrel::createSubscription(const SXValue& channels,
                                                                      SXValue& subscribedChannels) {
   subscribedChannels = channels;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (nullSubscriptions_ || !channels.is_object()) return nullptr;
   return std::make_shared<FakeSubscription>(queryIn(channels));
 }
@@ -146,7 +147,7 @@ std::shared_ptr<KestrelSubscription> FakeKestrel::createSubscription(const SXVal
 std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* subscription,
                                                   const SXValue& subscribedChannels,
                                                   std::optional<KestrelError>& error) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   ++samplingCalls_;
   auto* fake = dynamic_cast<const FakeSubscription*>(subscription);
   const SXValue* channels = channelsOf(subscribedChannels);
@@ -172,7 +173,7 @@ std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* sub
 
 std::optional<SXValue> FakeKestrel::createSamplesDelta(const SXValue* earlier, const SXValue& later,
                                                        std::optional<KestrelError>& error) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   ++deltaCalls_;
   const SXValue* before = earlier ? channelsOf(*earlier) : nullptr;
   const SXValue* after = channelsOf(later);

@@ -17,6 +17,7 @@
 #include <string>
 #include <tuple>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Kestrel.h"
 
 inline constexpr int64_t kFakeKestrelBadArgument = 22;
@@ -68,13 +69,13 @@ class FakeKestrel final : public Kestrel {
     bool returnChannels = false;
   };
 
-  mutable std::mutex mutex_;
-  std::set<Query> groups_;                                  // guarded by mutex_
-  std::map<ChannelId, int64_t> values_;                     // guarded by mutex_
-  std::map<Query, QueryFault> queryFaults_;                 // guarded by mutex_
-  std::map<Query, std::optional<int64_t>> samplingFaults_;  // guarded by mutex_
-  std::map<Query, int64_t> deltaFaults_;                    // guarded by mutex_
-  bool nullSubscriptions_ = false;                          // guarded by mutex_
-  int samplingCalls_ = 0;                                   // guarded by mutex_
-  int deltaCalls_ = 0;                                      // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::set<Query> groups_ SX_GUARDED_BY(mutex_);
+  std::map<ChannelId, int64_t> values_ SX_GUARDED_BY(mutex_);
+  std::map<Query, QueryFault> queryFaults_ SX_GUARDED_BY(mutex_);
+  std::map<Query, std::optional<int64_t>> samplingFaults_ SX_GUARDED_BY(mutex_);
+  std::map<Query, int64_t> deltaFaults_ SX_GUARDED_BY(mutex_);
+  bool nullSubscriptions_ SX_GUARDED_BY(mutex_) = false;
+  int samplingCalls_ SX_GUARDED_BY(mutex_) = 0;
+  int deltaCalls_ SX_GUARDED_BY(mutex_) = 0;
 };

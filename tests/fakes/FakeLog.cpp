@@ -1,13 +1,14 @@
 #include "fakes/FakeLog.h"
 
+
 std::shared_ptr<const SXLogScope> FakeLog::registerScope(const SXLogScope& scope) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   registrations_.push_back(scope);
   return std::make_shared<const SXLogScope>(scope);
 }
 
 bool FakeLog::isEnabled(const SXLogScope* scope, int level) const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return scope && level <= kSXLogVerboseLevel && verbose_.count(scope->shortName);
 }
 
@@ -19,31 +20,31 @@ void FakeLog::write(const SXLogScope* scope, SXLogLevel level, std::string_view 
   size_t third = second == std::string::npos ? second : text.find(": ", second + 1);
   std::string message = third == std::string::npos ? text : text.substr(third + 2);
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     lines_.push_back({scope ? scope->shortName : "", level, std::move(text), std::move(message)});
   }
   written_.notify_all();
 }
 
 std::vector<FakeLog::Line> FakeLog::lines() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return lines_;
 }
 
 std::vector<std::string> FakeLog::messages() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   std::vector<std::string> out;
   for (const auto& l : lines_) out.push_back(l.message);
   return out;
 }
 
 std::vector<SXLogScope> FakeLog::registrations() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return registrations_;
 }
 
 size_t FakeLog::count(const std::string& message) const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return countLocked(message);
 }
 
@@ -55,12 +56,13 @@ size_t FakeLog::countLocked(const std::string& message) const {
 
 bool FakeLog::waitFor(const std::string& message, size_t times,
                       std::chrono::milliseconds timeout) const {
-  std::unique_lock lock(mutex_);
-  return written_.wait_for(lock, timeout, [&] { return countLocked(message) >= times; });
+  SXMutexLock lock(mutex_);
+  return lock.waitFor(written_, timeout,
+                      [&]() SX_REQUIRES(mutex_) { return countLocked(message) >= times; });
 }
 
 size_t FakeLog::countContaining(const std::string& fragment) const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   size_t n = 0;
   for (const auto& l : lines_) n += l.message.find(fragment) != std::string::npos;
   return n;
@@ -69,7 +71,7 @@ size_t FakeLog::countContaining(const std::string& fragment) const {
 bool FakeLog::contains(const std::string& fragment) const { return countContaining(fragment) > 0; }
 
 void FakeLog::setVerbose(const std::string& scope, bool on) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (on) {
     verbose_.insert(scope);
   } else {

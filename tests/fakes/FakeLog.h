@@ -9,6 +9,7 @@
 #include <string>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Log.h"
 
 class FakeLog final : public SXLogFacility {
@@ -42,7 +43,7 @@ class FakeLog final : public SXLogFacility {
  private:
   size_t countLocked(const std::string& message) const;  // REQUIRES(mutex_)
 
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   mutable std::condition_variable written_;
   std::set<std::string> verbose_;
   std::vector<Line> lines_;

@@ -9,7 +9,7 @@ int FakeNotifications::registerDispatch(const std::string& name, int& token,
                                         SXNotifyHandler handler) {
   if (int status = SXInotifyNotifications::checkName(name)) return status;
   if (!queue || !handler) return EINVAL;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (registerStatus_ != 0) return registerStatus_;
   token = nextToken_++;
   registrations_.emplace(name, Registration{token, std::move(queue), std::move(handler)});
@@ -20,7 +20,7 @@ int FakeNotifications::post(const std::string& name) {
   if (int status = SXInotifyNotifications::checkName(name)) return status;
   std::vector<Registration> due;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     posts_.push_back(name);
     auto [first, last] = registrations_.equal_range(name);
     for (auto it = first; it != last; ++it) due.push_back(it->second);
@@ -33,22 +33,22 @@ int FakeNotifications::post(const std::string& name) {
 }
 
 void FakeNotifications::failRegistrations(int status) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   registerStatus_ = status;
 }
 
 size_t FakeNotifications::registrationCount(const std::string& name) const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return registrations_.count(name);
 }
 
 std::vector<std::string> FakeNotifications::posts() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return posts_;
 }
 
 void FakeNotifications::clear() {
   std::multimap<std::string, Registration> dropped;
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   dropped.swap(registrations_);
 }

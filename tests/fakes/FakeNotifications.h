@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Notify.h"
 
 class FakeNotifications final : public SXNotifications {
@@ -31,9 +32,9 @@ class FakeNotifications final : public SXNotifications {
     SXNotifyHandler handler;
   };
 
-  mutable std::mutex mutex_;
-  std::multimap<std::string, Registration> registrations_;  // guarded by mutex_
-  std::vector<std::string> posts_;                          // guarded by mutex_
-  int registerStatus_ = 0;                                  // guarded by mutex_
-  int nextToken_ = 1;                                       // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::multimap<std::string, Registration> registrations_ SX_GUARDED_BY(mutex_);
+  std::vector<std::string> posts_ SX_GUARDED_BY(mutex_);
+  int registerStatus_ SX_GUARDED_BY(mutex_) = 0;
+  int nextToken_ SX_GUARDED_BY(mutex_) = 1;
 };

@@ -4,7 +4,7 @@
 
 std::optional<SXValue> FakePreferences::copyValue(const std::string& domain,
                                                   const std::string& key) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   ++reads_;
   auto domainIt = domains_.find(domain);
   if (domainIt == domains_.end()) return std::nullopt;
@@ -14,7 +14,7 @@ std::optional<SXValue> FakePreferences::copyValue(const std::string& domain,
 }
 
 SXValue FakePreferences::copyDomain(const std::string& domain) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   ++reads_;
   auto it = domains_.find(domain);
   return it == domains_.end() ? SXValue::object() : it->second;
@@ -26,7 +26,7 @@ std::optional<std::string> FakePreferences::setValue(const std::string& domain,
   if (!SXJsonPreferences::isValidDomain(domain)) {
     return "preferences domain \"" + domain + "\" is not a valid name";
   }
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   if (writeFailure_) return writeFailure_;
   SXValue& object = domains_.try_emplace(domain, SXValue::object()).first->second;
   if (value) {
@@ -38,11 +38,11 @@ std::optional<std::string> FakePreferences::setValue(const std::string& domain,
 }
 
 void FakePreferences::failWrites(std::optional<std::string> error) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   writeFailure_ = std::move(error);
 }
 
 size_t FakePreferences::reads() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return reads_;
 }

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Preferences.h"
 
 class FakePreferences final : public SXPreferences {
@@ -22,8 +23,8 @@ class FakePreferences final : public SXPreferences {
   size_t reads() const;
 
  private:
-  mutable std::mutex mutex_;
-  std::map<std::string, SXValue> domains_;   // guarded by mutex_
-  std::optional<std::string> writeFailure_;  // guarded by mutex_
-  size_t reads_ = 0;                         // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::map<std::string, SXValue> domains_ SX_GUARDED_BY(mutex_);
+  std::optional<std::string> writeFailure_ SX_GUARDED_BY(mutex_);
+  size_t reads_ SX_GUARDED_BY(mutex_) = 0;
 };

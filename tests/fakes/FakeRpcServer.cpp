@@ -95,7 +95,7 @@ void FakeRpcServer::accept() {
         connections_.insert(connection);
         connection->read();
         {
-          std::lock_guard lock(mutex_);
+          SXMutexLock lock(mutex_);
           ++connectionCount_;
         }
         changed_.notify_all();
@@ -110,7 +110,7 @@ void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const 
   if (!request) return;
   Handler handler;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     requests_.push_back({request->msgid, request->method, request->params});
     auto it = handlers_.find(request->method);
     handler = it != handlers_.end() ? it->second : anyHandler_;
@@ -123,33 +123,35 @@ void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const 
 }
 
 void FakeRpcServer::on(const std::string& method, Handler handler) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   handlers_[method] = std::move(handler);
 }
 
 void FakeRpcServer::onAny(Handler handler) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   anyHandler_ = std::move(handler);
 }
 
 std::vector<FakeRpcServer::Request> FakeRpcServer::requests() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return requests_;
 }
 
 bool FakeRpcServer::waitForRequests(size_t count, std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  return changed_.wait_for(lock, timeout, [&] { return requests_.size() >= count; });
+  SXMutexLock lock(mutex_);
+  return lock.waitFor(changed_, timeout,
+                      [&]() SX_REQUIRES(mutex_) { return requests_.size() >= count; });
 }
 
 size_t FakeRpcServer::connectionCount() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return connectionCount_;
 }
 
 bool FakeRpcServer::waitForConnections(size_t count, std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  return changed_.wait_for(lock, timeout, [&] { return connectionCount_ >= count; });
+  SXMutexLock lock(mutex_);
+  return lock.waitFor(changed_, timeout,
+                      [&]() SX_REQUIRES(mutex_) { return connectionCount_ >= count; });
 }
 
 void FakeRpcServer::forEachConnection(std::function<void(Connection&)> action) {

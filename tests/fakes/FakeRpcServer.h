@@ -18,6 +18,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "sxreporting/types.h"
 
 class FakeRpcServer {
@@ -76,12 +77,12 @@ class FakeRpcServer {
   asio::local::stream_protocol::acceptor acceptor_;
   std::set<std::shared_ptr<Connection>> connections_;  // I/O thread only
 
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   std::condition_variable changed_;
-  std::map<std::string, Handler> handlers_;  // GUARDED_BY(mutex_)
-  Handler anyHandler_;                       // GUARDED_BY(mutex_)
-  std::vector<Request> requests_;            // GUARDED_BY(mutex_)
-  size_t connectionCount_ = 0;               // GUARDED_BY(mutex_): accepted so far
+  std::map<std::string, Handler> handlers_ SX_GUARDED_BY(mutex_);
+  Handler anyHandler_ SX_GUARDED_BY(mutex_);
+  std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
+  size_t connectionCount_ SX_GUARDED_BY(mutex_) = 0;  // accepted so far
 
   std::thread thread_;
 };

@@ -1,5 +1,6 @@
 #include "fakes/FakeTallyvane.h"
 
+
 FakeTallyvane::FakeTallyvane(Delivery delivery) : delivery_(delivery) {
   if (delivery_ == Delivery::kOwnThread) {
     thread_ = std::make_unique<SXCompletionThread>("fake-tallyvane", nullptr);
@@ -12,7 +13,7 @@ void FakeTallyvane::record(const std::string& name, const SXPayloadProvider& pro
                            bool wasInFlight) {
   SXValue payload = provider ? provider() : SXValue();
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     events_.push_back({name, std::move(payload), std::this_thread::get_id()});
     if (wasInFlight) --inFlight_;
   }
@@ -20,7 +21,7 @@ void FakeTallyvane::record(const std::string& name, const SXPayloadProvider& pro
 }
 
 bool FakeTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider provider) {
-  std::unique_lock lock(mutex_);
+  SXMutexLock lock(mutex_);
   bool accepts = accepts_;
   if (!accepts) return false;
   switch (delivery_) {
@@ -41,37 +42,38 @@ bool FakeTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider pro
 }
 
 void FakeTallyvane::setAccepts(bool accepts) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   accepts_ = accepts;
 }
 
 void FakeTallyvane::deliver() {
   std::vector<std::pair<std::string, SXPayloadProvider>> held;
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     held.swap(held_);
   }
   for (const auto& [name, provider] : held) record(name, provider, false);
 }
 
 std::vector<FakeTallyvane::Event> FakeTallyvane::events() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return events_;
 }
 
 std::vector<std::string> FakeTallyvane::names() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   std::vector<std::string> out;
   for (const auto& e : events_) out.push_back(e.name);
   return out;
 }
 
 size_t FakeTallyvane::pending() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return held_.size() + inFlight_;
 }
 
 bool FakeTallyvane::waitForEvents(size_t count, std::chrono::milliseconds timeout) const {
-  std::unique_lock lock(mutex_);
-  return recorded_.wait_for(lock, timeout, [&] { return events_.size() >= count; });
+  SXMutexLock lock(mutex_);
+  return lock.waitFor(recorded_, timeout,
+                      [&]() SX_REQUIRES(mutex_) { return events_.size() >= count; });
 }

@@ -11,6 +11,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/CompletionThread.h"
 #include "platform/Tallyvane.h"
 
@@ -44,11 +45,11 @@ class FakeTallyvane final : public SXTallyvane {
   void record(const std::string& name, const SXPayloadProvider& provider, bool wasInFlight);
 
   const Delivery delivery_;
-  mutable std::mutex mutex_;
-  mutable std::condition_variable recorded_;                     // guarded by mutex_
-  bool accepts_ = true;                                          // guarded by mutex_
-  std::vector<Event> events_;                                    // guarded by mutex_
-  std::vector<std::pair<std::string, SXPayloadProvider>> held_;  // guarded by mutex_
-  size_t inFlight_ = 0;                         // guarded by mutex_: posted to thread_, not run
+  mutable SXMutex mutex_;
+  mutable std::condition_variable recorded_;  // guarded by mutex_
+  bool accepts_ SX_GUARDED_BY(mutex_) = true;
+  std::vector<Event> events_ SX_GUARDED_BY(mutex_);
+  std::vector<std::pair<std::string, SXPayloadProvider>> held_ SX_GUARDED_BY(mutex_);
+  size_t inFlight_ SX_GUARDED_BY(mutex_) = 0;   // posted to thread_, not run
   std::unique_ptr<SXCompletionThread> thread_;  // kOwnThread only; declared last, joined first
 };

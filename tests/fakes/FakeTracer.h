@@ -4,24 +4,25 @@
 #include <mutex>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "platform/Trace.h"
 
 class FakeTracer final : public SXTracer {
  public:
   void trace(uint32_t code) override {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     codes_.push_back(code);
   }
   std::vector<uint32_t> codes() const {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     return codes_;
   }
   void clear() {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     codes_.clear();
   }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SXMutex mutex_;
   std::vector<uint32_t> codes_;
 };

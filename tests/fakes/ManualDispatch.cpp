@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+
 namespace {
 
 class ManualQueue final : public SXWorkQueue {
@@ -33,7 +34,7 @@ ManualDispatch::ManualDispatch(std::shared_ptr<FakeClock> clock)
 std::shared_ptr<SXWorkQueue> ManualDispatch::createSerialQueue(std::string label,
                                                                SXQualityOfService) {
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     created_.push_back(label);
   }
   return std::make_shared<ManualQueue>(std::move(label), *this);
@@ -42,7 +43,7 @@ std::shared_ptr<SXWorkQueue> ManualDispatch::createSerialQueue(std::string label
 void ManualDispatch::after(std::chrono::nanoseconds delay, std::shared_ptr<SXWorkQueue> queue,
                            SXTask task) {
   {
-    std::lock_guard lock(mutex_);
+    SXMutexLock lock(mutex_);
     delays_.push_back(delay);
     if (clock_) {
       delayed_.push_back({clock_->now() + std::chrono::duration_cast<SXDate::duration>(delay),
@@ -59,7 +60,7 @@ size_t ManualDispatch::advance(std::chrono::nanoseconds delay) {
   for (;;) {
     Delayed next;
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       // The earliest due; among equal due times the first submitted.
       auto earliest =
           std::min_element(delayed_.begin(), delayed_.end(),
@@ -78,7 +79,7 @@ size_t ManualDispatch::advance(std::chrono::nanoseconds delay) {
 
 void ManualDispatch::enqueue(const std::string& label, SXTask task,
                              std::shared_ptr<const std::atomic<int>> suspended) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   tasks_.push_back({label, std::move(task), std::move(suspended)});
 }
 
@@ -87,7 +88,7 @@ size_t ManualDispatch::runAll() {
   for (;;) {
     SXTask task;
     {
-      std::lock_guard lock(mutex_);
+      SXMutexLock lock(mutex_);
       auto next = std::find_if(tasks_.begin(), tasks_.end(), [](const Queued& queued) {
         return !queued.suspended || queued.suspended->load() == 0;
       });
@@ -101,16 +102,16 @@ size_t ManualDispatch::runAll() {
 }
 
 size_t ManualDispatch::pending() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return tasks_.size();
 }
 
 std::vector<std::chrono::nanoseconds> ManualDispatch::delays() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return delays_;
 }
 
 std::vector<std::string> ManualDispatch::createdQueues() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return created_;
 }

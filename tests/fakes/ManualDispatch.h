@@ -11,6 +11,7 @@
 #include <mutex>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "fakes/FakeClock.h"
 #include "platform/Dispatch.h"
 
@@ -53,10 +54,10 @@ class ManualDispatch final : public SXDispatch {
     SXTask task;
   };
   const std::shared_ptr<FakeClock> clock_;  // null: delays are not waited for
-  mutable std::mutex mutex_;
-  std::deque<Queued> tasks_;                      // GUARDED_BY(mutex_)
-  std::vector<std::chrono::nanoseconds> delays_;  // GUARDED_BY(mutex_)
-  std::vector<std::string> created_;              // GUARDED_BY(mutex_)
-  std::vector<Delayed> delayed_;                  // GUARDED_BY(mutex_), in order of `after`
+  mutable SXMutex mutex_;
+  std::deque<Queued> tasks_ SX_GUARDED_BY(mutex_);
+  std::vector<std::chrono::nanoseconds> delays_ SX_GUARDED_BY(mutex_);
+  std::vector<std::string> created_ SX_GUARDED_BY(mutex_);
+  std::vector<Delayed> delayed_ SX_GUARDED_BY(mutex_);  // in order of `after`
   std::shared_ptr<SXWorkQueue> lowPriority_;
 };

@@ -19,14 +19,15 @@
 #include "SXReportingSession.h"
 #include "common/MsgpackValue.h"
 #include "common/RpcCodec.h"
+#include "common/SXThreadSafety.h"
 #include "platform/DiscardLog.h"
 #include "support/TestEnvironment.h"
 
 #ifndef SXR_FUZZ_FAILED
 #define SXR_FUZZ_FAILED(what) __builtin_trap()
 #endif
-#define SXR_FUZZ_CHECK(condition) \
-  do {                            \
+#define SXR_FUZZ_CHECK(condition)                  \
+  do {                                             \
     if (!(condition)) SXR_FUZZ_FAILED(#condition); \
   } while (0)
 
@@ -190,7 +191,7 @@ inline void SXFuzzSummary(const SXValue& payload, int64_t reporterID, uint32_t c
   session->sendMessage(payload, category, type, nullptr);
   session->createSummaryEventForSession();
   t.drain();
-  std::lock_guard lock(t.fileSystem->mutex_);
+  SXMutexLock lock(t.fileSystem->mutex_);
   for (const auto& [path, contents] : t.fileSystem->files) {
     SXR_FUZZ_CHECK(path.rfind("/diag/", 0) == 0);
     std::string name = path.substr(std::min(path.size(), std::string("/diag/").size()));

@@ -8,11 +8,11 @@
 #include <unistd.h>
 
 #include <cstring>
-
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <thread>
+
 
 bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds timeout) {
   auto deadline = std::chrono::steady_clock::now() + timeout;
@@ -274,7 +274,7 @@ TestFlood::~TestFlood() {
 void TestFlood::stop() {
   stop_ = true;
   for (auto& lane : lanes_) {
-    std::lock_guard lock(lane->mutex);
+    SXMutexLock lock(lane->mutex);
     lane->room.notify_all();
   }
   for (auto& thread : threads_) thread.join();
@@ -284,8 +284,10 @@ void TestFlood::stop() {
 void TestFlood::run(Lane& lane, int64_t firstId) {
   for (int64_t xid = firstId; !stop_; ++xid) {
     {
-      std::unique_lock lock(lane.mutex);
-      lane.room.wait(lock, [&] { return stop_ || lane.lost || lane.unanswered < window_; });
+      SXMutexLock lock(lane.mutex);
+      lock.wait(lane.room, [&]() SX_REQUIRES(lane.mutex) {
+        return stop_ || lane.lost || lane.unanswered < window_;
+      });
       if (stop_ || lane.lost) return;
       ++lane.unanswered;
     }
@@ -293,10 +295,10 @@ void TestFlood::run(Lane& lane, int64_t firstId) {
         {{"xid", xid}}, 3, 1, lane.sender.reporterIDs,
         [this, &lane, xid](SXCallResult<std::optional<SXError>> result) {
           if (result.replied() && !result.value) {
-            std::lock_guard lock(ackMutex_);
+            SXMutexLock lock(ackMutex_);
             acknowledged_[xid] = Clock::now();
           }
-          std::lock_guard lock(lane.mutex);
+          SXMutexLock lock(lane.mutex);
           --lane.unanswered;
           if (result.status == SXCallStatus::kConnectionLost) lane.lost = true;
           lane.room.notify_all();
@@ -306,12 +308,12 @@ void TestFlood::run(Lane& lane, int64_t firstId) {
 }
 
 size_t TestFlood::acknowledgedCount() const {
-  std::lock_guard lock(ackMutex_);
+  SXMutexLock lock(ackMutex_);
   return acknowledged_.size();
 }
 
 std::map<int64_t, TestFlood::Clock::time_point> TestFlood::acknowledged() const {
-  std::lock_guard lock(ackMutex_);
+  SXMutexLock lock(ackMutex_);
   return acknowledged_;
 }
 

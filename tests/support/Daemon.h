@@ -15,6 +15,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "support/SqliteTestSupport.h"
 #include "sxreporting/client.h"
 
@@ -129,10 +130,10 @@ class TestFlood {
   static constexpr int64_t kIdsPerSender = 1'000'000'000;
   struct Lane {
     Sender sender;
-    std::mutex mutex;
+    SXMutex mutex;
     std::condition_variable room;
-    size_t unanswered = 0;  // guarded by mutex
-    bool lost = false;      // guarded by mutex
+    size_t unanswered SX_GUARDED_BY(mutex) = 0;
+    bool lost SX_GUARDED_BY(mutex) = false;
   };
   void run(Lane& lane, int64_t firstId);
 
@@ -140,6 +141,6 @@ class TestFlood {
   std::vector<std::unique_ptr<Lane>> lanes_;
   std::vector<std::thread> threads_;
   std::atomic<bool> stop_{false};
-  mutable std::mutex ackMutex_;
-  std::map<int64_t, Clock::time_point> acknowledged_;  // guarded by ackMutex_
+  mutable SXMutex ackMutex_;
+  std::map<int64_t, Clock::time_point> acknowledged_ SX_GUARDED_BY(ackMutex_);
 };

@@ -152,7 +152,7 @@ void OtlpReceiver::accept() {
 }
 
 OtlpReceiver::Answer OtlpReceiver::judge(Request request) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   Answer answer{200, "", delay_};
   if (request.headers["content-encoding"] == "gzip") {
     auto body = Gunzip(request.body);
@@ -170,14 +170,14 @@ OtlpReceiver::Answer OtlpReceiver::judge(Request request) {
 }
 
 void OtlpReceiver::failNext(size_t count, int status, std::string retryAfter) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   faultsLeft_ = count;
   faultStatus_ = status;
   faultRetryAfter_ = std::move(retryAfter);
 }
 
 void OtlpReceiver::answerAfter(std::chrono::milliseconds delay) {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   delay_ = delay;
 }
 
@@ -186,7 +186,7 @@ void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
 void OtlpReceiver::succeed() { failNext(0, 0); }
 
 std::vector<OtlpReceiver::Request> OtlpReceiver::requests() const {
-  std::lock_guard lock(mutex_);
+  SXMutexLock lock(mutex_);
   return requests_;
 }
 

@@ -19,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/SXThreadSafety.h"
 #include "sxreporting/types.h"
 
 class OtlpReceiver {
@@ -81,11 +82,11 @@ class OtlpReceiver {
   asio::io_context io_;
   asio::ip::tcp::acceptor acceptor_{io_};
   uint16_t port_ = 0;
-  mutable std::mutex mutex_;
-  std::vector<Request> requests_;       // guarded by mutex_
-  size_t faultsLeft_ = 0;               // guarded by mutex_
-  int faultStatus_ = 0;                 // guarded by mutex_; 0: drop
-  std::string faultRetryAfter_;         // guarded by mutex_
-  std::chrono::milliseconds delay_{0};  // guarded by mutex_
+  mutable SXMutex mutex_;
+  std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
+  size_t faultsLeft_ SX_GUARDED_BY(mutex_) = 0;
+  int faultStatus_ SX_GUARDED_BY(mutex_) = 0;  // 0: drop
+  std::string faultRetryAfter_ SX_GUARDED_BY(mutex_);
+  std::chrono::milliseconds delay_ SX_GUARDED_BY(mutex_){0};
   std::thread thread_;
 };
