@@ -12,15 +12,15 @@
 #include "SXReportingEventSession.h"
 #include "common/SXThreadSafety.h"
 
-
 // The analytics events of one message: their payloads differ only in the host name, so each
 // distinct host's text is made once (when the analytics service first asks for it, on its
 // thread), however many sessions the message goes to. Used on the server queue.
 class SXReportingEventTexts {
  public:
   // `payloadText`, when given, may return the payload's own text (made for another store);
-  // the events' texts are then that text with the host added, not written again.
-  using PayloadText = std::function<std::optional<std::string>()>;
+  // the events' texts are then that text with the host added, not written again. The text it
+  // points to must last as long as the function (which holds what owns it).
+  using PayloadText = std::function<const std::string*()>;
   explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
                                  PayloadText payloadText = nullptr)
       : payload_(std::move(payload)), payloadText_(std::move(payloadText)) {}

@@ -2,7 +2,6 @@
 
 #include <array>
 #include <chrono>
-#include <map>
 
 #include "SXReportingEnvironment.h"
 

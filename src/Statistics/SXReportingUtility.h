@@ -1,6 +1,6 @@
-// The reporting vocabulary: names of categories and message types (service types: in
-// common/SXServiceTypes.h), the host
-// application name of a configuration, and the bounded wait on a condition.
+// The reporting vocabulary: names of categories and message types (service types are in
+// common/SXServiceTypes.h), the host application name of a configuration, and the bounded
+// wait on a condition.
 #pragma once
 
 #include <condition_variable>

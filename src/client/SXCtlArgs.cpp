@@ -94,9 +94,8 @@ bool buildReporterID(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
 bool buildSetType(const RawArgs& raw, SXCtlRequest& r, std::string& error) {
   auto type = SXServiceTypeFromText(raw.positional[0]);
   if (!type) {
-    error = "not a service type: '" + raw.positional[0] + "' (0-65535 or a name: generic, " +
-            "vokira, telephony, haptics, alarms, standalone, soundautoconfig, longformaudio, " +
-            "nonlongformaudio, audiodeviceusage, alerts, test, unknown)";
+    error = "not a service type: '" + raw.positional[0] +
+            "' (0-65535 or a name: " + SXServiceTypeNameList() + ")";
     return false;
   }
   r.serviceType = *type;

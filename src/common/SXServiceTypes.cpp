@@ -41,6 +41,15 @@ const std::string& SXServiceTypeName(SXReportingServiceType serviceType) {
   return outOfTableName(serviceType);
 }
 
+const std::string& SXServiceTypeNameList() {
+  static const std::string kList = [] {
+    std::string list;
+    for (const std::string& name : kNames) list += name + ", ";
+    return list + kUnknownName;
+  }();
+  return kList;
+}
+
 std::optional<SXReportingServiceType> SXServiceTypeFromText(std::string_view text) {
   // A code as it stands, or as it is named outside the table.
   constexpr std::string_view kCodePrefix = "servicetype";

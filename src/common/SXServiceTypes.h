@@ -12,6 +12,9 @@
 // The reference stays valid for the life of the process.
 const std::string& SXServiceTypeName(SXReportingServiceType serviceType);
 
+// "generic, vokira, ..., test, unknown": every name, for messages that list them.
+const std::string& SXServiceTypeNameList();
+
 // A service type from a decimal code (0-65535), a name or "servicetype<code>", in any case;
 // nothing otherwise.
 std::optional<SXReportingServiceType> SXServiceTypeFromText(std::string_view text);

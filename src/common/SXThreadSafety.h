@@ -20,9 +20,7 @@
 #define SX_CAPABILITY(name) SX_THREAD_ANNOTATION(capability(name))
 #define SX_SCOPED_CAPABILITY SX_THREAD_ANNOTATION(scoped_lockable)
 #define SX_GUARDED_BY(mutex) SX_THREAD_ANNOTATION(guarded_by(mutex))
-#define SX_PT_GUARDED_BY(mutex) SX_THREAD_ANNOTATION(pt_guarded_by(mutex))
 #define SX_REQUIRES(...) SX_THREAD_ANNOTATION(requires_capability(__VA_ARGS__))
-#define SX_EXCLUDES(...) SX_THREAD_ANNOTATION(locks_excluded(__VA_ARGS__))
 #define SX_ACQUIRE(...) SX_THREAD_ANNOTATION(acquire_capability(__VA_ARGS__))
 #define SX_RELEASE(...) SX_THREAD_ANNOTATION(release_capability(__VA_ARGS__))
 

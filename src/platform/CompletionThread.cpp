@@ -15,7 +15,7 @@ struct SXCompletionThread::State {
 
   std::shared_ptr<SXLogFacility> log;
   SXMutex mutex;
-  std::condition_variable wake;  // guarded by `mutex`
+  std::condition_variable wake;
   std::deque<std::function<void()>> tasks SX_GUARDED_BY(mutex);
   bool stopping SX_GUARDED_BY(mutex) = false;
 };

@@ -26,8 +26,8 @@ struct SXSqliteBatchWriter::Core {
   const std::shared_ptr<SXLogFacility> log;
 
   SXMutex mutex;
-  std::condition_variable wake;      // rows queued or stopping; guarded by `mutex`
-  std::condition_variable progress;  // `done` advanced; guarded by `mutex`
+  std::condition_variable wake;      // rows queued or stopping
+  std::condition_variable progress;  // `done` advanced
   std::deque<RowProducer> queue SX_GUARDED_BY(mutex);
   uint64_t enqueued SX_GUARDED_BY(mutex) = 0;  // rows ever accepted
   uint64_t done SX_GUARDED_BY(mutex) = 0;      // rows committed or dropped

@@ -222,7 +222,7 @@ class SXSqliteFernReporting::Spool {
   const std::shared_ptr<SXLogFacility> log_;
   const std::chrono::milliseconds busyTimeout_;
   SXMutex mutex_;
-  std::condition_variable idle_;  // busy_ cleared or rows done; guarded by mutex_
+  std::condition_variable idle_;                           // busy_ cleared or rows done
   std::vector<PendingRow*> queued_ SX_GUARDED_BY(mutex_);  // rows waiting for a transaction
   bool busy_ SX_GUARDED_BY(mutex_) = false;                // a thread owns the connection
   // Owned by the thread that set busy_ (or the constructor, before the spool is shared).

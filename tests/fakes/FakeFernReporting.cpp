@@ -62,7 +62,7 @@ class Deliverer {
       }
     }
     SXMutex mutex;
-    std::condition_variable wake;  // guarded by `mutex`
+    std::condition_variable wake;
     std::multimap<Clock::time_point, std::function<void()>> due SX_GUARDED_BY(mutex);
     bool stopping SX_GUARDED_BY(mutex) = false;
   };
@@ -153,7 +153,7 @@ class FakeFernReporting::State {
   }
 
   SXMutex mutex;
-  std::condition_variable changed;  // guarded by `mutex`
+  std::condition_variable changed;
   std::vector<Event> events SX_GUARDED_BY(mutex);
   std::optional<std::vector<std::string>> backends = std::vector<std::string>{"fake"};
   Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kImmediate;  // like the rest

@@ -46,7 +46,7 @@ class FakeTallyvane final : public SXTallyvane {
 
   const Delivery delivery_;
   mutable SXMutex mutex_;
-  mutable std::condition_variable recorded_;  // guarded by mutex_
+  mutable std::condition_variable recorded_;
   bool accepts_ SX_GUARDED_BY(mutex_) = true;
   std::vector<Event> events_ SX_GUARDED_BY(mutex_);
   std::vector<std::pair<std::string, SXPayloadProvider>> held_ SX_GUARDED_BY(mutex_);

@@ -154,11 +154,11 @@ void SXReportingMessagePayload::keepOnlyText() {
   textLocked();
 }
 
-std::optional<std::string> SXReportingMessagePayload::callerDictionaryText() {
+const std::string* SXReportingMessagePayload::callerDictionaryText() {
   SXMutexLock lock(mutex_);
-  if (rewritesLocked() || !callerIsDictionary_) return std::nullopt;
+  if (rewritesLocked() || !callerIsDictionary_) return nullptr;
   // The dictionaries stay: a standalone send of a session not started reads them.
-  return makeTextLocked();
+  return &makeTextLocked();
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

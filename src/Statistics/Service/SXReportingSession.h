@@ -39,8 +39,9 @@ class SXReportingMessagePayload {
   void keepOnlyText();
   // The text, made now if need be, when it is also that of the caller's own payload: a
   // dictionary with no space in its keys, which the rewrite leaves as it is. Whichever store
-  // asks first makes it for both.
-  std::optional<std::string> callerDictionaryText();
+  // asks first makes it for both. Once made the text never changes, so the pointer holds for
+  // as long as this payload; null when the text is not the caller's.
+  const std::string* callerDictionaryText();
 
  private:
   // Whether the rewrite changes the caller's payload; made once.
@@ -243,7 +244,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   // them together instead of one transaction each; the order of everything on the queue is
   // the order of acceptance, as with one task per message.
   struct SendBatch {
-    std::vector<PendingSend> sends;  // GUARDED_BY(SXReportingSession::batchMutex_)
+    std::vector<PendingSend> sends;  // under the session's batchMutex_
   };
 
   void runSetupTask(SXValue userInfo, std::string serviceName, std::shared_ptr<SetupState> setup);
