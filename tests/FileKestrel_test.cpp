@@ -278,6 +278,11 @@ TEST_F(FileKestrelTest, DriverUtilityWithoutTreeSubscribesNothing) {
   EXPECT_EQ(utility.getSnapShot(), SXValue::object());
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(SXValue::object()), std::nullopt);
   EXPECT_THAT(log_->messages(), ElementsAre("creating kestrelstats driver utility"));
+
+  SXPlatform bare;  // no driver library at all
+  bare.log = log_;
+  SXReportingEnvironment withoutLibrary(std::move(bare));
+  EXPECT_TRUE(SXReportingDriverUtility(withoutLibrary).ioChannelSubscriptions().empty());
 }
 
 }  // namespace

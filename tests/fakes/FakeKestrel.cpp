@@ -67,11 +67,6 @@ void FakeKestrel::removeChannel(const Name& group, const Name& subgroup, const N
   values_.erase({group, subgroup, channel});
 }
 
-void FakeKestrel::addGroup(const Name& group, const Name& subgroup) {
-  SXMutexLock lock(mutex_);
-  groups_.insert({group, subgroup});
-}
-
 void FakeKestrel::failChannelQuery(const Name& group, const Name& subgroup,
                                    std::optional<int64_t> code, bool returnChannels) {
   SXMutexLock lock(mutex_);
@@ -97,11 +92,6 @@ void FakeKestrel::failDelta(const Name& group, const Name& subgroup, int64_t cod
 void FakeKestrel::setSubscriptionReturnsNull(bool on) {
   SXMutexLock lock(mutex_);
   nullSubscriptions_ = on;
-}
-
-int FakeKestrel::samplingCalls() const {
-  SXMutexLock lock(mutex_);
-  return samplingCalls_;
 }
 
 int FakeKestrel::deltaCalls() const {
@@ -148,7 +138,6 @@ std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* sub
                                                   const SXValue& subscribedChannels,
                                                   std::optional<KestrelError>& error) {
   SXMutexLock lock(mutex_);
-  ++samplingCalls_;
   auto* fake = dynamic_cast<const FakeSubscription*>(subscription);
   const SXValue* channels = channelsOf(subscribedChannels);
   if (!fake || !channels) {

@@ -29,8 +29,6 @@ class FakeKestrel final : public Kestrel {
   // Adds the channel (and its group) with `value`, or sets the value of an existing one.
   void setValue(const Name& group, const Name& subgroup, const Name& channel, int64_t value);
   void removeChannel(const Name& group, const Name& subgroup, const Name& channel);
-  // Makes a group exist, with no channels until some are set.
-  void addGroup(const Name& group, const Name& subgroup);
 
   // The channel query for (group, subgroup) sets an error with `code` (none: no error) and
   // returns its channels only when `returnChannels`.
@@ -45,7 +43,6 @@ class FakeKestrel final : public Kestrel {
   // createSubscription returns nullptr (the subscribed channels are still filled in).
   void setSubscriptionReturnsNull(bool on);
 
-  int samplingCalls() const;
   int deltaCalls() const;
 
   std::optional<SXValue> copyChannelsInGroup(const Name& group, const Name& subgroup, int options,
@@ -76,6 +73,5 @@ class FakeKestrel final : public Kestrel {
   std::map<Query, std::optional<int64_t>> samplingFaults_ SX_GUARDED_BY(mutex_);
   std::map<Query, int64_t> deltaFaults_ SX_GUARDED_BY(mutex_);
   bool nullSubscriptions_ SX_GUARDED_BY(mutex_) = false;
-  int samplingCalls_ SX_GUARDED_BY(mutex_) = 0;
   int deltaCalls_ SX_GUARDED_BY(mutex_) = 0;
 };
