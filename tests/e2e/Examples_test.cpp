@@ -1,11 +1,9 @@
-// The example clients in C and Python against the real daemon, and `status --metrics`.
+// The example clients in C and Python against the real daemon.
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
 #include <cstdio>
 #include <filesystem>
-#include <regex>
-#include <sstream>
 
 #include "support/Daemon.h"
 
@@ -96,23 +94,6 @@ TEST(ExamplesEndToEnd, ThePythonClientSurvivesSilenceAndRejections) {
             "SXReportingError frobnicate:: unknown method 'frobnicate:'\n"
             "True\nheld\nTrue\n"
             "{'reporterID': 5, 'serviceType': 65535} [5]\n");
-}
-
-TEST(ExamplesEndToEnd, StatusMetricsIsPrometheusText) {
-  TestDaemon daemon;
-  auto client = daemon.client();  // one more client for the status to show
-  std::string text;
-  ASSERT_EQ(daemon.ctl({"status", "--metrics"}, &text), 0) << text;
-  EXPECT_TRUE(text.starts_with("# HELP sxreporting_up ")) << text;
-  EXPECT_NE(text.find("\nsxreporting_up 1\n"), std::string::npos) << text;
-  EXPECT_NE(text.find("\nsxreporting_reporting_enabled 1\n"), std::string::npos) << text;
-  const std::regex line(
-      R"(# (HELP|TYPE) sxreporting_[a-z0-9_]+ .*|sxreporting_[a-z0-9_]+(\{[a-z]+="[^"]*"\})? [-+.0-9eNaInf]+)");
-  std::istringstream lines(text);
-  for (std::string one; std::getline(lines, one);) {
-    EXPECT_TRUE(std::regex_match(one, line)) << one;
-  }
-  EXPECT_EQ(text.back(), '\n');
 }
 
 }  // namespace

@@ -246,6 +246,22 @@ int TestDaemon::ctl(const std::vector<std::string>& args, std::string* output) c
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
+pid_t TestDaemon::spawnCtl(const std::vector<std::string>& args) const {
+  std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", socket_};
+  argv.insert(argv.end(), args.begin(), args.end());
+  std::vector<char*> raw;
+  for (auto& a : argv) raw.push_back(a.data());
+  raw.push_back(nullptr);
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    int null = ::open("/dev/null", O_WRONLY);
+    ::dup2(null, STDOUT_FILENO);
+    ::execv(raw[0], raw.data());
+    ::_exit(127);
+  }
+  return pid;
+}
+
 long residentKiB(pid_t pid) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/status");
   std::string line;

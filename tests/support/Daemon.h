@@ -76,6 +76,8 @@ class TestDaemon {
 
   // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
+  // Starts sxreportctl against this daemon, its output discarded; returns its pid.
+  pid_t spawnCtl(const std::vector<std::string>& args) const;
 
  private:
   std::vector<int> listeningSockets(int count) const;
