@@ -139,21 +139,6 @@ TEST_F(InotifyNotificationsTest, OtherWaysOfChangingTheFileCountAsPosts) {
   ASSERT_TRUE(deliveries_.waitFor(3));
 }
 
-TEST_F(InotifyNotificationsTest, PostsReachRegistrationsOfOtherInstances) {
-  // Two instances watch the directory the way two processes would.
-  auto daemon = open();
-  auto tool = open();
-  subscribe(*daemon, kName, queue1_, "daemon");
-  subscribe(*tool, kName, queue2_, "tool");
-  EXPECT_EQ(tool->post(kName), 0);
-  ASSERT_TRUE(deliveries_.waitFor(2));
-  EXPECT_EQ(daemon->post(kName), 0);
-  ASSERT_TRUE(deliveries_.waitFor(4));
-  std::multiset<std::string> tags;
-  for (const auto& delivery : deliveries_.all()) tags.insert(delivery.tag);
-  EXPECT_EQ(tags, std::multiset<std::string>({"daemon", "daemon", "tool", "tool"}));
-}
-
 TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArguments) {
   auto notify = open();
   int token = -7;

@@ -102,16 +102,6 @@ TEST_F(JsonPreferencesTest, WritesCreateDirectoriesAndReadBack) {
   EXPECT_EQ(errorLines(), 0u);
 }
 
-TEST_F(JsonPreferencesTest, ReadsChangesOfOtherProcessesAtOnce) {
-  auto prefs = open();
-  ASSERT_EQ(prefs->setValue(kDomain, "disable_reporting", SXValue(false)), std::nullopt);
-  writeFile(domainFile(), R"({"disable_reporting": "YES", "device_name": 12})");
-  EXPECT_EQ(prefs->copyValue(kDomain, "disable_reporting"), SXValue("YES"));
-  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), SXValue(12));
-  fs::remove(domainFile());
-  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue::object());
-}
-
 TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {
   auto prefs = open();
   for (const char* text : {"not json", "[1, 2]", "\"text\"", "", "{\"a\": 1"}) {

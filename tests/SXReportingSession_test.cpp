@@ -56,10 +56,7 @@ TEST(SXReportingSessionRecord, NewSessionDefaultsAndConfigurationMerge) {
   EXPECT_FALSE(session->started());
   EXPECT_EQ(session->userInfo(), SXValue::object());
   EXPECT_TRUE(session->aggregatedPayloadEntries().empty());
-  EXPECT_EQ(t.dispatch->createdQueues().back(), "com.vendra.sonex.session.fernreporting");
 
-  session->setServiceType(1);
-  EXPECT_EQ(session->serviceName(), "vokira");
   SXValue config = {{"a", 1}};
   SXValue defaults = {{"a", 2}, {"b", 3}};
   session->setConfiguration(&config);
