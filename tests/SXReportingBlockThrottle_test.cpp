@@ -82,7 +82,8 @@ TEST(SXReportingBlockThrottleKeyTest, KeyListsSortedFieldsThenReporterCategoryAn
       // A message's own blacklist applies to it; one that is not an array is ignored.
       {{{"a", 1}, {"b", 2}, {"_comparison_field_blacklist", {"b", 7}}},
        "_comparison_field_blacklist|^|a|1|b|^" + tail},
-      {{{"b", 2}, {"_comparison_field_blacklist", "b"}}, "_comparison_field_blacklist|^|b|2" + tail},
+      {{{"b", 2}, {"_comparison_field_blacklist", "b"}},
+       "_comparison_field_blacklist|^|b|2" + tail},
       {{{"n", 1e20}}, "n|100000000000000000000" + tail},
       {{{"n", 0.1}}, "n|0.1" + tail},
       // Dictionaries nest in ascending key order.
@@ -102,7 +103,8 @@ TEST(SXReportingBlockThrottleKeyTest, EqualKeysMeanEqualValuesBarTheExcludedOnes
     bool same;
   };
   std::vector<Row> rows = {
-      {{{"Volume", 0.5}, {"VolumeOperationTime", 3}}, {{"Volume", 0.75}, {"VolumeOperationTime", 9}},
+      {{{"Volume", 0.5}, {"VolumeOperationTime", 3}},
+       {{"Volume", 0.75}, {"VolumeOperationTime", 9}},
        true},
       {{{"Volume", 0.5}}, {{"Volume", 0.75}}, false},
       {{{"VolumeOperationTime", 1}}, {{"VolumeOperationTime", 2}}, false},

@@ -371,8 +371,8 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
 }
 
 TEST(SummaryFileName, NamesAreKeptButForSlashAndNul) {
-  for (const std::string name : {"player", "com.vendra.Music", "caf\u00e9 app", "", ".hidden", "...",
-                                 "a\\b", "tab\there\nnew\x7f"}) {
+  for (const std::string name : {"player", "com.vendra.Music", "caf\u00e9 app", "", ".hidden",
+                                 "...", "a\\b", "tab\there\nnew\x7f"}) {
     EXPECT_EQ(hostPart(name), name);
   }
   EXPECT_EQ(hostPart("../../etc/passwd"), ".._.._etc_passwd");

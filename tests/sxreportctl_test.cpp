@@ -11,6 +11,7 @@
 #include <sstream>
 
 #include "fakes/FakeRpcServer.h"
+#include "support/Daemon.h"
 
 using namespace sxr::method;
 using Answer = FakeRpcServer::Answer;
@@ -22,12 +23,6 @@ struct CtlRun {
   std::string out;
   std::string err;
 };
-
-std::string quoted(const std::string& arg) {
-  std::string text = "'";
-  for (char c : arg) text += c == '\'' ? std::string("'\\''") : std::string(1, c);
-  return text + "'";
-}
 
 std::string slurp(const std::string& path) {
   std::ifstream in(path);
@@ -50,10 +45,11 @@ class SxreportctlTest : public ::testing::Test {
   }
   std::string command(const std::vector<std::string>& args) {
     const std::string& dir = server_.directory();
-    std::string command = std::string(SXR_CTL_PATH) + " --socket " + quoted(server_.socketPath()) +
-                          " --state-dir " + quoted(dir) + " --config-dir " + quoted(dir) +
-                          " --runtime-dir " + quoted(dir);
-    for (const auto& arg : args) command += " " + quoted(arg);
+    std::string command = std::string(SXR_CTL_PATH) + " --socket " +
+                          shellQuoted(server_.socketPath()) + " --state-dir " + shellQuoted(dir) +
+                          " --config-dir " + shellQuoted(dir) + " --runtime-dir " +
+                          shellQuoted(dir);
+    for (const auto& arg : args) command += " " + shellQuoted(arg);
     return command;
   }
 

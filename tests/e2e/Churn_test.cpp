@@ -86,8 +86,8 @@ void churnBatch(const TestDaemon& daemon, SXReportingClient& observer, int64_t f
     std::string id = std::to_string(firstID + i);
     SXValue payload = {{"churn", firstID + i}};
     if (i % 2 == 0) {
-      children.push_back(daemon.spawnCtl({"create", id, "then", "send", "--ids", id,
-                                           payload.dump(), "then", "start", id}));
+      children.push_back(daemon.spawnCtl(
+          {"create", id, "then", "send", "--ids", id, payload.dump(), "then", "start", id}));
       continue;
     }
     auto raw = std::make_unique<RawClient>(daemon.socket());

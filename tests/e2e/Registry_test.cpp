@@ -153,9 +153,11 @@ TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
   for (int i = 0; i < 33; ++i) deep = SXValue{{"k", deep}};
   std::vector<std::string> attacks = {
       std::string("\xc1\xc1\xc1\xc1", 4),  // not MessagePack
+      SXTestRequest(
+          1, sxr::method::kSendMessage,
+          SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),  // too large
       SXTestRequest(1, sxr::method::kSendMessage,
-              SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),    // too large
-      SXTestRequest(1, sxr::method::kSendMessage, SXValue::array({deep, 3, 1, nullptr})),  // too deep
+                    SXValue::array({deep, 3, 1, nullptr})),  // too deep
       SXTestRequest(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3) +
           std::string(70000, '\0'),         // a message that never ends
       std::string("\x93\x02\xa1m\x90", 5),  // a notification: no msgid to answer

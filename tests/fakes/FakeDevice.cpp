@@ -1,7 +1,6 @@
 #include "fakes/FakeDevice.h"
 
-void FakeOrientationService::add(bool interface, const std::string& id,
-                                 SXOrientationCallback cb) {
+void FakeOrientationService::add(bool interface, const std::string& id, SXOrientationCallback cb) {
   SXMutexLock lock(mutex_);
   callbacks(interface)[id] = std::move(cb);
   calls_.push_back("register" + what(interface) + id);

@@ -88,12 +88,8 @@ class FakeOrientationService final : public SXOrientationService {
                                             SXOrientationCallback cb) override {
     add(true, id, std::move(cb));
   }
-  void unregisterDeviceOrientationCallback(const std::string& id) override {
-    remove(false, id);
-  }
-  void unregisterInterfaceOrientationCallback(const std::string& id) override {
-    remove(true, id);
-  }
+  void unregisterDeviceOrientationCallback(const std::string& id) override { remove(false, id); }
+  void unregisterInterfaceOrientationCallback(const std::string& id) override { remove(true, id); }
   std::string orientationName(int32_t orientation) const override {
     return "orientation" + std::to_string(orientation);
   }

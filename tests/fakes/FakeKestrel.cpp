@@ -48,7 +48,8 @@ std::string temporaryTree() {
 
 }  // namespace
 
-FakeKestrel::FakeKestrel() : root_(temporaryTree()), real_(root_, std::make_shared<SXDiscardLog>()) {}
+FakeKestrel::FakeKestrel()
+    : root_(temporaryTree()), real_(root_, std::make_shared<SXDiscardLog>()) {}
 
 FakeKestrel::~FakeKestrel() {
   std::error_code ignored;

@@ -1,6 +1,5 @@
 #include "fakes/FakeLog.h"
 
-
 std::shared_ptr<const SXLogScope> FakeLog::registerScope(const SXLogScope& scope) {
   return std::make_shared<const SXLogScope>(scope);
 }

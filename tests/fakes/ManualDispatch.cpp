@@ -2,7 +2,6 @@
 
 #include <algorithm>
 
-
 namespace {
 
 class ManualQueue final : public SXWorkQueue {
