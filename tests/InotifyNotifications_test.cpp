@@ -18,6 +18,7 @@
 
 #include "common/SXThreadSafety.h"
 #include "fakes/FakeLog.h"
+#include "support/SqliteTestSupport.h"
 #include "platform/AsioDispatch.h"
 
 namespace fs = std::filesystem;
@@ -37,7 +38,9 @@ auto runOn(SXWorkQueue& queue, Task task) {
   EXPECT_EQ(result.wait_for(kDeadline), std::future_status::ready) << queue.label();
   return result.get();
 }
-void drain(SXWorkQueue& queue) { runOn(queue, [] {}); }
+void drain(SXWorkQueue& queue) {
+  runOn(queue, [] {});
+}
 std::thread::id threadOf(SXWorkQueue& queue) {
   return runOn(queue, [] { return std::this_thread::get_id(); });
 }
@@ -77,13 +80,6 @@ class Deliveries {
 
 class InotifyNotificationsTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char pattern[] = "/tmp/sxnotify-XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern), nullptr);
-    runtimeDir_ = pattern;
-  }
-  void TearDown() override { fs::remove_all(runtimeDir_); }
-
   std::unique_ptr<SXInotifyNotifications> open() {
     return std::make_unique<SXInotifyNotifications>(runtimeDir_, log_);
   }
@@ -95,7 +91,8 @@ class InotifyNotificationsTest : public ::testing::Test {
   }
   std::string notifyFile(const std::string& name) const { return runtimeDir_ + "/notify/" + name; }
 
-  std::string runtimeDir_;
+  SXTestTempDir temporary_;
+  const std::string runtimeDir_ = temporary_.path();
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
   Deliveries deliveries_;  // outlives the queues below, which run its handlers
   SXAsioDispatch dispatch_;
