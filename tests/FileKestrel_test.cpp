@@ -12,6 +12,7 @@
 
 #include "SXReportingDriverUtility.h"
 #include "fakes/FakeLog.h"
+#include "support/SqliteTestSupport.h"
 
 namespace {
 
@@ -20,18 +21,6 @@ using ::testing::ElementsAre;
 
 class FileKestrelTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "kestrel-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    dir_ = pattern;
-    root_ = dir_ / "kestrel";
-    kestrel_ = std::make_unique<SXFileKestrel>(root_.string(), log_);
-  }
-  void TearDown() override {
-    std::error_code ec;
-    fs::remove_all(dir_, ec);
-  }
-
   void publish(const std::string& relative, const std::string& contents) {
     fs::create_directories((root_ / relative).parent_path());
     std::ofstream(root_ / relative) << contents;
@@ -90,10 +79,11 @@ class FileKestrelTest : public ::testing::Test {
     return out;
   }
 
-  fs::path dir_;
-  fs::path root_;
+  SXTestTempDir temporary_;
+  const fs::path dir_ = temporary_.path();
+  const fs::path root_ = dir_ / "kestrel";
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
-  std::unique_ptr<SXFileKestrel> kestrel_;
+  std::unique_ptr<SXFileKestrel> kestrel_ = std::make_unique<SXFileKestrel>(root_.string(), log_);
   std::optional<KestrelError> error_;
   std::shared_ptr<KestrelSubscription> subscription_;
   SXValue subscribed_;
@@ -266,6 +256,8 @@ TEST_F(FileKestrelTest, DriverUtilityEndToEnd) {
                      {"MCA_clips", 1},
                      {"MCA_overruns", 1},
                      {"Haptics_Stats_clips", 8}}));
+  // Nothing rose since a fresh snapshot: none, rather than an empty dictionary.
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(utility.getSnapShot()), std::nullopt);
 }
 
 TEST_F(FileKestrelTest, DriverUtilityWithoutTreeSubscribesNothing) {
@@ -278,6 +270,11 @@ TEST_F(FileKestrelTest, DriverUtilityWithoutTreeSubscribesNothing) {
   EXPECT_EQ(utility.getSnapShot(), SXValue::object());
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(SXValue::object()), std::nullopt);
   EXPECT_THAT(log_->messages(), ElementsAre("creating kestrelstats driver utility"));
+
+  SXPlatform bare;  // no driver library at all
+  bare.log = log_;
+  SXReportingEnvironment withoutLibrary(std::move(bare));
+  EXPECT_TRUE(SXReportingDriverUtility(withoutLibrary).ioChannelSubscriptions().empty());
 }
 
 }  // namespace

@@ -27,21 +27,13 @@ size_t replayCorpus(const std::string& target, Target run) {
 
 }  // namespace
 
-TEST(FuzzCorpus, WireDecoderInputs) {
-  EXPECT_GT(replayCorpus("fuzz_rpc_decoder", SXFuzzRpcDecoder), 0u);
-}
-
-TEST(FuzzCorpus, MsgpackValueInputs) {
-  EXPECT_GT(replayCorpus("fuzz_msgpack_value", SXFuzzMsgpackValue), 0u);
-}
-
-TEST(FuzzCorpus, PayloadInputs) { EXPECT_GT(replayCorpus("fuzz_payload", SXFuzzPayload), 0u); }
-
-TEST(FuzzCorpus, EmptyAndTinyInputs) {
+TEST(FuzzCorpus, EveryTargetTakesItsCorpusAndTinyInputs) {
+  const std::pair<const char*, Target> targets[] = {{"fuzz_rpc_decoder", SXFuzzRpcDecoder},
+                                                    {"fuzz_msgpack_value", SXFuzzMsgpackValue},
+                                                    {"fuzz_payload", SXFuzzPayload}};
   const uint8_t bytes[] = {0, 1, 2};
-  for (size_t n = 0; n <= sizeof bytes; ++n) {
-    SXFuzzRpcDecoder(bytes, n);
-    SXFuzzMsgpackValue(bytes, n);
-    SXFuzzPayload(bytes, n);
+  for (const auto& [name, run] : targets) {
+    EXPECT_GT(replayCorpus(name, run), 0u) << name;
+    for (size_t n = 0; n <= sizeof bytes; ++n) run(bytes, n);
   }
 }

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "fakes/FakeLog.h"
+#include "support/SqliteTestSupport.h"
 
 namespace fs = std::filesystem;
 
@@ -20,14 +21,6 @@ constexpr const char* kDomain = "com.vendra.sonex";
 
 class JsonPreferencesTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char pattern[] = "/tmp/sxprefs-XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern), nullptr);
-    root_ = pattern;
-    configDir_ = root_ + "/config";  // absent until the first write
-  }
-  void TearDown() override { fs::remove_all(root_); }
-
   std::unique_ptr<SXJsonPreferences> open() {
     return std::make_unique<SXJsonPreferences>(configDir_ + "/preferences", log_);
   }
@@ -44,8 +37,9 @@ class JsonPreferencesTest : public ::testing::Test {
     return n;
   }
 
-  std::string root_;
-  std::string configDir_;
+  SXTestTempDir temporary_;
+  const std::string root_ = temporary_.path();
+  const std::string configDir_ = root_ + "/config";  // absent until the first write
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
 };
 
@@ -100,16 +94,6 @@ TEST_F(JsonPreferencesTest, WritesCreateDirectoriesAndReadBack) {
   ASSERT_EQ(prefs->setValue("other", "key", std::nullopt), std::nullopt);
   EXPECT_FALSE(fs::exists(domainFile("other")));
   EXPECT_EQ(errorLines(), 0u);
-}
-
-TEST_F(JsonPreferencesTest, ReadsChangesOfOtherProcessesAtOnce) {
-  auto prefs = open();
-  ASSERT_EQ(prefs->setValue(kDomain, "disable_reporting", SXValue(false)), std::nullopt);
-  writeFile(domainFile(), R"({"disable_reporting": "YES", "device_name": 12})");
-  EXPECT_EQ(prefs->copyValue(kDomain, "disable_reporting"), SXValue("YES"));
-  EXPECT_EQ(prefs->copyValue(kDomain, "device_name"), SXValue(12));
-  fs::remove(domainFile());
-  EXPECT_EQ(prefs->copyDomain(kDomain), SXValue::object());
 }
 
 TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {

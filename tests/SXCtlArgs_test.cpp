@@ -167,27 +167,6 @@ TEST(SXCtlArgsTest, SinceTakesUtcTimesAndAges) {
   }
 }
 
-TEST(SXCtlArgsTest, HelpForTheToolAndEachCommand) {
-  auto overview = parse({"--help"});
-  EXPECT_TRUE(overview.help);
-  EXPECT_TRUE(overview.command.empty());
-  auto send = parse({"send", "--help"});  // needs none of send's arguments
-  EXPECT_TRUE(send.help);
-  EXPECT_EQ(send.command, "send");
-  EXPECT_EQ(parse({"help", "start"}).command, "start");
-  EXPECT_TRUE(parse({"-h"}).help);
-  EXPECT_TRUE(parse({"--version"}).version);
-  EXPECT_TRUE(parse({"list", "--version"}).version);
-
-  EXPECT_EQ(SXCtlHelp("start").rfind("usage: sxreportctl [options] start ID\n", 0), 0u);
-  const std::string text = SXCtlHelp("");
-  for (const char* command :
-       {"create", "set-type", "get-type", "configure", "start", "send", "stop", "destroy", "valid",
-        "list", "kill", "status", "events", "defaults", "notify"}) {
-    EXPECT_NE(text.find(std::string("\n  ") + command), std::string::npos) << command;
-  }
-}
-
 TEST(SXCtlArgsTest, ChainsShareGlobalOptions) {
   std::vector<SXCtlRequest> chain;
   std::string error;

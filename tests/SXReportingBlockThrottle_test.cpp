@@ -68,72 +68,70 @@ struct Rig {
 // ---- Message keys ----
 
 TEST(SXReportingBlockThrottleKeyTest, KeyListsSortedFieldsThenReporterCategoryAndType) {
-  EXPECT_EQ(key({{"b", 2}, {"a", "x"}, {"systemuptime_sec", 100}}),
-            "a|x|b|2|systemuptime_sec|^|reporterID|42|Playback|Start");
+  const std::string tail = "|reporterID|42|Playback|Start";
+  const std::pair<SXValue, std::string> rows[] = {
+      {{{"b", 2}, {"a", "x"}, {"systemuptime_sec", 100}}, "a|x|b|2|systemuptime_sec|^" + tail},
+      // Keys in byte order: upper case before "_" before lower case before non-ASCII.
+      {{{"\xC3\xA9", 1}, {"a", 2}, {"_x", 3}, {"B", 4}}, "B|4|_x|3|a|2|\xC3\xA9|1" + tail},
+      // A payload that is not a dictionary counts as empty.
+      {SXValue::array({1, 2}), tail.substr(1)},
+      {SXValue(), tail.substr(1)},
+      // The volume pair is left out only together.
+      {{{"Volume", 0.5}, {"VolumeOperationTime", 3}}, "Volume|^|VolumeOperationTime|^" + tail},
+      {{{"Volume", 0.5}}, "Volume|0.5" + tail},
+      // A message's own blacklist applies to it; one that is not an array is ignored.
+      {{{"a", 1}, {"b", 2}, {"_comparison_field_blacklist", {"b", 7}}},
+       "_comparison_field_blacklist|^|a|1|b|^" + tail},
+      {{{"b", 2}, {"_comparison_field_blacklist", "b"}},
+       "_comparison_field_blacklist|^|b|2" + tail},
+      {{{"n", 1e20}}, "n|100000000000000000000" + tail},
+      {{{"n", 0.1}}, "n|0.1" + tail},
+      // Dictionaries nest in ascending key order.
+      {{{"d", {{"z", 1}, {"a", {{"y", "s"}}}}}}, "d|{\"a\":{\"y\":\"s\"},\"z\":1}" + tail},
+  };
+  for (const auto& [payload, expected] : rows) EXPECT_EQ(key(payload), expected) << payload;
   EXPECT_EQ(SXReportingBlockThrottle::buildMessageKey(SXValue::object(), 7, 1, 1),
             "reporterID|7|Generic|Start");
   EXPECT_EQ(key({{"a", 1}}, -1), "a|1|reporterID|-1|Playback|Start");
-  EXPECT_NE(key({{"a", 1}}, 1), key({{"a", 1}}, -1));
-  // Keys in byte order: upper case before "_" before lower case before non-ASCII.
-  EXPECT_EQ(key({{"\xC3\xA9", 1}, {"a", 2}, {"_x", 3}, {"B", 4}}),
-            "B|4|_x|3|a|2|\xC3\xA9|1|reporterID|42|Playback|Start");
-  // Bad input: a payload that is not a dictionary counts as empty.
-  EXPECT_EQ(key(SXValue::array({1, 2})), key(SXValue::object()));
-  EXPECT_EQ(key(SXValue()), "reporterID|42|Playback|Start");
 }
 
-TEST(SXReportingBlockThrottleKeyTest, DefaultExclusionsHideValuesButNotKeys) {
-  SXValue base = {{"a", 1}};
+// Two messages share a key exactly when their values' texts are equal, once the excluded
+// fields' values are left out (their keys still count).
+TEST(SXReportingBlockThrottleKeyTest, EqualKeysMeanEqualValuesBarTheExcludedOnes) {
+  struct Row {
+    SXValue a, b;
+    bool same;
+  };
+  std::vector<Row> rows = {
+      {{{"Volume", 0.5}, {"VolumeOperationTime", 3}},
+       {{"Volume", 0.75}, {"VolumeOperationTime", 9}},
+       true},
+      {{{"Volume", 0.5}}, {{"Volume", 0.75}}, false},
+      {{{"VolumeOperationTime", 1}}, {{"VolumeOperationTime", 2}}, false},
+      {{{"b", 2}, {"_comparison_field_blacklist", {"b"}}},
+       {{"b", 99}, {"_comparison_field_blacklist", {"b"}}},
+       true},
+      // Numbers compare by value, whatever their kind; booleans are the numbers 1 and 0.
+      {{{"n", 1}}, {{"n", 1.0}}, true},
+      {{{"n", {1, -2, 3u}}}, {{"n", {1.0, -2.0, 3.0}}}, true},
+      {{{"n", {true}}}, {{"n", {1}}}, true},
+      {{{"n", 1}}, {{"n", 1.5}}, false},
+      {{{"n", 9007199254740993}}, {{"n", 9007199254740992.0}}, false},
+      // At top level a string is its own text, so "1" and 1 meet; inside containers strings
+      // are quoted and never meet a number.
+      {{{"n", "1"}}, {{"n", 1}}, true},
+      {{{"n", {"1"}}}, {{"n", {1}}}, false},
+      {{{"n", {"a,b"}}}, {{"n", {"a", "b"}}}, false},
+      {{{"n", {"a\"b"}}}, {{"n", {"a", "b"}}}, false},
+      {{{"n", {nullptr}}}, {{"n", {"null"}}}, false},
+  };
   for (const char* field : {"systemuptime_sec", "processuptime_ms", "sxreporting_timestamp",
                             "_throttle_seconds", "_comparison_field_blacklist"}) {
-    SXValue one = base, two = base;
-    one[field] = 1;
-    two[field] = "different";
-    EXPECT_EQ(key(one), key(two)) << field;
-    EXPECT_NE(key(one), key(base)) << field;  // the excluded key itself still counts
+    rows.push_back({{{"a", 1}, {field, 1}}, {{"a", 1}, {field, "different"}}, true});
+    rows.push_back({{{"a", 1}, {field, 1}}, {{"a", 1}}, false});
   }
-}
-
-TEST(SXReportingBlockThrottleKeyTest, VolumePairExcludedOnlyTogether) {
-  SXValue withTime = {{"Volume", 0.5}, {"VolumeOperationTime", 3}};
-  SXValue otherVolume = {{"Volume", 0.75}, {"VolumeOperationTime", 9}};
-  EXPECT_EQ(key(withTime), key(otherVolume));
-  EXPECT_EQ(key(withTime), "Volume|^|VolumeOperationTime|^|reporterID|42|Playback|Start");
-  EXPECT_NE(key({{"Volume", 0.5}}), key({{"Volume", 0.75}}));
-  EXPECT_NE(key({{"VolumeOperationTime", 1}}), key({{"VolumeOperationTime", 2}}));
-}
-
-TEST(SXReportingBlockThrottleKeyTest, MessageBlacklistAppliesToThatMessageOnly) {
-  SXValue listed = {{"a", 1}, {"b", 2}, {"_comparison_field_blacklist", {"b", 7}}};
-  EXPECT_EQ(key(listed), "_comparison_field_blacklist|^|a|1|b|^|reporterID|42|Playback|Start");
-  listed["b"] = 99;
-  EXPECT_EQ(key(listed), "_comparison_field_blacklist|^|a|1|b|^|reporterID|42|Playback|Start");
-  EXPECT_EQ(key({{"a", 1}, {"b", 2}}), "a|1|b|2|reporterID|42|Playback|Start");
-  // Not an array: ignored, the default exclusions still apply.
-  EXPECT_EQ(key({{"b", 2}, {"_comparison_field_blacklist", "b"}}),
-            "_comparison_field_blacklist|^|b|2|reporterID|42|Playback|Start");
-}
-
-TEST(SXReportingBlockThrottleKeyTest, ValueTextIsEqualityPreserving) {
-  // Numbers compare by value, whatever their kind; booleans are the numbers 1 and 0.
-  EXPECT_EQ(key({{"n", 1}}), key({{"n", 1.0}}));
-  EXPECT_EQ(key({{"n", SXValue::array({1, -2, 3u})}}),
-            key({{"n", SXValue::array({1.0, -2.0, 3.0})}}));
-  EXPECT_EQ(key({{"n", SXValue::array({true})}}), key({{"n", SXValue::array({1})}}));
-  EXPECT_NE(key({{"n", 1}}), key({{"n", 1.5}}));
-  EXPECT_EQ(key({{"n", 1e20}}), "n|100000000000000000000|reporterID|42|Playback|Start");
-  EXPECT_EQ(key({{"n", 0.1}}), "n|0.1|reporterID|42|Playback|Start");
-  EXPECT_NE(key({{"n", 9007199254740993}}), key({{"n", 9007199254740992.0}}));
-  // At top level a string is its own text, so "1" and 1 meet; inside containers strings are
-  // quoted and never meet a number.
-  EXPECT_EQ(key({{"n", "1"}}), key({{"n", 1}}));
-  EXPECT_NE(key({{"n", SXValue::array({"1"})}}), key({{"n", SXValue::array({1})}}));
-  EXPECT_NE(key({{"n", SXValue::array({"a,b"})}}), key({{"n", SXValue::array({"a", "b"})}}));
-  EXPECT_NE(key({{"n", SXValue::array({"a\"b"})}}), key({{"n", SXValue::array({"a", "b"})}}));
-  EXPECT_NE(key({{"n", SXValue::array({nullptr})}}), key({{"n", SXValue::array({"null"})}}));
-  // Dictionaries nest in ascending key order.
-  EXPECT_EQ(key({{"d", {{"z", 1}, {"a", {{"y", "s"}}}}}}),
-            "d|{\"a\":{\"y\":\"s\"},\"z\":1}|reporterID|42|Playback|Start");
+  for (const Row& row : rows) EXPECT_EQ(key(row.a) == key(row.b), row.same) << row.a << row.b;
+  EXPECT_NE(key({{"a", 1}}, 1), key({{"a", 1}}, -1));
 }
 
 // ---- Throttle time ----

@@ -31,70 +31,10 @@ class SXReportingClientTest : public ::testing::Test {
     ASSERT_TRUE(client_->connect(&error)) << error;
   }
 
-  SXValue paramsOf(const std::string& method) {
-    for (const auto& request : server_.requests()) {
-      if (request.method == method) return request.params;
-    }
-    return "no request";
-  }
-
   FakeRpcServer server_;
   std::unique_ptr<SXReportingClient> client_ =
       std::make_unique<SXReportingClient>(SXClientOptions{server_.socketPath()});
 };
-
-TEST_F(SXReportingClientTest, EachOperationSendsItsParamsAndDecodesItsReply) {
-  server_.on(kCreate, [](auto&) { return Answer::reply(true); });
-  server_.on(kSetServiceType, [](auto&) { return Answer::reply(true); });
-  server_.on(kGetServiceType, [](auto&) { return Answer::reply(2); });
-  server_.on(kSetConfiguration, [](auto&) { return Answer::reply(true); });
-  server_.on(kStart, [](auto&) { return Answer::reply(false); });
-  server_.on(kStop, [](auto&) { return Answer::reply(true); });
-  server_.on(kDestroy, [](auto&) { return Answer::reply(false); });
-  server_.on(kValid, [](auto&) { return Answer::reply({{"reporterID", 42}, {"serviceType", 2}}); });
-  server_.on(kGetAllReporters, [](auto&) { return Answer::reply({1, -2, 3}); });
-  server_.on(kStatus, [](auto&) { return Answer::reply({{"reportingEnabled", true}}); });
-
-  auto& c = *client_;
-  EXPECT_TRUE(await(c.createReportingSession(42)).value);
-  EXPECT_TRUE(await(c.setServiceType(2, 42)).value);
-  EXPECT_EQ(await(c.getServiceNameForReporterID(42)).value, 2);
-  EXPECT_TRUE(await(c.setConfiguration(std::nullopt, 42)).value);
-  EXPECT_FALSE(await(c.startReportingSessionForID(43)).value);
-  EXPECT_TRUE(await(c.stopReportingSessionForID(42)).value);
-  EXPECT_FALSE(await(c.destroyReportingSession(42)).value);
-  EXPECT_EQ(await(c.reporterID(42)).value, (SXReporterIDValidity{42, 2}));
-  EXPECT_EQ(await(c.getAllReporters()).value, (std::vector<int64_t>{1, -2, 3}));
-  auto status = await(c.status());
-  EXPECT_TRUE(status.replied());
-  EXPECT_EQ(status.value["reportingEnabled"], true);
-
-  EXPECT_EQ(paramsOf(kCreate), SXValue::array({42}));
-  EXPECT_EQ(paramsOf(kSetServiceType), SXValue::array({2, 42}));
-  EXPECT_EQ(paramsOf(kSetConfiguration), SXValue::array({nullptr, 42}));
-  EXPECT_EQ(paramsOf(kStart), SXValue::array({43}));
-  EXPECT_EQ(paramsOf(kGetAllReporters), SXValue::array());
-  EXPECT_EQ(paramsOf(kStatus), SXValue::array());
-}
-
-TEST_F(SXReportingClientTest, SendMessageDistinguishesBroadcastAndReportsTheDisabledError) {
-  server_.on(kSendMessage, [](const SXValue& params) {
-    if (params[3].is_null()) return Answer::reply(nullptr);
-    return Answer::reply({{"domain", kSXReportingErrorDomain}, {"code", 1}});
-  });
-  auto broadcast = await(client_->sendMessage({{"k", 1}}, 0x08000003, 1, std::nullopt));
-  ASSERT_TRUE(broadcast.replied());
-  EXPECT_FALSE(broadcast.value.has_value());
-
-  auto none = await(client_->sendMessage({{"k", 1}}, 3, 2, std::vector<int64_t>{}));
-  ASSERT_TRUE(none.replied()) << none.error;
-  EXPECT_EQ(none.value, (SXError{kSXReportingErrorDomain, kSXReportingErrorReportingDisabled}));
-
-  auto requests = server_.requests();
-  ASSERT_EQ(requests.size(), 2u);
-  EXPECT_EQ(requests[0].params, SXValue::array({{{"k", 1}}, 0x08000003, 1, nullptr}));
-  EXPECT_EQ(requests[1].params, SXValue::array({{{"k", 1}}, 3, 2, SXValue::array()}));
-}
 
 TEST_F(SXReportingClientTest, RepliesOfTheWrongShapeAreBadReplies) {
   server_.on(kGetServiceType, [](const SXValue& p) {
@@ -111,22 +51,6 @@ TEST_F(SXReportingClientTest, RepliesOfTheWrongShapeAreBadReplies) {
   auto send = await(client_->sendMessage(SXValue::object(), 1, 1, std::nullopt));
   EXPECT_EQ(send.status, SXCallStatus::kBadReply);
   EXPECT_NE(send.error.find("domain"), std::string::npos);
-}
-
-TEST_F(SXReportingClientTest, RemoteErrorsCarryTheServiceText) {
-  server_.on(kCreate, [](const SXValue& params) {
-    if (!params[0].is_number_integer()) return Answer::fail("param 1 is not a reporter ID");
-    return Answer::reply(true);
-  });
-  auto bad = await(client_->call(kCreate, SXValue::array({"forty-two"})));
-  EXPECT_EQ(bad.status, SXCallStatus::kRemoteError);
-  EXPECT_EQ(bad.error, "param 1 is not a reporter ID");
-
-  auto unknown = await(client_->call("frobnicate:", SXValue::array()));
-  EXPECT_EQ(unknown.status, SXCallStatus::kRemoteError);
-  EXPECT_EQ(unknown.error, "unknown method frobnicate:");
-
-  EXPECT_TRUE(await(client_->createReportingSession(1)).value);  // the connection goes on
 }
 
 TEST_F(SXReportingClientTest, ManyCallsInFlightMatchOutOfOrderReplies) {

@@ -70,15 +70,6 @@ TEST_F(DriverUtilityTest, SubscribesToTheFourGroupsInTableOrder) {
   publishAllGroups();
   utility();
 
-  ASSERT_EQ(log_->registrations().size(), 1u);
-  const SXLogScope scope = log_->registrations()[0];
-  EXPECT_EQ(scope.code, 0x73787264u);  // "sxrd"
-  EXPECT_EQ(scope.shortName, "sxrd");
-  EXPECT_EQ(scope.subsystem, "com.vendra.sonex");
-  EXPECT_EQ(scope.category, "reporting_driver_verbose");
-  EXPECT_EQ(scope.options, 31);
-  EXPECT_NE(environment_->driverLogScope(), nullptr);
-
   EXPECT_THAT(descriptions(),
               ElementsAre("VendraAE2MCA-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"));
   EXPECT_THAT(linesIn(kInitPrefix),
@@ -106,20 +97,6 @@ TEST_F(DriverUtilityTest, GroupsWithoutChannelsOrWithFailedQueriesAreLeftOut) {
                           "default|subscribed to group group (null)-MCA"));
 }
 
-TEST_F(DriverUtilityTest, NoDriverLibraryOrNoGroupsMeansNoSubscriptions) {
-  EXPECT_TRUE(descriptions().empty());
-  EXPECT_EQ(utility().getSnapShot(), SXValue::object());
-  EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(std::nullopt), std::nullopt);
-  EXPECT_FALSE(log_->contains("subscribed"));
-
-  SXPlatform bare;
-  bare.log = log_;
-  SXReportingEnvironment environment(std::move(bare));
-  SXReportingDriverUtility withoutLibrary(environment);
-  EXPECT_TRUE(withoutLibrary.ioChannelSubscriptions().empty());
-  EXPECT_EQ(withoutLibrary.getSnapShot(), SXValue::object());
-}
-
 TEST_F(DriverUtilityTest, SnapshotIsKeyedByDriverDescription) {
   publishAllGroups();
   SXValue snapshot = utility().getSnapShot();
@@ -132,35 +109,6 @@ TEST_F(DriverUtilityTest, SnapshotIsKeyedByDriverDescription) {
       linesIn(kSnapShotPrefix),
       ElementsAre("info|sampling driver VendraAE2MCA-(null)", "info|sampling driver Speaker-(null)",
                   "info|sampling driver (null)-MCA", "info|sampling driver Haptics-Stats"));
-}
-
-TEST_F(DriverUtilityTest, ReportsOnlyCountersThatRose) {
-  publishAllGroups();
-  std::optional<SXValue> snapshot = utility().getSnapShot();
-  kestrel_->setValue("VendraAE2MCA", std::nullopt, "Underruns", 5);
-  kestrel_->setValue("Speaker", std::nullopt, "Temp", 39);        // went down
-  kestrel_->setValue("Speaker", std::nullopt, std::nullopt, 12);  // unnamed channel
-  kestrel_->setValue("Haptics", "Stats", "Clips", 8);
-  kestrel_->setValue("Haptics", "Other", "Ignored", 500);  // not subscribed
-  // Codec/MCA/Overruns unchanged.
-
-  auto statistics = utility().getDriverStatisticsRelativeToSnapShot(snapshot);
-  ASSERT_TRUE(statistics);
-  EXPECT_EQ(*statistics,
-            (SXValue{{"VendraAE2MCA_Underruns", 2}, {"Speaker_", 10}, {"Haptics_Stats_Clips", 1}}));
-  EXPECT_TRUE((*statistics)["Speaker_"].is_number_integer());
-
-  std::vector<std::string> expected;
-  for (int i = 0; i < 4; ++i) {
-    expected.push_back("info|getting latest samples");
-    expected.push_back("info|done getting latest samples");
-  }
-  EXPECT_EQ(linesIn(kStatisticsPrefix), expected);
-
-  // Against the same snapshot once more, nothing has moved since the last change: the same.
-  EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(snapshot), statistics);
-  // Against a fresh snapshot nothing rose: none rather than an empty dictionary.
-  EXPECT_EQ(utility().getDriverStatisticsRelativeToSnapShot(utility().getSnapShot()), std::nullopt);
 }
 
 TEST_F(DriverUtilityTest, WithoutSnapshotReportsAbsoluteValuesOfAtLeastOne) {

@@ -8,10 +8,8 @@
 #include <thread>
 
 #include "SXReportingDaemonConfig.h"
-#include "SXReportingServiceDelegate.h"
 #include "common/SXThreadSafety.h"
-#include "fakes/FakeIpc.h"
-#include "support/TestEnvironment.h"
+#include "support/FakeService.h"
 
 namespace {
 
@@ -26,44 +24,10 @@ std::shared_ptr<SXReportingEnvironment> limitedEnvironment(TestEnvironment& t,
   return environment;
 }
 
-struct LimitedService {
-  explicit LimitedService(SXReportingLimits limits)
-      : environment(limitedEnvironment(t, limits)),
-        delegate(SXReportingServiceDelegate::init(environment)) {}
-  ~LimitedService() { t.drain(); }
-
-  std::shared_ptr<FakeIpcConnection> connect(int32_t pid) {
-    auto connection = std::make_shared<FakeIpcConnection>(pid);
-    delegate->shouldAcceptNewConnection(connection);
-    t.drain();
-    return connection;
-  }
-  SXValue call(FakeIpcConnection& c, std::string_view method, SXValue params) {
-    size_t before = c.responses().size();
-    c.request(method, std::move(params));
-    t.drain();
-    auto all = c.responses();
-    return all.size() > before ? all.back().result : SXValue("no reply");
-  }
-  SXValue status() {
-    SXValue out;
-    environment->serverQueue()->async([&] { out = delegate->statusSnapshot(); });
-    t.drain();
-    return out;
-  }
-  uint64_t dropped(const char* guardrail) {
-    return status()["counters"]["guardrail_dropped"][guardrail].get<uint64_t>();
-  }
-
-  TestEnvironment t;
-  std::shared_ptr<SXReportingEnvironment> environment;
-  std::shared_ptr<SXReportingServiceDelegate> delegate;
-};
-
 }  // namespace
 
 TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing) {
-  LimitedService s({.maxSessionsPerClient = 2, .maxSessions = 3});
+  FakeService s({.maxSessionsPerClient = 2, .maxSessions = 3});
   auto a = s.connect(10);
   auto b = s.connect(11);
   for (int64_t id : {1, 2, 3}) EXPECT_EQ(s.call(*a, sxr::method::kCreate, {id}), true) << id;
@@ -86,6 +50,8 @@ TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing)
             (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
 
   EXPECT_EQ(s.call(*a, sxr::method::kDestroy, {1}), true);
+  EXPECT_EQ(s.call(*a, sxr::method::kDestroy, {1}), true);  // already gone: gives nothing back
+  EXPECT_EQ(s.status()["gauges"]["sessions_live"], 2u);
   EXPECT_EQ(s.call(*b, sxr::method::kCreate, {5}), true);
   EXPECT_EQ(s.call(*a, sxr::method::kGetAllReporters, SXValue::array()), SXValue({2, 4, 5}));
   EXPECT_EQ(s.dropped("sessions_total"), 1u);
@@ -214,7 +180,7 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
 // Requests over a size limit get an error reply naming the limit and change nothing; a list
 // that names a session several times reaches it once.
 TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliverOnce) {
-  LimitedService s({.maxPayloadBytes = 64, .maxConfigurationBytes = 64, .maxReporterIDs = 3});
+  FakeService s({.maxPayloadBytes = 64, .maxConfigurationBytes = 64, .maxReporterIDs = 3});
   auto c = s.connect(10);
   ASSERT_EQ(s.call(*c, sxr::method::kCreate, {7}), true);
   ASSERT_EQ(s.call(*c, sxr::method::kStart, {7}), "no reply");  // answered at stop
@@ -260,7 +226,7 @@ TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliver
 // One client's unknown reporter IDs cost at most the per-minute number of error lines; the
 // rest are counted and summed up in one line once the minute is over.
 TEST(SXReportingLimitsErrorLines, ABadClientCostsAFewLinesAMinute) {
-  LimitedService s({.maxErrorLines = 2});
+  FakeService s({.maxErrorLines = 2});
   auto c = s.connect(10);
   EXPECT_EQ(s.call(*c, sxr::method::kSendMessage, {{{"k", 1}}, 3, 1, {1, 2, 3, 4, 5}}), nullptr);
   EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 2u);
@@ -275,7 +241,7 @@ TEST(SXReportingLimitsErrorLines, ABadClientCostsAFewLinesAMinute) {
 }
 
 TEST(SXReportingLimitsConnections, AProcessBeyondItsConnectionLimitIsRefusedUntilOneEnds) {
-  LimitedService s({.maxConnectionsPerClient = 2});
+  FakeService s({.maxConnectionsPerClient = 2});
   auto first = s.connect(10);
   auto second = s.connect(10);
   auto other = s.connect(11);

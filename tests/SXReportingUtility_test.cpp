@@ -22,13 +22,6 @@ TEST(SXReportingUtilityNames, CategoriesComposeComponentAndCategory) {
   EXPECT_EQ(SXReportingUtilityCategoryName(65536), "_Undefined");
 }
 
-TEST(SXReportingUtilityNames, MessageTypes) {
-  EXPECT_EQ(SXReportingUtilityTypeName(0), "Generic");
-  EXPECT_EQ(SXReportingUtilityTypeName(5), "IssueDetector");
-  EXPECT_EQ(SXReportingUtilityTypeName(6), "Undefined");
-  EXPECT_EQ(SXReportingUtilityTypeName(65535), "Unknown");
-}
-
 TEST(SXReportingUtilityNames, MessageKindsStayRightBeyondTheCache) {
   EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
   EXPECT_EQ(SXReportingUtilityMessageKind(0xFFFFFFFF, 65535), "Undefined_Unknown");

@@ -194,27 +194,6 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   }
 }
 
-TEST_F(SqliteFernReportingTest, FlushIsRecordedAfterItsMessagesAndCompletesElsewhere) {
-  auto fern = Make();
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
-  std::optional<FernError> error;
-  session->sendMessage(1, 1, SXValue::object(), error);
-  std::promise<std::pair<std::optional<FernError>, std::thread::id>> done;
-  session->flushMessages([&](std::optional<FernError> e) {
-    done.set_value({e, std::this_thread::get_id()});
-  });
-  auto future = done.get_future();
-  ASSERT_EQ(future.wait_for(20s), std::future_status::ready);
-  auto [flushError, thread] = future.get();
-  EXPECT_EQ(flushError, std::nullopt);
-  EXPECT_NE(thread, std::this_thread::get_id());
-  auto flushes = SXTestQuery(db_, "SELECT * FROM flushes");
-  ASSERT_EQ(flushes.size(), 1u);
-  EXPECT_EQ(flushes[0]["session_id"], SXTestQuery(db_, "SELECT id FROM sessions")[0]["id"]);
-  EXPECT_GE(flushes[0]["time"].get<double>(),
-            SXTestQuery(db_, "SELECT time FROM messages")[0]["time"].get<double>());
-}
-
 TEST_F(SqliteFernReportingTest, SessionsKeepTheSpoolAfterTheAdapterIsGone) {
   auto fern = Make();
   auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});

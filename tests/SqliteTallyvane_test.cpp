@@ -1,3 +1,4 @@
+// The analytics store and the power log, both written by a batch writer of their own.
 #include "platform/SqliteTallyvane.h"
 
 #include <gtest/gtest.h>
@@ -6,6 +7,7 @@
 #include <thread>
 
 #include "fakes/FakeLog.h"
+#include "platform/SqliteJoulebook.h"
 #include "support/SqliteTestSupport.h"
 
 using namespace std::chrono_literals;
@@ -192,6 +194,33 @@ TEST_F(SqliteTallyvaneTest, AFailedWriteDropsItsBatchAndLaterEventsAreWritten) {
   ASSERT_EQ(rows.size(), 2u);
   EXPECT_EQ(rows[0]["name"], "before");
   EXPECT_EQ(rows[1]["name"], "after");
+}
+
+TEST(SqliteJoulebook, EntriesLandWithClientEventAndPayload) {
+  SXTestTempDir dir;
+  auto log = std::make_shared<FakeLog>();
+  double before = SXSqliteNow();
+  SXSqliteJoulebook joulebook(dir.file("joulebook.db"), log);
+  SXValue entry = {{"EngineOnDuration", 12.5}, {"ApplicationName", "app"}, {"TimestampEnd", 1000}};
+  joulebook.logRegisteredEvent(28, "Flumen_Haptics", entry, std::nullopt);
+  // The entry is taken whole at the call: later changes by the caller do not reach the log.
+  entry["ApplicationName"] = "changed";
+  joulebook.logRegisteredEvent(-1, "Other", SXValue::object(), SXValue{{"filter", 1}});
+  joulebook.flush();
+
+  auto rows = SXTestQuery(dir.file("joulebook.db"),
+                          "SELECT time, client_id, event, payload_json FROM entries ORDER BY id");
+  ASSERT_EQ(rows.size(), 2u);
+  EXPECT_EQ(rows[0]["client_id"], 28);
+  EXPECT_EQ(rows[0]["event"], "Flumen_Haptics");
+  EXPECT_EQ(
+      SXValue::parse(rows[0]["payload_json"].get<std::string>()),
+      (SXValue{{"EngineOnDuration", 12.5}, {"ApplicationName", "app"}, {"TimestampEnd", 1000}}));
+  EXPECT_GE(rows[0]["time"].get<double>(), before);
+  EXPECT_LE(rows[0]["time"].get<double>(), SXSqliteNow());
+  EXPECT_EQ(rows[1]["client_id"], -1);
+  EXPECT_EQ(rows[1]["payload_json"], "{}");
+  EXPECT_TRUE(log->lines().empty());
 }
 
 }  // namespace

@@ -2,77 +2,17 @@
 // may queue, and a client that stops reading its replies, get every reply in order, and the
 // daemon's memory stays bounded meanwhile.
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <thread>
 
-#include "common/RpcCodec.h"
 #include "support/Daemon.h"
+#include "support/RawSocket.h"
 
 namespace {
 
 using namespace std::chrono_literals;
-
-int connectTo(const std::string& path) {
-  int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  EXPECT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-  return fd;
-}
-
-// Writes requests built by `encode(i)` for i in [0, count) in chunks, counting bytes written.
-void writeRequests(int fd, int count, const std::function<void(msgpack::sbuffer&, int)>& encode,
-                   std::atomic<size_t>& written) {
-  msgpack::sbuffer out;
-  for (int i = 0; i < count; ++i) {
-    encode(out, i);
-    if (out.size() < 16 * 1024 && i + 1 < count) continue;
-    const char* data = out.data();
-    size_t left = out.size();
-    while (left > 0) {
-      ssize_t n = ::write(fd, data, left);
-      if (n <= 0) return;
-      data += n;
-      left -= static_cast<size_t>(n);
-      written += static_cast<size_t>(n);
-    }
-    out.clear();
-  }
-}
-
-// Reads `count` responses; their msgids in arrival order.
-std::vector<int64_t> readResponseIds(int fd, int count) {
-  RpcLimits limits;
-  limits.maxMessageBytes = 64 << 20;
-  RpcStreamDecoder decoder(limits);
-  std::vector<int64_t> ids;
-  SXValue message;
-  while (static_cast<int>(ids.size()) < count) {
-    auto status = decoder.next(message);
-    if (status == RpcStreamDecoder::Status::kMessage) {
-      auto response = RpcParseResponse(message);
-      ids.push_back(response && response->error.is_null() ? int64_t(response->msgid) : -1);
-      continue;
-    }
-    if (status == RpcStreamDecoder::Status::kBroken) break;
-    char* buffer = decoder.prepare(256 * 1024);
-    ssize_t n = ::read(fd, buffer, 256 * 1024);
-    if (n <= 0) break;
-    decoder.commit(static_cast<size_t>(n));
-  }
-  return ids;
-}
-
-std::vector<int64_t> range(int from, int count) {
-  std::vector<int64_t> ids(count);
-  for (int i = 0; i < count; ++i) ids[i] = from + i;
-  return ids;
-}
 
 TestDaemon::Options withArgs(std::vector<std::string> args) {
   TestDaemon::Options options;
@@ -102,21 +42,21 @@ TEST(BackpressureEndToEnd, PipelinedFarBeyondTheQueueLimitEveryReplyComesInOrder
 
   // Far beyond the limit of 32 either way; the sanitizers' daemon is several times slower.
   constexpr int kRequests = SXR_UNDER_ASAN ? 5'000 : 20'000;
-  int fd = connectTo(daemon.socket());
+  int fd = SXTestConnect(daemon.socket());
   std::atomic<size_t> written{0};
   std::thread writer([&] {
-    writeRequests(
+    SXTestWriteRequests(
         fd, kRequests,
         [](msgpack::sbuffer& out, int i) {
           RpcEncodeRequest(out, static_cast<uint32_t>(i), sxr::method::kSendMessage,
                            SXValue::array({SXValue{{"index", i}, {"route name", "speaker"}}, 3, 1,
                                            SXValue::array({7})}));
         },
-        written);
+        &written);
   });
-  const std::vector<int64_t> ids = readResponseIds(fd, kRequests);
+  const std::vector<int64_t> ids = SXTestReadResponseIds(fd, kRequests);
   EXPECT_EQ(ids.size(), size_t{kRequests}) << "the daemon's log ends:\n" << logTail(daemon);
-  EXPECT_EQ(ids, range(0, kRequests));
+  EXPECT_EQ(ids, SXTestIds(kRequests));
   writer.join();
   ::close(fd);
   // Every message reached the session, in order.
@@ -140,16 +80,16 @@ TEST(BackpressureEndToEnd, AClientThatStopsReadingKeepsTheDaemonsMemoryBounded) 
   int64_t before = residentKiB(daemon.pid());
 
   constexpr int kRequests = 20'000;
-  int fd = connectTo(daemon.socket());
+  int fd = SXTestConnect(daemon.socket());
   std::atomic<size_t> written{0};
   std::thread writer([&] {
-    writeRequests(
+    SXTestWriteRequests(
         fd, kRequests,
         [](msgpack::sbuffer& out, int i) {
           RpcEncodeRequest(out, static_cast<uint32_t>(i), sxr::method::kGetAllReporters,
                            SXValue::array());
         },
-        written);
+        &written);
   });
   // The daemon stops reading: the writer makes no progress for a while.
   size_t last = 0;
@@ -168,9 +108,9 @@ TEST(BackpressureEndToEnd, AClientThatStopsReadingKeepsTheDaemonsMemoryBounded) 
     EXPECT_LT(paused - before, 40 * 1024) << before << " KiB before";
   }
 
-  const std::vector<int64_t> ids = readResponseIds(fd, kRequests);
+  const std::vector<int64_t> ids = SXTestReadResponseIds(fd, kRequests);
   EXPECT_EQ(ids.size(), size_t{kRequests}) << "the daemon's log ends:\n" << logTail(daemon);
-  EXPECT_EQ(ids, range(0, kRequests));
+  EXPECT_EQ(ids, SXTestIds(kRequests));
   writer.join();
   ::close(fd);
 }

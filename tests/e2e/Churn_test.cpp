@@ -6,15 +6,14 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstring>
 #include <fstream>
 
-#include "common/RpcCodec.h"
 #include "support/Daemon.h"
+#include "support/RawSocket.h"
 
 namespace {
 
@@ -26,27 +25,16 @@ constexpr int kBatch = 50;  // clients alive at once: half processes, half raw s
 // A client speaking the wire protocol itself, so that it can leave in the middle of things.
 class RawClient {
  public:
-  explicit RawClient(const std::string& path) {
-    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-    if (::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-      ADD_FAILURE() << "connect: " << std::strerror(errno);
-    }
+  explicit RawClient(const std::string& path) : fd_(SXTestConnect(path)) {
+    if (fd_ < 0) ADD_FAILURE() << "connect: " << std::strerror(errno);
   }
   ~RawClient() { ::close(fd_); }
   RawClient(const RawClient&) = delete;
   RawClient& operator=(const RawClient&) = delete;
 
   void request(std::string_view method, const SXValue& params) {
-    msgpack::sbuffer out;
-    RpcEncodeRequest(out, ++msgid_, method, params);
-    for (size_t sent = 0; sent < out.size();) {
-      ssize_t n = ::send(fd_, out.data() + sent, out.size() - sent, MSG_NOSIGNAL);
-      if (n <= 0) return;
-      sent += static_cast<size_t>(n);
-    }
+    std::string bytes = SXTestRequest(++msgid_, method, params);
+    SXTestSend(fd_, bytes.data(), bytes.size());
   }
   // Reads until `count` responses have come; false when the connection ends or time runs out.
   bool awaitResponses(size_t count) {
@@ -76,27 +64,11 @@ class RawClient {
   }
 
  private:
-  int fd_ = -1;
+  int fd_;
   uint32_t msgid_ = 0;
   size_t responses_ = 0;
   RpcStreamDecoder decoder_;
 };
-
-pid_t spawnCtl(const TestDaemon& daemon, const std::vector<std::string>& args) {
-  std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", daemon.socket()};
-  argv.insert(argv.end(), args.begin(), args.end());
-  std::vector<char*> raw;
-  for (auto& a : argv) raw.push_back(a.data());
-  raw.push_back(nullptr);
-  pid_t pid = ::fork();
-  if (pid == 0) {
-    int null = ::open("/dev/null", O_WRONLY);
-    ::dup2(null, STDOUT_FILENO);
-    ::execv(raw[0], raw.data());
-    ::_exit(127);
-  }
-  return pid;
-}
 
 size_t startedSessions(const SXValue& status) {
   size_t started = 0;
@@ -114,8 +86,8 @@ void churnBatch(const TestDaemon& daemon, SXReportingClient& observer, int64_t f
     std::string id = std::to_string(firstID + i);
     SXValue payload = {{"churn", firstID + i}};
     if (i % 2 == 0) {
-      children.push_back(spawnCtl(daemon, {"create", id, "then", "send", "--ids", id,
-                                           payload.dump(), "then", "start", id}));
+      children.push_back(daemon.spawnCtl(
+          {"create", id, "then", "send", "--ids", id, payload.dump(), "then", "start", id}));
       continue;
     }
     auto raw = std::make_unique<RawClient>(daemon.socket());

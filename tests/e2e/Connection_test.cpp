@@ -6,26 +6,7 @@
 
 #include "support/Daemon.h"
 
-namespace {
-
 using namespace std::chrono_literals;
-
-// Starts sxreportctl with `args` against `daemon`; returns its pid.
-pid_t spawnCtl(const TestDaemon& daemon, const std::vector<std::string>& args) {
-  std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", daemon.socket()};
-  argv.insert(argv.end(), args.begin(), args.end());
-  pid_t pid = ::fork();
-  if (pid == 0) {
-    std::vector<char*> raw;
-    for (auto& a : argv) raw.push_back(a.data());
-    raw.push_back(nullptr);
-    ::execv(raw[0], raw.data());
-    ::_exit(127);
-  }
-  return pid;
-}
-
-}  // namespace
 
 // The preferences live outside the configuration directory, as under the packaged unit; the
 // daemon's flag and the tool's environment twin must name the same place.
@@ -75,7 +56,7 @@ TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
   TestDaemon daemon;
   auto observer = daemon.client();
   auto began = std::chrono::steady_clock::now();
-  pid_t child = spawnCtl(daemon, {"create", "42", "then", "start", "42"});
+  pid_t child = daemon.spawnCtl({"create", "42", "then", "start", "42"});
   // The start never answers while the session runs, so the tool sits waiting.
   ASSERT_TRUE(waitUntil([&] { return replied(observer->getAllReporters()).size() == 1; }));
   ASSERT_TRUE(waitUntil([&] {

@@ -1,38 +1,13 @@
-// The example clients in C and Python against the real daemon, and `status --metrics`.
+// The example clients in C and Python against the real daemon.
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
-#include <cstdio>
 #include <filesystem>
-#include <regex>
-#include <sstream>
 
 #include "support/Daemon.h"
 
 namespace {
 
-struct Outcome {
-  int status = -1;
-  std::string out;  // stdout and stderr together
-};
-
-Outcome run(const std::string& command) {
-  Outcome result;
-  FILE* pipe = ::popen((command + " 2>&1").c_str(), "r");
-  if (!pipe) return result;
-  char buf[4096];
-  size_t n;
-  while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) result.out.append(buf, n);
-  const int raw = ::pclose(pipe);
-  result.status = WIFEXITED(raw) ? WEXITSTATUS(raw) : -1;
-  return result;
-}
-
-std::string quoted(const std::string& word) {
-  std::string text = "'";
-  for (char c : word) text += c == '\'' ? std::string("'\\''") : std::string(1, c);
-  return text + "'";
-}
+CommandRun run(const std::string& command) { return runCommand(command + " 2>&1"); }
 
 // Both examples walk one session through the same steps and print the same replies.
 std::string expectedWalk(const std::string& yes, int64_t id) {
@@ -44,30 +19,32 @@ std::string expectedWalk(const std::string& yes, int64_t id) {
 
 TEST(ExamplesEndToEnd, TheCExampleWalksASessionThroughItsLife) {
   TestDaemon daemon;
-  Outcome walk = run(quoted(SXR_C_EXAMPLE_PATH) + " " + quoted(daemon.socket()) + " 42");
-  EXPECT_EQ(walk.status, 0) << walk.out;
-  EXPECT_EQ(walk.out, expectedWalk("true", 42));
+  CommandRun walk =
+      run(shellQuoted(SXR_C_EXAMPLE_PATH) + " " + shellQuoted(daemon.socket()) + " 42");
+  EXPECT_EQ(walk.status, 0) << walk.output;
+  EXPECT_EQ(walk.output, expectedWalk("true", 42));
 
-  Outcome absent = run(quoted(SXR_C_EXAMPLE_PATH) + " " + quoted(daemon.dir("no-such-socket")));
+  CommandRun absent =
+      run(shellQuoted(SXR_C_EXAMPLE_PATH) + " " + shellQuoted(daemon.dir("no-such-socket")));
   EXPECT_EQ(absent.status, 2);
-  EXPECT_NE(absent.out.find("no-such-socket"), std::string::npos) << absent.out;
+  EXPECT_NE(absent.output.find("no-such-socket"), std::string::npos) << absent.output;
 }
 
 TEST(ExamplesEndToEnd, ThePythonExampleWalksASessionThroughItsLife) {
   if (!std::filesystem::exists("/usr/bin/python3")) GTEST_SKIP() << "no /usr/bin/python3";
   TestDaemon daemon;
-  const std::string script = "/usr/bin/python3 -B " + quoted(SXR_PYTHON_EXAMPLE_PATH);
-  Outcome walk = run(script + " --socket " + quoted(daemon.socket()) + " --reporter-id -7");
-  EXPECT_EQ(walk.status, 0) << walk.out;
-  EXPECT_EQ(walk.out, expectedWalk("True", -7));
+  const std::string script = "/usr/bin/python3 -B " + shellQuoted(SXR_PYTHON_EXAMPLE_PATH);
+  CommandRun walk = run(script + " --socket " + shellQuoted(daemon.socket()) + " --reporter-id -7");
+  EXPECT_EQ(walk.status, 0) << walk.output;
+  EXPECT_EQ(walk.output, expectedWalk("True", -7));
 
   // The sessions of a run end with its connection.
   auto client = daemon.client();
   EXPECT_TRUE(waitUntil([&] { return replied(client->getAllReporters()).empty(); }));
 
-  Outcome absent = run(script + " --socket " + quoted(daemon.dir("no-such-socket")));
+  CommandRun absent = run(script + " --socket " + shellQuoted(daemon.dir("no-such-socket")));
   EXPECT_EQ(absent.status, 1);
-  EXPECT_NE(absent.out.find("sxreporting_client: "), std::string::npos) << absent.out;
+  EXPECT_NE(absent.output.find("sxreporting_client: "), std::string::npos) << absent.output;
 }
 
 TEST(ExamplesEndToEnd, ThePythonClientSurvivesSilenceAndRejections) {
@@ -88,31 +65,14 @@ TEST(ExamplesEndToEnd, ThePythonClientSurvivesSilenceAndRejections) {
       "except s.SXReportingTimeout: print('held')\n"
       "print(s.SXReportingClient(sys.argv[2]).stop_reporting_session_for_id(5))\n"
       "print(c.reporter_id_valid(5), c.get_all_reporters())\n";
-  Outcome outcome = run("/usr/bin/python3 -B -c " + quoted(program) + " " + quoted(dir) + " " +
-                        quoted(daemon.socket()));
-  EXPECT_EQ(outcome.status, 0) << outcome.out;
-  EXPECT_EQ(outcome.out,
+  CommandRun outcome = run("/usr/bin/python3 -B -c " + shellQuoted(program) + " " +
+                           shellQuoted(dir) + " " + shellQuoted(daemon.socket()));
+  EXPECT_EQ(outcome.status, 0) << outcome.output;
+  EXPECT_EQ(outcome.output,
             "SXReportingTimeout no reply within 0.2 s\n"
             "SXReportingError frobnicate:: unknown method 'frobnicate:'\n"
             "True\nheld\nTrue\n"
             "{'reporterID': 5, 'serviceType': 65535} [5]\n");
-}
-
-TEST(ExamplesEndToEnd, StatusMetricsIsPrometheusText) {
-  TestDaemon daemon;
-  auto client = daemon.client();  // one more client for the status to show
-  std::string text;
-  ASSERT_EQ(daemon.ctl({"status", "--metrics"}, &text), 0) << text;
-  EXPECT_TRUE(text.starts_with("# HELP sxreporting_up ")) << text;
-  EXPECT_NE(text.find("\nsxreporting_up 1\n"), std::string::npos) << text;
-  EXPECT_NE(text.find("\nsxreporting_reporting_enabled 1\n"), std::string::npos) << text;
-  const std::regex line(
-      R"(# (HELP|TYPE) sxreporting_[a-z0-9_]+ .*|sxreporting_[a-z0-9_]+(\{[a-z]+="[^"]*"\})? [-+.0-9eNaInf]+)");
-  std::istringstream lines(text);
-  for (std::string one; std::getline(lines, one);) {
-    EXPECT_TRUE(std::regex_match(one, line)) << one;
-  }
-  EXPECT_EQ(text.back(), '\n');
 }
 
 }  // namespace

@@ -1,8 +1,6 @@
 // Resource faults with the real daemon: a full or slow disk under the stores, an unusable
 // diagnostic-logs directory, and many connections that come and go.
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <array>
@@ -11,8 +9,8 @@
 #include <fstream>
 #include <thread>
 
-#include "common/RpcCodec.h"
 #include "support/Daemon.h"
+#include "support/RawSocket.h"
 
 namespace {
 
@@ -76,19 +74,6 @@ int64_t backpressurePauses(SXReportingClient& client) {
   SXValue status = replied(client.status());
   if (!status.is_object()) return -1;
   return status["counters"]["guardrail_dropped"]["requests_backpressure"].get<int64_t>();
-}
-
-// A raw connection, so that thousands of them cost little.
-int connectTo(const std::string& path) {
-  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-    ::close(fd);
-    return -1;
-  }
-  return fd;
 }
 
 }  // namespace
@@ -161,7 +146,15 @@ TEST(FaultsEndToEnd, UnusableDiagnosticLogsLeaveTheStoresWorking) {
     EXPECT_TRUE(replied(client->stopReportingSessionForID(id)));
     EXPECT_TRUE(start.get().value);
   }
+  EXPECT_TRUE(daemon.waitForLog(
+      "-[SXReportingSession createSummaryEventForSession]: can't create logging directory at " +
+          other.file("file/Reporting") + ": ",
+      3));
   EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: ", 3));
+  EXPECT_EQ(
+      daemon.waitForRows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535", 3)
+          .size(),
+      3u);
   EXPECT_EQ(daemon
                 .waitForRows("tallyvane.db",
                              "SELECT id FROM events WHERE name LIKE "
@@ -187,7 +180,7 @@ TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
   msgpack::sbuffer request;
   RpcEncodeRequest(request, 1, "getAllReporters:", SXValue::array());
   for (int i = 0; i < 10'000; ++i) {
-    int fd = connectTo(daemon.socket());
+    int fd = SXTestConnect(daemon.socket());
     ASSERT_GE(fd, 0) << "connection " << i;
     if (i % 3 == 1) {
       // A request in flight: the reply may find the connection gone.

@@ -246,23 +246,3 @@ TEST(LifecycleEndToEnd, NoBackendsWaitsNineSecondsWithoutDelayingOtherSessions) 
   EXPECT_TRUE(daemon.waitForLog("No valid FernReportingSession"));
   EXPECT_TRUE(daemon.rows("fernreporting.db", "SELECT id FROM flushes").empty());
 }
-
-TEST(LifecycleEndToEnd, UnwritableDiagnosticLogsAreLoggedAndTheStopCompletes) {
-  TestDaemon::Options options = internalDevice();
-  options.extraArgs = {"--diagnostic-logs-dir", "/proc/version/Reporting"};  // never a directory
-  TestDaemon daemon(options);
-  auto client = daemon.client();
-  ASSERT_TRUE(replied(client->createReportingSession(42)));
-  auto start = client->startReportingSessionForID(42, kSXWaitForever);
-  EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
-  EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
-  EXPECT_TRUE(start.get().value);
-  EXPECT_TRUE(daemon.waitForLog(
-      "-[SXReportingSession createSummaryEventForSession]: can't create logging directory at "
-      "/proc/version/Reporting: "));
-  EXPECT_TRUE(daemon.waitForLog("jsonOutput writeToURL: "));
-  EXPECT_EQ(
-      daemon.waitForRows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535", 1)
-          .size(),
-      1u);
-}

@@ -1,11 +1,9 @@
 // The session registry and the protocol's guard rails, through the real daemon.
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
-#include "common/RpcCodec.h"
 #include "support/Daemon.h"
+#include "support/RawSocket.h"
 
 namespace {
 
@@ -14,22 +12,11 @@ using namespace std::chrono_literals;
 // A plain socket for bytes the client library would never send.
 class RawConnection {
  public:
-  explicit RawConnection(const std::string& path) {
-    fd_ = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
-    EXPECT_EQ(::connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  explicit RawConnection(const std::string& path) : fd_(SXTestConnect(path)) {
+    EXPECT_GE(fd_, 0) << path;
   }
   ~RawConnection() { ::close(fd_); }
-  void send(const std::string& bytes) {
-    size_t done = 0;
-    while (done < bytes.size()) {
-      ssize_t n = ::send(fd_, bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
-      if (n <= 0) return;  // the daemon may close while we write
-      done += static_cast<size_t>(n);
-    }
-  }
+  void send(const std::string& bytes) { SXTestSend(fd_, bytes.data(), bytes.size()); }
   // True when the daemon closed the connection (EOF or reset) within `timeout`.
   bool closedByPeer(std::chrono::milliseconds timeout = 10s) {
     timeval tv{static_cast<time_t>(timeout.count() / 1000), 0};
@@ -43,14 +30,8 @@ class RawConnection {
   }
 
  private:
-  int fd_ = -1;
+  const int fd_;
 };
-
-std::string request(uint32_t id, const std::string& method, const SXValue& params) {
-  msgpack::sbuffer buffer;
-  RpcEncodeRequest(buffer, id, method, params);
-  return std::string(buffer.data(), buffer.size());
-}
 
 }  // namespace
 
@@ -172,10 +153,12 @@ TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
   for (int i = 0; i < 33; ++i) deep = SXValue{{"k", deep}};
   std::vector<std::string> attacks = {
       std::string("\xc1\xc1\xc1\xc1", 4),  // not MessagePack
-      request(1, sxr::method::kSendMessage,
-              SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),    // too large
-      request(1, sxr::method::kSendMessage, SXValue::array({deep, 3, 1, nullptr})),  // too deep
-      request(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3) +
+      SXTestRequest(
+          1, sxr::method::kSendMessage,
+          SXValue::array({{{"k", std::string(70000, 'x')}}, 3, 1, nullptr})),  // too large
+      SXTestRequest(1, sxr::method::kSendMessage,
+                    SXValue::array({deep, 3, 1, nullptr})),  // too deep
+      SXTestRequest(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3) +
           std::string(70000, '\0'),         // a message that never ends
       std::string("\x93\x02\xa1m\x90", 5),  // a notification: no msgid to answer
   };

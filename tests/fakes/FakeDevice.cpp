@@ -1,58 +1,27 @@
 #include "fakes/FakeDevice.h"
 
-
-void FakeOrientationService::registerDeviceOrientationCallback(const std::string& id,
-                                                               SXOrientationCallback cb) {
+void FakeOrientationService::add(bool interface, const std::string& id, SXOrientationCallback cb) {
   SXMutexLock lock(mutex_);
-  device_[id] = std::move(cb);
-  calls_.push_back("registerDevice " + id);
+  callbacks(interface)[id] = std::move(cb);
+  calls_.push_back("register" + what(interface) + id);
 }
 
-void FakeOrientationService::registerInterfaceOrientationCallback(const std::string& id,
-                                                                  SXOrientationCallback cb) {
+void FakeOrientationService::remove(bool interface, const std::string& id) {
+  SXOrientationCallback dropped;  // released once the lock is
   SXMutexLock lock(mutex_);
-  interface_[id] = std::move(cb);
-  calls_.push_back("registerInterface " + id);
-}
-
-void FakeOrientationService::unregisterDeviceOrientationCallback(const std::string& id) {
-  SXOrientationCallback dropped;
-  SXMutexLock lock(mutex_);
-  if (auto it = device_.find(id); it != device_.end()) {
+  if (auto it = callbacks(interface).find(id); it != callbacks(interface).end()) {
     dropped = std::move(it->second);
-    device_.erase(it);
+    callbacks(interface).erase(it);
   }
-  calls_.push_back("unregisterDevice " + id);
+  calls_.push_back("unregister" + what(interface) + id);
 }
 
-void FakeOrientationService::unregisterInterfaceOrientationCallback(const std::string& id) {
-  SXOrientationCallback dropped;
-  SXMutexLock lock(mutex_);
-  if (auto it = interface_.find(id); it != interface_.end()) {
-    dropped = std::move(it->second);
-    interface_.erase(it);
-  }
-  calls_.push_back("unregisterInterface " + id);
-}
-
-bool FakeOrientationService::fireDevice(const std::string& id, int32_t orientation) {
+bool FakeOrientationService::fire(bool interface, const std::string& id, int32_t orientation) {
   SXOrientationCallback cb;
   {
     SXMutexLock lock(mutex_);
-    auto it = device_.find(id);
-    if (it == device_.end()) return false;
-    cb = it->second;
-  }
-  cb(orientation);
-  return true;
-}
-
-bool FakeOrientationService::fireInterface(const std::string& id, int32_t orientation) {
-  SXOrientationCallback cb;
-  {
-    SXMutexLock lock(mutex_);
-    auto it = interface_.find(id);
-    if (it == interface_.end()) return false;
+    auto it = callbacks(interface).find(id);
+    if (it == callbacks(interface).end()) return false;
     cb = it->second;
   }
   cb(orientation);
@@ -65,7 +34,7 @@ std::vector<std::string> FakeOrientationService::calls() const {
 }
 
 void FakeOrientationService::clear() {
-  std::map<std::string, SXOrientationCallback> device, interface;
+  Callbacks device, interface;
   SXMutexLock lock(mutex_);
   device.swap(device_);
   interface.swap(interface_);

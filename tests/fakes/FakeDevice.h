@@ -50,19 +50,17 @@ class FakeProcessInfo final : public SXProcessInfo {
   std::optional<int> exitStatus;
 };
 
-// Files in memory; `failDirectories` / `failWrites` make the operations fail.
+// Files in memory.
 class FakeFileSystem final : public SXFileSystem {
  public:
   std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override {
     SXMutexLock lock(mutex_);
-    if (failDirectories) return "mkdir " + path + ": Permission denied";
     directories[path] = mode;
     return std::nullopt;
   }
   std::optional<std::string> writeFileAtomically(const std::string& path,
                                                  const std::string& contents) override {
     SXMutexLock lock(mutex_);
-    if (failWrites) return "open " + path + ": Permission denied";
     files[path] = contents;
     return std::nullopt;
   }
@@ -71,14 +69,11 @@ class FakeFileSystem final : public SXFileSystem {
                                                     const std::string& contents,
                                                     bool& taken) override {
     SXMutexLock lock(mutex_);
-    if (failWrites) return "open " + path + ": Permission denied";
     taken = !files.try_emplace(path, contents).second;
     return std::nullopt;
   }
 
   SXMutex mutex_;
-  bool failDirectories = false;
-  bool failWrites = false;
   std::map<std::string, unsigned> directories;
   std::map<std::string, std::string> files;
 };
@@ -86,25 +81,43 @@ class FakeFileSystem final : public SXFileSystem {
 // Holds registrations; a test fires callbacks from any thread.
 class FakeOrientationService final : public SXOrientationService {
  public:
-  void registerDeviceOrientationCallback(const std::string& id, SXOrientationCallback cb) override;
+  void registerDeviceOrientationCallback(const std::string& id, SXOrientationCallback cb) override {
+    add(false, id, std::move(cb));
+  }
   void registerInterfaceOrientationCallback(const std::string& id,
-                                            SXOrientationCallback cb) override;
-  void unregisterDeviceOrientationCallback(const std::string& id) override;
-  void unregisterInterfaceOrientationCallback(const std::string& id) override;
+                                            SXOrientationCallback cb) override {
+    add(true, id, std::move(cb));
+  }
+  void unregisterDeviceOrientationCallback(const std::string& id) override { remove(false, id); }
+  void unregisterInterfaceOrientationCallback(const std::string& id) override { remove(true, id); }
   std::string orientationName(int32_t orientation) const override {
     return "orientation" + std::to_string(orientation);
   }
 
   // Calls the registered callback, if any; returns whether one was registered.
-  bool fireDevice(const std::string& id, int32_t orientation);
-  bool fireInterface(const std::string& id, int32_t orientation);
+  bool fireDevice(const std::string& id, int32_t orientation) {
+    return fire(false, id, orientation);
+  }
+  bool fireInterface(const std::string& id, int32_t orientation) {
+    return fire(true, id, orientation);
+  }
   std::vector<std::string> calls() const;  // "registerDevice <id>", ...
   // Drops every registration (callbacks hold their sessions).
   void clear();
 
  private:
+  using Callbacks = std::map<std::string, SXOrientationCallback>;
+  // `interface`: the interface orientation's registrations, else the device orientation's.
+  void add(bool interface, const std::string& id, SXOrientationCallback cb);
+  void remove(bool interface, const std::string& id);
+  bool fire(bool interface, const std::string& id, int32_t orientation);
+  Callbacks& callbacks(bool interface) SX_REQUIRES(mutex_) {
+    return interface ? interface_ : device_;
+  }
+  static std::string what(bool interface) { return interface ? "Interface " : "Device "; }
+
   mutable SXMutex mutex_;
-  std::map<std::string, SXOrientationCallback> device_ SX_GUARDED_BY(mutex_);
-  std::map<std::string, SXOrientationCallback> interface_ SX_GUARDED_BY(mutex_);
+  Callbacks device_ SX_GUARDED_BY(mutex_);
+  Callbacks interface_ SX_GUARDED_BY(mutex_);
   std::vector<std::string> calls_ SX_GUARDED_BY(mutex_);
 };

@@ -79,38 +79,29 @@ class FakeFernReporting::State {
   std::shared_ptr<FernSecureHierarchyToken> token(
       const std::shared_ptr<FernSecureHierarchyToken>& parent) {
     SXMutexLock lock(mutex);
-    Event& e = append({.kind = Kind::kToken, .accepted = !tokenFails});
-    if (tokenFails) return nullptr;
-    e.token = "fake-token-" + std::to_string(++tokens);
-    if (parent) e.token = parent->identifier() + "/" + e.token;
-    return std::make_shared<FernSecureHierarchyToken>(e.token);
+    append({.kind = Kind::kToken});
+    std::string identifier = "fake-token-" + std::to_string(++tokens);
+    if (parent) identifier = parent->identifier() + "/" + identifier;
+    return std::make_shared<FernSecureHierarchyToken>(identifier);
   }
 
-  // Returns the new session's number, or 0 when opening fails.
+  // Returns the new session's number.
   int open(const SXValue& sessionInfo, const SXValue& userInfo) {
     SXMutexLock lock(mutex);
-    int number = openFails ? 0 : ++sessions;
-    Event& e = append({.kind = Kind::kOpen,
-                       .session = number,
-                       .sessionInfo = sessionInfo,
-                       .userInfo = userInfo,
-                       .accepted = !openFails});
-    if (sessionInfo.is_object() && sessionInfo.contains(fern::kSessionInfoHierarchyToken) &&
-        sessionInfo[fern::kSessionInfoHierarchyToken].is_string()) {
-      e.token = sessionInfo[fern::kSessionInfoHierarchyToken].get<std::string>();
-    }
-    return number;
+    append({.kind = Kind::kOpen,
+            .session = ++sessions,
+            .sessionInfo = sessionInfo,
+            .userInfo = userInfo});
+    return sessions;
   }
 
   void startConfiguration(int session, FernBackendsCompletion completion) {
     SXMutexLock lock(mutex);
     append({.kind = Kind::kStartConfiguration, .session = session});
-    std::function<void()> deliver = [completion, found = backends] {
-      if (completion) completion(found);
+    std::function<void()> deliver = [completion] {
+      if (completion) completion(std::vector<std::string>{"fake"});
     };
-    if (configurationDelivery != Delivery::kInline) {
-      return complete(configurationDelivery, configurationDelay, std::move(deliver));
-    }
+    if (configurationDelivery == Delivery::kNever) return held.push_back(std::move(deliver));
     lock.unlock();
     deliver();
   }
@@ -126,8 +117,7 @@ class FakeFernReporting::State {
             .userInfo = userInfo ? *userInfo : SXValue(),
             .category = category,
             .type = type,
-            .payload = payload,
-            .accepted = !failure.fails});
+            .payload = payload});
     if (failure.fails && failure.error) error = failure.error;
     return !failure.fails;
   }
@@ -135,8 +125,8 @@ class FakeFernReporting::State {
   void flush(int session, FernFlushCompletion completion) {
     SXMutexLock lock(mutex);
     append({.kind = Kind::kFlush, .session = session});
-    complete(flushDelivery, flushDelay, [completion, error = flushError] {
-      if (completion) completion(error);
+    deliverer.post(std::chrono::milliseconds(0), [completion] {
+      if (completion) completion(std::nullopt);
     });
   }
 
@@ -155,36 +145,18 @@ class FakeFernReporting::State {
   SXMutex mutex;
   std::condition_variable changed;
   std::vector<Event> events SX_GUARDED_BY(mutex);
-  std::optional<std::vector<std::string>> backends = std::vector<std::string>{"fake"};
-  Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kImmediate;  // like the rest
-  std::chrono::milliseconds configurationDelay{0};
-  Delivery flushDelivery = Delivery::kImmediate;
-  std::chrono::milliseconds flushDelay{0};
-  std::optional<FernError> flushError;
+  Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kInline;
   SendFailure messageFailure;
   SendFailure singleFailure;
-  bool openFails = false;
-  bool tokenFails = false;
   int sessions = 0;
   int tokens = 0;
   std::vector<std::function<void()>> held;  // kNever completions
   Deliverer deliverer;                      // declared last: stopped before the rest goes
 
  private:
-  Event& append(Event event) SX_REQUIRES(mutex) {
+  void append(Event event) SX_REQUIRES(mutex) {
     events.push_back(std::move(event));
     changed.notify_all();
-    return events.back();
-  }
-
-  void complete(Delivery delivery, std::chrono::milliseconds delay, std::function<void()> task)
-      SX_REQUIRES(mutex) {
-    if (delivery == Delivery::kNever) {
-      held.push_back(std::move(task));
-    } else {
-      deliverer.post(delivery == Delivery::kDelayed ? delay : std::chrono::milliseconds(0),
-                     std::move(task));
-    }
   }
 };
 
@@ -229,9 +201,7 @@ std::shared_ptr<FernSecureHierarchyToken> FakeFernReporting::newHierarchyToken(
 std::shared_ptr<FernReportingSession> FakeFernReporting::openSession(const SXValue& sessionInfo,
                                                                      const SXValue& userInfo,
                                                                      const SXValue&) {
-  int number = state_->open(sessionInfo, userInfo);
-  if (number == 0) return nullptr;
-  return std::make_shared<Session>(state_, number);
+  return std::make_shared<Session>(state_, state_->open(sessionInfo, userInfo));
 }
 
 bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue& userInfo,
@@ -241,27 +211,9 @@ bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue
                       payload, error);
 }
 
-void FakeFernReporting::setBackends(std::optional<std::vector<std::string>> backends) {
-  SXMutexLock lock(state_->mutex);
-  state_->backends = std::move(backends);
-}
-
-void FakeFernReporting::setConfigurationDelivery(Delivery delivery,
-                                                 std::chrono::milliseconds delay) {
+void FakeFernReporting::setConfigurationDelivery(Delivery delivery) {
   SXMutexLock lock(state_->mutex);
   state_->configurationDelivery = delivery;
-  state_->configurationDelay = delay;
-}
-
-void FakeFernReporting::setFlushDelivery(Delivery delivery, std::chrono::milliseconds delay) {
-  SXMutexLock lock(state_->mutex);
-  state_->flushDelivery = delivery;
-  state_->flushDelay = delay;
-}
-
-void FakeFernReporting::setFlushError(std::optional<FernError> error) {
-  SXMutexLock lock(state_->mutex);
-  state_->flushError = std::move(error);
 }
 
 void FakeFernReporting::setMessageFailure(SendFailure failure) {
@@ -272,16 +224,6 @@ void FakeFernReporting::setMessageFailure(SendFailure failure) {
 void FakeFernReporting::setSingleMessageFailure(SendFailure failure) {
   SXMutexLock lock(state_->mutex);
   state_->singleFailure = std::move(failure);
-}
-
-void FakeFernReporting::setOpenFails(bool fails) {
-  SXMutexLock lock(state_->mutex);
-  state_->openFails = fails;
-}
-
-void FakeFernReporting::setTokenFails(bool fails) {
-  SXMutexLock lock(state_->mutex);
-  state_->tokenFails = fails;
 }
 
 void FakeFernReporting::deliverHeld() { state_->deliverHeld(); }

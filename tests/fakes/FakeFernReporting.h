@@ -2,11 +2,10 @@
 // sessions opened (with their session info and user info), configurations started, messages
 // per session, single messages and flushes.
 //
-// Tests choose the backends a configuration finds, how its completion (and, separately, a
-// flush's) is delivered: at once from a thread of the fake, after a delay on that thread, or
-// never (held until deliverHeld()), and whether sends fail, with or without an error.
-// Completions still undelivered when the fake is destroyed are dropped; sessions that outlive
-// the fake fail their sends and complete nothing.
+// A configuration finds the backend "fake" and completes on the caller's thread, or is held
+// until deliverHeld(); flushes complete from a thread of the fake. Tests choose whether sends
+// fail, with or without an error. Completions still undelivered when the fake is destroyed are
+// dropped; sessions that outlive the fake fail their sends and complete nothing.
 #pragma once
 
 #include <chrono>
@@ -20,22 +19,19 @@
 
 class FakeFernReporting final : public FernReporting {
  public:
-  // kImmediate: from the fake's thread at once; kInline: on the caller's thread before the
-  // call returns; kDelayed: from the fake's thread after the delay; kNever: when the test calls
-  // deliverHeld().
-  enum class Delivery { kImmediate, kInline, kDelayed, kNever };
+  // kInline: on the caller's thread before the call returns; kNever: from the fake's thread
+  // once the test calls deliverHeld().
+  enum class Delivery { kInline, kNever };
 
   struct Event {
     enum class Kind { kToken, kOpen, kStartConfiguration, kMessage, kSingleMessage, kFlush };
     Kind kind{};
-    int session = 0;      // 1, 2, ... in the order sessions were opened; 0 for none
-    std::string token{};  // kToken: the new identifier; kOpen: the session info's token
+    int session = 0;  // 1, 2, ... in the order sessions were opened; 0 for none
     SXValue sessionInfo{};
     SXValue userInfo{};
     uint16_t category = 0;
     uint16_t type = 0;
     SXValue payload{};
-    bool accepted = true;  // sends: what the fake answered
   };
 
   struct SendFailure {
@@ -55,17 +51,9 @@ class FakeFernReporting final : public FernReporting {
                       uint16_t type, const SXValue& payload,
                       std::optional<FernError>& error) override;
 
-  // Configuration: default backends ["fake"], delivered at once.
-  void setBackends(std::optional<std::vector<std::string>> backends);
-  void setConfigurationDelivery(Delivery delivery,
-                                std::chrono::milliseconds delay = std::chrono::milliseconds(0));
-  void setFlushDelivery(Delivery delivery,
-                        std::chrono::milliseconds delay = std::chrono::milliseconds(0));
-  void setFlushError(std::optional<FernError> error);
+  void setConfigurationDelivery(Delivery delivery);
   void setMessageFailure(SendFailure failure);        // sendMessage on a session
   void setSingleMessageFailure(SendFailure failure);  // sendOneMessage
-  void setOpenFails(bool fails);
-  void setTokenFails(bool fails);
   // Delivers the completions held under kNever, now, from the fake's thread.
   void deliverHeld();
 

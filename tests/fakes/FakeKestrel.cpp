@@ -1,5 +1,11 @@
 #include "fakes/FakeKestrel.h"
 
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "platform/DiscardLog.h"
 
 namespace {
 
@@ -7,8 +13,10 @@ using Name = FakeKestrel::Name;
 
 class FakeSubscription final : public KestrelSubscription {
  public:
-  explicit FakeSubscription(SXValue query) : query(std::move(query)) {}
+  FakeSubscription(SXValue query, std::shared_ptr<KestrelSubscription> real)
+      : query(std::move(query)), real(std::move(real)) {}
   const SXValue query;
+  const std::shared_ptr<KestrelSubscription> real;
 };
 
 SXValue toValue(const Name& name) { return name ? SXValue(*name) : SXValue(); }
@@ -17,13 +25,15 @@ Name toName(const SXValue& value) {
   return value.is_string() ? Name(value.get<std::string>()) : std::nullopt;
 }
 
-SXValue queryValue(const Name& group, const Name& subgroup) {
-  return {{"group", toValue(group)}, {"subgroup", toValue(subgroup)}};
-}
-
-// The query that a channel dictionary, subscription or samples value descends from.
+// The query a value handed out descends from, and the library's own value in it.
 SXValue queryIn(const SXValue& value) {
   return value.is_object() ? value.value("query", SXValue()) : SXValue();
+}
+SXValue of(const SXValue& value) {
+  return value.is_object() && value.contains("of") ? value["of"] : value;
+}
+SXValue wrap(const SXValue& query, SXValue real) {
+  return {{"query", query}, {"of", std::move(real)}};
 }
 
 std::pair<Name, Name> toQuery(const SXValue& query) {
@@ -31,45 +41,36 @@ std::pair<Name, Name> toQuery(const SXValue& query) {
   return {toName(query.value("group", SXValue())), toName(query.value("subgroup", SXValue()))};
 }
 
-// The fields of one channel entry; an entry that is not an object has none.
-Name field(const SXValue& entry, const char* key) {
-  return entry.is_object() ? toName(entry.value(key, SXValue())) : std::nullopt;
-}
-
-int64_t valueOf(const SXValue& sample) {
-  auto value = sample.is_object() ? sample.find("value") : sample.end();
-  return value != sample.end() && value->is_number_integer() ? value->get<int64_t>() : 0;
-}
-
-bool matches(const Name& wanted, const Name& actual) { return !wanted || wanted == actual; }
-
-std::string channelKey(const Name& group, const Name& subgroup, const Name& channel) {
-  return SXValue::array({toValue(group), toValue(subgroup), toValue(channel)}).dump();
-}
-
-const SXValue* channelsOf(const SXValue& value) {
-  if (!value.is_object()) return nullptr;
-  auto channels = value.find("channels");
-  return channels != value.end() && channels->is_object() ? &*channels : nullptr;
+std::string temporaryTree() {
+  std::string pattern = (std::filesystem::temp_directory_path() / "sxr-kestrel-XXXXXX").string();
+  return ::mkdtemp(pattern.data()) ? pattern : std::string("/nonexistent");
 }
 
 }  // namespace
 
+FakeKestrel::FakeKestrel()
+    : root_(temporaryTree()), real_(root_, std::make_shared<SXDiscardLog>()) {}
+
+FakeKestrel::~FakeKestrel() {
+  std::error_code ignored;
+  std::filesystem::remove_all(root_, ignored);
+}
+
+std::string FakeKestrel::counterPath(const Name& group, const Name& subgroup,
+                                     const Name& channel) const {
+  return root_ + "/" + group.value_or("-") + "/" + subgroup.value_or("-") + "/" +
+         channel.value_or("-");
+}
+
 void FakeKestrel::setValue(const Name& group, const Name& subgroup, const Name& channel,
                            int64_t value) {
-  SXMutexLock lock(mutex_);
-  groups_.insert({group, subgroup});
-  values_[{group, subgroup, channel}] = value;
+  std::string path = counterPath(group, subgroup, channel);
+  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+  std::ofstream(path) << value;
 }
 
 void FakeKestrel::removeChannel(const Name& group, const Name& subgroup, const Name& channel) {
-  SXMutexLock lock(mutex_);
-  values_.erase({group, subgroup, channel});
-}
-
-void FakeKestrel::addGroup(const Name& group, const Name& subgroup) {
-  SXMutexLock lock(mutex_);
-  groups_.insert({group, subgroup});
+  std::filesystem::remove(counterPath(group, subgroup, channel));
 }
 
 void FakeKestrel::failChannelQuery(const Name& group, const Name& subgroup,
@@ -99,109 +100,78 @@ void FakeKestrel::setSubscriptionReturnsNull(bool on) {
   nullSubscriptions_ = on;
 }
 
-int FakeKestrel::samplingCalls() const {
-  SXMutexLock lock(mutex_);
-  return samplingCalls_;
-}
-
 int FakeKestrel::deltaCalls() const {
   SXMutexLock lock(mutex_);
   return deltaCalls_;
 }
 
 std::optional<SXValue> FakeKestrel::copyChannelsInGroup(const Name& group, const Name& subgroup,
-                                                        int /*options*/,
+                                                        int options,
                                                         std::optional<KestrelError>& error) {
-  SXMutexLock lock(mutex_);
-  auto fault = queryFaults_.find({group, subgroup});
-  if (fault != queryFaults_.end()) {
-    if (fault->second.code) error = KestrelError{*fault->second.code};
-    if (!fault->second.returnChannels) return std::nullopt;
+  {
+    SXMutexLock lock(mutex_);
+    auto fault = queryFaults_.find({group, subgroup});
+    if (fault != queryFaults_.end()) {
+      if (fault->second.code) error = KestrelError{*fault->second.code};
+      if (!fault->second.returnChannels) return std::nullopt;
+    }
   }
-  bool found = false;
-  for (const auto& [g, s] : groups_) found = found || (matches(group, g) && matches(subgroup, s));
-  if (!found) return std::nullopt;
-  SXValue channels = SXValue::object();
-  for (const auto& [id, value] : values_) {
-    const auto& [g, s, n] = id;
-    if (!matches(group, g) || !matches(subgroup, s)) continue;
-    channels[channelKey(g, s, n)] = {
-        {"group", toValue(g)}, {"subgroup", toValue(s)}, {"name", toValue(n)}};
-  }
-  return SXValue{{"query", queryValue(group, subgroup)}, {"channels", std::move(channels)}};
+  std::optional<KestrelError> ignored;
+  auto channels = real_.copyChannelsInGroup(group, subgroup, options, error ? ignored : error);
+  if (!channels) return std::nullopt;
+  return wrap({{"group", toValue(group)}, {"subgroup", toValue(subgroup)}}, std::move(*channels));
 }
 
 int64_t FakeKestrel::getChannelCount(const SXValue& channels) {
-  const SXValue* list = channelsOf(channels);
-  return list ? static_cast<int64_t>(list->size()) : 0;
+  return real_.getChannelCount(of(channels));
 }
 
 std::shared_ptr<KestrelSubscription> FakeKestrel::createSubscription(const SXValue& channels,
                                                                      SXValue& subscribedChannels) {
-  subscribedChannels = channels;
+  SXValue subscribed;
+  auto real = real_.createSubscription(of(channels), subscribed);
+  subscribedChannels = wrap(queryIn(channels), std::move(subscribed));
   SXMutexLock lock(mutex_);
-  if (nullSubscriptions_ || !channels.is_object()) return nullptr;
-  return std::make_shared<FakeSubscription>(queryIn(channels));
+  if (nullSubscriptions_ || !real) return nullptr;
+  return std::make_shared<FakeSubscription>(queryIn(channels), std::move(real));
 }
 
 std::optional<SXValue> FakeKestrel::createSamples(const KestrelSubscription* subscription,
                                                   const SXValue& subscribedChannels,
                                                   std::optional<KestrelError>& error) {
-  SXMutexLock lock(mutex_);
-  ++samplingCalls_;
   auto* fake = dynamic_cast<const FakeSubscription*>(subscription);
-  const SXValue* channels = channelsOf(subscribedChannels);
-  if (!fake || !channels) {
-    error = KestrelError{kFakeKestrelBadArgument};
-    return std::nullopt;
+  if (!fake) return real_.createSamples(nullptr, of(subscribedChannels), error);
+  {
+    SXMutexLock lock(mutex_);
+    auto fault = samplingFaults_.find(toQuery(fake->query));
+    if (fault != samplingFaults_.end()) {
+      if (fault->second) error = KestrelError{*fault->second};
+      return std::nullopt;
+    }
   }
-  auto fault = samplingFaults_.find(toQuery(fake->query));
-  if (fault != samplingFaults_.end()) {
-    if (fault->second) error = KestrelError{*fault->second};
-    return std::nullopt;
-  }
-  SXValue samples = SXValue::object();
-  for (const auto& [key, channel] : channels->items()) {
-    auto id =
-        ChannelId{field(channel, "group"), field(channel, "subgroup"), field(channel, "name")};
-    auto value = values_.find(id);
-    if (value == values_.end()) continue;  // removed since the subscription
-    samples[key] = {{"name", toValue(std::get<2>(id))}, {"value", value->second}};
-  }
-  return SXValue{{"query", fake->query}, {"channels", std::move(samples)}};
+  auto samples = real_.createSamples(fake->real.get(), of(subscribedChannels), error);
+  if (!samples) return std::nullopt;
+  return wrap(fake->query, std::move(*samples));
 }
 
 std::optional<SXValue> FakeKestrel::createSamplesDelta(const SXValue* earlier, const SXValue& later,
                                                        std::optional<KestrelError>& error) {
-  SXMutexLock lock(mutex_);
-  ++deltaCalls_;
-  const SXValue* before = earlier ? channelsOf(*earlier) : nullptr;
-  const SXValue* after = channelsOf(later);
-  if (!before || !after) {
-    error = KestrelError{kFakeKestrelBadArgument};
-    return std::nullopt;
+  {
+    SXMutexLock lock(mutex_);
+    ++deltaCalls_;
+    auto fault = deltaFaults_.find(toQuery(queryIn(later)));
+    if (fault != deltaFaults_.end()) {
+      error = KestrelError{fault->second};
+      return std::nullopt;
+    }
   }
-  auto fault = deltaFaults_.find(toQuery(queryIn(later)));
-  if (fault != deltaFaults_.end()) {
-    error = KestrelError{fault->second};
-    return std::nullopt;
-  }
-  SXValue delta = SXValue::object();
-  for (const auto& [key, sample] : after->items()) {
-    auto old = before->find(key);
-    if (old == before->end()) continue;
-    delta[key] = {{"name", toValue(field(sample, "name"))},
-                  {"value", valueOf(sample) - valueOf(*old)}};
-  }
-  return SXValue{{"query", queryIn(later)}, {"channels", std::move(delta)}};
+  SXValue before = earlier ? of(*earlier) : SXValue();
+  auto delta = real_.createSamplesDelta(earlier ? &before : nullptr, of(later), error);
+  if (!delta) return std::nullopt;
+  return wrap(queryIn(later), std::move(*delta));
 }
 
 void FakeKestrel::iterate(const SXValue& samples,
                           const std::function<int(const KestrelChannelSample&)>& callback) {
-  const SXValue* channels = channelsOf(samples);
-  if (!channels) return;
-  for (const auto& sample : *channels) {
-    KestrelChannelSample channel{field(sample, "name"), valueOf(sample)};
-    if (callback(channel) != 0) return;
-  }
+  real_.iterate(of(samples), callback);
 }

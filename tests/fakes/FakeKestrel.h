@@ -1,36 +1,30 @@
-// An in-memory driver-statistics library. A test adds groups and channels, sets and changes
-// their values, and switches faults on. Faults are keyed by the query a caller makes: the
-// group and subgroup exactly as passed to copyChannelsInGroup (none meaning "any"). Every
-// subscription, sample and delta remembers the query it descends from.
-//
-// Values it hands out:
-//   channels    {"query": {"group": .., "subgroup": ..}, "channels": {<id>: {...}}}
-//   samples     the same, each channel with "name" and "value"
-// Failures set error code kFakeKestrelBadArgument unless a fault names its own code.
+// The production driver-statistics library on a temporary counter tree, with faults a test
+// switches on. A test sets and removes counters (written as the tree's files). Faults are keyed
+// by the query a caller makes: the group and subgroup exactly as passed to copyChannelsInGroup
+// (none meaning "any"); so every channel dictionary, subscription and samples value handed out
+// remembers the query it descends from, as {"query": .., "of": <the library's own value>}.
 // All methods may be called from any thread.
 #pragma once
 
 #include <map>
 #include <mutex>
 #include <optional>
-#include <set>
 #include <string>
-#include <tuple>
 
 #include "common/SXThreadSafety.h"
-#include "platform/Kestrel.h"
-
-inline constexpr int64_t kFakeKestrelBadArgument = 22;
+#include "platform/FileKestrel.h"
 
 class FakeKestrel final : public Kestrel {
  public:
   using Name = std::optional<std::string>;
 
-  // Adds the channel (and its group) with `value`, or sets the value of an existing one.
+  FakeKestrel();
+  ~FakeKestrel() override;  // removes the tree
+
+  // Writes the counter (making its group) with `value`.
   void setValue(const Name& group, const Name& subgroup, const Name& channel, int64_t value);
+  // Removes the counter; its group stays.
   void removeChannel(const Name& group, const Name& subgroup, const Name& channel);
-  // Makes a group exist, with no channels until some are set.
-  void addGroup(const Name& group, const Name& subgroup);
 
   // The channel query for (group, subgroup) sets an error with `code` (none: no error) and
   // returns its channels only when `returnChannels`.
@@ -45,7 +39,6 @@ class FakeKestrel final : public Kestrel {
   // createSubscription returns nullptr (the subscribed channels are still filled in).
   void setSubscriptionReturnsNull(bool on);
 
-  int samplingCalls() const;
   int deltaCalls() const;
 
   std::optional<SXValue> copyChannelsInGroup(const Name& group, const Name& subgroup, int options,
@@ -63,19 +56,18 @@ class FakeKestrel final : public Kestrel {
 
  private:
   using Query = std::pair<Name, Name>;
-  using ChannelId = std::tuple<Name, Name, Name>;
   struct QueryFault {
     std::optional<int64_t> code;
     bool returnChannels = false;
   };
+  std::string counterPath(const Name& group, const Name& subgroup, const Name& channel) const;
 
+  const std::string root_;
+  SXFileKestrel real_;
   mutable SXMutex mutex_;
-  std::set<Query> groups_ SX_GUARDED_BY(mutex_);
-  std::map<ChannelId, int64_t> values_ SX_GUARDED_BY(mutex_);
   std::map<Query, QueryFault> queryFaults_ SX_GUARDED_BY(mutex_);
   std::map<Query, std::optional<int64_t>> samplingFaults_ SX_GUARDED_BY(mutex_);
   std::map<Query, int64_t> deltaFaults_ SX_GUARDED_BY(mutex_);
   bool nullSubscriptions_ SX_GUARDED_BY(mutex_) = false;
-  int samplingCalls_ SX_GUARDED_BY(mutex_) = 0;
   int deltaCalls_ SX_GUARDED_BY(mutex_) = 0;
 };

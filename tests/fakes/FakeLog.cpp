@@ -1,9 +1,6 @@
 #include "fakes/FakeLog.h"
 
-
 std::shared_ptr<const SXLogScope> FakeLog::registerScope(const SXLogScope& scope) {
-  SXMutexLock lock(mutex_);
-  registrations_.push_back(scope);
   return std::make_shared<const SXLogScope>(scope);
 }
 
@@ -38,11 +35,6 @@ std::vector<std::string> FakeLog::messages() const {
   return out;
 }
 
-std::vector<SXLogScope> FakeLog::registrations() const {
-  SXMutexLock lock(mutex_);
-  return registrations_;
-}
-
 size_t FakeLog::count(const std::string& message) const {
   SXMutexLock lock(mutex_);
   return countLocked(message);
@@ -69,12 +61,3 @@ size_t FakeLog::countContaining(const std::string& fragment) const {
 }
 
 bool FakeLog::contains(const std::string& fragment) const { return countContaining(fragment) > 0; }
-
-void FakeLog::setVerbose(const std::string& scope, bool on) {
-  SXMutexLock lock(mutex_);
-  if (on) {
-    verbose_.insert(scope);
-  } else {
-    verbose_.erase(scope);
-  }
-}

@@ -29,7 +29,6 @@ class FakeLog final : public SXLogFacility {
 
   std::vector<Line> lines() const;
   std::vector<std::string> messages() const;
-  std::vector<SXLogScope> registrations() const;
   // Number of lines whose message equals `message`.
   size_t count(const std::string& message) const;
   // Number of lines whose message contains `fragment`, and whether there is one.
@@ -38,7 +37,6 @@ class FakeLog final : public SXLogFacility {
   // Waits until `times` lines have the message `message`; false when `timeout` passes first.
   bool waitFor(const std::string& message, size_t times = 1,
                std::chrono::milliseconds timeout = std::chrono::seconds(20)) const;
-  void setVerbose(const std::string& scope, bool on);
 
  private:
   size_t countLocked(const std::string& message) const;  // REQUIRES(mutex_)
@@ -47,5 +45,4 @@ class FakeLog final : public SXLogFacility {
   mutable std::condition_variable written_;
   std::set<std::string> verbose_;
   std::vector<Line> lines_;
-  std::vector<SXLogScope> registrations_;
 };

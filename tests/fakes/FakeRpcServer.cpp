@@ -113,7 +113,7 @@ void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const 
     SXMutexLock lock(mutex_);
     requests_.push_back({request->msgid, request->method, request->params});
     auto it = handlers_.find(request->method);
-    handler = it != handlers_.end() ? it->second : anyHandler_;
+    if (it != handlers_.end()) handler = it->second;
   }
   changed_.notify_all();
   Answer answer =
@@ -125,11 +125,6 @@ void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const 
 void FakeRpcServer::on(const std::string& method, Handler handler) {
   SXMutexLock lock(mutex_);
   handlers_[method] = std::move(handler);
-}
-
-void FakeRpcServer::onAny(Handler handler) {
-  SXMutexLock lock(mutex_);
-  anyHandler_ = std::move(handler);
 }
 
 std::vector<FakeRpcServer::Request> FakeRpcServer::requests() const {
@@ -146,12 +141,6 @@ bool FakeRpcServer::waitForRequests(size_t count, std::chrono::milliseconds time
 size_t FakeRpcServer::connectionCount() const {
   SXMutexLock lock(mutex_);
   return connectionCount_;
-}
-
-bool FakeRpcServer::waitForConnections(size_t count, std::chrono::milliseconds timeout) {
-  SXMutexLock lock(mutex_);
-  return lock.waitFor(changed_, timeout,
-                      [&]() SX_REQUIRES(mutex_) { return connectionCount_ >= count; });
 }
 
 void FakeRpcServer::forEachConnection(std::function<void(Connection&)> action) {

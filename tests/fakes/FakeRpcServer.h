@@ -50,15 +50,11 @@ class FakeRpcServer {
   const std::string& socketPath() const { return socketPath_; }
 
   void on(const std::string& method, Handler handler);
-  // Answers every method that has no handler of its own.
-  void onAny(Handler handler);
 
   std::vector<Request> requests() const;
   // Waits until at least `count` requests have arrived. False when they did not in time.
   bool waitForRequests(size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10));
   size_t connectionCount() const;  // accepted so far
-  bool waitForConnections(size_t count,
-                          std::chrono::milliseconds timeout = std::chrono::seconds(10));
 
   // Sends to every open connection.
   void respond(uint32_t msgid, const SXValue& error, const SXValue& result);
@@ -80,7 +76,6 @@ class FakeRpcServer {
   mutable SXMutex mutex_;
   std::condition_variable changed_;
   std::map<std::string, Handler> handlers_ SX_GUARDED_BY(mutex_);
-  Handler anyHandler_ SX_GUARDED_BY(mutex_);
   std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
   size_t connectionCount_ SX_GUARDED_BY(mutex_) = 0;  // accepted so far
 

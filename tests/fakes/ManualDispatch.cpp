@@ -2,7 +2,6 @@
 
 #include <algorithm>
 
-
 namespace {
 
 class ManualQueue final : public SXWorkQueue {
@@ -33,10 +32,6 @@ ManualDispatch::ManualDispatch(std::shared_ptr<FakeClock> clock)
 
 std::shared_ptr<SXWorkQueue> ManualDispatch::createSerialQueue(std::string label,
                                                                SXQualityOfService) {
-  {
-    SXMutexLock lock(mutex_);
-    created_.push_back(label);
-  }
   return std::make_shared<ManualQueue>(std::move(label), *this);
 }
 
@@ -101,17 +96,7 @@ size_t ManualDispatch::runAll() {
   }
 }
 
-size_t ManualDispatch::pending() const {
-  SXMutexLock lock(mutex_);
-  return tasks_.size();
-}
-
 std::vector<std::chrono::nanoseconds> ManualDispatch::delays() const {
   SXMutexLock lock(mutex_);
   return delays_;
-}
-
-std::vector<std::string> ManualDispatch::createdQueues() const {
-  SXMutexLock lock(mutex_);
-  return created_;
 }

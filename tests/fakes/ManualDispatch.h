@@ -31,11 +31,8 @@ class ManualDispatch final : public SXDispatch {
   // Manual time only: moves the clock forward by `delay`, stopping at each delayed task's due
   // time (earliest first) to hand it to its queue and `runAll`; returns how many tasks ran.
   size_t advance(std::chrono::nanoseconds delay);
-  size_t pending() const;
   // Delays passed to `after`, in order.
   std::vector<std::chrono::nanoseconds> delays() const;
-  // Labels of the queues created, in order.
-  std::vector<std::string> createdQueues() const;
 
   // `suspended`, when given, is the count of the queue's suspensions: the task waits while it
   // is above zero.
@@ -57,7 +54,6 @@ class ManualDispatch final : public SXDispatch {
   mutable SXMutex mutex_;
   std::deque<Queued> tasks_ SX_GUARDED_BY(mutex_);
   std::vector<std::chrono::nanoseconds> delays_ SX_GUARDED_BY(mutex_);
-  std::vector<std::string> created_ SX_GUARDED_BY(mutex_);
   std::vector<Delayed> delayed_ SX_GUARDED_BY(mutex_);  // in order of `after`
   std::shared_ptr<SXWorkQueue> lowPriority_;
 };

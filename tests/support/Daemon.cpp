@@ -13,7 +13,6 @@
 #include <sstream>
 #include <thread>
 
-
 bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds timeout) {
   auto deadline = std::chrono::steady_clock::now() + timeout;
   while (!ready()) {
@@ -229,21 +228,44 @@ int TestDaemon::ctl(const std::vector<std::string>& args, std::string* output) c
                                     "--runtime-dir", dir_.file("run")};
   words.insert(words.end(), args.begin(), args.end());
   std::string command = SXR_CTL_PATH;
-  for (const auto& word : words) {
-    command += " '";
-    command += word;
-    command += "'";
-  }
-  command += " 2>&1";
+  for (const auto& word : words) command += " " + shellQuoted(word);
+  CommandRun run = runCommand(command + " 2>&1");
+  if (output) *output = run.output;
+  return run.status;
+}
+
+std::string shellQuoted(const std::string& word) {
+  std::string text = "'";
+  for (char c : word) text += c == '\'' ? std::string("'\\''") : std::string(1, c);
+  return text + "'";
+}
+
+CommandRun runCommand(const std::string& command) {
+  CommandRun run;
   FILE* pipe = ::popen(command.c_str(), "r");
-  if (!pipe) return -1;
-  std::string text;
+  if (!pipe) return run;
   char buf[4096];
   size_t n;
-  while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) text.append(buf, n);
-  int status = ::pclose(pipe);
-  if (output) *output = text;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) run.output.append(buf, n);
+  const int status = ::pclose(pipe);
+  run.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  return run;
+}
+
+pid_t TestDaemon::spawnCtl(const std::vector<std::string>& args) const {
+  std::vector<std::string> argv = {SXR_CTL_PATH, "--socket", socket_};
+  argv.insert(argv.end(), args.begin(), args.end());
+  std::vector<char*> raw;
+  for (auto& a : argv) raw.push_back(a.data());
+  raw.push_back(nullptr);
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    int null = ::open("/dev/null", O_WRONLY);
+    ::dup2(null, STDOUT_FILENO);
+    ::execv(raw[0], raw.data());
+    ::_exit(127);
+  }
+  return pid;
 }
 
 long residentKiB(pid_t pid) {

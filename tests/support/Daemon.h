@@ -76,6 +76,8 @@ class TestDaemon {
 
   // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
+  // Starts sxreportctl against this daemon, its output discarded; returns its pid.
+  pid_t spawnCtl(const std::vector<std::string>& args) const;
 
  private:
   std::vector<int> listeningSockets(int count) const;
@@ -87,9 +89,20 @@ class TestDaemon {
   std::optional<int> exitStatus_;
 };
 
-// Polls `ready` until it holds or `timeout` passes.
 // A process's resident set in KiB (VmRSS), or -1 when it cannot be read.
 long residentKiB(pid_t pid);
+
+// `word` quoted for the shell.
+std::string shellQuoted(const std::string& word);
+// Runs `command` through the shell; its exit status (-1 when it did not exit) and its standard
+// output.
+struct CommandRun {
+  int status = -1;
+  std::string output;
+};
+CommandRun runCommand(const std::string& command);
+
+// Polls `ready` until it holds or `timeout` passes.
 
 bool waitUntil(const std::function<bool()>& ready,
                std::chrono::milliseconds timeout = std::chrono::seconds(15));

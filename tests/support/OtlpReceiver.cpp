@@ -183,8 +183,6 @@ void OtlpReceiver::answerAfter(std::chrono::milliseconds delay) {
 
 void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
 
-void OtlpReceiver::succeed() { failNext(0, 0); }
-
 std::vector<OtlpReceiver::Request> OtlpReceiver::requests() const {
   SXMutexLock lock(mutex_);
   return requests_;

@@ -38,7 +38,6 @@ class OtlpReceiver {
   OtlpReceiver(const OtlpReceiver&) = delete;
   OtlpReceiver& operator=(const OtlpReceiver&) = delete;
 
-  uint16_t port() const { return port_; }
   // "http://127.0.0.1:<port>/v1/logs"
   std::string endpoint() const;
 
@@ -49,8 +48,6 @@ class OtlpReceiver {
   void answerAfter(std::chrono::milliseconds delay);
   // The next `count` requests are read and then their connection is closed, unanswered.
   void dropNext(size_t count);
-  // Every request from now on is answered 200 again.
-  void succeed();
 
   std::vector<Request> requests() const;
   // The log records of the requests answered 2xx, in the order they came (whether or not the

@@ -1,22 +1,37 @@
 #include "support/TestEnvironment.h"
 
+#include <stdlib.h>
+
+#include <filesystem>
+
+namespace {
+
+std::string temporaryDirectory() {
+  std::string pattern =
+      (std::filesystem::temp_directory_path() / "sxr-environment-XXXXXX").string();
+  return ::mkdtemp(pattern.data()) ? pattern : std::string();
+}
+
+}  // namespace
+
 TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string> verboseScopes)
     : log(std::make_shared<FakeLog>(std::move(verboseScopes))),
-      device(std::make_shared<FakeDeviceProperties>(std::move(deviceProperties))) {
+      device(std::make_shared<FakeDeviceProperties>(std::move(deviceProperties))),
+      directory(temporaryDirectory()) {
   environment = std::make_shared<SXReportingEnvironment>(platform());
   environment->setServerQueue(dispatch->createSerialQueue("com.vendra.sonex.reporting.server",
                                                           SXQualityOfService::kUserInteractive));
+  // The manual dispatch runs a backend wait's timer as soon as it is set, so the fake's
+  // backends are known before the setup task looks for them (its configuration is inline).
   environment->setBackendWaitSeconds(0.3);
-  // The manual dispatch runs a backend wait's timer as soon as it is set, so the backends must
-  // be known before the setup task looks for them.
-  fern->setConfigurationDelivery(FakeFernReporting::Delivery::kInline);
 }
 
 TestEnvironment::~TestEnvironment() {
   // Queued work holds sessions strongly; run it so nothing outlives the fakes.
   dispatch->runAll();
-  notifications->clear();  // registrations hold the service delegate
-  orientation->clear();    // and callbacks their sessions
+  orientation->clear();  // callbacks hold their sessions
+  std::error_code ignored;
+  if (!directory.empty()) std::filesystem::remove_all(directory, ignored);
 }
 
 SXPlatform TestEnvironment::platform() const {

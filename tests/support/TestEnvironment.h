@@ -3,20 +3,20 @@
 #pragma once
 
 #include <memory>
+#include <string>
 
 #include "SXReportingEnvironment.h"
 #include "fakes/FakeClock.h"
 #include "fakes/FakeDevice.h"
 #include "fakes/FakeFernReporting.h"
-#include "fakes/FakeJoulebook.h"
 #include "fakes/FakeKestrel.h"
 #include "fakes/FakeLog.h"
-#include "fakes/FakeNotifications.h"
-#include "fakes/FakePreferences.h"
 #include "fakes/FakeTallyvane.h"
-#include "fakes/FakeTracer.h"
 #include "fakes/ManualDispatch.h"
+#include "platform/JsonPreferences.h"
+#include "platform/Notify.h"
 #include "platform/Random.h"
+#include "platform/Trace.h"
 
 // Always draws the same number (below its bound).
 class FixedRandom final : public SXRandom {
@@ -30,13 +30,25 @@ class FixedRandom final : public SXRandom {
   uint32_t value_;
 };
 
+// Registrations succeed and nothing is ever delivered: the defaults' notification is tested
+// through the real daemon, and a registration kept here would keep the service alive.
+class SilentNotifications final : public SXNotifications {
+ public:
+  int registerDispatch(const std::string&, int& token, std::shared_ptr<SXWorkQueue>,
+                       SXNotifyHandler) override {
+    token = 1;
+    return 0;
+  }
+  int post(const std::string&) override { return 0; }
+};
+
 struct TestEnvironment {
   explicit TestEnvironment(SXValue deviceProperties = SXValue::object(),
                            std::set<std::string> verboseScopes = {"sxrs", "sxrr", "sxrd"});
   ~TestEnvironment();
 
   std::shared_ptr<FakeLog> log;
-  std::shared_ptr<FakeTracer> tracer = std::make_shared<FakeTracer>();
+  std::shared_ptr<SXTracer> tracer = std::make_shared<SXUsdtTracer>();
   std::shared_ptr<FakeClock> clock = std::make_shared<FakeClock>();
   std::shared_ptr<ManualDispatch> dispatch = std::make_shared<ManualDispatch>();
   std::shared_ptr<FixedRandom> random = std::make_shared<FixedRandom>(59);
@@ -48,8 +60,10 @@ struct TestEnvironment {
   std::shared_ptr<FakeFernReporting> fern = std::make_shared<FakeFernReporting>();
   std::shared_ptr<FakeKestrel> kestrel = std::make_shared<FakeKestrel>();
   std::shared_ptr<FakeOrientationService> orientation = std::make_shared<FakeOrientationService>();
-  std::shared_ptr<FakePreferences> preferences = std::make_shared<FakePreferences>();
-  std::shared_ptr<FakeNotifications> notifications = std::make_shared<FakeNotifications>();
+  const std::string directory;  // a fresh temporary one, removed with the environment
+  std::shared_ptr<SXJsonPreferences> preferences =
+      std::make_shared<SXJsonPreferences>(directory + "/preferences", log);
+  std::shared_ptr<SilentNotifications> notifications = std::make_shared<SilentNotifications>();
   std::shared_ptr<SXReportingEnvironment> environment;
 
   SXPlatform platform() const;

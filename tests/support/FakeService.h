@@ -1,0 +1,56 @@
+// The service delegate over a TestEnvironment, driven through fake connections with the
+// queues run by hand.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string_view>
+
+#include "SXReportingServiceDelegate.h"
+#include "fakes/FakeIpc.h"
+#include "support/TestEnvironment.h"
+
+struct FakeService {
+  // `adjust` may swap a facility of the platform before the service is made of it.
+  explicit FakeService(SXReportingLimits limits = {},
+                       const std::function<void(TestEnvironment&, SXPlatform&)>& adjust = {}) {
+    platform = t.platform();
+    if (adjust) adjust(t, platform);
+    environment = std::make_shared<SXReportingEnvironment>(platform, limits);
+    environment->setServerQueue(
+        t.dispatch->createSerialQueue("server", SXQualityOfService::kUserInteractive));
+    environment->setBackendWaitSeconds(0.3);
+    delegate = SXReportingServiceDelegate::init(environment);
+  }
+  ~FakeService() { t.drain(); }
+
+  // A connection the delegate accepted; its registration has run unless `settle` is false.
+  std::shared_ptr<FakeIpcConnection> connect(int32_t pid, bool settle = true) {
+    auto connection = std::make_shared<FakeIpcConnection>(pid);
+    EXPECT_TRUE(delegate->shouldAcceptNewConnection(connection)) << pid;
+    if (settle) t.drain();
+    return connection;
+  }
+  // The result of the request's reply, or "no reply" when none came once the queues ran.
+  SXValue call(FakeIpcConnection& c, std::string_view method, SXValue params) {
+    size_t before = c.responses().size();
+    c.request(method, std::move(params));
+    t.drain();
+    auto all = c.responses();
+    return all.size() > before ? all.back().result : SXValue("no reply");
+  }
+  SXValue status() {
+    SXValue out;
+    environment->serverQueue()->async([&] { out = delegate->statusSnapshot(); });
+    t.drain();
+    return out;
+  }
+  uint64_t dropped(const char* guardrail) {
+    return status()["counters"]["guardrail_dropped"][guardrail].get<uint64_t>();
+  }
+
+  TestEnvironment t;
+  SXPlatform platform;  // what the service was made of
+  std::shared_ptr<SXReportingEnvironment> environment;
+  std::shared_ptr<SXReportingServiceDelegate> delegate;
+};
