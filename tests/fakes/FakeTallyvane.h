@@ -11,6 +11,24 @@
 #include "platform/Joulebook.h"
 #include "platform/Tallyvane.h"
 
+// What a double was handed, in order; any thread.
+template <typename Record>
+class Recorded {
+ public:
+  void add(Record record) {
+    SXMutexLock lock(mutex_);
+    records_.push_back(std::move(record));
+  }
+  std::vector<Record> all() const {
+    SXMutexLock lock(mutex_);
+    return records_;
+  }
+
+ private:
+  mutable SXMutex mutex_;
+  std::vector<Record> records_ SX_GUARDED_BY(mutex_);
+};
+
 class FakeTallyvane final : public SXTallyvane {
  public:
   struct Event {
@@ -18,19 +36,13 @@ class FakeTallyvane final : public SXTallyvane {
     SXValue payload;
   };
   bool sendEventLazy(const std::string& name, SXPayloadProvider provider) override {
-    SXValue payload = provider ? provider() : SXValue();
-    SXMutexLock lock(mutex_);
-    events_.push_back({name, std::move(payload)});
+    events_.add({name, provider ? provider() : SXValue()});
     return true;
   }
-  std::vector<Event> events() const {
-    SXMutexLock lock(mutex_);
-    return events_;
-  }
+  std::vector<Event> events() const { return events_.all(); }
 
  private:
-  mutable SXMutex mutex_;
-  std::vector<Event> events_ SX_GUARDED_BY(mutex_);
+  Recorded<Event> events_;
 };
 
 class FakeJoulebook final : public SXJoulebook {
@@ -42,15 +54,10 @@ class FakeJoulebook final : public SXJoulebook {
   };
   void logRegisteredEvent(int clientID, const std::string& event, const SXValue& entry,
                           const std::optional<SXValue>&) override {
-    SXMutexLock lock(mutex_);
-    entries_.push_back({clientID, event, entry});
+    entries_.add({clientID, event, entry});
   }
-  std::vector<Entry> entries() const {
-    SXMutexLock lock(mutex_);
-    return entries_;
-  }
+  std::vector<Entry> entries() const { return entries_.all(); }
 
  private:
-  mutable SXMutex mutex_;
-  std::vector<Entry> entries_ SX_GUARDED_BY(mutex_);
+  Recorded<Entry> entries_;
 };
