@@ -7,6 +7,8 @@
 
 using namespace std::chrono_literals;
 
+// The second half of the tasks is handed on inside nested SXCoalescedWakes scopes, which put
+// off the worker's wake-up to the end of the outer one, beside a queue that goes meanwhile.
 TEST(AsioDispatch, SerialQueuesKeepOrderAndNeverOverlap) {
   SXAsioDispatch dispatch;
   for (auto qos : {SXQualityOfService::kUserInteractive, SXQualityOfService::kUtility}) {
@@ -14,13 +16,23 @@ TEST(AsioDispatch, SerialQueuesKeepOrderAndNeverOverlap) {
     std::vector<int> order;  // touched only by the queue's tasks
     std::atomic<int> running{0};
     std::promise<void> done;
-    for (int i = 0; i < 1000; ++i) {
+    auto submit = [&](int i) {
       queue->async([&, i] {
         EXPECT_EQ(running.fetch_add(1), 0);
         order.push_back(i);
         running.fetch_sub(1);
         if (i == 999) done.set_value();
       });
+    };
+    for (int i = 0; i < 500; ++i) submit(i);
+    {
+      SXCoalescedWakes outer;
+      auto gone = dispatch.createSerialQueue("gone", qos);
+      gone->async([] {});
+      gone.reset();
+      for (int i = 500; i < 750; ++i) submit(i);
+      SXCoalescedWakes inner;
+      for (int i = 750; i < 1000; ++i) submit(i);
     }
     ASSERT_EQ(done.get_future().wait_for(10s), std::future_status::ready);
     for (int i = 0; i < 1000; ++i) ASSERT_EQ(order[static_cast<size_t>(i)], i);

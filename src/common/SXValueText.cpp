@@ -15,10 +15,7 @@ namespace {
 // through the library's serializer, so the text is the same byte for byte.
 class JsonWriter {
  public:
-  explicit JsonWriter(std::string& out)
-      : out_(out),
-        serializer_(nlohmann::detail::output_adapter<char, std::string>(out), ' ',
-                    SXValue::error_handler_t::replace) {}
+  explicit JsonWriter(std::string& out) : out_(out) {}
 
   void value(const SXValue& value) {
     switch (value.type()) {
@@ -47,8 +44,20 @@ class JsonWriter {
       case SXValue::value_t::string:
         string(value.get_ref<const std::string&>(), &value);
         return;
+      case SXValue::value_t::number_integer:
+        decimal(value.get<int64_t>());
+        return;
+      case SXValue::value_t::number_unsigned:
+        decimal(value.get<uint64_t>());
+        return;
+      case SXValue::value_t::boolean:
+        out_ += value.get<bool>() ? "true" : "false";
+        return;
+      case SXValue::value_t::null:
+        out_ += "null";
+        return;
       default:
-        serializer_.dump(value, false, false, 0);
+        serializer().dump(value, false, false, 0);
     }
   }
 
@@ -59,6 +68,23 @@ class JsonWriter {
   }
 
  private:
+  template <typename Integer>
+  void decimal(Integer number) {
+    char digits[24];
+    auto [end, ec] = std::to_chars(digits, digits + sizeof digits, number);
+    out_.append(digits, end);
+  }
+
+  // The library's serializer, for floating values, binary values and strings that need
+  // escaping or repair. Made on first use: setting one up costs more than writing a payload.
+  nlohmann::detail::serializer<SXValue>& serializer() {
+    if (!serializer_) {
+      serializer_.emplace(nlohmann::detail::output_adapter<char, std::string>(out_), ' ',
+                          SXValue::error_handler_t::replace);
+    }
+    return *serializer_;
+  }
+
   static bool plain(std::string_view text) {
     for (unsigned char c : text) {
       if (c < 0x20 || c >= 0x7F || c == '"' || c == '\\') return false;
@@ -73,14 +99,14 @@ class JsonWriter {
       out_.append(text);
       out_ += '"';
     } else if (asValue) {
-      serializer_.dump(*asValue, false, false, 0);
+      serializer().dump(*asValue, false, false, 0);
     } else {
-      serializer_.dump(SXValue(std::string(text)), false, false, 0);
+      serializer().dump(SXValue(std::string(text)), false, false, 0);
     }
   }
 
   std::string& out_;
-  nlohmann::detail::serializer<SXValue> serializer_;
+  std::optional<nlohmann::detail::serializer<SXValue>> serializer_;
 };
 
 std::string JsonText(const SXValue& value) {

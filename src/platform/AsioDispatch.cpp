@@ -17,7 +17,17 @@ void nameThisThread(const std::string& name) {
 }
 
 // Serial queue on a thread of its own.
-class ThreadQueue final : public SXWorkQueue {
+class ThreadQueue;
+
+// This thread's open SXCoalescedWakes scopes and the queues whose wake-up waits for them.
+thread_local int tlsWakeScopes = 0;
+struct DeferredWake {
+  const ThreadQueue* queue;  // identity only: the queue may be gone by the scope's end
+  std::weak_ptr<ThreadQueue> alive;
+};
+thread_local std::vector<DeferredWake> tlsDeferredWakes;
+
+class ThreadQueue final : public SXWorkQueue, public std::enable_shared_from_this<ThreadQueue> {
  public:
   explicit ThreadQueue(std::string label) : label_(std::move(label)) {
     thread_ = std::thread([this] { run(); });
@@ -39,8 +49,13 @@ class ThreadQueue final : public SXWorkQueue {
       SXMutexLock lock(mutex_);
       tasks_.push_back(std::move(task));
     }
-    wake_.notify_one();
+    if (tlsWakeScopes == 0) {
+      wake_.notify_one();
+    } else {
+      deferWake();
+    }
   }
+  void wakeNow() { wake_.notify_one(); }
   const std::string& label() const override { return label_; }
   void suspend() override {
     SXMutexLock lock(mutex_);
@@ -55,6 +70,13 @@ class ThreadQueue final : public SXWorkQueue {
   }
 
  private:
+  void deferWake() {
+    for (const DeferredWake& deferred : tlsDeferredWakes) {
+      if (deferred.queue == this) return;
+    }
+    tlsDeferredWakes.push_back({this, weak_from_this()});
+  }
+
   void run() {
     nameThisThread("sxr-server");
     SXMutexLock lock(mutex_);
@@ -310,6 +332,15 @@ SXAsioDispatch::~SXAsioDispatch() {
   timersWork_.reset();
   timers_.stop();
   timerThread_.join();
+}
+
+SXCoalescedWakes::SXCoalescedWakes() { ++tlsWakeScopes; }
+
+SXCoalescedWakes::~SXCoalescedWakes() {
+  if (--tlsWakeScopes > 0) return;
+  for (const DeferredWake& deferred : std::exchange(tlsDeferredWakes, {})) {
+    if (auto queue = deferred.alive.lock()) queue->wakeNow();
+  }
 }
 
 std::shared_ptr<SXWorkQueue> SXAsioDispatch::createSerialQueue(std::string label,

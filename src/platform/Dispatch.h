@@ -28,6 +28,18 @@ class SXWorkQueue {
   virtual void resume() = 0;
 };
 
+// While one is alive on a thread, the thread-backed serial queues that this thread hands tasks
+// to wake their worker once, when the outermost one ends, instead of once per task: a reader
+// that hands on every request of one read pays for one wake-up, not thirty. Tasks are queued
+// at once and run in their order; only the wake-up waits. Other queues ignore it.
+class SXCoalescedWakes {
+ public:
+  SXCoalescedWakes();
+  ~SXCoalescedWakes();
+  SXCoalescedWakes(const SXCoalescedWakes&) = delete;
+  SXCoalescedWakes& operator=(const SXCoalescedWakes&) = delete;
+};
+
 class SXDispatch {
  public:
   virtual ~SXDispatch() = default;

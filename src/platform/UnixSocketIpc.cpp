@@ -233,6 +233,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   // says wait. kDrained: no whole message is left; kStopped: back-pressure stopped it with
   // messages left; kEnded: the stream broke or the connection ended.
   Dispatched dispatchMessages() {
+    SXCoalescedWakes wakeOnce;  // the server queue wakes once for this read's requests
     SXValue message;
     bool ok = true;
     bool drained = false;
