@@ -6,6 +6,8 @@
 #include "common/SXFormat.h"
 #include "common/SXValueText.h"
 
+#include <cmath>
+
 namespace {
 
 std::string encodeRequest(uint32_t id, const std::string& method, const SXValue& params) {
@@ -124,6 +126,7 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndWithMemberIsThatOfTheMergedCop
         SXValue{{"Host", 1}, {"Hz", 2.5}, {"b", {{"c", "\xff\n"}}}},
         SXValue{{"q\"u\\o\te", "\x7f\x01"}, {"\xc3\xa9t\xc3\xa9", "caf\xc3\xa9"}, {"", ""}},
         SXValue{{"n", {nullptr, true, -1, 18446744073709551615ull, 1e300, 0.1, SXValue::object()}},
+                {"f", {12.0, -0.0, 1e-7, 1e21, 5e-324, NAN, -INFINITY, INT64_MIN}},
                 {"bin", SXValue::binary(bytes)},
                 {"arr", SXValue::array()}},
         SXValue{{"A", "}\\\"{,]"}, {"Host", {{"x", {1, "]"}}}}, {"I", nullptr}, {"z", false}},

@@ -88,11 +88,20 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   auto sent = t.fern->events(Kind::kMessage);
   ASSERT_EQ(sent.size(), 1u);
   EXPECT_EQ(sent[0].payload, entries[0]["Playback_Start_3"]);
-  // The stored text is made without the rewritten copy: same members, same order.
+  // The stored text is made without the rewritten copy, from the dictionary or from the
+  // caller's own text: same members, same order.
   for (const SXValue& spaced :
-       {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}}, SXValue::array({1})}) {
-    EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced),
-              SXValueText(SXReportingSessionUnderscoreKeys(spaced)));
+       {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}}, SXValue::array({1}),
+        SXValue{{"z", "\",{} \\"}, {"a b", {1.5, "]", nullptr}}, {"a_b", 2}, {"a c", -0.0}},
+        SXValue{{"\xc3\xa9 t", 1}, {"e t", 2}}, SXValue{{"q\"u o", 1}, {"b", 2}},
+        SXValue::object()}) {
+    const std::string expected = SXValueText(SXReportingSessionUnderscoreKeys(spaced));
+    EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced), expected);
+    SXReportingMessagePayload prepared(std::make_shared<const SXValue>(spaced));
+    auto own = prepared.callerDictionaryText();
+    EXPECT_EQ(own ? *own : "", spaced.is_object() ? SXValueText(spaced) : "");
+    EXPECT_EQ(prepared.text(), expected) << spaced.dump();
+    EXPECT_EQ(prepared.callerDictionaryText(), nullptr);  // only the stored text is kept
   }
 }
 

@@ -23,7 +23,7 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   return [payload = payload_, payloadText = payloadText_, text] {
     SXMutexLock lock(text->mutex);
     if (!text->text && payloadText) {
-      if (const std::string* own = payloadText()) {
+      if (auto own = payloadText()) {
         text->text = SXDictionaryTextWithMember(*own, kHostKey, text->host);
       }
     }

@@ -18,9 +18,8 @@
 class SXReportingEventTexts {
  public:
   // `payloadText`, when given, may return the payload's own text (made for another store);
-  // the events' texts are then that text with the host added, not written again. The text it
-  // points to must last as long as the function (which holds what owns it).
-  using PayloadText = std::function<const std::string*()>;
+  // the events' texts are then that text with the host added, not written again.
+  using PayloadText = std::function<std::shared_ptr<const std::string>()>;
   explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
                                  PayloadText payloadText = nullptr)
       : payload_(std::move(payload)), payloadText_(std::move(payloadText)) {}

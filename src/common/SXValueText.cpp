@@ -1,6 +1,8 @@
 #include "common/SXValueText.h"
 
+#include <algorithm>
 #include <charconv>
+#include <cmath>
 
 std::string SXDoubleText(double value) {
   char buf[64];
@@ -56,6 +58,9 @@ class JsonWriter {
       case SXValue::value_t::null:
         out_ += "null";
         return;
+      case SXValue::value_t::number_float:
+        floating(value.get<double>());
+        return;
       default:
         serializer().dump(value, false, false, 0);
     }
@@ -75,7 +80,18 @@ class JsonWriter {
     out_.append(digits, end);
   }
 
-  // The library's serializer, for floating values, binary values and strings that need
+  // The library's own shortest form, as its serializer writes it; not a number is null.
+  void floating(double number) {
+    if (!std::isfinite(number)) {
+      out_ += "null";
+      return;
+    }
+    char digits[64];
+    char* end = nlohmann::detail::to_chars(digits, digits + sizeof digits, number);
+    out_.append(digits, end);
+  }
+
+  // The library's serializer, for binary values and strings that need
   // escaping or repair. Made on first use: setting one up costs more than writing a payload.
   nlohmann::detail::serializer<SXValue>& serializer() {
     if (!serializer_) {
@@ -179,17 +195,29 @@ std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& 
 
 namespace {
 
+// The index just past the string whose opening quote is at `at`, or npos. The closing quote is
+// the first one after an even run of backslashes; memchr finds the candidates.
+size_t SkipJsonString(std::string_view text, size_t at) {
+  for (size_t from = at + 1;;) {
+    size_t quote = text.find('"', from);
+    if (quote == std::string_view::npos) return quote;
+    size_t backslashes = 0;
+    while (quote - backslashes > at + 1 && text[quote - 1 - backslashes] == '\\') ++backslashes;
+    if (backslashes % 2 == 0) return quote + 1;
+    from = quote + 1;
+  }
+}
+
 // The index just past the JSON value that starts at `at` in compact JSON text, or npos.
 size_t SkipJsonValue(std::string_view text, size_t at) {
   int depth = 0;
   for (size_t i = at; i < text.size(); ++i) {
     char c = text[i];
     if (c == '"') {
-      for (++i; i < text.size() && text[i] != '"'; ++i) {
-        if (text[i] == '\\') ++i;
-      }
-      if (i >= text.size()) return std::string_view::npos;
-      if (depth == 0) return i + 1;
+      i = SkipJsonString(text, i);
+      if (i == std::string_view::npos) return i;
+      if (depth == 0) return i;
+      --i;  // the loop steps past the closing quote
     } else if (c == '{' || c == '[') {
       ++depth;
     } else if (c == '}' || c == ']') {
@@ -204,16 +232,10 @@ size_t SkipJsonValue(std::string_view text, size_t at) {
 
 }  // namespace
 
-std::optional<std::string> SXDictionaryTextWithMember(std::string_view text, const std::string& key,
-                                                      const SXValue& value) {
+std::optional<SXTextSlices> SXDictionaryTextMembers(std::string_view text) {
   if (text.size() < 2 || text.front() != '{' || text.back() != '}') return std::nullopt;
-  const SXTextMember only[] = {{key, &value}};
-  const std::string single = SXDictionaryText(only);
-  const std::string_view member = std::string_view(single).substr(1, single.size() - 2);
+  SXTextSlices members;
   const size_t end = text.size() - 1;
-  std::string out;
-  out.reserve(text.size() + member.size() + 1);
-  // Members come in key order: the new one goes before the first key not below it.
   for (size_t at = 1; at < end;) {
     if (text[at] != '"') return std::nullopt;
     size_t close = text.find('"', at + 1);
@@ -224,20 +246,37 @@ std::optional<std::string> SXDictionaryTextWithMember(std::string_view text, con
     if (name.find('\\') != std::string_view::npos) return std::nullopt;
     size_t next = SkipJsonValue(text, close + 2);
     if (next == std::string_view::npos || next > end) return std::nullopt;
-    if (int order = name.compare(key); order >= 0) {
-      out.append(text.substr(0, at)).append(member);
-      if (order == 0) {
-        out.append(text.substr(next));  // the member replaced
-      } else {
-        out.append(",").append(text.substr(at));
-      }
-      return out;
-    }
     if (next < end && text[next] != ',') return std::nullopt;
+    members.emplace_back(name, text.substr(close + 2, next - close - 2));
     at = next + 1;
   }
-  out.append(text.substr(0, end));
-  if (end > 1) out += ',';
-  out.append(member).append("}");
+  return members;
+}
+
+std::optional<std::string> SXDictionaryTextWithMember(std::string_view text, const std::string& key,
+                                                      const SXValue& value) {
+  auto members = SXDictionaryTextMembers(text);
+  if (!members) return std::nullopt;
+  const SXTextMember only[] = {{key, &value}};
+  const std::string single = SXDictionaryText(only);
+  const std::string_view member = std::string_view(single).substr(1, single.size() - 2);
+  std::string out;
+  out.reserve(text.size() + member.size() + 1);
+  // Members come in key order: the new one goes before the first key not below it.
+  auto next = std::find_if(members->begin(), members->end(),
+                           [&](const auto& slice) { return !(slice.first < key); });
+  if (next == members->end()) {
+    out.append(text.substr(0, text.size() - 1));
+    if (!members->empty()) out += ',';
+    return out.append(member).append("}");
+  }
+  const size_t start = static_cast<size_t>(next->first.data() - text.data()) - 1;  // its quote
+  out.append(text.substr(0, start)).append(member);
+  if (next->first == key) {
+    const std::string_view& replaced = next->second;
+    out.append(text.substr(static_cast<size_t>(replaced.data() + replaced.size() - text.data())));
+  } else {
+    out.append(",").append(text.substr(start));
+  }
   return out;
 }

@@ -5,6 +5,8 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 #include "sxreporting/types.h"
 
@@ -34,6 +36,12 @@ std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& 
 // from the dictionary.
 std::optional<std::string> SXDictionaryTextWithMember(std::string_view dictionaryText,
                                                       const std::string& key, const SXValue& value);
+
+// The members of a dictionary's SXValueText as slices of that text: each key (without its
+// quotes) and the text of its value, in the text's order. Nothing when the text cannot be read
+// that way (a key with an escape in it, or not a dictionary's text).
+using SXTextSlices = std::vector<std::pair<std::string_view, std::string_view>>;
+std::optional<SXTextSlices> SXDictionaryTextMembers(std::string_view dictionaryText);
 
 // Shortest decimal text of a double that reads back to the same double.
 std::string SXDoubleText(double value);

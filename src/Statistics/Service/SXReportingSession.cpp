@@ -72,6 +72,39 @@ std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXV
 
 }  // namespace
 
+namespace {
+
+// The rewrite's text made from the caller's dictionary text: each member's value text copied
+// under its rewritten key, in the rewritten order. Nothing when a key is not plain ASCII, whose
+// order in the text might not be that of the dictionary's keys; the caller then writes it anew.
+std::optional<std::string> underscoredText(std::string_view callerText) {
+  auto members = SXDictionaryTextMembers(callerText);
+  if (!members) return std::nullopt;
+  std::vector<std::pair<std::string, std::string_view>> renamed;
+  renamed.reserve(members->size());
+  for (const auto& [key, value] : *members) {
+    if (std::any_of(key.begin(), key.end(), [](char c) { return c & 0x80; })) return std::nullopt;
+    std::string name(key);
+    std::replace(name.begin(), name.end(), ' ', '_');
+    renamed.emplace_back(std::move(name), value);
+  }
+  std::stable_sort(renamed.begin(), renamed.end(),
+                   [](const auto& a, const auto& b) { return a.first < b.first; });
+  std::string text;
+  text.reserve(callerText.size());
+  text += '{';
+  for (auto it = renamed.begin(); it != renamed.end(); ++it) {
+    // Of keys that became equal the last in the caller's order wins.
+    if (std::next(it) != renamed.end() && std::next(it)->first == it->first) continue;
+    if (text.size() > 1) text += ',';
+    text.append("\"").append(it->first).append("\":").append(it->second);
+  }
+  text += '}';
+  return text;
+}
+
+}  // namespace
+
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   SXValue rewritten = SXValue::object();
   for (const auto& [key, value] : underscoredMembers(payload)) rewritten[key] = *value;
@@ -123,16 +156,22 @@ std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
   return rewrittenLocked();
 }
 
+const std::shared_ptr<const std::string>& SXReportingMessagePayload::callerTextLocked() {
+  if (!callerText_) callerText_ = std::make_shared<const std::string>(SXValueText(*caller_));
+  return callerText_;
+}
+
 const std::string& SXReportingMessagePayload::makeTextLocked() {
-  if (!text_) {
-    // Without a rewritten dictionary, the rewrite's text comes straight from the caller's.
-    if (rewritten_) {
-      text_ = SXValueText(*rewritten_);
-    } else if (rewritesLocked()) {
-      text_ = SXReportingSessionUnderscoreKeysText(*caller_);
-    } else {
-      text_ = SXValueText(*caller_);
-    }
+  if (text_) return *text_;
+  if (!rewritesLocked()) {
+    text_ = callerTextLocked();
+  } else if (rewritten_) {
+    text_ = std::make_shared<const std::string>(SXValueText(*rewritten_));
+  } else {
+    std::optional<std::string> text;
+    if (callerIsDictionary_) text = underscoredText(*callerTextLocked());
+    text_ = std::make_shared<const std::string>(
+        text ? std::move(*text) : SXReportingSessionUnderscoreKeysText(*caller_));
   }
   return *text_;
 }
@@ -141,6 +180,7 @@ const std::string& SXReportingMessagePayload::textLocked() {
   makeTextLocked();
   caller_ = nullptr;
   rewritten_ = nullptr;
+  callerText_ = nullptr;
   return *text_;
 }
 
@@ -154,11 +194,12 @@ void SXReportingMessagePayload::keepOnlyText() {
   textLocked();
 }
 
-const std::string* SXReportingMessagePayload::callerDictionaryText() {
+std::shared_ptr<const std::string> SXReportingMessagePayload::callerDictionaryText() {
   SXMutexLock lock(mutex_);
-  if (rewritesLocked() || !callerIsDictionary_) return nullptr;
+  if (callerText_) return callerText_;
+  if (!caller_ || !caller_->is_object()) return nullptr;
   // The dictionaries stay: a standalone send of a session not started reads them.
-  return &makeTextLocked();
+  return callerTextLocked();
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

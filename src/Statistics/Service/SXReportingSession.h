@@ -37,16 +37,17 @@ class SXReportingMessagePayload {
   std::string text();
   // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
   void keepOnlyText();
-  // The text, made now if need be, when it is also that of the caller's own payload: a
-  // dictionary with no space in its keys, which the rewrite leaves as it is. Whichever store
-  // asks first makes it for both. Once made the text never changes, so the pointer holds for
-  // as long as this payload; null when the text is not the caller's.
-  const std::string* callerDictionaryText();
+  // SXValueText of the caller's own payload when it is a dictionary, made now if need be; null
+  // when it is not a dictionary, or once only the rewrite's text is kept. The rewrite's text is
+  // made from it (its members' texts copied under their new keys), so whichever store asks
+  // first writes the payload's values for both.
+  std::shared_ptr<const std::string> callerDictionaryText();
 
  private:
   // Whether the rewrite changes the caller's payload; made once.
   bool rewritesLocked() SX_REQUIRES(mutex_);
   std::shared_ptr<const SXValue> rewrittenLocked() SX_REQUIRES(mutex_);
+  const std::shared_ptr<const std::string>& callerTextLocked() SX_REQUIRES(mutex_);
   // Makes the text once.
   const std::string& makeTextLocked() SX_REQUIRES(mutex_);
   // Makes the text once and releases the dictionaries.
@@ -55,7 +56,8 @@ class SXReportingMessagePayload {
   SXMutex mutex_;
   std::shared_ptr<const SXValue> caller_ SX_GUARDED_BY(mutex_);     // released with the text
   std::shared_ptr<const SXValue> rewritten_ SX_GUARDED_BY(mutex_);  // released with the text
-  std::optional<std::string> text_ SX_GUARDED_BY(mutex_);
+  std::shared_ptr<const std::string> callerText_ SX_GUARDED_BY(mutex_);  // released with them
+  std::shared_ptr<const std::string> text_ SX_GUARDED_BY(mutex_);  // the caller's when no rewrite
   std::optional<bool> rewrites_ SX_GUARDED_BY(mutex_);
   bool callerIsDictionary_ SX_GUARDED_BY(mutex_) = false;  // set with rewrites_
 };
