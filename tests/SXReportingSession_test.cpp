@@ -98,10 +98,12 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
     const std::string expected = SXValueText(SXReportingSessionUnderscoreKeys(spaced));
     EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced), expected);
     SXReportingMessagePayload prepared(std::make_shared<const SXValue>(spaced));
-    auto own = prepared.callerDictionaryText();
-    EXPECT_EQ(own ? *own : "", spaced.is_object() ? SXValueText(spaced) : "");
+    prepared.hold();  // an analytics event still to come keeps the caller's text
     EXPECT_EQ(prepared.text(), expected) << spaced.dump();
-    EXPECT_EQ(prepared.callerDictionaryText(), nullptr);  // only the stored text is kept
+    auto own = prepared.payloadText();
+    EXPECT_EQ(own ? *own : "", spaced.is_object() ? SXValueText(spaced) : "");
+    prepared.release();
+    EXPECT_EQ(prepared.payloadText(), nullptr);  // then only the stored text is kept
   }
 }
 

@@ -12,17 +12,30 @@
 #include "SXReportingEventSession.h"
 #include "common/SXThreadSafety.h"
 
+// The payload's own compact text, shared with another store, that the events' texts can be
+// made from (the host added by copying, not by writing the payload again). Any thread.
+class SXPayloadTextSource {
+ public:
+  virtual ~SXPayloadTextSource() = default;
+  // One more reader may ask for the text: the source keeps it until every hold is released.
+  virtual void hold() = 0;
+  virtual void release() = 0;
+  // The text, made now if need be; null when the payload has none (not a dictionary, or the
+  // text was let go with no hold on it).
+  virtual std::shared_ptr<const std::string> payloadText() = 0;
+};
+
 // The analytics events of one message: their payloads differ only in the host name, so each
 // distinct host's text is made once (when the analytics service first asks for it, on its
-// thread), however many sessions the message goes to. Used on the server queue.
+// thread), however many sessions the message goes to. Used on the server queue; lives while
+// the message is routed.
 class SXReportingEventTexts {
  public:
-  // `payloadText`, when given, may return the payload's own text (made for another store);
-  // the events' texts are then that text with the host added, not written again.
-  using PayloadText = std::function<std::shared_ptr<const std::string>()>;
   explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
-                                 PayloadText payloadText = nullptr)
-      : payload_(std::move(payload)), payloadText_(std::move(payloadText)) {}
+                                 std::shared_ptr<SXPayloadTextSource> source = nullptr);
+  ~SXReportingEventTexts();
+  SXReportingEventTexts(const SXReportingEventTexts&) = delete;
+  SXReportingEventTexts& operator=(const SXReportingEventTexts&) = delete;
   const std::shared_ptr<const SXValue>& payload() const { return payload_; }
   // The event text for a session whose host is `host`.
   SXPayloadTextProvider textForHost(const SXValue& host);
@@ -35,7 +48,7 @@ class SXReportingEventTexts {
     std::optional<std::string> text SX_GUARDED_BY(mutex);  // made by the first event to ask
   };
   std::shared_ptr<const SXValue> payload_;
-  PayloadText payloadText_;
+  std::shared_ptr<SXPayloadTextSource> source_;
   std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few
 };
 

@@ -253,7 +253,7 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> me
   size_t packedBytes = SXPackedSize(*message);
   message = chargeDeliveries(std::move(message), packedBytes, sessions.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(message);
-  SXReportingEventTexts events(message, [prepared] { return prepared->callerDictionaryText(); });
+  SXReportingEventTexts events(message, prepared);
   for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
@@ -297,7 +297,7 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
   size_t packedBytes = SXPackedSize(*message);
   auto charged = chargeDeliveries(message, packedBytes, active.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(charged);
-  SXReportingEventTexts events(charged, [prepared] { return prepared->callerDictionaryText(); });
+  SXReportingEventTexts events(charged, prepared);
   for (const auto& session : active) {
     session->sendMessage(charged, category, type, nullptr, packedBytes, prepared);
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);

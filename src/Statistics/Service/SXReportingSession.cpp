@@ -180,7 +180,7 @@ const std::string& SXReportingMessagePayload::textLocked() {
   makeTextLocked();
   caller_ = nullptr;
   rewritten_ = nullptr;
-  callerText_ = nullptr;
+  if (holds_ == 0) callerText_ = nullptr;
   return *text_;
 }
 
@@ -194,12 +194,23 @@ void SXReportingMessagePayload::keepOnlyText() {
   textLocked();
 }
 
-std::shared_ptr<const std::string> SXReportingMessagePayload::callerDictionaryText() {
+std::shared_ptr<const std::string> SXReportingMessagePayload::payloadText() {
   SXMutexLock lock(mutex_);
   if (callerText_) return callerText_;
   if (!caller_ || !caller_->is_object()) return nullptr;
   // The dictionaries stay: a standalone send of a session not started reads them.
   return callerTextLocked();
+}
+
+void SXReportingMessagePayload::hold() {
+  SXMutexLock lock(mutex_);
+  ++holds_;
+}
+
+void SXReportingMessagePayload::release() {
+  SXMutexLock lock(mutex_);
+  // Once only the stored text is kept, the last reader lets the caller's go.
+  if (--holds_ == 0 && !caller_ && text_) callerText_ = nullptr;
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {

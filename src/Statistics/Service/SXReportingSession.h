@@ -17,6 +17,7 @@
 
 #include "SXReportingEnvironment.h"
 #include "SXReportingEventSession.h"
+#include "SXReportingTallyvaneBridge.h"
 #include "common/SXThreadSafety.h"
 #include "common/SXValueText.h"
 #include "platform/FernReporting.h"
@@ -27,7 +28,7 @@
 // queue, so that the server queue only hands the payload on. Once the text exists the
 // dictionaries are released, so that a started session's aggregate holds only text until
 // stop. Any thread.
-class SXReportingMessagePayload {
+class SXReportingMessagePayload final : public SXPayloadTextSource {
  public:
   explicit SXReportingMessagePayload(std::shared_ptr<const SXValue> callerPayload)
       : caller_(std::move(callerPayload)) {}
@@ -38,10 +39,12 @@ class SXReportingMessagePayload {
   // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
   void keepOnlyText();
   // SXValueText of the caller's own payload when it is a dictionary, made now if need be; null
-  // when it is not a dictionary, or once only the rewrite's text is kept. The rewrite's text is
-  // made from it (its members' texts copied under their new keys), so whichever store asks
-  // first writes the payload's values for both.
-  std::shared_ptr<const std::string> callerDictionaryText();
+  // when it is not a dictionary, or once only the rewrite's text is kept and nothing holds this
+  // one. The rewrite's text is made from it (its members' texts copied under their new keys),
+  // so whichever store asks first writes the payload's values for both.
+  std::shared_ptr<const std::string> payloadText() override;
+  void hold() override;
+  void release() override;
 
  private:
   // Whether the rewrite changes the caller's payload; made once.
@@ -59,6 +62,7 @@ class SXReportingMessagePayload {
   std::shared_ptr<const std::string> callerText_ SX_GUARDED_BY(mutex_);  // released with them
   std::shared_ptr<const std::string> text_ SX_GUARDED_BY(mutex_);  // the caller's when no rewrite
   std::optional<bool> rewrites_ SX_GUARDED_BY(mutex_);
+  int holds_ SX_GUARDED_BY(mutex_) = 0;  // readers that may still want callerText_
   bool callerIsDictionary_ SX_GUARDED_BY(mutex_) = false;  // set with rewrites_
 };
 
