@@ -107,13 +107,22 @@ TEST(RpcParseRequest, SaysWhatIsWrongAndKeepsAnyUsableMsgid) {
   }
 }
 
-TEST(MsgpackValue, NonStringKeysAreRefused) {
+TEST(MsgpackValue, DictionariesTakeKeysInAnyOrderTheLastRepeatWinsAndOnlyStringKeys) {
   msgpack::sbuffer buffer;
   msgpack::packer<msgpack::sbuffer> p(buffer);
+  p.pack_map(5);
+  for (auto [key, value] : {std::pair{"b", 1}, {"c", 2}, {"a", 3}, {"c", 4}, {"d", 5}}) {
+    p.pack(key);
+    p.pack(value);
+  }
+  auto handle = msgpack::unpack(buffer.data(), buffer.size());
+  EXPECT_EQ(SXValueFromMsgpack(handle.get()), (SXValue{{"a", 3}, {"b", 1}, {"c", 4}, {"d", 5}}));
+
+  buffer.clear();
   p.pack_map(1);
   p.pack_int(1);
   p.pack_int(2);
-  auto handle = msgpack::unpack(buffer.data(), buffer.size());
+  handle = msgpack::unpack(buffer.data(), buffer.size());
   EXPECT_THROW(SXValueFromMsgpack(handle.get()), SXValueConversionError);
 }
 

@@ -40,13 +40,19 @@ SXValue convert(const msgpack::object& o, int depthLeft) {
     case object_type::MAP: {
       if (depthLeft <= 0) throw SXValueConversionError("value nested too deeply");
       SXValue object = SXValue::object();
+      auto& members = object.get_ref<SXValue::object_t&>();
       for (uint32_t i = 0; i < o.via.map.size; ++i) {
         const auto& kv = o.via.map.ptr[i];
         if (kv.key.type != object_type::STR) {
           throw SXValueConversionError("dictionary key is not a string");
         }
-        object[std::string(kv.key.via.str.ptr, kv.key.via.str.size)] =
-            convert(kv.val, depthLeft - 1);
+        std::string key(kv.key.via.str.ptr, kv.key.via.str.size);
+        // Clients pack dictionaries in key order: each key then goes last, with no search.
+        if (members.empty() || std::prev(members.end())->first < key) {
+          members.emplace_hint(members.end(), std::move(key), convert(kv.val, depthLeft - 1));
+        } else {
+          members[std::move(key)] = convert(kv.val, depthLeft - 1);  // a repeat: the last wins
+        }
       }
       return object;
     }
