@@ -239,7 +239,11 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   // One accepted message, waiting for its send task on the session's queue.
   struct PendingSend {
     std::shared_ptr<SXReportingMessagePayload> payload;
-    std::shared_ptr<const SXValue> callerPayload;  // as the caller gave it; only for verbose lines
+    // As the caller gave it, for the verbose line. Held until this session's store has the
+    // message: it carries the message's charge on its connection's budget, and a message
+    // delivered to several sessions shares one payload that the first store to finish may
+    // reduce to text.
+    std::shared_ptr<const SXValue> callerPayload;
     SXReportingCategory category;
     SXReportingMessageType type;
     bool startedSnapshot;

@@ -74,8 +74,6 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   }
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
-  // The caller's own payload appears only in a verbose line; keep it only for that.
-  if (!log().isEnabled(scope(), kSXLogVerboseLevel)) payload = nullptr;
   queueSend(
       {std::move(rewritten), std::move(payload), category, type, startedSnapshot, aggregated});
   if (reply) reply(std::nullopt);
