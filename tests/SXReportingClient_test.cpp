@@ -53,25 +53,6 @@ TEST_F(SXReportingClientTest, RepliesOfTheWrongShapeAreBadReplies) {
   EXPECT_NE(send.error.find("domain"), std::string::npos);
 }
 
-TEST_F(SXReportingClientTest, ManyCallsInFlightMatchOutOfOrderReplies) {
-  server_.on(kGetServiceType, [](auto&) { return Answer::none(); });
-  constexpr int kCalls = 300;
-  std::vector<std::future<SXCallResult<SXReportingServiceType>>> futures;
-  for (int i = 0; i < kCalls; ++i) futures.push_back(client_->getServiceNameForReporterID(i));
-
-  // Every request reaches the service before any reply exists: the calls are pipelined.
-  ASSERT_TRUE(server_.waitForRequests(kCalls));
-  auto requests = server_.requests();
-  for (auto it = requests.rbegin(); it != requests.rend(); ++it) {
-    server_.respond(it->msgid, nullptr, it->params[0].get<int>() + 1000);
-  }
-  for (int i = 0; i < kCalls; ++i) {
-    auto result = await(std::move(futures[i]));
-    ASSERT_TRUE(result.replied()) << i << ": " << result.error;
-    EXPECT_EQ(result.value, i + 1000);
-  }
-}
-
 TEST_F(SXReportingClientTest, WithheldReplyTimesOutAndItsLateReplyIsIgnored) {
   server_.on(kStop,
              [](const SXValue& p) { return p[0] == 0 ? Answer::none() : Answer::reply(true); });
@@ -175,19 +156,6 @@ TEST_F(SXReportingClientTest, CallsFromManyThreadsAllComplete) {
   ASSERT_TRUE(lock.waitFor(
       done, 60s, [&]() SX_REQUIRES(mutex) { return completed == kThreads * kCallsEach; }));
   EXPECT_EQ(delivered, kThreads * kCallsEach);
-}
-
-TEST(SXReportingClientConnectTest, FailureSaysWhyAndCallsCompleteAtOnce) {
-  SXReportingClient client({"/nonexistent/sxr/socket"});
-  std::string error;
-  EXPECT_FALSE(client.connect(&error));
-  EXPECT_NE(error.find("/nonexistent/sxr/socket"), std::string::npos) << error;
-  auto result = await(client.getAllReporters());
-  EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
-  EXPECT_EQ(result.error, error);
-
-  SXReportingClient tooLong({std::string(200, 'x')});
-  EXPECT_FALSE(tooLong.connect(&error));
 }
 
 }  // namespace

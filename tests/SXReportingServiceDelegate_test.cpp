@@ -51,22 +51,6 @@ SXValue delivered(uint64_t tallyvane, uint64_t joulebook, uint64_t fernreporting
 
 }  // namespace
 
-TEST(SXReportingServiceDelegateClients, RegistrationRecordsStartDateAndProcessName) {
-  Service s;
-  s.t.process->names[77] = "player";
-  auto player = s.connect(77, false);
-  auto self = s.connect(s.t.process->processIdentifier(), false);
-  auto nobody = s.connect(0, false);
-  EXPECT_TRUE(player->resumed());
-  s.t.drain();
-  const auto& clients = s.delegate->getAllClients();
-  ASSERT_EQ(clients.size(), 3u);
-  EXPECT_EQ(clients[0]->clientProcessName(), "player");
-  EXPECT_EQ(clients[1]->clientProcessName(), "sxreportingd");
-  EXPECT_FALSE(clients[2]->clientProcessName());
-  EXPECT_EQ(clients[0]->clientStartDate(), s.t.clock->now());
-}
-
 TEST(SXReportingServiceDelegateRouting, AddressedHitsBridgesFirstBroadcastHitsSessionFirst) {
   Service s;
   auto c = s.connect(10);
@@ -90,33 +74,6 @@ TEST(SXReportingServiceDelegateRouting, AddressedHitsBridgesFirstBroadcastHitsSe
   EXPECT_TRUE(
       s.t.log->contains("active reporting sessions 1 : (<SXReportingSession reporterID=42"));
   s.call(*c, sxr::method::kStop, {42});
-}
-
-TEST(SXReportingServiceDelegateRouting, DisabledReportingAnswersTheErrorAndHidesOtherClients) {
-  Service s;
-  auto a = s.connect(10);
-  auto b = s.connect(11);
-  s.call(*a, sxr::method::kCreate, {42});
-  s.delegate->setReportingEnabled(false);
-  EXPECT_EQ(s.call(*a, sxr::method::kSendMessage, {{{"a", 1}}, 3, 1, SXValue::array({42})}),
-            (SXValue{{"domain", "com.vendra.audio.reporting"}, {"code", 1}}));
-  EXPECT_TRUE(s.tallyvane->payloads.empty());
-  EXPECT_EQ(s.call(*b, sxr::method::kGetServiceType, {42}), 65535);  // service-wide: none
-  EXPECT_FALSE(s.t.log->contains("failed to find reporting session 42"));
-  s.call(*a, sxr::method::kSetServiceType, {2, 42});
-  EXPECT_EQ(s.call(*a, sxr::method::kGetServiceType, {42}), 2);  // own map still works
-}
-
-TEST(SXReportingServiceDelegateConnections, FallbacksWhenNameOrStartDateAreMissing) {
-  Service s;
-  auto early = s.connect(33, false);  // ends before its registration ran: no start date, no name
-  early->end(false);
-  s.t.drain();
-  EXPECT_TRUE(s.t.log->contains("clientStartDate is nil. clientpid=33 clientprocessname=unknown"));
-  EXPECT_TRUE(
-      s.t.log->contains("InvalidationHandler: connection exited process=(null) uptime_sec=-1"));
-  EXPECT_TRUE(s.t.log->contains("clientProcessName is nil. clientpid=33"));
-  EXPECT_TRUE(s.tallyvane->payloads.empty());
 }
 
 TEST(SXReportingCounters, EachSinkCountsWhatItAccepted) {
@@ -144,25 +101,4 @@ TEST(SXReportingCounters, EachSinkCountsWhatItAccepted) {
   EXPECT_EQ(counters["messages_received"], 5u);
   EXPECT_EQ(counters["messages_delivered"], delivered(3, 1, 4));
   EXPECT_EQ(s.t.joulebook->entries().size(), 1u);  // the counting forwarder forwards
-}
-
-TEST(SXReportingCounters, ProvidedNumbersAppearUnderTheirKeys) {
-  FakeService s;
-  uint64_t backlog = 5;
-  s.delegate->setStatusProviders({.requestsBackpressure = [] { return uint64_t{7}; },
-                                  .tallyvaneWriteErrors = [] { return uint64_t{1}; },
-                                  .joulebookWriteErrors = [] { return uint64_t{2}; },
-                                  .fernReportingWriteErrors = [] { return uint64_t{3}; },
-                                  .spoolBacklog = [&] { return backlog; }});
-  SXValue status = s.status();
-  EXPECT_EQ(status["counters"]["guardrail_dropped"]["requests_backpressure"], 7u);
-  EXPECT_EQ(status["counters"]["store_write_errors"], delivered(1, 2, 3));
-  EXPECT_EQ(status["gauges"]["spool_backlog"], 5u);
-  backlog = 9;  // read afresh on every status
-  EXPECT_EQ(s.status()["gauges"]["spool_backlog"], 9u);
-
-  s.delegate->setStatusProviders({.spoolBacklog = [] { return uint64_t{0}; }});
-  status = s.status();
-  EXPECT_FALSE(status["counters"].contains("store_write_errors"));
-  EXPECT_EQ(status["counters"]["guardrail_dropped"]["requests_backpressure"], 0u);
 }

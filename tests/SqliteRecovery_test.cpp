@@ -12,8 +12,6 @@
 #include <fstream>
 
 #include "fakes/FakeLog.h"
-#include "platform/SqliteFernReporting.h"
-#include "platform/SqliteJoulebook.h"
 #include "platform/SqliteTallyvane.h"
 #include "support/SqliteTestSupport.h"
 
@@ -184,23 +182,6 @@ TEST(SqliteRecovery, WhatIsNotTheFilesFaultIsNeverMovedAside) {
   EXPECT_TRUE(recovered.empty()) << recovered;
   EXPECT_EQ(entries(dir.file("")).size(), 3u);  // store.db, -wal, -shm
   EXPECT_EQ(SXTestQuery(path, "SELECT x FROM t").size(), 1u);
-}
-
-// A store in a directory that does not exist: every row is lost and counted. (A damaged store
-// moved aside and replaced is the daemon's crash-safety test.)
-TEST(SqliteRecovery, StoresCountRowsTheyCouldNotWrite) {
-  SXTestTempDir dir;
-  auto log = std::make_shared<FakeLog>();
-  SXSqliteJoulebook power(dir.file("gone/joulebook.db"), log);
-  for (int i = 0; i < 3; ++i) power.logRegisteredEvent(1, "e", SXValue::object(), std::nullopt);
-  power.flush();
-  EXPECT_EQ(power.writeErrors(), 3u);
-
-  SXSqliteFernReporting spool(dir.file("gone/fern.db"), dir.file("none.json"), log);
-  std::optional<FernError> error;
-  EXPECT_FALSE(spool.sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
-  EXPECT_FALSE(spool.openSession({}, {}, {}));
-  EXPECT_EQ(spool.writeErrors(), 2u);
 }
 
 TEST(SqliteRecovery, AStoreMadeWithoutIncrementalVacuumIsConvertedOnceByItsOwner) {

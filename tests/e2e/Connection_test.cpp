@@ -16,7 +16,9 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   TestDaemon daemon({{"--preferences-dir", preferences}, nullptr, nullptr, {}});
   ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
   auto client = daemon.client();
+  auto other = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
+  ASSERT_TRUE(replied(client->setServiceType(2, 42)));
   EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "true"}), 0);
@@ -29,13 +31,16 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   auto disabled = replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42}));
   ASSERT_TRUE(disabled);
   EXPECT_EQ(*disabled, (SXError{"com.vendra.audio.reporting", 1}));
-  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 65535);  // own map still answers
+  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 2);     // own map still answers
+  EXPECT_EQ(replied(other->getServiceNameForReporterID(42)), 65535);  // other clients' are hidden
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "false"}), 0);
   ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
   ASSERT_TRUE(waitUntil([&] { return replied(client->status())["reportingEnabled"].get<bool>(); }));
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
   EXPECT_EQ(daemon.countInLog("re-reading sonex defaults"), 2u);
+  // The send refused while reporting was off reached no store.
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
 
   // A post with nothing changed still reaches every session: the merged defaults travel in
   // the user info of the session's next server-reporting session.

@@ -273,15 +273,6 @@ TEST_P(StopUnderFlood, StoresEveryAnsweredMessageAndExitsZero) {
 INSTANTIATE_TEST_SUITE_P(CrashSafetyEndToEnd, StopUnderFlood, testing::ValuesIn(kFloodKinds),
                          [](const auto& info) { return std::string(info.param.name); });
 
-TEST(CrashSafetyEndToEnd, StoresUseWriteAheadLogging) {
-  TestDaemon daemon;
-  for (const Store& store : kStores) {
-    auto mode = daemon.rows(store.db, "PRAGMA journal_mode");
-    ASSERT_EQ(mode.size(), 1u) << store.db;
-    EXPECT_EQ(mode[0]["journal_mode"], "wal") << store.db;
-  }
-}
-
 TEST(CrashSafetyEndToEnd, KillNineUnderLoadLosesNoCommittedRow) {
   SXTestTempDir state;
   TestDaemon::Options options;
