@@ -1,6 +1,6 @@
 // The driver utility over a driver library that fails one query, sampling or delta at a time:
-// each failure leaves out, or falls back for, its own driver only. The happy path over the real
-// counter tree is FileKestrelTest.DriverUtilityEndToEnd and the daemon's session stop.
+// each failure leaves out, or falls back for, its own driver only. (The fake is the production
+// library on a real counter tree; the daemon's session stop reads the deltas end to end.)
 #include "SXReportingDriverUtility.h"
 
 #include <gtest/gtest.h>
@@ -67,6 +67,21 @@ TEST(SXReportingDriverUtility, AbsoluteValuesOfAtLeastOneWithoutASnapshot) {
                      {"MCA_Overruns", 1},
                      {"Haptics_Stats_Clips", 7}}));
   EXPECT_EQ(rig.kestrel->deltaCalls(), 0);
+}
+
+TEST(SXReportingDriverUtility, ADeltaHoldsWhatRoseOnTheSubscribedChannelsOrNothing) {
+  Rig rig;
+  SXValue snapshot = rig.utility().getSnapShot();
+  EXPECT_EQ(snapshot.size(), 4u);
+  rig.kestrel->setValue("VendraAE2MCA", std::nullopt, "Underruns", 10);
+  rig.kestrel->setValue("Speaker", std::nullopt, std::nullopt, 3);
+  rig.kestrel->setValue("Codec", "MCA", "Overruns", 0);  // went down
+  rig.kestrel->setValue("Haptics", "Stats", "New", 50);  // appeared after subscribing
+  EXPECT_EQ(rig.utility().getDriverStatisticsRelativeToSnapShot(snapshot),
+            (SXValue{{"VendraAE2MCA_Underruns", 7}, {"Speaker_", 1}}));
+  // Nothing rose since a fresh snapshot: none, rather than an empty dictionary.
+  EXPECT_EQ(rig.utility().getDriverStatisticsRelativeToSnapShot(rig.utility().getSnapShot()),
+            std::nullopt);
 }
 
 TEST(SXReportingDriverUtility, ASamplingOrDeltaFailureCostsOnlyItsOwnDriver) {
