@@ -87,8 +87,7 @@ TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {
   // A write leaves the broken file as it is (it may be an administrator's typo); once the file
   // is gone, writes work again.
   EXPECT_NE(prefs->setValue(kDomain, "a", SXValue(2)), std::nullopt);
-  std::ifstream kept(domainFile());
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(kept), {}), "{\"a\": 1");
+  EXPECT_EQ(SXTestReadFile(domainFile()), "{\"a\": 1");
   fs::remove(domainFile());
   ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(2)), std::nullopt);
   size_t before = errorLines();

@@ -30,11 +30,6 @@ std::vector<std::string> entries(const std::string& dir) {
   return names;
 }
 
-std::string contents(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 // Sets or clears the immutable attribute; false where the file system or our privileges lack it.
 bool setImmutable(const std::string& path, bool on) {
   int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
@@ -140,9 +135,9 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
     return n.rfind("store.db.damaged-", 0) == 0 && n.find("-wal") == std::string::npos;
   });
   ASSERT_NE(aside, names.end());
-  EXPECT_EQ(contents(dir.file(*aside)), std::string(4096, 'G'));
+  EXPECT_EQ(SXTestReadFile(dir.file(*aside)), std::string(4096, 'G'));
   // The old log goes with its file (or SQLite drops it), never into the new store.
-  EXPECT_EQ(contents(path + "-wal").find("stale log"), std::string::npos);
+  EXPECT_EQ(SXTestReadFile(path + "-wal").find("stale log"), std::string::npos);
   EXPECT_NE(recovered.find(dir.file(*aside)), std::string::npos);
 
   // A second damage the same second gets a name of its own.
@@ -189,8 +184,8 @@ TEST(SqliteRecovery, AStoreMadeWithoutIncrementalVacuumIsConvertedOnceByItsOwner
   std::string path = dir.file("store.db");
   sqlite3* raw = nullptr;
   ASSERT_EQ(sqlite3_open(path.c_str(), &raw), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(raw, "CREATE TABLE t(x); INSERT INTO t VALUES (1), (2)", nullptr,
-                         nullptr, nullptr),
+  ASSERT_EQ(sqlite3_exec(raw, "CREATE TABLE t(x); INSERT INTO t VALUES (1), (2)", nullptr, nullptr,
+                         nullptr),
             SQLITE_OK);
   sqlite3_close(raw);
   auto autoVacuum = [&](SXSqliteConnection& db) {

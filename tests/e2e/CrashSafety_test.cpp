@@ -340,9 +340,9 @@ TEST(CrashSafetyEndToEnd, DamagedStoresAreMovedAsideAndRecreated) {
     auto aside = filesStartingWith(state.file(""), std::string(store.db) + ".damaged-");
     ASSERT_EQ(aside.size(), 1u) << store.db;
   }
-  std::ifstream kept(state.file(filesStartingWith(state.file(""), "tallyvane.db.damaged-")[0]),
-                     std::ios::binary);
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(kept), {}), garbage);
+  EXPECT_EQ(
+      SXTestReadFile(state.file(filesStartingWith(state.file(""), "tallyvane.db.damaged-")[0])),
+      garbage);
 
   // It serves and stores; a kill and a second start find healthy stores and move nothing.
   expectNewRowsLand(daemon, {0, 0, 0});

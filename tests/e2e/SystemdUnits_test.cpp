@@ -14,16 +14,11 @@ namespace fs = std::filesystem;
 
 namespace {
 
-std::string slurp(const fs::path& path) {
-  std::ifstream in(path);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 class SystemdUnitsTest : public ::testing::Test {
  protected:
   void SetUp() override {
     const fs::path units = fs::path(SXR_SOURCE_DIR) / "packaging/systemd";
-    std::string service = slurp(units / "sxreportingd.service.in");
+    std::string service = SXTestReadFile(units / "sxreportingd.service.in");
     const std::string sbindir = fs::path(SXR_DAEMON_PATH).parent_path().string();
     service = std::regex_replace(service, std::regex("@SXR_SBINDIR@"), sbindir);
     ASSERT_FALSE(std::regex_search(service, std::regex("@[A-Z_]+@"))) << "a variable is left";
