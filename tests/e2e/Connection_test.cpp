@@ -1,7 +1,6 @@
-// The defaults switch and the end of client connections, through the real daemon.
+// The defaults switch and socket activation, through the real daemon. (The end of client
+// connections is ChurnEndToEnd.)
 #include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include "support/Daemon.h"
@@ -55,49 +54,6 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
   EXPECT_TRUE(start.get().value);
   ::unsetenv("SXREPORTING_PREFERENCES_DIR");
-}
-
-TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
-  TestDaemon daemon;
-  auto observer = daemon.client();
-  auto began = std::chrono::steady_clock::now();
-  pid_t child = daemon.spawnCtl({"create", "42", "then", "start", "42"});
-  // The start never answers while the session runs, so the tool sits waiting.
-  ASSERT_TRUE(waitUntil([&] { return replied(observer->getAllReporters()).size() == 1; }));
-  ASSERT_TRUE(waitUntil([&] {
-    auto clients = replied(observer->status())["clients"];
-    for (const auto& c : clients) {
-      for (const auto& s : c["sessions"]) {
-        if (s["started"].get<bool>()) return true;
-      }
-    }
-    return false;
-  }));
-  // Gather something, so that the stop has a summary to send.
-  EXPECT_FALSE(replied(observer->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
-  std::this_thread::sleep_for(300ms);
-  ::kill(child, SIGKILL);
-  ::waitpid(child, nullptr, 0);
-  double lifetime = std::chrono::duration<double>(std::chrono::steady_clock::now() - began).count();
-
-  EXPECT_TRUE(
-      daemon.waitForLog("removing " + std::to_string(child) + " from the server client list"));
-  auto uptime = daemon.waitForRows(
-      "tallyvane.db",
-      "SELECT payload_json FROM events WHERE name = 'com.vendra.sonex.sxreportingclientuptime'", 1);
-  EXPECT_TRUE(replied(observer->getAllReporters()).empty());
-  auto summaries = daemon.waitForRows(
-      "fernreporting.db", "SELECT payload_json FROM messages WHERE category = 65535", 1);
-  std::this_thread::sleep_for(200ms);  // nothing more may come
-  EXPECT_EQ(
-      daemon.rows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535").size(), 1u);
-  EXPECT_EQ(daemon.countInLog("removing " + std::to_string(child)), 1u);
-  ASSERT_EQ(uptime.size(), 1u);
-  SXValue event = SXValue::parse(uptime[0]["payload_json"].get<std::string>());
-  EXPECT_EQ(event["processName"], "sxreportctl");
-  EXPECT_GT(event["seconds"].get<double>(), 0.3);
-  EXPECT_LE(event["seconds"].get<double>(), lifetime + 0.5);
-  EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=sxreportctl"));
 }
 
 // The service manager passes the listening socket: exactly one Unix stream socket is served,
