@@ -84,31 +84,6 @@ TEST_F(SqliteTallyvaneTest, LazySendReturnsBeforeTheProviderRunsOnAnotherThread)
   EXPECT_EQ(SXSqliteTallyvane::readEvents(db_, "lazy", 0).size(), 1u);
 }
 
-TEST_F(SqliteTallyvaneTest, ReadEventsFiltersByNameAndKeepsTheNewest) {
-  {
-    SXSqliteTallyvane tallyvane(db_, log_);
-    for (const char* name : {"a.one", "b.one", "a.two", "a.three"}) {
-      tallyvane.sendEventLazy(name, Returning(name));
-    }
-  }
-  auto names = [](const std::vector<SXValue>& rows) {
-    std::vector<std::string> out;
-    for (const auto& r : rows) out.push_back(r["name"]);
-    return out;
-  };
-  EXPECT_EQ(names(SXSqliteTallyvane::readEvents(db_, "a.two", 0)),
-            std::vector<std::string>{"a.two"});
-  EXPECT_EQ(names(SXSqliteTallyvane::readEvents(db_, "a.*", 2)),
-            (std::vector<std::string>{"a.two", "a.three"}));
-  EXPECT_EQ(names(SXSqliteTallyvane::readEvents(db_, std::nullopt, 1)),
-            std::vector<std::string>{"a.three"});
-
-  std::string error;
-  EXPECT_TRUE(
-      SXSqliteTallyvane::readEvents(dir_.file("absent.db"), std::nullopt, 0, error).empty());
-  EXPECT_NE(error.find("absent.db"), std::string::npos) << error;
-}
-
 TEST_F(SqliteTallyvaneTest, AStoreThatCannotBeOpenedLogsAndDropsEvents) {
   db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
   SXSqliteTallyvane tallyvane(db_, log_);
