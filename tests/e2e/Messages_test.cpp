@@ -89,6 +89,7 @@ TEST(MessagesEndToEnd, EmptyListReachesNothingAndUnknownIDsAreSkipped) {
   EXPECT_EQ(counters["messages_received"], 3);
   EXPECT_EQ(counters["messages_delivered"],
             (SXValue{{"tallyvane", 0}, {"joulebook", 0}, {"fernreporting", 1}}));
+  EXPECT_EQ(counters["guardrail_dropped"]["requests_backpressure"], 0);  // no pressure, no pause
 }
 
 TEST(MessagesEndToEnd, EveryValueKindTravelsUnchanged) {
