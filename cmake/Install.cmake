@@ -193,12 +193,6 @@ if(SXR_TESTS)
               ${CMAKE_BINARY_DIR} ${CMAKE_SOURCE_DIR} ${PROJECT_VERSION})
     set_tests_properties(install.packages PROPERTIES LABELS e2e TIMEOUT 300)
   endif()
-  if(SXR_HELP2MAN)
-    add_test(NAME install.manpages
-      COMMAND sh ${CMAKE_SOURCE_DIR}/tests/e2e/install/manpages_test.sh
-              $<TARGET_FILE:sxreportingd> $<TARGET_FILE:sxreportctl> ${SXR_MAN_DIR})
-    set_tests_properties(install.manpages PROPERTIES LABELS e2e TIMEOUT 60)
-  endif()
 endif()
 
 # --- Debian packages: `cpack -G DEB` in the build directory -------------------------------------

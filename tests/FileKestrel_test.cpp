@@ -118,12 +118,6 @@ TEST_F(FileKestrelTest, QueriesMatchGroupAndSubgroupDirectories) {
   }
 }
 
-TEST_F(FileKestrelTest, MissingRootMeansNoChannels) {
-  EXPECT_EQ(channels(std::nullopt, std::nullopt), std::nullopt);
-  EXPECT_EQ(channels("Speaker", std::nullopt), std::nullopt);
-  EXPECT_FALSE(error_);
-}
-
 TEST_F(FileKestrelTest, SamplingReadsFilesAnewAndSkipsBadCounters) {
   publishTree();
   publish("Speaker/-/garbage", "12abc");
@@ -230,37 +224,10 @@ TEST_F(FileKestrelTest, SymlinksNeverLeadOutOfTheTree) {
             2);
 }
 
-TEST_F(FileKestrelTest, DriverUtilityEndToEnd) {
-  publishTree();
-  SXPlatform platform;
-  platform.log = log_;
-  platform.kestrel = std::make_shared<SXFileKestrel>(root_.string(), log_);
-  SXReportingEnvironment environment(std::move(platform));
-  SXReportingDriverUtility utility(environment);
-  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
-
-  SXValue snapshot = utility.getSnapShot();
-  EXPECT_EQ(snapshot.size(), 4u);
-  publish("VendraAE2MCA/-/underruns", "10");
-  publish("Speaker/-/-", "3");
-  publish("Amp/MCA/clips", "1");  // went down
-  publish("Haptics/Stats/clips", "8");
-  publish("Haptics/Stats/new", "50");  // appeared after subscribing: not covered
-
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot),
-            (SXValue{{"VendraAE2MCA_underruns", 7}, {"Speaker_", 1}, {"Haptics_Stats_clips", 1}}));
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(std::nullopt),
-            (SXValue{{"VendraAE2MCA_underruns", 10},
-                     {"Speaker_temp", 40},
-                     {"Speaker_", 3},
-                     {"MCA_clips", 1},
-                     {"MCA_overruns", 1},
-                     {"Haptics_Stats_clips", 8}}));
-  // Nothing rose since a fresh snapshot: none, rather than an empty dictionary.
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(utility.getSnapShot()), std::nullopt);
-}
-
 TEST_F(FileKestrelTest, DriverUtilityWithoutTreeSubscribesNothing) {
+  EXPECT_EQ(channels(std::nullopt, std::nullopt), std::nullopt);
+  EXPECT_EQ(channels("Speaker", std::nullopt), std::nullopt);
+  EXPECT_FALSE(error_);
   SXPlatform platform;
   platform.log = log_;
   platform.kestrel = std::make_shared<SXFileKestrel>(root_.string(), log_);

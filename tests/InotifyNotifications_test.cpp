@@ -18,8 +18,8 @@
 
 #include "common/SXThreadSafety.h"
 #include "fakes/FakeLog.h"
-#include "support/SqliteTestSupport.h"
 #include "platform/AsioDispatch.h"
+#include "support/SqliteTestSupport.h"
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
@@ -136,7 +136,7 @@ TEST_F(InotifyNotificationsTest, OtherWaysOfChangingTheFileCountAsPosts) {
   ASSERT_TRUE(deliveries_.waitFor(3));
 }
 
-TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArguments) {
+TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArgumentsAndFailsSetUpWithoutThrowing) {
   auto notify = open();
   int token = -7;
   for (std::string name : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
@@ -148,14 +148,12 @@ TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArguments) {
   EXPECT_NE(notify->registerDispatch(kName, token, queue1_, nullptr), 0);
   EXPECT_EQ(token, -7);
   EXPECT_FALSE(fs::exists(runtimeDir_ + "/b"));
-}
 
-TEST_F(InotifyNotificationsTest, FailedSetUpIsReportedNotThrown) {
+  // A set-up that failed (the runtime directory is a file) is reported, not thrown.
   std::ofstream(runtimeDir_ + "/file") << "";
-  SXInotifyNotifications notify(runtimeDir_ + "/file", log_);
-  int token = 0;
-  EXPECT_NE(notify.registerDispatch(kName, token, queue1_, [](int) {}), 0);
-  EXPECT_NE(notify.post(kName), 0);
+  SXInotifyNotifications failed(runtimeDir_ + "/file", log_);
+  EXPECT_NE(failed.registerDispatch(kName, token, queue1_, [](int) {}), 0);
+  EXPECT_NE(failed.post(kName), 0);
   EXPECT_FALSE(log_->lines().empty());
 }
 

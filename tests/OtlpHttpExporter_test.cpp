@@ -81,63 +81,7 @@ class OtlpHttpExporterTest : public ::testing::Test {
   SXOtlpExportOptions options_;
 };
 
-// The value of attribute `key` of `record`, or null.
-SXValue Attribute(const SXValue& record, const std::string& key) {
-  for (const SXValue& attribute : record["attributes"]) {
-    if (attribute["key"] == key) return attribute["value"];
-  }
-  return nullptr;
-}
-
 }  // namespace
-
-TEST_F(OtlpHttpExporterTest, BodyIsAnOtlpLogsRequestWithOneRecordPerMessage) {
-  auto session = spool_.openSession(
-      {{fern::kSessionInfoSessionID, 42}, {fern::kSessionInfoHierarchyToken, "t-1"}},
-      {{fern::kUserInfoServiceName, "telephony_session"}, {fern::kUserInfoClientName, "c"}},
-      SXValue::array());
-  std::optional<FernError> error;
-  SXValue payload = {
-      {"n", 7}, {"x", 1.5}, {"on", true}, {"list", {1, "a"}}, {"d", {{"k", nullptr}}}};
-  ASSERT_TRUE(session->sendMessage(9, 2, payload, error));
-  Standalone({{"big", uint64_t(1) << 63}}, 0xFFFF);
-
-  auto exporter = Make();
-  EXPECT_EQ(exporter->backlog(), 0u);  // unknown before the first pass opens the spool
-  ASSERT_EQ(exporter->exportOnce().outcome, Outcome::kExported)
-      << testing::PrintToString(log_->messages());
-  auto request = http_->requests().at(0);
-  EXPECT_EQ(request.url, "http://collector.test:4318/v1/logs");
-  EXPECT_EQ(request.headers["Content-Type"], "application/json");
-  EXPECT_EQ(request.headers["Authorization"], "Bearer token");
-
-  // The resource, the record kinds, the service names and the body's value mapping are
-  // checked through the daemon (OtlpExportEndToEnd) and value by value (OtlpLogsBody).
-  SXValue body = SXValue::parse(request.body);
-  const SXValue& scope = body["resourceLogs"][0]["scopeLogs"][0];
-  EXPECT_EQ(scope["scope"]["name"], "sxreporting");
-  ASSERT_EQ(scope["logRecords"].size(), 2u);
-
-  const SXValue& inSession = scope["logRecords"][0];
-  auto stored = SXTestQuery(db_, "SELECT time FROM messages ORDER BY id");
-  double nanos = std::stod(inSession["timeUnixNano"].get<std::string>());
-  EXPECT_NEAR(nanos / 1e9, stored[0]["time"].get<double>(), 1e-3);
-  EXPECT_EQ(inSession["observedTimeUnixNano"], "1800000000000000000");  // from the clock
-  EXPECT_EQ(inSession["severityText"], "INFO");
-  EXPECT_EQ(inSession["body"]["kvlistValue"]["values"].size(), 5u);
-  EXPECT_EQ(Attribute(inSession, "sxr.category"), (SXValue{{"intValue", "9"}}));
-  EXPECT_EQ(Attribute(inSession, "sxr.type"), (SXValue{{"intValue", "2"}}));
-  EXPECT_EQ(Attribute(inSession, "sxr.reporter_id"), (SXValue{{"intValue", "42"}}));
-  EXPECT_EQ(Attribute(inSession, "sxr.session.token"), (SXValue{{"stringValue", "t-1"}}));
-
-  const SXValue& single = scope["logRecords"][1];
-  EXPECT_EQ(Attribute(single, "sxr.reporter_id"), (SXValue{{"intValue", "-1"}}));
-  EXPECT_EQ(Attribute(single, "sxr.category"), (SXValue{{"intValue", "65535"}}));
-  EXPECT_TRUE(Attribute(single, "sxr.session.token").is_null());
-  // Beyond int64 a number keeps its digits as a string.
-  EXPECT_EQ(single["body"]["kvlistValue"]["values"][0]["value"],
-            (SXValue{{"stringValue", "9223372036854775808"}}));
-}
 
 TEST(OtlpLogsBody, ValuesMapAsTheProtobufJsonMappingWritesThem) {
   const double inf = std::numeric_limits<double>::infinity();
@@ -426,20 +370,7 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
   EXPECT_EQ(defaults->encoding, SXOtlpExportOptions::Encoding::kJson);
   EXPECT_FALSE(defaults->resource.serviceVersion.empty());  // the project's version
 
-  auto options = SXOtlpExportOptions::fromJson({{"endpoint", "https://c:4318/v1/logs"},
-                                                {"batchSize", 10},
-                                                {"intervalMs", 50},
-                                                {"maxBackoffMs", 2000},
-                                                {"initialBackoffMs", 20},
-                                                {"headers", {{"X-Key", "v"}}}},
-                                               error);
-  ASSERT_TRUE(options) << error;
-  EXPECT_EQ(options->endpoint, "https://c:4318/v1/logs");
-  EXPECT_EQ(options->batchSize, 10u);
-  EXPECT_EQ(options->interval, 50ms);
-  EXPECT_EQ(options->initialBackoff, 20ms);
-  EXPECT_EQ(options->headers.at("X-Key"), "v");
-
+  // Good values of every key are read through the daemon (OtlpExportEndToEnd).
   for (const char* bad :
        {R"([])", R"({"endpoint": "ftp://x"})", R"({"batchSize": 0})", R"({"batchSize": "5"})",
         R"({"intervalMs": -1})", R"({"headers": {"A": 1}})", R"({"headers": {"A": "x\ny"}})",

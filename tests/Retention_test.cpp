@@ -99,19 +99,6 @@ TEST(RetentionPolicy, TheSectionSetsWhatItNamesAndRefusesAnythingElse) {
   }
 }
 
-TEST(RetentionPolicy, TheConfigFilesSectionOrTheDefaults) {
-  std::string error;
-  EXPECT_EQ(SXRetentionPolicy::fromConfigFile(SXValue::object(), error), SXRetentionPolicy());
-  auto policy = SXRetentionPolicy::fromConfigFile(
-      SXValue::parse(R"({"limits": {}, "retention": {"spool": {"maxBytes": 4096}}})"), error);
-  ASSERT_TRUE(policy);
-  EXPECT_EQ(policy->spool.maxBytes, 4096u);
-  EXPECT_FALSE(SXRetentionPolicy::fromConfigFile(
-      SXValue::parse(R"({"retention": {"spool": {"maxBytes": 0}}})"), error));
-  EXPECT_NE(error.find("retention.spool.maxBytes: expected a positive integer"), std::string::npos)
-      << error;
-}
-
 // ---- stores
 
 // Writes rows n .. n + count - 1 (payload {"n": n, "pad": ...}) through the store's adapter and

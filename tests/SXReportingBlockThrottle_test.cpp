@@ -205,13 +205,6 @@ TEST(SXReportingBlockThrottleTest, MessageIsSentOnceAtItsDueTime) {
     EXPECT_EQ(rig.throttle->timersInFlightCount(), 0u);
     rig.advance(5);
     EXPECT_EQ(rig.sends.size(), 1u);
-    EXPECT_GE(rig.log->count("calling workingRunLoop run from inside thread block"), 1u);
-    EXPECT_GE(rig.log->count("sleeping in thread"), 1u);
-    for (const auto& line : rig.log->lines()) {
-      if (line.level == SXLogLevel::kDebug) {
-        EXPECT_EQ(line.scope, "thrt") << line.message;
-      }
-    }
   }
 }
 
@@ -276,13 +269,8 @@ TEST(SXReportingBlockThrottleTest, WaitForCompletionEndsWhenIdleOrAfterFiveSecon
     std::optional<double> entrySeconds;  // none: idle
     int duplicateEveryMs;                // 0: none
     int returnsAtMs;
-    std::string firstLine;
   };
-  for (const Case& c : std::vector<Case>{
-           {std::nullopt, 0, 0, "waitForCompletion. timersInFlight=0 unscheduledTimerKeys=0"},
-           {1, 0, 1000, "waitForCompletion. timersInFlight=1 unscheduledTimerKeys=1"},
-           {0.5, 300, 5000, "waitForCompletion. timersInFlight=1 unscheduledTimerKeys=1"},
-       }) {
+  for (const Case& c : std::vector<Case>{{std::nullopt, 0, 0}, {1, 0, 1000}, {0.5, 300, 5000}}) {
     SCOPED_TRACE(c.returnsAtMs);
     Rig rig;
     int added = 0;
@@ -304,18 +292,8 @@ TEST(SXReportingBlockThrottleTest, WaitForCompletionEndsWhenIdleOrAfterFiveSecon
       }
     }
     ASSERT_EQ(waiter.wait_for(std::chrono::seconds(20)), std::future_status::ready);
-    EXPECT_EQ(rig.log->messages().at(0), c.firstLine);
-    EXPECT_EQ(rig.log->contains("Waiting up to"), waits);
     bool givesUp = c.duplicateEveryMs > 0;
-    EXPECT_EQ(
-        rig.log->count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"),
-        givesUp ? 1u : 0u);
     EXPECT_EQ(rig.log->countContaining("Giving up"), givesUp ? 1u : 0u);
-    for (const auto& line : rig.log->lines()) {
-      if (line.message.starts_with("Giving up")) {
-        EXPECT_EQ(line.level, SXLogLevel::kDefault);
-      }
-    }
     if (givesUp) {
       rig.advance(1);
       ASSERT_EQ(rig.sends.size(), 1u);

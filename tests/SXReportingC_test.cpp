@@ -46,45 +46,37 @@ class SXReportingCTest : public ::testing::Test {
   sxr_client* client_ = nullptr;
 };
 
+// The operations the C example does not walk through against the daemon (ExamplesEndToEnd),
+// and values at the ends of their ranges.
 TEST_F(SXReportingCTest, EachOperationSendsItsParamsAndFillsItsOutParameters) {
   server_.on(kCreate, [](auto&) { return Answer::reply(true); });
-  server_.on(kSetServiceType, [](auto&) { return Answer::reply(true); });
   server_.on(kGetServiceType, [](auto&) { return Answer::reply(65535); });
-  server_.on(kSetConfiguration, [](auto&) { return Answer::reply(true); });
   server_.on(kStart, [](auto&) { return Answer::reply(false); });
   server_.on(kStop, [](auto&) { return Answer::reply(true); });
-  server_.on(kDestroy, [](auto&) { return Answer::reply(false); });
   server_.on(kValid, [](auto&) { return Answer::reply({{"reporterID", -9}, {"serviceType", 3}}); });
   server_.on(kGetAllReporters, [](auto&) { return Answer::reply({1, INT64_MIN, 3}); });
   server_.on(kStatus, [](auto&) { return Answer::reply({{"reportingEnabled", true}}); });
 
   bool result = false;
   EXPECT_EQ(sxr_create_reporting_session(client_, INT64_MAX, 0, &result), SXR_OK);
-  EXPECT_TRUE(result);
   EXPECT_EQ(lastParams(kCreate), SXValue::array({INT64_MAX}));
-  EXPECT_EQ(sxr_set_service_type(client_, 65535, -1, 0, &result), SXR_OK);
-  EXPECT_EQ(lastParams(kSetServiceType), SXValue::array({65535, -1}));
   uint16_t type = 0;
   EXPECT_EQ(sxr_get_service_name_for_reporter_id(client_, 5, 0, &type), SXR_OK);
   EXPECT_EQ(type, 65535);
+  result = true;
   EXPECT_EQ(sxr_start_reporting_session_for_id(client_, 5, 0, &result), SXR_OK);
   EXPECT_FALSE(result);
   EXPECT_EQ(sxr_stop_reporting_session_for_id(client_, 5, 0, nullptr), SXR_OK);  // NULL: ignored
-  EXPECT_EQ(sxr_destroy_reporting_session(client_, 5, 0, &result), SXR_OK);
-  EXPECT_FALSE(result);
-
   int64_t validID = 0;
   EXPECT_EQ(sxr_reporter_id_valid(client_, -9, 0, &validID, &type), SXR_OK);
   EXPECT_EQ(validID, -9);
   EXPECT_EQ(type, 3);
-
   int64_t* ids = nullptr;
   size_t count = 0;
   ASSERT_EQ(sxr_get_all_reporters(client_, 0, &ids, &count), SXR_OK);
   ASSERT_EQ(count, 3u);
   EXPECT_EQ(ids[1], INT64_MIN);
   sxr_free(ids);
-
   char* status = nullptr;
   ASSERT_EQ(sxr_get_status(client_, 0, &status), SXR_OK);
   EXPECT_EQ(SXValue::parse(status), (SXValue{{"reportingEnabled", true}}));

@@ -1,9 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <condition_variable>
 
-#include "common/SXThreadSafety.h"
 #include "fakes/FakeRpcServer.h"
 #include "sxreporting/client.h"
 
@@ -51,25 +49,6 @@ TEST_F(SXReportingClientTest, RepliesOfTheWrongShapeAreBadReplies) {
   auto send = await(client_->sendMessage(SXValue::object(), 1, 1, std::nullopt));
   EXPECT_EQ(send.status, SXCallStatus::kBadReply);
   EXPECT_NE(send.error.find("domain"), std::string::npos);
-}
-
-TEST_F(SXReportingClientTest, ManyCallsInFlightMatchOutOfOrderReplies) {
-  server_.on(kGetServiceType, [](auto&) { return Answer::none(); });
-  constexpr int kCalls = 300;
-  std::vector<std::future<SXCallResult<SXReportingServiceType>>> futures;
-  for (int i = 0; i < kCalls; ++i) futures.push_back(client_->getServiceNameForReporterID(i));
-
-  // Every request reaches the service before any reply exists: the calls are pipelined.
-  ASSERT_TRUE(server_.waitForRequests(kCalls));
-  auto requests = server_.requests();
-  for (auto it = requests.rbegin(); it != requests.rend(); ++it) {
-    server_.respond(it->msgid, nullptr, it->params[0].get<int>() + 1000);
-  }
-  for (int i = 0; i < kCalls; ++i) {
-    auto result = await(std::move(futures[i]));
-    ASSERT_TRUE(result.replied()) << i << ": " << result.error;
-    EXPECT_EQ(result.value, i + 1000);
-  }
 }
 
 TEST_F(SXReportingClientTest, WithheldReplyTimesOutAndItsLateReplyIsIgnored) {
@@ -151,43 +130,22 @@ TEST_F(SXReportingClientTest, CallbacksRunOnTheIoThreadWhichMayDestroyTheClient)
 
 TEST_F(SXReportingClientTest, CallsFromManyThreadsAllComplete) {
   server_.on(kSendMessage, [](auto&) { return Answer::reply(nullptr); });
-  constexpr int kThreads = 4;
-  constexpr int kCallsEach = 2000;
-  SXMutex mutex;
-  std::condition_variable done;
-  int completed = 0;
   std::atomic<int> delivered = 0;
   std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
+  for (int t = 0; t < 4; ++t) {
     threads.emplace_back([&, t] {
-      for (int i = 0; i < kCallsEach; ++i) {
-        client_->sendMessage({{"i", i}}, 3, 1, std::vector<int64_t>{t},
-                             [&](SXCallResult<std::optional<SXError>> result) {
-                               if (result.replied() && !result.value) ++delivered;
-                               SXMutexLock lock(mutex);
-                               if (++completed == kThreads * kCallsEach) done.notify_one();
-                             });
+      std::vector<std::future<SXCallResult<std::optional<SXError>>>> sends;
+      for (int i = 0; i < 2000; ++i) {
+        sends.push_back(client_->sendMessage({{"i", i}}, 3, 1, std::vector<int64_t>{t}));
+      }
+      for (auto& send : sends) {
+        auto result = await(std::move(send));
+        delivered += result.replied() && !result.value;
       }
     });
   }
   for (auto& thread : threads) thread.join();
-  SXMutexLock lock(mutex);
-  ASSERT_TRUE(lock.waitFor(
-      done, 60s, [&]() SX_REQUIRES(mutex) { return completed == kThreads * kCallsEach; }));
-  EXPECT_EQ(delivered, kThreads * kCallsEach);
-}
-
-TEST(SXReportingClientConnectTest, FailureSaysWhyAndCallsCompleteAtOnce) {
-  SXReportingClient client({"/nonexistent/sxr/socket"});
-  std::string error;
-  EXPECT_FALSE(client.connect(&error));
-  EXPECT_NE(error.find("/nonexistent/sxr/socket"), std::string::npos) << error;
-  auto result = await(client.getAllReporters());
-  EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
-  EXPECT_EQ(result.error, error);
-
-  SXReportingClient tooLong({std::string(200, 'x')});
-  EXPECT_FALSE(tooLong.connect(&error));
+  EXPECT_EQ(delivered, 4 * 2000);
 }
 
 }  // namespace

@@ -7,24 +7,10 @@
 
 #include <thread>
 
-#include "SXReportingDaemonConfig.h"
 #include "common/SXThreadSafety.h"
 #include "support/FakeService.h"
 
-namespace {
-
 using Kind = FakeFernReporting::Event::Kind;
-
-std::shared_ptr<SXReportingEnvironment> limitedEnvironment(TestEnvironment& t,
-                                                           SXReportingLimits limits) {
-  auto environment = std::make_shared<SXReportingEnvironment>(t.platform(), limits);
-  environment->setServerQueue(
-      t.dispatch->createSerialQueue("server", SXQualityOfService::kUserInteractive));
-  environment->setBackendWaitSeconds(0.3);
-  return environment;
-}
-
-}  // namespace
 
 TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing) {
   FakeService s({.maxSessionsPerClient = 2, .maxSessions = 3});
@@ -80,7 +66,7 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
   };
   for (const Case& c : cases) {
     TestEnvironment t;
-    auto environment = limitedEnvironment(t, c.limits);
+    auto environment = t.makeEnvironment(c.limits);
     auto session = SXReportingSession::initWithID(environment, 42, SXValue::array({1}));
     session->setServiceType(7);
     session->start();
@@ -111,7 +97,7 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
 
 TEST(SXReportingLimitsAggregate, NeverStartedSessionsAreCappedToo) {
   TestEnvironment t;
-  auto environment = limitedEnvironment(t, {.maxAggregateEntries = 2});
+  auto environment = t.makeEnvironment({.maxAggregateEntries = 2});
   auto session = SXReportingSession::initWithID(environment, 7, SXValue::array({1}));
   for (int i = 0; i < 4; ++i) session->sendMessage({{"i", i}}, 3, 1, nullptr);
   EXPECT_EQ(session->aggregatedPayloadEntries().size(), 2u);
@@ -122,7 +108,7 @@ TEST(SXReportingLimitsAggregate, NeverStartedSessionsAreCappedToo) {
 
 TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
   TestEnvironment t;  // its random source always draws 59
-  auto environment = limitedEnvironment(t, {});
+  auto environment = t.makeEnvironment({});
   // {"i": n} packs into 4 bytes: room for two delayed sends.
   auto budget = std::make_shared<SXReportingPendingBudget>(8, 10);
   auto session = SXReportingSession::initWithID(environment, 7, SXValue::array({10}), budget);
@@ -254,39 +240,4 @@ TEST(SXReportingLimitsConnections, AProcessBeyondItsConnectionLimitIsRefusedUnti
   first->end(false);
   s.t.drain();
   EXPECT_TRUE(s.connect(10)->resumed());
-}
-
-// The "limits" section of sxreportingd.json over the limits of the command line: a load takes
-// what the file says except what the flags fixed, a reload keeps the listener's limits until the
-// next start, and a bad section changes nothing.
-TEST(SXReportingLimitsFile, SectionAppliesOverTheFlagsAndABadOneChangesNothing) {
-  TestEnvironment t;
-  SXReportingLimits flags;
-  flags.maxReporterIDs = 3;
-  auto environment = limitedEnvironment(t, flags);
-  SXReportingLimitsSection section(environment, {"max-reporter-ids"});
-  auto limits = [&] { return environment->limits(); };
-
-  ASSERT_TRUE(section.read(
-      {{"limits",
-        {{"max-payload-bytes", 100}, {"max-reporter-ids", 50}, {"max-inflight-bytes", 4096}}}}));
-  EXPECT_EQ(limits().maxPayloadBytes, 100u);
-  EXPECT_EQ(limits().maxReporterIDs, 3u);       // the flag wins
-  EXPECT_EQ(limits().maxInflightBytes, 4096u);  // at start, the listener takes it
-
-  ASSERT_TRUE(section.read({{"limits", {{"max-inflight-bytes", 8192}}}}));
-  EXPECT_EQ(limits().maxPayloadBytes, SXReportingLimits{}.maxPayloadBytes);  // key gone: default
-  EXPECT_EQ(limits().maxInflightBytes, 4096u);                               // until the next start
-  EXPECT_EQ(t.log->countContaining("limit max-inflight-bytes changed to 8192; it applies at the "
-                                   "next start"),
-            1u);
-
-  for (const SXValue& bad : {SXValue{{"limits", 5}}, SXValue{{"limits", {{"max-payload", 5}}}},
-                             SXValue{{"limits", {{"max-payload-bytes", 0}}}},
-                             SXValue{{"limits", {{"max-payload-bytes", -5}}}},
-                             SXValue{{"limits", {{"max-payload-bytes", 5.5}}}}}) {
-    EXPECT_FALSE(section.read(bad)) << bad;
-    EXPECT_EQ(limits().maxPayloadBytes, SXReportingLimits{}.maxPayloadBytes) << bad;
-  }
-  EXPECT_TRUE(section.read(SXValue::object()));  // no section: the flags and defaults
 }

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "SXReportingUtility.h"
 #include "platform/AsioDispatch.h"
 #include "support/TestEnvironment.h"
 
@@ -71,6 +72,11 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   EXPECT_EQ(session->messageIdForCategory(3, 1), "Playback_Start_1");
   EXPECT_EQ(session->messageIdForCategory(3, 1), "Playback_Start_2");
   EXPECT_EQ(session->messageIdForCategory(0x08000003, 1), "Session_Playback_Start_1");
+  // Far more kinds than the name cache keeps: a cached name is still the right one.
+  for (uint32_t category = 0; category < 600; ++category) {
+    ASSERT_EQ(SXReportingUtilityMessageKind(category, 2).ends_with("_Stop"), true) << category;
+  }
+  EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
 
   session->start();
   SXValue payload = {{"peak level", 1}, {"route", "a b"}, {"a b", 1}, {"a_b", 2}};
@@ -288,7 +294,9 @@ TEST(SXReportingSessionOrientation, WhoTracks) {
   for (const auto& c :
        {Case{internalBuild(), 2, true}, Case{internalBuild(), 7, true},
         Case{internalBuild(), 1, false}, Case{internalBuild(6), 2, false},
-        Case{{{"InternalBuild", true}}, 7, true}, Case{SXValue::object(), 2, false}}) {
+        Case{{{"InternalBuild", true}}, 7, true}, Case{SXValue::object(), 2, false},
+        // Only a true boolean makes an internal build.
+        Case{{{"InternalBuild", 1}}, 7, false}, Case{{{"InternalBuild", "YES"}}, 7, false}}) {
     TestEnvironment t(c.device);
     auto session = makeSession(t, 42, c.type);
     session->start();
@@ -381,18 +389,14 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
   EXPECT_EQ(t.log->count("failed to find backend"), 0u);
 }
 
-TEST(SummaryFileName, NamesAreKeptButForSlashAndNul) {
-  for (const std::string name : {"player", "com.vendra.Music", "caf\u00e9 app", "", ".hidden",
-                                 "...", "a\\b", "tab\there\nnew\x7f"}) {
-    EXPECT_EQ(hostPart(name), name);
-  }
+TEST(SummaryFileName, TheHostNameStandsAsItIsButCannotEscapeOrOverrun) {
+  // "20261116-185803+0000-sonex-" and "-longformaudio.json": 46 bytes besides the host.
+  const std::string kept[] = {
+      "player", "com.vendra.Music",   "caf\u00e9 app",      "", ".hidden", "...",
+      "a\\b",   "tab\there\nnew\x7f", std::string(209, 'a')};
+  for (const std::string& name : kept) EXPECT_EQ(hostPart(name), name);
   EXPECT_EQ(hostPart("../../etc/passwd"), ".._.._etc_passwd");
   EXPECT_EQ(hostPart(std::string("nul\0x", 5)), "nul_x");
-}
-
-TEST(SummaryFileName, OnlyANameTooLongForTheFileSystemIsCut) {
-  // "20261116-185803+0000-sonex-" and "-longformaudio.json": 46 bytes besides the host.
-  EXPECT_EQ(hostPart(std::string(209, 'a')), std::string(209, 'a'));
   EXPECT_EQ(hostPart(std::string(300, 'a')), std::string(209, 'a'));
   // Two-byte characters: the cut keeps 104 of them whole rather than split the 105th.
   std::string accents;

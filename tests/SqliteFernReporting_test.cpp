@@ -97,25 +97,6 @@ TEST_F(SqliteFernReportingTest, ConfigurationCompletesOnceOnAnotherThread) {
   EXPECT_EQ(Configure(*none).first, std::nullopt);
 }
 
-TEST_F(SqliteFernReportingTest, SessionsAreStoredWithTheirInfoAndToken) {
-  auto fern = Make();
-  auto token = fern->newHierarchyToken(nullptr);
-  ASSERT_NE(token, nullptr);
-  auto session = fern->openSession(SessionInfo(token->identifier()), UserInfo("telephony_session"),
-                                   SXValue::array());
-  ASSERT_NE(session, nullptr);
-  auto rows = SXTestQuery(db_, "SELECT * FROM sessions");
-  ASSERT_EQ(rows.size(), 1u);
-  EXPECT_EQ(rows[0]["token"], token->identifier());
-  EXPECT_EQ(SXValue::parse(rows[0]["session_info_json"].get<std::string>()),
-            SessionInfo(token->identifier()));
-  EXPECT_EQ(SXValue::parse(rows[0]["user_info_json"].get<std::string>()),
-            UserInfo("telephony_session"));
-  EXPECT_EQ(session->description(), "<FernReportingSession " +
-                                        std::to_string(rows[0]["id"].get<int64_t>()) +
-                                        " service=telephony_session>");
-}
-
 TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
   auto fern = Make();
   std::set<std::string> seen;
@@ -126,33 +107,6 @@ TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
   auto child = fern->newHierarchyToken(parent);
   EXPECT_EQ(child->identifier().rfind(parent->identifier() + "/", 0), 0u);
   EXPECT_GT(child->identifier().size(), parent->identifier().size() + 1);
-}
-
-TEST_F(SqliteFernReportingTest, SendsAreCommittedWhenTheyReturn) {
-  auto fern = Make();
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("alarms_session"), {});
-  ASSERT_NE(session, nullptr);
-  std::optional<FernError> error;
-  ASSERT_TRUE(session->sendMessage(3, 1, {{"dropped_frames", 2}}, error));
-  SXValue single = {{fern::kSessionInfoClientType, 19}, {fern::kSessionInfoSessionID, -1}};
-  ASSERT_TRUE(fern->sendOneMessage(single, UserInfo("alarms"), 65535, 7, {{"k", "v"}}, error));
-  EXPECT_EQ(error, std::nullopt);
-
-  // Read through another connection while the adapter stays open: nothing waits for a flush.
-  auto rows = SXTestQuery(db_, "SELECT * FROM messages ORDER BY id");
-  ASSERT_EQ(rows.size(), 2u);
-  auto sessionId = SXTestQuery(db_, "SELECT id FROM sessions")[0]["id"];
-  EXPECT_EQ(rows[0]["session_id"], sessionId);
-  EXPECT_EQ(rows[0]["session_info_json"], nullptr);
-  EXPECT_EQ(rows[0]["user_info_json"], nullptr);
-  EXPECT_EQ(rows[0]["category"], 3);
-  EXPECT_EQ(rows[0]["type"], 1);
-  EXPECT_EQ(rows[0]["payload_json"], "{\"dropped_frames\":2}");
-  EXPECT_EQ(rows[1]["session_id"], nullptr);
-  EXPECT_EQ(SXValue::parse(rows[1]["session_info_json"].get<std::string>()), single);
-  EXPECT_EQ(SXValue::parse(rows[1]["user_info_json"].get<std::string>()), UserInfo("alarms"));
-  EXPECT_EQ(rows[1]["category"], 65535);
-  EXPECT_EQ(rows[1]["type"], 7);
 }
 
 TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommittedOnReturn) {

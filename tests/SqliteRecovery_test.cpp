@@ -12,8 +12,6 @@
 #include <fstream>
 
 #include "fakes/FakeLog.h"
-#include "platform/SqliteFernReporting.h"
-#include "platform/SqliteJoulebook.h"
 #include "platform/SqliteTallyvane.h"
 #include "support/SqliteTestSupport.h"
 
@@ -30,11 +28,6 @@ std::vector<std::string> entries(const std::string& dir) {
   }
   std::sort(names.begin(), names.end());
   return names;
-}
-
-std::string contents(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 // Sets or clears the immutable attribute; false where the file system or our privileges lack it.
@@ -142,9 +135,9 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
     return n.rfind("store.db.damaged-", 0) == 0 && n.find("-wal") == std::string::npos;
   });
   ASSERT_NE(aside, names.end());
-  EXPECT_EQ(contents(dir.file(*aside)), std::string(4096, 'G'));
+  EXPECT_EQ(SXTestReadFile(dir.file(*aside)), std::string(4096, 'G'));
   // The old log goes with its file (or SQLite drops it), never into the new store.
-  EXPECT_EQ(contents(path + "-wal").find("stale log"), std::string::npos);
+  EXPECT_EQ(SXTestReadFile(path + "-wal").find("stale log"), std::string::npos);
   EXPECT_NE(recovered.find(dir.file(*aside)), std::string::npos);
 
   // A second damage the same second gets a name of its own.
@@ -186,30 +179,13 @@ TEST(SqliteRecovery, WhatIsNotTheFilesFaultIsNeverMovedAside) {
   EXPECT_EQ(SXTestQuery(path, "SELECT x FROM t").size(), 1u);
 }
 
-// A store in a directory that does not exist: every row is lost and counted. (A damaged store
-// moved aside and replaced is the daemon's crash-safety test.)
-TEST(SqliteRecovery, StoresCountRowsTheyCouldNotWrite) {
-  SXTestTempDir dir;
-  auto log = std::make_shared<FakeLog>();
-  SXSqliteJoulebook power(dir.file("gone/joulebook.db"), log);
-  for (int i = 0; i < 3; ++i) power.logRegisteredEvent(1, "e", SXValue::object(), std::nullopt);
-  power.flush();
-  EXPECT_EQ(power.writeErrors(), 3u);
-
-  SXSqliteFernReporting spool(dir.file("gone/fern.db"), dir.file("none.json"), log);
-  std::optional<FernError> error;
-  EXPECT_FALSE(spool.sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
-  EXPECT_FALSE(spool.openSession({}, {}, {}));
-  EXPECT_EQ(spool.writeErrors(), 2u);
-}
-
 TEST(SqliteRecovery, AStoreMadeWithoutIncrementalVacuumIsConvertedOnceByItsOwner) {
   SXTestTempDir dir;
   std::string path = dir.file("store.db");
   sqlite3* raw = nullptr;
   ASSERT_EQ(sqlite3_open(path.c_str(), &raw), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(raw, "CREATE TABLE t(x); INSERT INTO t VALUES (1), (2)", nullptr,
-                         nullptr, nullptr),
+  ASSERT_EQ(sqlite3_exec(raw, "CREATE TABLE t(x); INSERT INTO t VALUES (1), (2)", nullptr, nullptr,
+                         nullptr),
             SQLITE_OK);
   sqlite3_close(raw);
   auto autoVacuum = [&](SXSqliteConnection& db) {

@@ -59,6 +59,8 @@ TEST(BackpressureEndToEnd, PipelinedFarBeyondTheQueueLimitEveryReplyComesInOrder
   EXPECT_EQ(ids, SXTestIds(kRequests));
   writer.join();
   ::close(fd);
+  // The connection was paused at its limit of queued requests, and lost nothing by it.
+  EXPECT_GT(replied(client->status())["counters"]["guardrail_dropped"]["requests_backpressure"], 0);
   // Every message reached the session, in order.
   // Only the messages' events: the connections' uptime events land in the same table.
   auto rows = daemon.waitForRows(

@@ -145,6 +145,19 @@ TEST(ChurnEndToEnd, AThousandVanishingClientsLeaveNothingBehind) {
                              kClients, 30s)
                 .size(),
             static_cast<size_t>(kClients));
+  // Each process's end is an uptime event with its name and how long it was connected.
+  auto uptimes = daemon.waitForRows(
+      "tallyvane.db",
+      "SELECT payload_json FROM events WHERE name = 'com.vendra.sonex.sxreportingclientuptime' "
+      "AND json_extract(payload_json, '$.processName') = 'sxreportctl'",
+      kClients / 2, 30s);
+  EXPECT_EQ(uptimes.size(), kClients / 2u);
+  for (const auto& row : uptimes) {
+    double lived = SXValue::parse(row["payload_json"].get<std::string>())["seconds"];
+    EXPECT_TRUE(lived > 0 && lived < seconds + 1) << lived;
+  }
+  EXPECT_EQ(daemon.countInLog("InvalidationHandler: connection exited process=sxreportctl"),
+            kClients / 2u);
   std::printf(
       "churn: %d clients in %.1f s; daemon RSS %ld KiB before, %ld KiB peak, %ld KiB after\n",
       kClients, seconds, baseline, peak, after);

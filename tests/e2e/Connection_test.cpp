@@ -1,7 +1,6 @@
-// The defaults switch and the end of client connections, through the real daemon.
+// The defaults switch and socket activation, through the real daemon. (The end of client
+// connections is ChurnEndToEnd.)
 #include <gtest/gtest.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include "support/Daemon.h"
@@ -16,7 +15,9 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   TestDaemon daemon({{"--preferences-dir", preferences}, nullptr, nullptr, {}});
   ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
   auto client = daemon.client();
+  auto other = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
+  ASSERT_TRUE(replied(client->setServiceType(2, 42)));
   EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "true"}), 0);
@@ -29,13 +30,16 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   auto disabled = replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42}));
   ASSERT_TRUE(disabled);
   EXPECT_EQ(*disabled, (SXError{"com.vendra.audio.reporting", 1}));
-  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 65535);  // own map still answers
+  EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 2);     // own map still answers
+  EXPECT_EQ(replied(other->getServiceNameForReporterID(42)), 65535);  // other clients' are hidden
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "false"}), 0);
   ASSERT_EQ(daemon.ctl({"notify", "com.vendra.sonex.reporting"}), 0);
   ASSERT_TRUE(waitUntil([&] { return replied(client->status())["reportingEnabled"].get<bool>(); }));
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
   EXPECT_EQ(daemon.countInLog("re-reading sonex defaults"), 2u);
+  // The send refused while reporting was off reached no store.
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
 
   // A post with nothing changed still reaches every session: the merged defaults travel in
   // the user info of the session's next server-reporting session.
@@ -50,49 +54,6 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
   EXPECT_TRUE(start.get().value);
   ::unsetenv("SXREPORTING_PREFERENCES_DIR");
-}
-
-TEST(ConnectionEndToEnd, ADeadClientIsStoppedRemovedAndTimed) {
-  TestDaemon daemon;
-  auto observer = daemon.client();
-  auto began = std::chrono::steady_clock::now();
-  pid_t child = daemon.spawnCtl({"create", "42", "then", "start", "42"});
-  // The start never answers while the session runs, so the tool sits waiting.
-  ASSERT_TRUE(waitUntil([&] { return replied(observer->getAllReporters()).size() == 1; }));
-  ASSERT_TRUE(waitUntil([&] {
-    auto clients = replied(observer->status())["clients"];
-    for (const auto& c : clients) {
-      for (const auto& s : c["sessions"]) {
-        if (s["started"].get<bool>()) return true;
-      }
-    }
-    return false;
-  }));
-  // Gather something, so that the stop has a summary to send.
-  EXPECT_FALSE(replied(observer->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{42})));
-  std::this_thread::sleep_for(300ms);
-  ::kill(child, SIGKILL);
-  ::waitpid(child, nullptr, 0);
-  double lifetime = std::chrono::duration<double>(std::chrono::steady_clock::now() - began).count();
-
-  EXPECT_TRUE(
-      daemon.waitForLog("removing " + std::to_string(child) + " from the server client list"));
-  auto uptime = daemon.waitForRows(
-      "tallyvane.db",
-      "SELECT payload_json FROM events WHERE name = 'com.vendra.sonex.sxreportingclientuptime'", 1);
-  EXPECT_TRUE(replied(observer->getAllReporters()).empty());
-  auto summaries = daemon.waitForRows(
-      "fernreporting.db", "SELECT payload_json FROM messages WHERE category = 65535", 1);
-  std::this_thread::sleep_for(200ms);  // nothing more may come
-  EXPECT_EQ(
-      daemon.rows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535").size(), 1u);
-  EXPECT_EQ(daemon.countInLog("removing " + std::to_string(child)), 1u);
-  ASSERT_EQ(uptime.size(), 1u);
-  SXValue event = SXValue::parse(uptime[0]["payload_json"].get<std::string>());
-  EXPECT_EQ(event["processName"], "sxreportctl");
-  EXPECT_GT(event["seconds"].get<double>(), 0.3);
-  EXPECT_LE(event["seconds"].get<double>(), lifetime + 0.5);
-  EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=sxreportctl"));
 }
 
 // The service manager passes the listening socket: exactly one Unix stream socket is served,

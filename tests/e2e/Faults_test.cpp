@@ -34,11 +34,23 @@ size_t openDescriptors(pid_t pid) {
   return n;
 }
 
-std::string asanOptions() {
+// A daemon whose stores' directory is under the fault library (tests/faults): their writes fail
+// with ENOSPC, or take `delayMs` when it is set, while `trigger` exists.
+TestDaemon::Options faultyDisk(const SXTestTempDir& faults, const std::string& trigger,
+                               const char* delayMs = nullptr) {
+  TestDaemon::Options options;
+  options.stateDir = faults.file("lib");
+  std::filesystem::create_directories(options.stateDir);
   // The shim comes before the sanitizer runtime in the load order, which ASan refuses unless
   // told not to check; a daemon built without ASan ignores this.
   const char* own = ::getenv("ASAN_OPTIONS");
-  return std::string(own ? own : "") + (own && *own ? ":" : "") + "verify_asan_link_order=0";
+  options.environment = {{"LD_PRELOAD", SXR_FAULTS_LIB},
+                         {"SXR_FAULT_DIR", options.stateDir},
+                         {"SXR_FAULT_TRIGGER", trigger},
+                         {"ASAN_OPTIONS", std::string(own ? own : "") + (own && *own ? ":" : "") +
+                                              "verify_asan_link_order=0"}};
+  if (delayMs) options.environment["SXR_FAULT_DELAY_MS"] = delayMs;
+  return options;
 }
 
 // Rows in each store's table that a message reaches: events, power-log entries, spooled messages.
@@ -81,14 +93,8 @@ int64_t backpressurePauses(SXReportingClient& client) {
 TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
   SXTestTempDir faults;
   std::string trigger = faults.file("disk-full");
-  TestDaemon::Options options;
+  TestDaemon::Options options = faultyDisk(faults, trigger);
   options.device = {{"InternalBuild", true}};
-  options.stateDir = faults.file("lib");
-  std::filesystem::create_directories(options.stateDir);
-  options.environment = {{"LD_PRELOAD", SXR_FAULTS_LIB},
-                         {"SXR_FAULT_DIR", options.stateDir},
-                         {"SXR_FAULT_TRIGGER", trigger},
-                         {"ASAN_OPTIONS", asanOptions()}};
   TestDaemon daemon(options);
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(1)));
@@ -101,16 +107,29 @@ TEST(FaultsEndToEnd, FullDiskIsLoggedAndSurvivedAndStoresWriteAgain) {
 
   std::ofstream(trigger) << "full";
   RowCounts before = rowCounts(daemon);
+  SXValue countersBefore = replied(client->status())["counters"];
   for (int i = 1; i <= 20; ++i) {
     EXPECT_FALSE(replied(client->sendMessage(payload(i), 3, 1, std::vector<int64_t>{1})));
   }
   // Every store counts what it could not write, and says so at error level.
   EXPECT_TRUE(waitUntil([&] {
     SXValue errors = writeErrors(*client);
-    return errors["tallyvane"] > 0 && errors["joulebook"] > 0 && errors["fernreporting"] > 0;
+    return errors["tallyvane"] > 0 && errors["joulebook"] > 0 && errors["fernreporting"] >= 20;
   })) << writeErrors(*client)
       << "\n"
       << daemon.log();
+  // A send the spool refused is not delivered; the batch-written stores had taken theirs.
+  SXValue counters = replied(client->status())["counters"];
+  auto rose = [&](const char* sink) {
+    return counters["messages_delivered"][sink].get<int64_t>() -
+           countersBefore["messages_delivered"][sink].get<int64_t>();
+  };
+  EXPECT_EQ(counters["messages_received"].get<int64_t>() -
+                countersBefore["messages_received"].get<int64_t>(),
+            20);
+  EXPECT_EQ(rose("fernreporting"), 0);
+  EXPECT_EQ(rose("tallyvane"), 20);
+  EXPECT_EQ(rose("joulebook"), 20);
   EXPECT_TRUE(daemon.waitForLog("dropped ")) << daemon.log();
   EXPECT_TRUE(daemon.waitForLog("cannot store the message")) << daemon.log();
   // The daemon keeps answering, and the summary file, on another disk, is still written.
@@ -201,17 +220,10 @@ TEST(FaultsEndToEnd, TenThousandConnectionsLeakNoDescriptor) {
 TEST(FaultsEndToEnd, ASlowStoreHoldsBackOnlyTheClientThatFloodsIt) {
   SXTestTempDir faults;
   std::string trigger = faults.file("disk-slow");
-  TestDaemon::Options options;
-  options.stateDir = faults.file("lib");
-  std::filesystem::create_directories(options.stateDir);
+  TestDaemon::Options options = faultyDisk(faults, trigger, "50");
   // A pool smaller than one connection's budget: the other client is read only through the
   // room every connection keeps while the pool is over its limit.
   options.extraArgs = {"--max-connection-bytes", "262144", "--max-inflight-bytes", "131072"};
-  options.environment = {{"LD_PRELOAD", SXR_FAULTS_LIB},
-                         {"SXR_FAULT_DIR", options.stateDir},
-                         {"SXR_FAULT_TRIGGER", trigger},
-                         {"SXR_FAULT_DELAY_MS", "50"},
-                         {"ASAN_OPTIONS", asanOptions()}};
   TestDaemon daemon(options);
   auto quiet = daemon.client();
   ASSERT_TRUE(replied(quiet->createReportingSession(1)));

@@ -7,10 +7,9 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <asio.hpp>
 #include <filesystem>
 #include <fstream>
-
-#include <asio.hpp>
 
 #include "support/Daemon.h"
 
@@ -95,17 +94,28 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   };
   EXPECT_EQ(send(big, {7}), SXCallStatus::kRemoteError);
 
+  // A key gone is its default again; a limit of the listener waits for the next start.
   daemon.writeConfig("sxreportingd.json",
-                     {{"limits", {{"max-payload-bytes", 4096}, {"max-reporter-ids", 8}}}});
+                     {{"limits", {{"max-reporter-ids", 8}, {"max-inflight-bytes", 8192}}}});
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  ASSERT_TRUE(daemon.waitForLog("limit max-payload-bytes: 4096 (was 64)")) << daemon.log();
+  ASSERT_TRUE(daemon.waitForLog("limit max-payload-bytes: 65536 (was 64)")) << daemon.log();
+  EXPECT_EQ(daemon.countInLog("limit max-inflight-bytes changed to 8192; it applies at the next "
+                              "start"),
+            1u);
   EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
   EXPECT_EQ(send({{"a", 1}}, {7, 8}), SXCallStatus::kRemoteError);  // the flag wins
 
-  daemon.writeConfig("sxreportingd.json", "limits");
-  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  ASSERT_TRUE(daemon.waitForLog("sxreportingd.json: not a JSON object; the configuration stays"));
-  EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
+  // A file or a section that is bad anywhere changes nothing.
+  for (const SXValue& bad :
+       {SXValue("limits"),
+        SXValue{{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", -5}}}}}) {
+    daemon.writeConfig("sxreportingd.json", bad);
+    ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+    ASSERT_TRUE(daemon.waitForLog(bad.is_string() ? "not a JSON object; the configuration stays"
+                                                  : "max-reporter-ids is -5, not a positive "
+                                                    "integer; the limits stay"));
+    EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
+  }
 
   TestDaemon::Options bad;
   bad.daemonConfig = {{"limits", {{"max-payload", 64}}}};
@@ -124,9 +134,9 @@ TEST(LifecycleEndToEnd, AStopThatCannotDrainEndsAtItsLimitOrAtASecondSignal) {
       "http://127.0.0.1:" + std::to_string(silent.local_endpoint().port()) + "/v1/logs";
   for (bool secondSignal : {false, true}) {
     TestDaemon::Options options;
-    options.fernConfig = {{"backends", {"spool", "otlp-http"}},
-                          {"otlp-http",
-                           {{"endpoint", endpoint}, {"intervalMs", 20}, {"timeoutMs", 60000}}}};
+    options.fernConfig = {
+        {"backends", {"spool", "otlp-http"}},
+        {"otlp-http", {{"endpoint", endpoint}, {"intervalMs", 20}, {"timeoutMs", 60000}}}};
     options.extraArgs = {"--drain-timeout-ms", secondSignal ? "60000" : "300"};
     TestDaemon daemon(options);
     auto client = daemon.client();

@@ -22,15 +22,17 @@ TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStore) {
   ASSERT_TRUE(replied(client->createReportingSession(42)));
   ASSERT_TRUE(
       replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
-  EXPECT_FALSE(replied(client->sendMessage(
-      {{"peak level", 1}, {"EngineOnTime", 12.5}, {"sxreporting_timestamp", 1000}}, 3, 1,
-      std::vector<int64_t>{42})));
+  EXPECT_FALSE(replied(client->sendMessage({{"peak level", 1},
+                                            {"EngineOnTime", 12.5},
+                                            {"sxreporting_timestamp", 1000},
+                                            {"HostApplicationDisplayID", "not the session's"}},
+                                           3, 1, std::vector<int64_t>{42})));
 
   auto events = daemon.waitForRows("tallyvane.db", kEvents, 1);
   ASSERT_EQ(events.size(), 1u);
   EXPECT_EQ(events[0]["name"], "com.vendra.sonex.Playback.Start");
   SXValue payload = SXValue::parse(events[0]["payload_json"].get<std::string>());
-  EXPECT_EQ(payload["HostApplicationDisplayID"], "player");
+  EXPECT_EQ(payload["HostApplicationDisplayID"], "player");  // the session's wins
   EXPECT_EQ(payload["peak level"], 1);  // the analytics event keeps the client's keys
 
   auto power =
@@ -82,6 +84,12 @@ TEST(MessagesEndToEnd, EmptyListReachesNothingAndUnknownIDsAreSkipped) {
   auto singles = daemon.waitForRows("fernreporting.db", kSingles, 1);
   EXPECT_EQ(singles.size(), 1u);
   EXPECT_TRUE(daemon.rows("tallyvane.db", kEvents).empty());
+  // Received, all three; delivered, only the broadcast's standalone send.
+  SXValue counters = replied(client->status())["counters"];
+  EXPECT_EQ(counters["messages_received"], 3);
+  EXPECT_EQ(counters["messages_delivered"],
+            (SXValue{{"tallyvane", 0}, {"joulebook", 0}, {"fernreporting", 1}}));
+  EXPECT_EQ(counters["guardrail_dropped"]["requests_backpressure"], 0);  // no pressure, no pause
 }
 
 TEST(MessagesEndToEnd, EveryValueKindTravelsUnchanged) {

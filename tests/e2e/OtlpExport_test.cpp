@@ -106,11 +106,23 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   const SXValue& inSession = byKind["session 3"];
   EXPECT_EQ(OtlpReceiver::intAttribute(inSession, "sxr.reporter_id"), 42);
   EXPECT_EQ(OtlpReceiver::stringAttribute(inSession, "sxr.service_name"), "telephony_session");
+  EXPECT_EQ(OtlpReceiver::intAttribute(inSession, "sxr.type"), 1);
+  EXPECT_FALSE(OtlpReceiver::stringAttribute(inSession, "sxr.session.token").empty());
+  EXPECT_EQ(inSession["severityText"], "INFO");
+  // The record's time is the message's, stored by the spool; the observed time is the export's.
+  auto nanos = [](const SXValue& text) { return std::stod(text.get<std::string>()); };
+  auto stored = daemon.rows("fernreporting.db",
+                            "SELECT time FROM messages WHERE category = 3 "
+                            "AND session_id IS NOT NULL");
+  ASSERT_EQ(stored.size(), 1u);
+  EXPECT_NEAR(nanos(inSession["timeUnixNano"]) / 1e9, stored[0]["time"].get<double>(), 1e-3);
+  EXPECT_GE(nanos(inSession["observedTimeUnixNano"]), nanos(inSession["timeUnixNano"]));
   EXPECT_EQ(inSession["body"]["kvlistValue"]["values"][0],
             (SXValue{{"key", "peak_level"}, {"value", {{"intValue", "3"}}}}));
   EXPECT_TRUE(byKind.count("session 65535"));  // the summary
   ASSERT_TRUE(byKind.count("standalone 3"));
   EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.service_name"), "unknown");
+  EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.session.token"), "");
 
   auto cursor = daemon.rows("fernreporting.db", "SELECT last_message_id FROM otlp_export");
   EXPECT_TRUE(waitUntil([&] {

@@ -8,7 +8,6 @@
 #include <ctime>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "support/Daemon.h"
 
@@ -21,13 +20,6 @@ int modeOf(const std::string& path) {
   struct stat st {};
   if (::stat(path.c_str(), &st) != 0) return -1;
   return static_cast<int>(st.st_mode & 07777);
-}
-
-std::string contentsOf(const std::string& path) {
-  std::ifstream in(path);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
 }
 
 // The summary files in `dir` that are regular files, not symlinks (nor temporary files).
@@ -147,9 +139,9 @@ TEST(PermissionsEndToEnd, SummaryFilesStayInTheirOwnClosedDirectory) {
   EXPECT_EQ(name.substr(name.size() - 7), "-2.json") << name;
   std::string plain = name.substr(0, name.size() - 7) + ".json";
   EXPECT_NE(std::find(planted.begin(), planted.end(), plain), planted.end()) << files[0];
-  EXPECT_EQ(SXValue::parse(contentsOf(files[0].string()))[0],
+  EXPECT_EQ(SXValue::parse(SXTestReadFile(files[0].string()))[0],
             (SXValue{{"HostApplicationDisplayID", "player"}}));
-  EXPECT_EQ(contentsOf(victim), "keep");
+  EXPECT_EQ(SXTestReadFile(victim), "keep");
   EXPECT_EQ(modeOf(victim), 0600);
 
   // The directory swapped for a symlink to another one: the summary is refused, not written

@@ -2,50 +2,23 @@
 // daemon: systemd-analyze verify finds nothing to say, and the daemon accepts the unit's
 // command line.
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <regex>
-#include <sstream>
 #include <string>
 
-#include "support/SqliteTestSupport.h"
+#include "support/Daemon.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
-struct Shell {
-  int status = -1;
-  std::string output;  // stdout and stderr
-};
-
-Shell shell(const std::string& command) {
-  Shell run;
-  FILE* pipe = ::popen((command + " 2>&1").c_str(), "r");
-  if (!pipe) return run;
-  char buf[4096];
-  size_t n;
-  while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) run.output.append(buf, n);
-  const int status = ::pclose(pipe);
-  run.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  return run;
-}
-
-std::string slurp(const fs::path& path) {
-  std::ifstream in(path);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
 class SystemdUnitsTest : public ::testing::Test {
  protected:
   void SetUp() override {
     const fs::path units = fs::path(SXR_SOURCE_DIR) / "packaging/systemd";
-    std::string service = slurp(units / "sxreportingd.service.in");
+    std::string service = SXTestReadFile(units / "sxreportingd.service.in");
     const std::string sbindir = fs::path(SXR_DAEMON_PATH).parent_path().string();
     service = std::regex_replace(service, std::regex("@SXR_SBINDIR@"), sbindir);
     ASSERT_FALSE(std::regex_search(service, std::regex("@[A-Z_]+@"))) << "a variable is left";
@@ -59,10 +32,10 @@ class SystemdUnitsTest : public ::testing::Test {
 };
 
 TEST_F(SystemdUnitsTest, VerifyFindsNothing) {
-  if (shell("command -v systemd-analyze").status != 0) GTEST_SKIP() << "no systemd-analyze";
-  Shell verify = shell("cd '" + dir_.file("") +
-                       "' && systemd-analyze verify --man=no ./sxreportingd.socket "
-                       "./sxreportingd.service");
+  if (runCommand("command -v systemd-analyze").status != 0) GTEST_SKIP() << "no systemd-analyze";
+  CommandRun verify = runCommand("cd '" + dir_.file("") +
+                                 "' && systemd-analyze verify --man=no ./sxreportingd.socket "
+                                 "./sxreportingd.service 2>&1");
   EXPECT_EQ(verify.status, 0) << verify.output;
   EXPECT_EQ(verify.output, "");
 }
@@ -73,7 +46,7 @@ TEST_F(SystemdUnitsTest, TheDaemonAcceptsTheUnitsCommandLine) {
   const std::string joined = std::regex_replace(service_, std::regex("\\\\\n"), " ");
   std::smatch line;
   ASSERT_TRUE(std::regex_search(joined, line, std::regex("\nExecStart=([^\n]*)")));
-  Shell daemon = shell(line[1].str() + " --version");
+  CommandRun daemon = runCommand(line[1].str() + " --version 2>&1");
   EXPECT_EQ(daemon.status, 0) << daemon.output;
   EXPECT_TRUE(std::regex_match(daemon.output, std::regex("sxreportingd [0-9.]+\n")))
       << daemon.output;

@@ -18,21 +18,13 @@ class FakeDeviceProperties final : public SXDeviceProperties {
   explicit FakeDeviceProperties(SXValue properties = SXValue::object())
       : properties_(std::move(properties)) {}
   std::optional<SXValue> property(const std::string& key) const override {
-    SXMutexLock lock(mutex_);
-    queries_[key]++;
     auto it = properties_.find(key);
     if (it == properties_.end()) return std::nullopt;
     return *it;
   }
-  int queries(const std::string& key) const {
-    SXMutexLock lock(mutex_);
-    return queries_[key];
-  }
 
  private:
-  mutable SXMutex mutex_;
-  SXValue properties_;
-  mutable std::map<std::string, int> queries_;
+  const SXValue properties_;  // never changed: read from any thread
 };
 
 class FakeProcessInfo final : public SXProcessInfo {

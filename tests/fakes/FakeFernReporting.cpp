@@ -1,7 +1,7 @@
 #include "fakes/FakeFernReporting.h"
 
 #include <condition_variable>
-#include <map>
+#include <deque>
 #include <mutex>
 #include <thread>
 
@@ -9,10 +9,8 @@
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-// A thread that runs tasks once their time has come, in time order (posting order for equal
-// times). Tasks not yet due when it is destroyed are dropped.
+// A thread that runs tasks in the order they were posted. Tasks not yet run when it is
+// destroyed are dropped.
 class Deliverer {
  public:
   Deliverer() : shared_(std::make_shared<Shared>()) {
@@ -34,10 +32,10 @@ class Deliverer {
   Deliverer(const Deliverer&) = delete;
   Deliverer& operator=(const Deliverer&) = delete;
 
-  void post(std::chrono::milliseconds delay, std::function<void()> task) {
+  void post(std::function<void()> task) {
     {
       SXMutexLock lock(shared_->mutex);
-      shared_->due.emplace(Clock::now() + delay, std::move(task));
+      shared_->due.push_back(std::move(task));
     }
     shared_->wake.notify_all();
   }
@@ -49,21 +47,19 @@ class Deliverer {
       while (!stopping) {
         if (due.empty()) {
           lock.wait(wake);
-        } else if (due.begin()->first > Clock::now()) {
-          lock.waitUntil(wake, due.begin()->first);
-        } else {
-          auto task = std::move(due.begin()->second);
-          due.erase(due.begin());
-          lock.unlock();
-          task();
-          task = nullptr;
-          lock.lock();
+          continue;
         }
+        auto task = std::move(due.front());
+        due.pop_front();
+        lock.unlock();
+        task();
+        task = nullptr;
+        lock.lock();
       }
     }
     SXMutex mutex;
     std::condition_variable wake;
-    std::multimap<Clock::time_point, std::function<void()>> due SX_GUARDED_BY(mutex);
+    std::deque<std::function<void()>> due SX_GUARDED_BY(mutex);
     bool stopping SX_GUARDED_BY(mutex) = false;
   };
   std::shared_ptr<Shared> shared_;
@@ -110,7 +106,7 @@ class FakeFernReporting::State {
             uint16_t category, uint16_t type, const SXValue& payload,
             std::optional<FernError>& error) {
     SXMutexLock lock(mutex);
-    const SendFailure& failure = kind == Kind::kMessage ? messageFailure : singleFailure;
+    const SendFailure failure = kind == Kind::kSingleMessage ? singleFailure : SendFailure{};
     append({.kind = kind,
             .session = session,
             .sessionInfo = sessionInfo ? *sessionInfo : SXValue(),
@@ -125,14 +121,14 @@ class FakeFernReporting::State {
   void flush(int session, FernFlushCompletion completion) {
     SXMutexLock lock(mutex);
     append({.kind = Kind::kFlush, .session = session});
-    deliverer.post(std::chrono::milliseconds(0), [completion] {
+    deliverer.post([completion] {
       if (completion) completion(std::nullopt);
     });
   }
 
   void deliverHeld() {
     SXMutexLock lock(mutex);
-    for (auto& task : held) deliverer.post(std::chrono::milliseconds(0), std::move(task));
+    for (auto& task : held) deliverer.post(std::move(task));
     held.clear();
   }
 
@@ -146,7 +142,6 @@ class FakeFernReporting::State {
   std::condition_variable changed;
   std::vector<Event> events SX_GUARDED_BY(mutex);
   Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kInline;
-  SendFailure messageFailure;
   SendFailure singleFailure;
   int sessions = 0;
   int tokens = 0;
@@ -214,11 +209,6 @@ bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue
 void FakeFernReporting::setConfigurationDelivery(Delivery delivery) {
   SXMutexLock lock(state_->mutex);
   state_->configurationDelivery = delivery;
-}
-
-void FakeFernReporting::setMessageFailure(SendFailure failure) {
-  SXMutexLock lock(state_->mutex);
-  state_->messageFailure = std::move(failure);
 }
 
 void FakeFernReporting::setSingleMessageFailure(SendFailure failure) {

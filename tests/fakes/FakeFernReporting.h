@@ -3,9 +3,9 @@
 // per session, single messages and flushes.
 //
 // A configuration finds the backend "fake" and completes on the caller's thread, or is held
-// until deliverHeld(); flushes complete from a thread of the fake. Tests choose whether sends
-// fail, with or without an error. Completions still undelivered when the fake is destroyed are
-// dropped; sessions that outlive the fake fail their sends and complete nothing.
+// until deliverHeld(); flushes complete from a thread of the fake. Tests choose whether single
+// messages fail, with or without an error. Completions still undelivered when the fake is destroyed
+// are dropped; sessions that outlive the fake fail their sends and complete nothing.
 #pragma once
 
 #include <chrono>
@@ -52,7 +52,6 @@ class FakeFernReporting final : public FernReporting {
                       std::optional<FernError>& error) override;
 
   void setConfigurationDelivery(Delivery delivery);
-  void setMessageFailure(SendFailure failure);        // sendMessage on a session
   void setSingleMessageFailure(SendFailure failure);  // sendOneMessage
   // Delivers the completions held under kNever, now, from the fake's thread.
   void deliverHeld();

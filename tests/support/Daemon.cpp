@@ -10,7 +10,6 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <thread>
 
 bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds timeout) {
@@ -150,12 +149,7 @@ std::unique_ptr<SXReportingClient> TestDaemon::client() const {
   return client;
 }
 
-std::string TestDaemon::log() const {
-  std::ifstream in(dir_.file("daemon.log"));
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
+std::string TestDaemon::log() const { return SXTestReadFile(dir_.file("daemon.log")); }
 
 namespace {
 

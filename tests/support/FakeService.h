@@ -16,10 +16,7 @@ struct FakeService {
                        const std::function<void(TestEnvironment&, SXPlatform&)>& adjust = {}) {
     platform = t.platform();
     if (adjust) adjust(t, platform);
-    environment = std::make_shared<SXReportingEnvironment>(platform, limits);
-    environment->setServerQueue(
-        t.dispatch->createSerialQueue("server", SXQualityOfService::kUserInteractive));
-    environment->setBackendWaitSeconds(0.3);
+    environment = t.makeEnvironment(limits, platform);
     delegate = SXReportingServiceDelegate::init(environment);
   }
   ~FakeService() { t.drain(); }

@@ -1,4 +1,4 @@
-// Temporary directories and direct SQL access for the tests of the SQLite stores.
+// Temporary directories, whole files and direct SQL access for the tests.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -6,6 +6,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -32,6 +33,12 @@ class SXTestTempDir {
  private:
   std::string path_;
 };
+
+// The whole of a file ("" when it cannot be read).
+inline std::string SXTestReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  return std::string(std::istreambuf_iterator<char>(in), {});
+}
 
 // Every row `sql` returns, read through a connection of its own.
 inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::string& sql) {

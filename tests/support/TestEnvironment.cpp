@@ -18,12 +18,18 @@ TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string>
     : log(std::make_shared<FakeLog>(std::move(verboseScopes))),
       device(std::make_shared<FakeDeviceProperties>(std::move(deviceProperties))),
       directory(temporaryDirectory()) {
-  environment = std::make_shared<SXReportingEnvironment>(platform());
-  environment->setServerQueue(dispatch->createSerialQueue("com.vendra.sonex.reporting.server",
-                                                          SXQualityOfService::kUserInteractive));
+  environment = makeEnvironment();
+}
+
+std::shared_ptr<SXReportingEnvironment> TestEnvironment::makeEnvironment(
+    SXReportingLimits limits, std::optional<SXPlatform> platform) const {
+  auto made = std::make_shared<SXReportingEnvironment>(platform.value_or(this->platform()), limits);
+  made->setServerQueue(dispatch->createSerialQueue("com.vendra.sonex.reporting.server",
+                                                   SXQualityOfService::kUserInteractive));
   // The manual dispatch runs a backend wait's timer as soon as it is set, so the fake's
   // backends are known before the setup task looks for them (its configuration is inline).
-  environment->setBackendWaitSeconds(0.3);
+  made->setBackendWaitSeconds(0.3);
+  return made;
 }
 
 TestEnvironment::~TestEnvironment() {

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "SXReportingEnvironment.h"
@@ -67,6 +68,10 @@ struct TestEnvironment {
   std::shared_ptr<SXReportingEnvironment> environment;
 
   SXPlatform platform() const;
+  // An environment of `platform` (these facilities when none) under `limits`, its server queue
+  // one of the manual dispatch's.
+  std::shared_ptr<SXReportingEnvironment> makeEnvironment(
+      SXReportingLimits limits = {}, std::optional<SXPlatform> platform = {}) const;
   // Runs queued work until nothing is left.
   size_t drain() { return dispatch->runAll(); }
 };
