@@ -103,8 +103,8 @@ TEST_F(BenchEndToEnd, AnUnreachableDaemonIsAnError) {
 }
 
 // A bad option or environment variable of the benchmark or the daemon it spawns is one line on
-// standard error and exit status 2; the benchmark drops an optional daemon flag that the daemon
-// names as unknown.
+// standard error and exit status 2. The benchmark finds the optional daemon flags to drop by the
+// daemon's "unknown option" line.
 TEST_F(BenchEndToEnd, BadOptionsAndEnvironmentVariablesAreOneLineUsageErrors) {
   struct Row {
     std::string command;  // environment, then the arguments
@@ -115,13 +115,11 @@ TEST_F(BenchEndToEnd, BadOptionsAndEnvironmentVariablesAreOneLineUsageErrors) {
       {bench + " --clients 0", "sxreport-bench: --clients: not a number from 1 to 4096: '0'"},
       {bench + " --clients 4097", "sxreport-bench: --clients: not a number from 1 to 4096"},
       {bench + " --messages -1", "sxreport-bench: --messages: not a number from 1 on: '-1'"},
-      {bench + " --window 010x", "sxreport-bench: --window: not a number"},
       {bench + " --attack-seconds 3601", "sxreport-bench: --attack-seconds: not a number of"},
       {bench + " --drain-timeout nan", "sxreport-bench: --drain-timeout: not a positive number"},
       {bench + " --scenario rpc,nonsense", "sxreport-bench: --scenario: not a list of scenarios"},
       {bench + " --daemon-flag novalue", "sxreport-bench: --daemon-flag: not NAME=VALUE"},
       {bench + " --spawn --socket /tmp/x", "sxreport-bench: --spawn excludes --socket"},
-      {bench + " --bogus 1", "sxreport-bench: unknown option --bogus"},
       {daemon + " --max-sessions 0",
        "sxreportingd: --max-sessions (SXREPORTING_MAX_SESSIONS): not a positive number: '0'"},
       {daemon + " --max-payload-bytes 18446744073709551616",
