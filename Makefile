@@ -5,7 +5,7 @@ JOBS       ?= $(shell nproc)
 DEB_PACKAGES = cmake g++ make pkg-config libasio-dev libmsgpack-cxx-dev nlohmann-json3-dev \
                libsqlite3-dev sqlite3 systemtap-sdt-dev libgtest-dev libgmock-dev googletest \
                libcurl4-openssl-dev python3-msgpack help2man dpkg-dev libjemalloc-dev ccache \
-               libsystemd-dev zlib1g-dev protobuf-compiler libprotobuf-dev systemd
+               libsystemd-dev zlib1g-dev protobuf-compiler libprotobuf-dev systemd libcli11-dev
 # Paths below the checkout are hashed relative to it, so any clone shares ccache's results.
 export CCACHE_BASEDIR := $(CURDIR)
 # The libraries precompile their common headers; ccache caches around them only when told to.

@@ -1,13 +1,12 @@
-// `sxreportctl status --metrics`: the status reply as Prometheus text, and its flag.
+// `sxreportctl status --metrics`: the status reply as Prometheus text.
+#include "tools/sxreportctl/CtlMetrics.h"
+
 #include <gtest/gtest.h>
 
 #include <limits>
 #include <regex>
 #include <set>
 #include <sstream>
-
-#include "client/SXCtlArgs.h"
-#include "client/SXCtlMetrics.h"
 
 namespace {
 
@@ -140,18 +139,6 @@ TEST(CtlMetrics, NonFiniteValuesUseTheFormatsSpellings) {
   EXPECT_NE(text.find("sxreporting_a NaN\n"), std::string::npos);
   EXPECT_NE(text.find("sxreporting_b +Inf\n"), std::string::npos);
   EXPECT_NE(text.find("sxreporting_c -Inf\n"), std::string::npos);
-}
-
-TEST(CtlMetrics, OnlyStatusTakesTheMetricsFlag) {
-  std::vector<SXCtlRequest> requests;
-  std::string error;
-  ASSERT_TRUE(SXCtlParseChain({"status", "--metrics"}, requests, error)) << error;
-  EXPECT_TRUE(requests[0].metrics);
-  ASSERT_TRUE(SXCtlParseChain({"list", "then", "status"}, requests, error)) << error;
-  EXPECT_FALSE(requests[1].metrics);
-  EXPECT_FALSE(SXCtlParseChain({"list", "--metrics"}, requests, error));
-  EXPECT_EQ(error, "list has no option --metrics");
-  EXPECT_FALSE(SXCtlParseChain({"status", "--metrics=1"}, requests, error));
 }
 
 }  // namespace

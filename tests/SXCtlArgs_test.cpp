@@ -1,26 +1,17 @@
-#include "client/SXCtlArgs.h"
-
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include "common/SXServiceTypes.h"
+#include "tools/sxreportctl/CtlArgs.h"
 
 using namespace std::chrono_literals;
 
 namespace {
 
 SXCtlRequest parse(std::vector<std::string> args) {
-  SXCtlRequest request;
-  std::string error;
-  EXPECT_TRUE(SXCtlParse(args, request, error)) << error;
-  return request;
-}
-
-std::string parseError(std::vector<std::string> args) {
-  SXCtlRequest request;
-  std::string error;
-  EXPECT_FALSE(SXCtlParse(args, request, error)) << "parsed: " << request.command;
-  return error;
+  SXCtlCommandLine line = SXCtlParseChain(args);
+  EXPECT_FALSE(line.exitStatus) << line.text;
+  return line.requests.empty() ? SXCtlRequest() : line.requests[0];
 }
 
 TEST(SXCtlArgsTest, GlobalOptionsGoAnywhereInEitherForm) {
@@ -35,109 +26,159 @@ TEST(SXCtlArgsTest, GlobalOptionsGoAnywhereInEitherForm) {
   EXPECT_EQ(r.reporterID, 7);
   EXPECT_EQ(r.stateDir, "/st");
   EXPECT_EQ(r.configDir, "/cf");
+  // Decimal, whatever CLI11 would make of a leading zero; the later of two values.
+  EXPECT_EQ(parse({"destroy", "010"}).reporterID, 10);
+  EXPECT_EQ(parse({"--socket", "/a", "list", "--socket=/b"}).socketPath, "/b");
 }
 
-TEST(SXCtlArgsTest, UsageErrorsSayWhatIsWrong) {
-  EXPECT_EQ(parseError({}), "no command given; see sxreportctl --help");
-  EXPECT_EQ(parseError({"frob"}), "unknown command 'frob'");
-  EXPECT_EQ(parseError({"create"}), "usage: sxreportctl create ID");
-  EXPECT_EQ(parseError({"create", "1", "2"}), "usage: sxreportctl create ID");
-  EXPECT_EQ(parseError({"create", "x1"}), "not a reporter ID: 'x1'");
-  EXPECT_EQ(parseError({"create", "99999999999999999999"}),
-            "not a reporter ID: '99999999999999999999'");
-  EXPECT_EQ(parseError({"create", "--config", "{}", "1"}), "create has no option --config");
-  EXPECT_NE(parseError({"--ids", "1", "send", "{}"}).find("unknown option --ids"),
-            std::string::npos);
-  EXPECT_EQ(parseError({"list", "--socket"}), "--socket needs a value");
-  EXPECT_EQ(parseError({"list", "--json=yes"}), "--json takes no value");
-  EXPECT_EQ(parseError({"list", "--timeout", "-1"}), "not a time-out in seconds: '-1'");
-  EXPECT_EQ(parseError({"list", "--timeout", "soon"}), "not a time-out in seconds: 'soon'");
-  EXPECT_EQ(parseError({"notify", "a/b"}), "not a notification name: 'a/b'");
-  EXPECT_EQ(parseError({"notify", ".."}), "not a notification name: '..'");
+// Everything a command line can end with instead of a run: one line naming what is wrong
+// (status 2), or the help or version (status 0).
+TEST(SXCtlArgsTest, UsageErrorsHelpAndVersion) {
+  struct Row {
+    std::vector<std::string> args;
+    int status;
+    std::string text;  // how the error line begins, a part of the help
+  };
+  const Row rows[] = {
+      {{}, 2, "no command given; see sxreportctl --help"},
+      {{"frob"}, 2, "unknown command 'frob'"},
+      {{"create"}, 2, "create: ID is required"},
+      {{"create", "1", "2"}, 2, "create: The following argument was not expected: 2"},
+      {{"create", "x1"}, 2, "create: ID: not a reporter ID (a signed 64-bit number): 'x1'"},
+      {{"create", "99999999999999999999"},
+       2,
+       "create: ID: not a reporter ID (a signed 64-bit number): '99999999999999999999'"},
+      // An unknown option is named, not what its value did to the arguments after it.
+      {{"create", "--config", "{}", "1"}, 2, "create: unknown option --config"},
+      {{"--ids", "1", "send", "{}"}, 2, "unknown option --ids (a command's own options follow it)"},
+      {{"list", "--metrics"}, 2, "list: unknown option --metrics"},
+      {{"status", "--metrics=1"}, 2, "status: metrics was given a disallowed flag override"},
+      {{"list", "--socket"}, 2, "list: --socket: 1 required PATH missing"},
+      {{"list", "--timeout", "-1"}, 2, "list: --timeout: not a time-out in seconds: '-1'"},
+      {{"list", "--timeout", "inf"}, 2, "list: --timeout: not a time-out in seconds: 'inf'"},
+      {{"notify", "a/b"}, 2, "notify: NAME: not a notification name: 'a/b'"},
+      {{"set-type", "65536", "1"}, 2, "set-type: TYPE: not a service type: '65536' (0-65535"},
+      {{"send", "{}"},
+       2,
+       "send: send needs either --ids ID,ID,... (--ids '' for none) or --broadcast"},
+      {{"send", "--broadcast", "--ids", "1", "{}"}, 2, "send: send needs either"},
+      {{"send", "--ids", "1,,2", "{}"},
+       2,
+       "send: --ids: not a reporter ID (a signed 64-bit number): ''"},
+      {{"send", "--broadcast", "--type", "65536", "{}"},
+       2,
+       "send: --type: not a message type (0 to 65535): '65536'"},
+      {{"send", "--broadcast", "--category", "4294967296", "{}"},
+       2,
+       "send: --category: not a category (0 to 4294967295): '4294967296'"},
+      {{"send", "--broadcast", "[1]"}, 2, "send: PAYLOAD_JSON: not a JSON object"},
+      {{"send", "--broadcast", "{"}, 2, "send: PAYLOAD_JSON: not valid JSON: {"},
+      {{"configure", "5"}, 2, "configure: --config is required"},
+      {{"configure", "--config", "[1]", "5"}, 2, "configure: --config: not a JSON object or null"},
+      {{"defaults"}, 2, "defaults: needs one of: read, write, delete"},
+      {{"defaults", "erase", "K"}, 2, "defaults: unknown command 'erase'"},
+      {{"defaults", "write", "K"}, 2, "defaults write: VALUE is required"},
+      {{"defaults", "read", "--int", "K"}, 2, "defaults read: unknown option --int"},
+      {{"defaults", "write", "--bool", "K", "maybe"},
+       2,
+       "defaults write: VALUE: not a boolean: 'maybe' (true, false, yes, no, 1 or 0)"},
+      {{"defaults", "write", "--int", "K", "1x"}, 2, "defaults write: VALUE: not an integer: '1x'"},
+      {{"defaults", "write", "--int", "--bool", "K", "1"},
+       2,
+       "defaults write: --bool excludes --int"},
+      {{"events", "--limit", "-1"}, 2, "events: --limit: not a count (0 or more): '-1'"},
+      {{"events", "--since", "yesterday"}, 2, "events: --since: not a time: 'yesterday'"},
+      {{"list", "then"}, 2, "'then' must stand between two commands"},
+      {{"list", "then", "create"}, 2, "create: ID is required"},
+      // The help of the command it follows, wherever in a chain; an unknown one gets the overview.
+      {{"list", "then", "create", "1", "--help"}, 0, "Usage: sxreportctl create [OPTIONS] ID\n"},
+      {{"help", "send"}, 0, "Usage: sxreportctl send [OPTIONS] PAYLOAD_JSON\n"},
+      {{"defaults", "write", "-h"}, 0, "Usage: sxreportctl defaults write [OPTIONS] KEY VALUE\n"},
+      {{"help", "frob"}, 0, "Usage: sxreportctl [OPTIONS] COMMAND\n"},
+      {{"list", "--version"}, 0, "sxreportctl "},
+  };
+  for (const auto& row : rows) {
+    SXCtlCommandLine line = SXCtlParseChain(row.args);
+    SCOPED_TRACE(testing::PrintToString(row.args));
+    EXPECT_EQ(line.exitStatus, row.status);
+    EXPECT_TRUE(line.requests.empty());
+    if (row.status == 0) {
+      EXPECT_NE(line.text.find(row.text), std::string::npos) << line.text;
+    } else {
+      EXPECT_TRUE(line.text.starts_with("sxreportctl: " + row.text)) << line.text;
+      EXPECT_EQ(std::count(line.text.begin(), line.text.end(), '\n'), 1) << line.text;
+    }
+  }
 }
 
 TEST(SXCtlArgsTest, ServiceTypesByNumberOrName) {
-  EXPECT_EQ(parse({"set-type", "telephony", "42"}).serviceType, 2);
-  EXPECT_EQ(parse({"set-type", "TEST", "1"}).serviceType, 11);
-  EXPECT_EQ(parse({"set-type", "65535", "1"}).serviceType, 65535);
-  EXPECT_EQ(parse({"set-type", "unknown", "1"}).serviceType, 65535);
-  EXPECT_EQ(parse({"set-type", "12", "1"}).serviceType, 12);
-  EXPECT_NE(parseError({"set-type", "65536", "1"}).find("not a service type"), std::string::npos);
-  EXPECT_NE(parseError({"set-type", "-1", "1"}).find("not a service type"), std::string::npos);
-  EXPECT_NE(parseError({"set-type", "bogus", "1"}).find("not a service type"), std::string::npos);
-
+  const std::pair<const char*, SXReportingServiceType> types[] = {
+      {"telephony", 2}, {"TEST", 11}, {"65535", 65535}, {"unknown", 65535}, {"12", 12}};
+  for (const auto& [text, type] : types) {
+    EXPECT_EQ(parse({"set-type", text, "42"}).serviceType, type) << text;
+  }
   for (SXReportingServiceType type : {0, 1, 11, 12, 65534, 65535}) {
     EXPECT_EQ(SXServiceTypeFromText(SXServiceTypeName(type)), type);
   }
   EXPECT_EQ(SXServiceTypeName(12), "servicetype12");
 }
 
-TEST(SXCtlArgsTest, SendTakesDefaultsIdListsAndBroadcast) {
+TEST(SXCtlArgsTest, CommandsTakeTheirArguments) {
   auto r = parse({"send", "--ids", "1,-2,3", "{\"k\": 1}"});
   EXPECT_EQ(r.category, 3u);
   EXPECT_EQ(r.messageType, 1);
   EXPECT_EQ(r.reporterIDs, (std::vector<int64_t>{1, -2, 3}));
   EXPECT_EQ(r.payload, (SXValue{{"k", 1}}));
 
-  r = parse({"send", "--ids", "", "--category", "0x08000003", "--type=4", "{}"});
+  r = parse({"send", "--ids", "", "--category", "0x08000003", "--type=010", "{}"});
   ASSERT_TRUE(r.reporterIDs.has_value());  // an empty list, which is not a broadcast
   EXPECT_TRUE(r.reporterIDs->empty());
   EXPECT_EQ(r.category, 0x08000003u);
-  EXPECT_EQ(r.messageType, 4);
-
+  EXPECT_EQ(r.messageType, 10);
   EXPECT_FALSE(parse({"send", "--broadcast", "{}"}).reporterIDs.has_value());
 
-  EXPECT_NE(parseError({"send", "{}"}).find("--broadcast"), std::string::npos);
-  EXPECT_NE(parseError({"send", "--broadcast", "--ids", "1", "{}"}).find("either"),
-            std::string::npos);
-  EXPECT_EQ(parseError({"send", "--ids", "1,,2", "{}"}), "not a reporter ID: ''");
-  EXPECT_EQ(parseError({"send", "--broadcast", "--type", "65536", "{}"}),
-            "not a message type: '65536' (0 to 65535)");
-  EXPECT_EQ(parseError({"send", "--broadcast", "--category", "4294967296", "{}"}),
-            "not a category: '4294967296' (0 to 4294967295)");
-  EXPECT_EQ(parseError({"send", "--broadcast", "[1]"}), "the payload must be a JSON object");
-  EXPECT_EQ(parseError({"send", "--broadcast", "{"}), "the payload is not valid JSON: {");
-}
-
-TEST(SXCtlArgsTest, ConfigureTakesAnObjectOrNull) {
   EXPECT_EQ(parse({"configure", "--config", "{\"a\":1}", "5"}).configuration, (SXValue{{"a", 1}}));
   auto cleared = parse({"configure", "--config", "null", "5"});
   EXPECT_FALSE(cleared.configuration.has_value());
   EXPECT_EQ(cleared.reporterID, 5);
-  EXPECT_NE(parseError({"configure", "5"}).find("needs --config"), std::string::npos);
-  EXPECT_EQ(parseError({"configure", "--config", "[1]", "5"}),
-            "--config must be a JSON object or null");
+
+  r = parse({"events", "--name", "com.x", "--limit", "3", "--since", "2026-11-25T06:30:15Z"});
+  EXPECT_EQ(r.eventName, "com.x");
+  EXPECT_EQ(r.limit, 3);
+  EXPECT_EQ(r.since, 1795588215.0);
+  r = parse({"events"});
+  EXPECT_FALSE(r.limit.has_value());
+  EXPECT_FALSE(r.since.has_value());
+
+  EXPECT_TRUE(parse({"status", "--metrics"}).metrics);
+  EXPECT_FALSE(parse({"status"}).metrics);
+  EXPECT_EQ(parse({"notify", "--", "then"}).notificationName, "then");
 }
 
 TEST(SXCtlArgsTest, DefaultsActionsAndTypedValues) {
-  auto read = parse({"defaults", "read"});
-  EXPECT_EQ(read.defaultsAction, "read");
-  EXPECT_FALSE(read.key.has_value());
-  EXPECT_EQ(parse({"defaults", "read", "K"}).key, "K");
-  EXPECT_EQ(parse({"defaults", "write", "K", "v"}).value, "v");
-  EXPECT_EQ(parse({"defaults", "write", "--int", "K", "-5"}).value, -5);
-  EXPECT_EQ(parse({"defaults", "write", "--bool", "K", "NO"}).value, false);
-  EXPECT_EQ(parse({"defaults", "write", "--string", "K", "12"}).value, "12");
-  EXPECT_EQ(parse({"defaults", "delete", "K"}).key, "K");
-
-  EXPECT_NE(parseError({"defaults", "write", "K"}).find("usage"), std::string::npos);
-  EXPECT_NE(parseError({"defaults", "delete"}).find("usage"), std::string::npos);
-  EXPECT_NE(parseError({"defaults", "erase", "K"}).find("usage"), std::string::npos);
-  EXPECT_NE(parseError({"defaults", "read", "--int", "K"}).find("usage"), std::string::npos);
-  EXPECT_EQ(parseError({"defaults", "write", "--bool", "K", "maybe"}),
-            "not a boolean: 'maybe' (true, false, yes, no, 1 or 0)");
-  EXPECT_EQ(parseError({"defaults", "write", "--int", "--bool", "K", "1"}),
-            "give at most one of --bool, --int and --string");
-}
-
-TEST(SXCtlArgsTest, EventsFilters) {
-  auto r = parse({"events", "--name", "com.x", "--limit", "3"});
-  EXPECT_EQ(r.eventName, "com.x");
-  EXPECT_EQ(r.limit, 3);
-  EXPECT_FALSE(parse({"events"}).limit.has_value());
-  EXPECT_EQ(parseError({"events", "--limit", "-1"}), "--limit must not be negative");
-  EXPECT_EQ(parse({"events", "--since", "2026-11-25T06:30:15Z"}).since, 1795588215.0);
-  EXPECT_FALSE(parse({"events"}).since.has_value());
+  struct Row {
+    std::vector<std::string> args;
+    std::string action;
+    std::optional<std::string> key;
+    SXValue value;
+  };
+  const Row rows[] = {
+      {{"defaults", "read"}, "read", std::nullopt, nullptr},
+      {{"defaults", "read", "K"}, "read", "K", nullptr},
+      {{"defaults", "write", "K", "v"}, "write", "K", "v"},
+      {{"defaults", "write", "--int", "K", "-5"}, "write", "K", -5},
+      {{"defaults", "write", "K", "--bool", "NO"}, "write", "K", false},
+      {{"defaults", "write", "--string", "K", "12"}, "write", "K", "12"},
+      {{"defaults", "delete", "K", "--json"}, "delete", "K", nullptr},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(testing::PrintToString(row.args));
+    auto r = parse(row.args);
+    EXPECT_EQ(r.command, "defaults");
+    EXPECT_EQ(r.defaultsAction, row.action);
+    EXPECT_EQ(r.key, row.key);
+    EXPECT_EQ(r.value, row.value);
+  }
 }
 
 TEST(SXCtlArgsTest, SinceTakesUtcTimesAndAges) {
@@ -168,26 +209,18 @@ TEST(SXCtlArgsTest, SinceTakesUtcTimesAndAges) {
 }
 
 TEST(SXCtlArgsTest, ChainsShareGlobalOptions) {
-  std::vector<SXCtlRequest> chain;
-  std::string error;
-  ASSERT_TRUE(SXCtlParseChain({"create", "42", "then", "--json", "set-type", "telephony", "42",
-                               "then", "start", "42", "--socket", "/s"},
-                              chain, error))
-      << error;
-  ASSERT_EQ(chain.size(), 3u);
-  EXPECT_EQ(chain[1].serviceType, 2);
-  for (const auto& request : chain) {
+  SXCtlCommandLine line = SXCtlParseChain({"create", "42", "then", "--json", "set-type",
+                                           "telephony", "42", "then", "start", "42", "--socket",
+                                           "/s", "then", "defaults", "read", "--timeout", "1"});
+  ASSERT_FALSE(line.exitStatus) << line.text;
+  ASSERT_EQ(line.requests.size(), 4u);
+  EXPECT_EQ(line.requests[1].serviceType, 2);
+  EXPECT_EQ(line.requests[3].defaultsAction, "read");
+  for (const auto& request : line.requests) {
     EXPECT_TRUE(request.json);
     EXPECT_EQ(request.socketPath, "/s");
+    EXPECT_EQ(SXCtlTimeout(request), 1000ms);
   }
-  ASSERT_TRUE(SXCtlParseChain({"notify", "--", "then"}, chain, error)) << error;
-  EXPECT_EQ(chain.at(0).notificationName, "then");
-
-  EXPECT_FALSE(SXCtlParseChain({"list", "then"}, chain, error));
-  EXPECT_EQ(error, "'then' must stand between two commands");
-  EXPECT_FALSE(SXCtlParseChain({"list", "then", "then", "list"}, chain, error));
-  EXPECT_FALSE(SXCtlParseChain({"list", "then", "create"}, chain, error));
-  EXPECT_EQ(error, "usage: sxreportctl create ID");
 }
 
 TEST(SXCtlArgsTest, StartWaitsWithoutLimitUnlessTold) {

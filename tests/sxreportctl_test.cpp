@@ -99,7 +99,7 @@ TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
       {{"--version"}, 0, ""},
       {{"start", "42"}, 1, ""},
       {{"send", "--broadcast", "{}"}, 1, ""},
-      {{"create"}, 2, "usage: sxreportctl create ID"},
+      {{"create"}, 2, "create: ID is required"},
       {{"--socket", server_.directory() + "/nothing", "list"}, 3, "cannot connect"},
       {{"--timeout", "0.2", "stop", "0"}, 4, "stop: the service sent no reply within 0.2 s"},
       {{"defaults", "read", "Name"}, 5, "has no value for Name"},

@@ -42,12 +42,13 @@ class SXReportingConfigFile {
 enum class SXLimitApplies { kNextRequest, kNextConnection, kRestart };
 
 // One limit as an option: the long option name without its dashes (also its key in the
-// "limits" section), its environment variable and its member.
+// "limits" section), its environment variable, its member and what it limits (for --help).
 struct SXReportingLimitOption {
   const char* name;
   const char* environment;
   uint64_t SXReportingLimits::*member;
   SXLimitApplies applies;
+  const char* help;
 };
 std::span<const SXReportingLimitOption> SXReportingLimitOptions();
 

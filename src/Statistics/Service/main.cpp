@@ -20,6 +20,7 @@
 #include "SXReportingLifecycle.h"
 #include "SXReportingServiceDelegate.h"
 #include "SXVersion.h"
+#include "common/SXCommandLine.h"
 #include "common/SXPaths.h"
 #include "platform/AsioDispatch.h"
 #include "platform/FileKestrel.h"
@@ -43,91 +44,24 @@ const char* malloc_conf = "narenas:2,dirty_decay_ms:1000,muzzy_decay_ms:0";
 
 namespace {
 
-constexpr const char* kUsage =
-    "Usage: sxreportingd [options]\n"
-    "\n"
+struct Options {
+  SXPaths paths = SXPaths::fromEnvironment();
+  std::string logScopes;
+  size_t maxMessageBytes = 1 << 20;
+  unsigned socketMode = 0660;
+  SXReportingLimits limits;
+  // Limits given as options or environment variables: the configuration file cannot change them.
+  std::set<std::string> fixedLimits;
+  uint64_t drainTimeoutMs = 10'000;
+};
+
+constexpr const char* kDescription =
     "The reporting service of the audio stack. Clients connect over a Unix socket and speak\n"
     "MessagePack-RPC (see sxreportctl(1) and docs/protocol.md).\n"
     "\n"
-    "Each option can also be set by the environment variable named in parentheses.\n"
-    "\n"
-    "Options:\n"
-    "  --socket PATH               socket path (SXREPORTING_SOCKET)\n"
-    "                              default "
-    "<runtime-dir>/com.vendra.audio.kitbench.reporting.service\n"
-    "  --state-dir DIR             analytics, power-log and spool databases "
-    "(SXREPORTING_STATE_DIR)\n"
-    "  --config-dir DIR            device.json, fernreporting.json, preferences/ "
-    "(SXREPORTING_CONFIG_DIR)\n"
-    "  --runtime-dir DIR           socket and notify/ directory (SXREPORTING_RUNTIME_DIR)\n"
-    "  --preferences-dir DIR       preferences domains (SXREPORTING_PREFERENCES_DIR,\n"
-    "                              default <config-dir>/preferences;\n"
-    "                              as root <state-dir>/preferences)\n"
-    "  --diagnostic-logs-dir DIR   session summary files of internal builds\n"
-    "                              (SXREPORTING_DIAGNOSTIC_LOGS_DIR)\n"
-    "  --kestrel-root DIR          driver counters (SXREPORTING_KESTREL_ROOT)\n"
-    "  --log-scope SCOPE=LEVEL,...\n"
-    "                              enable verbose lines, e.g. sxrs=5,sxrr=5,sxrd=5\n"
-    "                              (SXREPORTING_LOG_SCOPES)\n"
-    "  --max-message-bytes N       largest request accepted (SXREPORTING_MAX_MESSAGE_BYTES,\n"
-    "                              default 1048576)\n"
-    "  --socket-mode MODE          permissions of the socket, octal (SXREPORTING_SOCKET_MODE,\n"
-    "                              default 0660)\n"
-    "\n"
-    "limits (a positive number each; what they refuse is logged and counted in `status`):\n"
-    "  --max-sessions-per-client N live sessions of one client; a create beyond it makes\n"
-    "                              nothing (SXREPORTING_MAX_SESSIONS_PER_CLIENT, default 4096)\n"
-    "  --max-sessions N            live sessions of all clients (SXREPORTING_MAX_SESSIONS,\n"
-    "                              default 65536)\n"
-    "  --max-aggregate-entries N   entries a session gathers for its summary; later messages\n"
-    "                              are sent but left out of it "
-    "(SXREPORTING_MAX_AGGREGATE_ENTRIES,\n"
-    "                              default 100000)\n"
-    "  --max-aggregate-bytes N     the same in bytes (texts and 256 an entry), per session\n"
-    "                              (SXREPORTING_MAX_AGGREGATE_BYTES, default 1048576)\n"
-    "  --max-aggregate-bytes-total N\n"
-    "                              the same for all sessions together\n"
-    "                              (SXREPORTING_MAX_AGGREGATE_BYTES_TOTAL, default 8388608)\n"
-    "  --max-pending-standalone-bytes N\n"
-    "                              payload bytes of one client's standalone sends waiting for\n"
-    "                              their delay; further ones are refused\n"
-    "                              (SXREPORTING_MAX_PENDING_STANDALONE_BYTES, default 1048576)\n"
-    "  --max-payload-bytes N       a message's payload, MessagePack bytes; larger ones get an\n"
-    "                              error reply (SXREPORTING_MAX_PAYLOAD_BYTES, default 65536)\n"
-    "  --max-configuration-bytes N a session's configuration, likewise\n"
-    "                              (SXREPORTING_MAX_CONFIGURATION_BYTES, default 65536)\n"
-    "  --max-reporter-ids N        reporter IDs in one send's list, likewise\n"
-    "                              (SXREPORTING_MAX_REPORTER_IDS, default 1024)\n"
-    "  --max-queued-requests N     requests of one connection read but not yet handled before\n"
-    "                              the daemon stops reading it (SXREPORTING_MAX_QUEUED_REQUESTS,\n"
-    "                              default 1024)\n"
-    "  --max-pending-reply-bytes N replies of one connection waiting to be written before the\n"
-    "                              daemon stops reading it (SXREPORTING_MAX_PENDING_REPLY_BYTES,\n"
-    "                              default 4194304)\n"
-    "  --max-connection-bytes N    bytes one connection may make the daemon hold (requests and\n"
-    "                              payloads not yet stored) before it stops reading it\n"
-    "                              (SXREPORTING_MAX_CONNECTION_BYTES, default 1048576)\n"
-    "  --max-inflight-bytes N      the same for all connections together; beyond it the\n"
-    "                              connections holding the most stop being read\n"
-    "                              (SXREPORTING_MAX_INFLIGHT_BYTES, default 8388608)\n"
-    "  --partial-frame-timeout-ms N\n"
-    "                              time a request that has begun to arrive may take to complete;\n"
-    "                              then its connection ends "
-    "(SXREPORTING_PARTIAL_FRAME_TIMEOUT_MS,\n"
-    "                              default 30000)\n"
-    "  --max-error-lines N         error lines one client may cause a minute; the rest are\n"
-    "                              counted in one line (SXREPORTING_MAX_ERROR_LINES, default 20)\n"
-    "  --max-connections-per-client N\n"
-    "                              open connections of one process; further ones are closed\n"
-    "                              at once (SXREPORTING_MAX_CONNECTIONS_PER_CLIENT, default 128)\n"
-    "  -h, --help                  this text\n"
-    "  --version                   print the version\n"
-    "\n"
-    "lifecycle:\n"
-    "  --drain-timeout-ms N        how long a stop (SIGTERM, SIGINT) may drain before the\n"
-    "                              daemon exits with what is left (SXREPORTING_DRAIN_TIMEOUT_MS,\n"
-    "                              default 10000)\n"
-    "\n"
+    "Each option can also be set by the environment variable named in parentheses.";
+
+constexpr const char* kFooter =
     "Signals: SIGTERM and SIGINT stop after storing everything answered (exit status 0); a\n"
     "second one during that drain exits at once (status 1). SIGHUP re-reads fernreporting.json,\n"
     "device.json and sxreportingd.json.\n"
@@ -142,146 +76,84 @@ constexpr const char* kUsage =
     "The limits can also be set in <config-dir>/sxreportingd.json, e.g.\n"
     "{\"limits\": {\"max-payload-bytes\": 131072}}; options and environment variables win.\n"
     "\n"
-    "With no options and not root, everything lives under ./var of the working directory.\n";
+    "With no options and not root, everything lives under ./var of the working directory.";
 
-struct Options {
-  SXPaths paths = SXPaths::fromEnvironment();
-  std::string logScopes;
-  size_t maxMessageBytes = 1 << 20;
-  unsigned socketMode = 0660;
-  SXReportingLimits limits;
-  // Limits given as options or environment variables: the configuration file cannot change them.
-  std::set<std::string> fixedLimits;
-  std::chrono::milliseconds drainTimeout{10'000};
-};
+// Returns nothing to go on, or the exit status.
+std::optional<int> parseOptions(int argc, char** argv, Options& options) {
+  CLI::App app(kDescription, "sxreportingd");
+  SXSetUpCommandLine(app, kSXVersion);
+  app.footer(kFooter);
+  SXPaths& p = options.paths;
+  // The directories' environment twins are read by SXPaths, which sxreportctl shares.
+  app.add_option("--socket", p.socketPath,
+                 "socket path (SXREPORTING_SOCKET)\n"
+                 "default <runtime-dir>/com.vendra.audio.kitbench.reporting.service")
+      ->type_name("PATH");
+  app.add_option("--state-dir", p.stateDir,
+                 "analytics, power-log and spool databases (SXREPORTING_STATE_DIR)")
+      ->type_name("DIR");
+  app.add_option("--config-dir", p.configDir,
+                 "device.json, fernreporting.json, preferences/ (SXREPORTING_CONFIG_DIR)")
+      ->type_name("DIR");
+  app.add_option("--runtime-dir", p.runtimeDir,
+                 "socket and notify/ directory "
+                 "(SXREPORTING_RUNTIME_DIR)")
+      ->type_name("DIR");
+  app.add_option("--preferences-dir", p.preferencesDir,
+                 "preferences domains (SXREPORTING_PREFERENCES_DIR,\n"
+                 "default <config-dir>/preferences;\nas root <state-dir>/preferences)")
+      ->type_name("DIR");
+  app.add_option("--diagnostic-logs-dir", p.diagnosticLogsDir,
+                 "session summary files of internal builds\n(SXREPORTING_DIAGNOSTIC_LOGS_DIR)")
+      ->type_name("DIR");
+  app.add_option("--kestrel-root", p.kestrelRoot, "driver counters (SXREPORTING_KESTREL_ROOT)")
+      ->type_name("DIR");
+  app.add_option("--log-scope", options.logScopes,
+                 "enable verbose lines, e.g. sxrs=5,sxrr=5,sxrd=5\n(SXREPORTING_LOG_SCOPES)")
+      ->type_name("SCOPE=LEVEL,...")
+      ->envname("SXREPORTING_LOG_SCOPES")
+      ->check([](const std::string& text) {
+        std::map<std::string, int> levels;
+        return SXStderrLog::parseLevels(text, levels) ? "" : "not SCOPE=LEVEL,...: '" + text + "'";
+      });
+  app.add_option("--max-message-bytes", options.maxMessageBytes,
+                 "largest request accepted (SXREPORTING_MAX_MESSAGE_BYTES,\ndefault 1048576)")
+      ->type_name("N")
+      ->envname("SXREPORTING_MAX_MESSAGE_BYTES")
+      ->transform(SXNumber<uint64_t>(1, UINT64_MAX, "a positive number"));
+  app.add_option("--socket-mode", options.socketMode,
+                 "permissions of the socket, octal (SXREPORTING_SOCKET_MODE,\ndefault 0660)")
+      ->type_name("MODE")
+      ->envname("SXREPORTING_SOCKET_MODE")
+      ->transform(SXNumber<unsigned>(0, 0777, "an octal mode up to 0777", 8));
 
-const char* envOr(const char* name, const char* fallback) {
-  const char* value = std::getenv(name);
-  return value && *value ? value : fallback;
-}
-
-bool parseNumber(const char* text, unsigned long long& out, int base) {
-  char* end = nullptr;
-  errno = 0;
-  out = std::strtoull(text, &end, base);
-  return errno == 0 && end && *end == '\0' && end != text;
-}
-
-bool parsePositive(const char* text, uint64_t& out) {
-  unsigned long long number = 0;
-  if (!parseNumber(text, number, 10) || number == 0) return false;
-  out = number;
-  return true;
-}
-
-// The limits and the drain timeout from their environment variables; false (and a message)
-// when one is malformed.
-bool lifecycleFromEnvironment(Options& options) {
+  const SXReportingLimits defaults;
   for (const auto& limit : SXReportingLimitOptions()) {
-    const char* text = envOr(limit.environment, nullptr);
-    if (!text) continue;
-    if (!parsePositive(text, options.limits.*limit.member)) {
-      std::fprintf(stderr, "sxreportingd: bad %s '%s' (expected a positive number)\n",
-                   limit.environment, text);
-      return false;
-    }
-    options.fixedLimits.insert(limit.name);
+    app.add_option(std::string("--") + limit.name, options.limits.*limit.member,
+                   std::string(limit.help) + "\n(" + limit.environment + ", default " +
+                       std::to_string(defaults.*limit.member) + ")")
+        ->type_name("N")
+        ->envname(limit.environment)
+        ->group(
+            "limits (a positive number each; what they refuse is logged and counted in "
+            "`status`)")
+        ->transform(SXNumber<uint64_t>(1, UINT64_MAX, "a positive number"));
   }
-  uint64_t ms = 0;
-  const char* drain = envOr("SXREPORTING_DRAIN_TIMEOUT_MS", nullptr);
-  if (drain && !parsePositive(drain, ms)) {
-    std::fprintf(stderr, "sxreportingd: bad SXREPORTING_DRAIN_TIMEOUT_MS '%s'\n", drain);
-    return false;
-  }
-  if (drain) options.drainTimeout = std::chrono::milliseconds(ms);
-  return true;
-}
+  app.add_option("--drain-timeout-ms", options.drainTimeoutMs,
+                 "how long a stop (SIGTERM, SIGINT) may drain before the\n"
+                 "daemon exits with what is left (SXREPORTING_DRAIN_TIMEOUT_MS,\ndefault 10000)")
+      ->type_name("N")
+      ->envname("SXREPORTING_DRAIN_TIMEOUT_MS")
+      ->group("lifecycle")
+      ->transform(SXNumber<uint64_t>(1, UINT64_MAX, "a positive number"));
 
-// Whether `arg` names a limit or the drain timeout; `ok` says whether its value was good.
-bool parseLifecycleFlag(const std::string& arg, const char* value, Options& options, bool& ok) {
-  if (arg == "--drain-timeout-ms") {
-    uint64_t ms = 0;
-    ok = parsePositive(value, ms);
-    options.drainTimeout = std::chrono::milliseconds(ms);
-    return true;
-  }
+  if (auto status = SXParseMainCommandLine(app, argc, argv)) return status;
+  p.socketPathExplicit = p.socketPathExplicit || app.count("--socket") > 0;
+  p.runtimeDirChanged();
   for (const auto& limit : SXReportingLimitOptions()) {
-    if (arg != std::string("--") + limit.name) continue;
-    ok = parsePositive(value, options.limits.*limit.member);
-    options.fixedLimits.insert(limit.name);
-    return true;
+    if (app.count(std::string("--") + limit.name) > 0) options.fixedLimits.insert(limit.name);
   }
-  return false;
-}
-
-// Returns 0 to go on, or the exit status.
-int parseOptions(int argc, char** argv, Options& options) {
-  if (!lifecycleFromEnvironment(options)) return 2;
-  options.logScopes = envOr("SXREPORTING_LOG_SCOPES", "");
-  unsigned long long number = 0;
-  if (parseNumber(envOr("SXREPORTING_MAX_MESSAGE_BYTES", "1048576"), number, 10)) {
-    options.maxMessageBytes = number;
-  }
-  if (parseNumber(envOr("SXREPORTING_SOCKET_MODE", "0660"), number, 8)) {
-    options.socketMode = static_cast<unsigned>(number);
-  }
-  for (int i = 1; i < argc; ++i) {
-    std::string arg = argv[i];
-    if (arg == "-h" || arg == "--help") {
-      std::fputs(kUsage, stdout);
-      return -1;
-    }
-    if (arg == "--version") {
-      std::printf("sxreportingd %s\n", kSXVersion);
-      return -1;
-    }
-    if (i + 1 >= argc) {
-      std::fprintf(stderr, "sxreportingd: %s needs a value\n%s", arg.c_str(), kUsage);
-      return 2;
-    }
-    const char* value = argv[++i];
-    SXPaths& p = options.paths;
-    bool lifecycleOk = false;
-    if (parseLifecycleFlag(arg, value, options, lifecycleOk)) {
-      if (lifecycleOk) continue;
-      std::fprintf(stderr, "sxreportingd: bad option %s %s (expected a positive number)\n",
-                   arg.c_str(), value);
-      return 2;
-    }
-    if (arg == "--socket") {
-      p.socketPath = value;
-      p.socketPathExplicit = true;
-    } else if (arg == "--state-dir") {
-      p.stateDir = value;
-    } else if (arg == "--config-dir") {
-      p.configDir = value;
-    } else if (arg == "--runtime-dir") {
-      p.runtimeDir = value;
-      p.runtimeDirChanged();
-    } else if (arg == "--preferences-dir") {
-      p.preferencesDir = value;
-    } else if (arg == "--diagnostic-logs-dir") {
-      p.diagnosticLogsDir = value;
-    } else if (arg == "--kestrel-root") {
-      p.kestrelRoot = value;
-    } else if (arg == "--log-scope") {
-      options.logScopes = value;
-    } else if (arg == "--max-message-bytes" && parseNumber(value, number, 10) && number > 0) {
-      options.maxMessageBytes = number;
-    } else if (arg == "--socket-mode" && parseNumber(value, number, 8) && number <= 0777) {
-      options.socketMode = static_cast<unsigned>(number);
-    } else {
-      std::fprintf(stderr, "sxreportingd: bad option %s %s\n%s", arg.c_str(), value, kUsage);
-      return 2;
-    }
-  }
-  std::map<std::string, int> levels;
-  if (!SXStderrLog::parseLevels(options.logScopes, levels)) {
-    std::fprintf(stderr, "sxreportingd: bad --log-scope '%s' (expected SCOPE=LEVEL,...)\n",
-                 options.logScopes.c_str());
-    return 2;
-  }
-  return 0;
+  return std::nullopt;
 }
 
 // The SQLite stores, kept by their own types so that status can read their write-error counts.
@@ -413,8 +285,10 @@ void reload(Service& s) {
   SXLogFacility& log = s.environment.log();
   s.configFile.load();
   if (s.adapters.device->reload()) {
-    SXLOG(log, nullptr, SXLogLevel::kDefault, "%@/device.json changed (InternalBuild is kept "
-          "from the start)", p.configDir);
+    SXLOG(log, nullptr, SXLogLevel::kDefault,
+          "%@/device.json changed (InternalBuild is kept "
+          "from the start)",
+          p.configDir);
   }
   if (s.adapters.stores.fernReporting->reloadBackends()) {
     SXLOG(log, nullptr, SXLogLevel::kDefault, "backends for sessions started from now on: %@",
@@ -446,21 +320,20 @@ void waitUntilSettled(Service& s) {
 // what it drained.
 std::string drain(Service& s) {
   uint64_t inflight = s.listener.inflightBytes();
-  s.retention.stop();  // a pass gives way after its current chunk
+  s.retention.stop();   // a pass gives way after its current chunk
   waitUntilSettled(s);  // the requests received have been handled and answered
   uint64_t sessions = s.environment.counters().sessionsLive();
   std::promise<size_t> closing;
-  asio::post(s.listener.executor(),
-             [&] { closing.set_value(s.listener.closeConnections()); });
+  asio::post(s.listener.executor(), [&] { closing.set_value(s.listener.closeConnections()); });
   size_t connections = closing.get_future().get();
   waitUntilSettled(s);  // their sessions have stopped and their summaries are written
   s.adapters.stores.tallyvane->flush();
   s.adapters.stores.joulebook->flush();
   s.exporter.stopAfterPass();
-  std::string drained = SXFormat(
-      "closed %zu connections and %llu sessions; stored the %llu payload bytes in flight",
-      connections, static_cast<unsigned long long>(sessions),
-      static_cast<unsigned long long>(inflight));
+  std::string drained =
+      SXFormat("closed %zu connections and %llu sessions; stored the %llu payload bytes in flight",
+               connections, static_cast<unsigned long long>(sessions),
+               static_cast<unsigned long long>(inflight));
   if (uint64_t held = s.listener.inflightBytes()) {
     drained += SXFormat("; %llu payload bytes still waiting for a delay (alarm sends) are dropped",
                         static_cast<unsigned long long>(held));
@@ -538,7 +411,7 @@ int serve(Service& s) {
        .throughServerQueue = [q = s.environment.serverQueue()](
                                  std::function<void()> task) { q->async(std::move(task)); },
        .finish = [&s] { s.listener.stop(); }},
-      manager, s.options.drainTimeout, s.environment.platform().log);
+      manager, std::chrono::milliseconds(s.options.drainTimeoutMs), s.environment.platform().log);
   lifecycle.start();
   if (s.exporter.reload()) setStatusProviders(s);
   s.retention.start();
@@ -551,7 +424,7 @@ int serve(Service& s) {
 
 int main(int argc, char** argv) {
   Options options;
-  if (int status = parseOptions(argc, argv, options)) return status < 0 ? 0 : status;
+  if (auto status = parseOptions(argc, argv, options)) return *status;
 
   // Stores, preferences and notification files hold client payloads: no access for others.
   ::umask(0027);
@@ -606,7 +479,7 @@ int main(int argc, char** argv) {
   Exporter exporter(options, environment->platform(), log);
   SXUnixSocketListener listener(listenerOptions(options, *environment), log);
   Service service{options,  adapters, *environment, *delegate,
-                  listener, exporter, *retention, configFile};
+                  listener, exporter, *retention,   configFile};
   setStatusProviders(service);
   int status = serve(service);
   // After a drain everything is stored; tearing down the object graph would only repeat it.

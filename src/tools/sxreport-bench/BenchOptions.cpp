@@ -1,36 +1,24 @@
 #include "BenchOptions.h"
 
-#include <cerrno>
-#include <cstdio>
-#include <cstdlib>
+#include <limits>
 #include <sstream>
 
 #include "SXVersion.h"
+#include "common/SXCommandLine.h"
 #include "common/SXPaths.h"
 
 namespace {
 
-constexpr const char* kUsage =
-    "usage: sxreport-bench [options]\n"
-    "\n"
+constexpr const char* kDescription =
     "Drives sxreportingd with N client connections and reports messages per second, reply\n"
     "latency (p50/p99/max), daemon CPU seconds per million messages, daemon peak RSS and, for\n"
     "the message scenarios, the rows that reached tallyvane.db and fernreporting.db. With\n"
     "--baseline it runs the same clients against a MessagePack-RPC echo server and prints the\n"
-    "ratio daemon / baseline. Exit status 0 when every reply came and every row landed.\n"
-    "\n"
-    "target:\n"
-    "  --spawn                start a daemon for each scenario on a temporary socket and\n"
-    "                         state directory\n"
-    "  --daemon PATH          the daemon to spawn (default: sxreportingd beside this program)\n"
-    "  --keep                 keep the spawned daemons' directories (and their logs)\n"
-    "  --daemon-flag NAME=VALUE\n"
-    "                         pass '--NAME VALUE' to every spawned daemon (repeatable)\n"
-    "  --socket PATH          a running daemon (default: the service's socket, as sxreportctl)\n"
-    "  --state-dir DIR        that daemon's state directory, for the row counts\n"
-    "  --baseline             also run every scenario against the echo server\n"
-    "\n"
-    "scenarios (--scenario NAME[,NAME...], or all; default addressed):\n"
+    "ratio daemon / baseline. Exit status 0 when every reply came and every row landed, 2 after\n"
+    "a usage error.";
+
+constexpr const char* kScenarios =
+    "Scenarios:\n"
     "  addressed   pipelined sends to each client's own started session\n"
     "  broadcast   pipelined sends to every started session (each lands once per client)\n"
     "  standalone  sends to each client's own session, created but not started (telephony,\n"
@@ -40,43 +28,7 @@ constexpr const char* kUsage =
     "  idle        daemon RSS idle, after creating the sessions, and after they are gone\n"
     "  abuse       (not in all) hostile clients, one attack after another, then all at once,\n"
     "              while a well-behaved one times reporterID:valid:; checks the daemon's peak\n"
-    "              RSS, that latency and its log size against targets (exit 0 when missed)\n"
-    "\n"
-    "load:\n"
-    "  --clients N            client connections (default 4)\n"
-    "  --messages N           messages per client (default 20000; lifecycle: N/10 loops)\n"
-    "  --sessions N           sessions per client, the active one included; the others are\n"
-    "                         created and left idle (default 1)\n"
-    "  --window N             requests in flight per client (default 32)\n"
-    "  --stop-every N         addressed: stop and restart the session every N messages\n"
-    "                         (default never)\n"
-    "  --rss-samples N        daemon RSS samples during the run (default 10)\n"
-    "  --drain-timeout S      give up on missing rows after S seconds without a new one (60)\n"
-    "  --reply-timeout S      give up after S seconds without any reply (30)\n"
-    "  --attack-seconds S     abuse: how long each attack runs (default 4)\n"
-    "  --partial-connections N\n"
-    "                         abuse: connections left mid-request (default 1000)\n"
-    "\n"
-    "output:\n"
-    "  --json                 one JSON object on stdout\n"
-    "  -h, --help             this text\n"
-    "  --version              print the version\n";
-
-bool parseCount(const char* text, uint64_t& out) {
-  char* end = nullptr;
-  errno = 0;
-  unsigned long long value = std::strtoull(text, &end, 10);
-  if (errno != 0 || end == text || *end != '\0' || text[0] == '-') return false;
-  out = value;
-  return true;
-}
-
-bool parseSeconds(const char* text, double& out) {
-  char* end = nullptr;
-  errno = 0;
-  out = std::strtod(text, &end);
-  return errno == 0 && end != text && *end == '\0' && out > 0;
-}
+    "              RSS, that latency and its log size against targets (exit 0 when missed)";
 
 // "NAME=VALUE" or "--NAME=VALUE".
 bool parseDaemonFlag(const std::string& text, std::vector<DaemonFlag>& out) {
@@ -117,50 +69,25 @@ bool parseScenarios(const std::string& text, std::vector<ScenarioKind>& out) {
   return !out.empty();
 }
 
-int usageError(const std::string& what) {
-  std::fprintf(stderr, "sxreport-bench: %s\n(see sxreport-bench --help)\n", what.c_str());
-  return 2;
+template <typename T>
+void count(CLI::App& app, const char* name, T& value, T min, T max, const char* help) {
+  const std::string range =
+      max == std::numeric_limits<T>::max()
+          ? "a number from " + std::to_string(min) + " on"
+          : "a number from " + std::to_string(min) + " to " + std::to_string(max);
+  app.add_option(name, value, help)
+      ->type_name("N")
+      ->group("load")
+      ->transform(SXNumber<T>(min, max, range));
 }
 
-// Applies one option that takes a value. Returns false when the value is bad.
-bool applyValue(const std::string& arg, const char* value, BenchOptions& options) {
-  uint64_t count = 0;
-  if (arg == "--socket") {
-    options.socketPath = value;
-  } else if (arg == "--state-dir") {
-    options.stateDir = value;
-  } else if (arg == "--daemon") {
-    options.daemonPath = value;
-  } else if (arg == "--scenario") {
-    return parseScenarios(value, options.scenarios);
-  } else if (arg == "--drain-timeout") {
-    return parseSeconds(value, options.drainTimeoutSeconds);
-  } else if (arg == "--reply-timeout") {
-    return parseSeconds(value, options.replyTimeoutSeconds);
-  } else if (arg == "--attack-seconds") {
-    return parseSeconds(value, options.attackSeconds) && options.attackSeconds <= 3600;
-  } else if (arg == "--daemon-flag") {
-    return parseDaemonFlag(value, options.daemonFlags);
-  } else if (!parseCount(value, count)) {
-    return false;
-  } else if (arg == "--clients" && count >= 1 && count <= 4096) {
-    options.clients = count;
-  } else if (arg == "--messages" && count >= 1) {
-    options.messages = count;
-  } else if (arg == "--sessions" && count >= 1 && count < (1u << 24)) {
-    options.sessions = count;
-  } else if (arg == "--window" && count >= 1 && count <= 65536) {
-    options.window = count;
-  } else if (arg == "--stop-every") {
-    options.stopEvery = count;
-  } else if (arg == "--rss-samples" && count >= 1 && count <= 10000) {
-    options.rssSamples = count;
-  } else if (arg == "--partial-connections" && count <= 100'000) {
-    options.partialConnections = count;
-  } else {
-    return false;
-  }
-  return true;
+void seconds(CLI::App& app, const char* name, double& value, double max, const char* help) {
+  app.add_option(name, value, help)
+      ->type_name("S")
+      ->group("load")
+      ->transform(SXNumber<double>(std::numeric_limits<double>::min(), max,
+                                   max < 1e9 ? "a number of seconds above 0, at most 3600"
+                                             : "a positive number of seconds"));
 }
 
 }  // namespace
@@ -185,42 +112,84 @@ const char* ScenarioName(ScenarioKind kind) {
   return "?";
 }
 
-int ParseBenchOptions(int argc, char** argv, BenchOptions& options) {
-  for (int i = 1; i < argc; ++i) {
-    std::string arg = argv[i];
-    if (arg == "-h" || arg == "--help") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--version") {
-      std::printf("sxreport-bench %s\n", kSXVersion);
-      return 0;
-    }
-    if (arg == "--spawn") {
-      options.spawn = true;
-    } else if (arg == "--keep") {
-      options.keep = true;
-    } else if (arg == "--baseline") {
-      options.baseline = true;
-    } else if (arg == "--json") {
-      options.json = true;
-    } else if (arg.rfind("--", 0) != 0) {
-      return usageError("unexpected argument '" + arg + "'");
-    } else if (i + 1 >= argc) {
-      return usageError(arg + " needs a value");
-    } else if (!applyValue(arg, argv[i + 1], options)) {
-      return usageError("bad option " + arg + " " + argv[i + 1]);
-    } else {
-      ++i;
-    }
-  }
-  if (options.spawn && !options.socketPath.empty()) {
-    return usageError("--spawn and --socket exclude each other");
-  }
+std::optional<int> ParseBenchOptions(int argc, char** argv, BenchOptions& options) {
+  CLI::App app(kDescription, "sxreport-bench");
+  SXSetUpCommandLine(app, kSXVersion);
+  app.footer(kScenarios);
+  auto* spawn = app.add_flag("--spawn", options.spawn,
+                             "start a daemon for each scenario on a temporary socket and\n"
+                             "state directory")
+                    ->group("target");
+  app.add_option("--daemon", options.daemonPath,
+                 "the daemon to spawn (default: sxreportingd beside this program)")
+      ->type_name("PATH")
+      ->group("target");
+  app.add_flag("--keep", options.keep, "keep the spawned daemons' directories (and their logs)")
+      ->group("target");
+  app.add_option_function<std::vector<std::string>>(
+         "--daemon-flag",
+         [&options](const std::vector<std::string>& flags) {
+           for (const auto& flag : flags) {
+             if (!parseDaemonFlag(flag, options.daemonFlags)) {
+               throw CLI::ValidationError("--daemon-flag", "not NAME=VALUE: '" + flag + "'");
+             }
+           }
+         },
+         "pass '--NAME VALUE' to every spawned daemon (repeatable)")
+      ->type_name("NAME=VALUE")
+      ->allow_extra_args(false)
+      ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+      ->group("target");
+  app.add_option("--socket", options.socketPath,
+                 "a running daemon (default: the service's socket, as sxreportctl)")
+      ->type_name("PATH")
+      ->group("target")
+      ->excludes(spawn);
+  app.add_option("--state-dir", options.stateDir,
+                 "that daemon's state directory, for the row counts")
+      ->type_name("DIR")
+      ->group("target");
+  app.add_flag("--baseline", options.baseline, "also run every scenario against the echo server")
+      ->group("target");
+  app.add_option_function<std::string>(
+         "--scenario",
+         [&options](const std::string& text) {
+           if (!parseScenarios(text, options.scenarios)) {
+             throw CLI::ValidationError("--scenario", "not a list of scenarios: '" + text + "'");
+           }
+         },
+         "the scenarios below, or all of them but abuse\n(default addressed)")
+      ->type_name("NAME[,NAME...]")
+      ->group("load");
+  const uint64_t unlimited = std::numeric_limits<uint64_t>::max();
+  count<size_t>(app, "--clients", options.clients, 1, 4096, "client connections (default 4)");
+  count<uint64_t>(app, "--messages", options.messages, 1, unlimited,
+                  "messages per client (default 20000; lifecycle: N/10 loops)");
+  count<size_t>(app, "--sessions", options.sessions, 1, (1u << 24) - 1,
+                "sessions per client, the active one included; the others are\n"
+                "created and left idle (default 1)");
+  count<size_t>(app, "--window", options.window, 1, 65536,
+                "requests in flight per client (default 32)");
+  count<uint64_t>(app, "--stop-every", options.stopEvery, 0, unlimited,
+                  "addressed: stop and restart the session every N messages\n(default never)");
+  count<size_t>(app, "--rss-samples", options.rssSamples, 1, 10000,
+                "daemon RSS samples during the run (default 10)");
+  const double forever = std::numeric_limits<double>::max();
+  seconds(app, "--drain-timeout", options.drainTimeoutSeconds, forever,
+          "give up on missing rows after S seconds without a new one (60)");
+  seconds(app, "--reply-timeout", options.replyTimeoutSeconds, forever,
+          "give up after S seconds without any reply (30)");
+  seconds(app, "--attack-seconds", options.attackSeconds, 3600,
+          "abuse: how long each attack runs (default 4)");
+  count<size_t>(app, "--partial-connections", options.partialConnections, 0, 100'000,
+                "abuse: connections left mid-request (default 1000)");
+  app.add_flag("--json", options.json, "one JSON object on stdout")->group("output");
+
+  if (auto status = SXParseMainCommandLine(app, argc, argv)) return status;
   if (!options.spawn) {
     SXPaths paths = SXPaths::fromEnvironment();
     if (options.socketPath.empty()) options.socketPath = paths.socketPath;
     if (options.stateDir.empty()) options.stateDir = paths.stateDir;
   }
-  return -1;
+  return std::nullopt;
 }

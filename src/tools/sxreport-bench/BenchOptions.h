@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -40,6 +41,6 @@ struct BenchOptions {
 
 const char* ScenarioName(ScenarioKind kind);
 
-// Returns -1 to go on, else the exit status (0 after --help, 2 after a usage error, which it
-// has printed).
-int ParseBenchOptions(int argc, char** argv, BenchOptions& options);
+// Returns nothing to go on, else the exit status (0 after --help or --version, 2 after a usage
+// error), having printed what it says.
+std::optional<int> ParseBenchOptions(int argc, char** argv, BenchOptions& options);

@@ -58,10 +58,13 @@ bool SpawnedDaemon::start(const std::string& daemonPath, bool keepDirectory,
   for (size_t round = 0; round <= flags.size(); ++round) {
     if (launch(remaining, error)) return true;
     if (pid_ > 0) return false;  // it started but never became ready
-    // It complains before its usage text, so the whole (short) log is searched.
+    // "unknown option --NAME", or from daemons of the hand-written parser "bad option --NAME
+    // VALUE" before their usage text, so the whole (short) log is searched.
     std::string log = readFile(logPath());
     auto refused = std::find_if(remaining.begin(), remaining.end(), [&](const DaemonFlag& flag) {
-      return flag.optional && log.find("bad option " + flag.name + " ") != std::string::npos;
+      return flag.optional &&
+             (log.find("unknown option " + flag.name + "\n") != std::string::npos ||
+              log.find("bad option " + flag.name + " ") != std::string::npos);
     });
     if (refused == remaining.end()) return false;
     refused_.push_back(*refused);

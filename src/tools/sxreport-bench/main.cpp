@@ -102,7 +102,7 @@ TargetFigures runOnBaseline(const BenchScenario& scenario, const BenchOptions& o
 
 int main(int argc, char** argv) {
   BenchOptions options;
-  if (int status = ParseBenchOptions(argc, argv, options); status >= 0) return status;
+  if (auto status = ParseBenchOptions(argc, argv, options)) return *status;
   ::signal(SIGPIPE, SIG_IGN);
 
   bool ok = true;

@@ -2,7 +2,7 @@
 // Each returns the exit status (SXCtlExit), and prints what went wrong.
 #pragma once
 
-#include "client/SXCtlArgs.h"
+#include "CtlArgs.h"
 
 // `events`: the analytics events stored in <state-dir>/tallyvane.db.
 int SXCtlRunEvents(const SXCtlRequest& request, const SXPaths& paths);

@@ -2,7 +2,7 @@
 // printed for people or as JSON.
 #pragma once
 
-#include "client/SXCtlArgs.h"
+#include "CtlArgs.h"
 
 // Performs the request's operation on `client` (connected) and prints the outcome. Returns the
 // exit status (SXCtlExit).

@@ -3,10 +3,9 @@
 #include <iostream>
 #include <memory>
 
+#include "CtlArgs.h"
 #include "CtlLocal.h"
 #include "CtlRemote.h"
-#include "SXVersion.h"
-#include "client/SXCtlArgs.h"
 
 namespace {
 
@@ -46,23 +45,12 @@ int runChain(const std::vector<SXCtlRequest>& requests) {
 
 int main(int argc, char** argv) {
   try {
-    std::vector<SXCtlRequest> requests;
-    std::string error;
-    if (!SXCtlParseChain(std::vector<std::string>(argv + 1, argv + argc), requests, error)) {
-      std::cerr << "sxreportctl: " << error << "\n";
-      return kSXCtlUsage;
+    const SXCtlCommandLine line = SXCtlParseChain(std::vector<std::string>(argv + 1, argv + argc));
+    if (line.exitStatus) {
+      (*line.exitStatus == kSXCtlOK ? std::cout : std::cerr) << line.text;
+      return *line.exitStatus;
     }
-    for (const auto& request : requests) {
-      if (request.help) {
-        std::cout << SXCtlHelp(request.command);
-        return kSXCtlOK;
-      }
-      if (request.version) {
-        std::cout << "sxreportctl " << kSXVersion << "\n";
-        return kSXCtlOK;
-      }
-    }
-    return runChain(requests);
+    return runChain(line.requests);
   } catch (const std::exception& e) {
     std::cerr << "sxreportctl: " << e.what() << "\n";
     return kSXCtlLocalError;

@@ -1,5 +1,6 @@
-// The command line of sxreportctl: parsing and help texts, kept out of the tool itself so that
-// tests can reach them. Pure functions apart from reading the environment in SXCtlPaths.
+// The command line of sxreportctl: commands chained by `then`, their arguments and their help.
+// Kept out of main.cpp so that tests can reach it; pure apart from reading the environment in
+// SXCtlPaths and the clock for `events --since AGE`.
 #pragma once
 
 #include <optional>
@@ -10,9 +11,7 @@
 #include "sxreporting/client.h"
 
 struct SXCtlRequest {
-  std::string command;   // "create", "send", ...; empty when none was given
-  bool help = false;     // show the help of `command` (the overview when there is none)
-  bool version = false;  // print the version instead of running anything
+  std::string command;  // "create", "send", ...
 
   // Global options.
   std::optional<std::string> socketPath;
@@ -56,23 +55,25 @@ enum SXCtlExit : int {
 // The exit status of a call that did not reply (kSXCtlOK for one that did).
 SXCtlExit SXCtlExitFor(SXCallStatus status);
 
-// Parses the arguments that follow the program name. On failure returns false and says what
-// is wrong in `error`.
-bool SXCtlParse(const std::vector<std::string>& args, SXCtlRequest& request, std::string& error);
+// What a command line asks for: the requests to run in order, or else (`exitStatus` set) a
+// text to print and the status to exit with: the help or the version (kSXCtlOK, for standard
+// output), or a one-line usage error (kSXCtlUsage, for standard error).
+struct SXCtlCommandLine {
+  std::vector<SXCtlRequest> requests;
+  std::optional<int> exitStatus;
+  std::string text;
+};
 
-// Parses a chain of commands joined by the word "then" ("create 42 then start 42"), which
-// run in order on one connection: a session lives only as long as the connection that created
-// it. Global options anywhere apply to every command. After "--", "then" is an argument.
-bool SXCtlParseChain(const std::vector<std::string>& args, std::vector<SXCtlRequest>& requests,
-                     std::string& error);
+// Parses the arguments that follow the program name: commands joined by the word "then"
+// ("create 42 then start 42"), which run in order on one connection, since a session lives
+// only as long as the connection that created it. Global options anywhere apply to every
+// command. After "--", "then" is an argument.
+SXCtlCommandLine SXCtlParseChain(const std::vector<std::string>& args);
 
 // The time `text` names, in seconds since the epoch: a UTC date and time in ISO 8601
 // ("2026-11-25", "2026-11-25T06:30", "2026-11-25T06:30:15Z"; a space may stand for the T),
 // or a time before `now` ("90s", "10m", "2h", "3d"). On failure returns false and says why.
 bool SXCtlParseSince(const std::string& text, double now, double& since, std::string& error);
-
-// The help of `command`, or the overview for an empty or unknown command.
-std::string SXCtlHelp(const std::string& command);
 
 // How long the command waits for its reply: --timeout when given (0: no limit), else no limit
 // for `start` (its reply comes when the session stops) and 5 s for everything else.
