@@ -416,9 +416,8 @@ TEST_F(OtlpHttpExporterTest, ThreadExportsUntilStoppedAndStopCancelsThePost) {
 }
 
 TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
-  std::string error;
-  auto defaults = SXOtlpExportOptions::fromJson(SXValue::object(), error);
-  ASSERT_TRUE(defaults);
+  auto defaults = SXOtlpExportOptions::fromJson(SXValue::object());
+  ASSERT_TRUE(defaults.ok());
   EXPECT_EQ(defaults->endpoint, "http://127.0.0.1:4318/v1/logs");
   EXPECT_EQ(defaults->batchSize, 256u);
   EXPECT_EQ(defaults->maxBackoff, 60s);
@@ -431,9 +430,8 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
                                                 {"intervalMs", 50},
                                                 {"maxBackoffMs", 2000},
                                                 {"initialBackoffMs", 20},
-                                                {"headers", {{"X-Key", "v"}}}},
-                                               error);
-  ASSERT_TRUE(options) << error;
+                                                {"headers", {{"X-Key", "v"}}}});
+  ASSERT_TRUE(options.ok()) << options.error();
   EXPECT_EQ(options->endpoint, "https://c:4318/v1/logs");
   EXPECT_EQ(options->batchSize, 10u);
   EXPECT_EQ(options->interval, 50ms);
@@ -447,9 +445,9 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
         R"({"compression": "zstd"})", R"({"encoding": "grpc"})",
         R"({"resourceAttributes": {"a": 1}})"}) {
     SCOPED_TRACE(bad);
-    error.clear();
-    EXPECT_FALSE(SXOtlpExportOptions::fromJson(SXValue::parse(bad), error));
-    EXPECT_FALSE(error.empty());
+    auto refused = SXOtlpExportOptions::fromJson(SXValue::parse(bad));
+    EXPECT_FALSE(refused.ok());
+    EXPECT_FALSE(refused.error().empty());
   }
 }
 
@@ -498,10 +496,8 @@ TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.file);
-    std::string error;
-    auto options =
-        SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment, error);
-    ASSERT_TRUE(options) << error;
+    auto options = SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment);
+    ASSERT_TRUE(options.ok()) << options.error();
     row.check(*options);
   }
   for (const auto& [name, value] : std::vector<std::pair<std::string, std::string>>{
@@ -511,9 +507,9 @@ TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
            {"OTEL_EXPORTER_OTLP_COMPRESSION", "br"},
            {"OTEL_EXPORTER_OTLP_ENDPOINT", "c:4318"}}) {
     SCOPED_TRACE(name);
-    std::string error;
-    EXPECT_FALSE(SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}}, error));
-    EXPECT_TRUE(error.starts_with("environment: ")) << error;
+    auto refused = SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}});
+    EXPECT_FALSE(refused.ok());
+    EXPECT_TRUE(refused.error().starts_with("environment: ")) << refused.error();
   }
 }
 

@@ -160,10 +160,10 @@ TEST_F(SqliteTallyvaneTest, ReadEventsFiltersByNameAndKeepsTheNewest) {
   EXPECT_EQ(names(SXSqliteTallyvane::readEvents(db_, std::nullopt, 1)),
             std::vector<std::string>{"a.three"});
 
-  std::string error;
-  EXPECT_TRUE(
-      SXSqliteTallyvane::readEvents(dir_.file("absent.db"), std::nullopt, 0, error).empty());
-  EXPECT_NE(error.find("absent.db"), std::string::npos) << error;
+  auto absent =
+      SXSqliteTallyvane::readEvents(dir_.file("absent.db"), std::nullopt, 0, std::nullopt);
+  EXPECT_FALSE(absent.ok());
+  EXPECT_NE(absent.error().find("absent.db"), std::string::npos) << absent.error();
 }
 
 TEST_F(SqliteTallyvaneTest, AStoreThatCannotBeOpenedLogsAndDropsEvents) {

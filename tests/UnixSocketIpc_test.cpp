@@ -81,8 +81,8 @@ class ServedListener {
       : path_(dir_.file("s")) {
     options.socketPath = path_;
     listener_ = std::make_unique<SXUnixSocketListener>(std::move(options), nullptr);
-    std::string error;
-    EXPECT_TRUE(listener_->open(error)) << error;
+    SXStatus opened = listener_->open();
+    EXPECT_TRUE(opened.ok()) << opened.error();
     listener_->setDelegate(std::make_shared<ExportingDelegate>(std::move(object)));
     thread_ = std::thread([this] { listener_->resume(); });
   }

@@ -203,20 +203,15 @@ SXEnvironment ProcessEnvironment() {
 
 }  // namespace
 
-std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& section,
-                                                                 std::string& error) {
+SXResult<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& section) {
   static const char* const kKnown[] = {"endpoint",      "headers",           "batchSize",
                                        "maxBatchBytes", "intervalMs",        "initialBackoffMs",
                                        "maxBackoffMs",  "timeoutMs",         "compression",
                                        "encoding",      "resourceAttributes"};
-  if (!section.is_object()) {
-    error = "must be an object";
-    return std::nullopt;
-  }
+  if (!section.is_object()) return SXFailure("must be an object");
   for (const auto& [key, value] : section.items()) {
     if (std::find(std::begin(kKnown), std::end(kKnown), key) == std::end(kKnown)) {
-      error = SXFormat("unknown key \"%@\"", key);
-      return std::nullopt;
+      return SXFailure(SXFormat("unknown key \"%@\"", key));
     }
   }
   SXOtlpExportOptions options;
@@ -237,30 +232,25 @@ std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromJson(const SXValue& 
   if (!bad && options.maxBackoff < options.initialBackoff) {
     bad = "\"maxBackoffMs\" must not be below \"initialBackoffMs\"";
   }
-  if (bad) {
-    error = *bad;
-    return std::nullopt;
-  }
+  if (bad) return SXFailure(*bad);
   options.batchSize = size_t(batchSize);
   options.maxBatchBytes = size_t(maxBytes);
   options.encoding = protobuf ? Encoding::kProtobuf : Encoding::kJson;
   return options;
 }
 
-std::optional<SXOtlpExportOptions> SXOtlpExportOptions::fromSources(
-    const SXValue& section, const SXEnvironment& environment, std::string& error) {
+SXResult<SXOtlpExportOptions> SXOtlpExportOptions::fromSources(const SXValue& section,
+                                                               const SXEnvironment& environment) {
   SXValue fromEnvironment;
   if (auto bad = EnvironmentSection(environment, fromEnvironment)) {
-    error = "environment: " + *bad;
-    return std::nullopt;
+    return SXFailure("environment: " + *bad);
   }
   // Checked alone first, so that an error says where the bad value came from.
-  if (!fromJson(fromEnvironment, error)) {
-    error = "environment: " + error;
-    return std::nullopt;
+  if (auto alone = fromJson(fromEnvironment); !alone.ok()) {
+    return SXFailure("environment: " + alone.error());
   }
-  if (!section.is_object()) return fromJson(section, error);
-  return fromJson(Merged(std::move(fromEnvironment), section), error);
+  if (!section.is_object()) return fromJson(section);
+  return fromJson(Merged(std::move(fromEnvironment), section));
 }
 
 std::optional<SXOtlpExportOptions> SXOtlpExportOptions::load(
@@ -272,11 +262,12 @@ std::optional<SXOtlpExportOptions> SXOtlpExportOptions::load(
   SXValue config = SXValue::parse(in, nullptr, false);
   SXValue section = SXValue::object();  // no "otlp-http" object: every default
   if (config.is_object() && config.contains(kBackendName)) section = config[kBackendName];
-  std::string error;
-  auto options = fromSources(section, ProcessEnvironment(), error);
-  if (!options) {
+  auto options = fromSources(section, ProcessEnvironment());
+  if (!options.ok()) {
     SXLOG(log, nullptr, SXLogLevel::kError,
-          "%@: \"otlp-http\": %@; not exporting (messages stay in the spool)", configPath, error);
+          "%@: \"otlp-http\": %@; not exporting (messages stay in the spool)", configPath,
+          options.error());
+    return std::nullopt;
   }
-  return options;
+  return std::move(*options);
 }
