@@ -116,8 +116,11 @@ int SXInotifyNotifications::registerDispatch(const std::string& name, int& token
 
 int SXInotifyNotifications::post(const std::string& name) { return PostTo(directory_, name); }
 
-int SXInotifyNotifications::postIn(const std::string& runtimeDir, const std::string& name) {
-  return PostTo(runtimeDir + "/notify", name);
+SXStatus SXInotifyNotifications::postIn(const std::string& runtimeDir, const std::string& name) {
+  if (int error = PostTo(runtimeDir + "/notify", name)) {
+    return SXErrnoStatus("cannot post " + name, error);
+  }
+  return {};
 }
 
 void SXInotifyNotifications::watch() {

@@ -1,7 +1,6 @@
 #include "CtlLocal.h"
 
 #include <cstdio>
-#include <cstring>
 #include <ctime>
 #include <filesystem>
 #include <iostream>
@@ -196,8 +195,9 @@ int SXCtlRunDefaults(const SXCtlRequest& r, const SXPaths& paths) {
 }
 
 int SXCtlRunNotify(const SXCtlRequest& r, const SXPaths& paths) {
-  if (int error = SXInotifyNotifications::postIn(paths.runtimeDir, r.notificationName)) {
-    return fail("notify: cannot post " + r.notificationName + ": " + std::strerror(error));
+  if (SXStatus posted = SXInotifyNotifications::postIn(paths.runtimeDir, r.notificationName);
+      !posted.ok()) {
+    return fail("notify: " + posted.error());
   }
   return 0;
 }
