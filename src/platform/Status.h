@@ -5,11 +5,12 @@
 // The text is what callers log or hand to a client as it is, so it is the whole message
 // ("<context>: <why>"); callers add their own context in front when they need to.
 //
-// Neither converts to bool: a failure that read as true (the optional<string> these replace)
-// and a success that reads as true (std::expected) are both habits; ok() leaves no doubt.
+// Neither converts to bool: the optional<string> these replace read true on failure,
+// std::expected reads true on success; ok() leaves no doubt.
 // Both are [[nodiscard]], so that a failure cannot be dropped without saying so ((void)).
 #pragma once
 
+#include <cassert>
 #include <cstring>
 #include <optional>
 #include <string>
@@ -50,9 +51,12 @@ inline SXStatus SXErrnoStatus(const std::string& context, int errnum) {
 template <typename T>
 class [[nodiscard]] SXResult {
  public:
-  SXResult(T value) : value_(std::move(value)) {}  // NOLINT: a value converts, as with expected
+  // Both convert, as with std::expected, so that a function returns either as it is.
+  SXResult(T value) : value_(std::in_place_index<0>, std::move(value)) {}  // NOLINT
   // A failure; `failure` must not be ok.
-  SXResult(SXStatus failure) : value_(std::move(failure)) {}  // NOLINT
+  SXResult(SXStatus failure) : value_(std::in_place_index<1>, std::move(failure)) {  // NOLINT
+    assert(!std::get<1>(value_).ok());
+  }
 
   bool ok() const { return value_.index() == 0; }
   // The value; only when ok().
