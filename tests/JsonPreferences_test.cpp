@@ -86,10 +86,10 @@ TEST_F(JsonPreferencesTest, MalformedFileReadsEmptyWithOneErrorPerRead) {
 
   // A write leaves the broken file as it is (it may be an administrator's typo); once the file
   // is gone, writes work again.
-  EXPECT_NE(prefs->setValue(kDomain, "a", SXValue(2)), std::nullopt);
+  EXPECT_FALSE(prefs->setValue(kDomain, "a", SXValue(2)).ok());
   EXPECT_EQ(SXTestReadFile(domainFile()), "{\"a\": 1");
   fs::remove(domainFile());
-  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(2)), std::nullopt);
+  ASSERT_TRUE(prefs->setValue(kDomain, "a", SXValue(2)).ok());
   size_t before = errorLines();
   EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", 2}}));
   EXPECT_EQ(errorLines(), before);
@@ -101,7 +101,7 @@ TEST_F(JsonPreferencesTest, RefusesDomainsThatAreNotFileNames) {
   for (std::string domain :
        {std::string(""), std::string("."), std::string(".."), std::string("../secret"),
         std::string("a/b"), std::string("/etc"), std::string("a\0b", 3)}) {
-    EXPECT_NE(prefs->setValue(domain, "a", SXValue(2)), std::nullopt) << domain;
+    EXPECT_FALSE(prefs->setValue(domain, "a", SXValue(2)).ok()) << domain;
     EXPECT_EQ(prefs->copyValue(domain, "a"), std::nullopt) << domain;
     EXPECT_EQ(prefs->copyDomain(domain), SXValue::object()) << domain;
   }
@@ -111,22 +111,22 @@ TEST_F(JsonPreferencesTest, RefusesDomainsThatAreNotFileNames) {
 
 TEST_F(JsonPreferencesTest, FailedWriteLeavesFileAsItWas) {
   auto prefs = open();
-  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(1)), std::nullopt);
-  EXPECT_NE(prefs->setValue(kDomain, "b", SXValue("\xff\xfe")), std::nullopt);
-  EXPECT_NE(prefs->setValue(kDomain, "b", SXValue(SXValue::value_t::discarded)), std::nullopt);
+  ASSERT_TRUE(prefs->setValue(kDomain, "a", SXValue(1)).ok());
+  EXPECT_FALSE(prefs->setValue(kDomain, "b", SXValue("\xff\xfe")).ok());
+  EXPECT_FALSE(prefs->setValue(kDomain, "b", SXValue(SXValue::value_t::discarded)).ok());
   EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", 1}}));
 
   // An unwritable place for the store is an error, not a crash.
   writeFile(root_ + "/file", "");
   SXJsonPreferences blocked(root_ + "/file/preferences", log_);
-  EXPECT_NE(blocked.setValue(kDomain, "a", SXValue(1)), std::nullopt);
+  EXPECT_FALSE(blocked.setValue(kDomain, "a", SXValue(1)).ok());
 }
 
 TEST_F(JsonPreferencesTest, ReplacingAKeyKeepsTheOthersAndLeavesNoTemporaries) {
   auto prefs = open();
-  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue(1)), std::nullopt);
-  ASSERT_EQ(prefs->setValue(kDomain, "b", SXValue::object({{"nested", {1, 2}}})), std::nullopt);
-  ASSERT_EQ(prefs->setValue(kDomain, "a", SXValue("one")), std::nullopt);
+  ASSERT_TRUE(prefs->setValue(kDomain, "a", SXValue(1)).ok());
+  ASSERT_TRUE(prefs->setValue(kDomain, "b", SXValue::object({{"nested", {1, 2}}})).ok());
+  ASSERT_TRUE(prefs->setValue(kDomain, "a", SXValue("one")).ok());
   EXPECT_EQ(prefs->copyDomain(kDomain), SXValue({{"a", "one"}, {"b", {{"nested", {1, 2}}}}}));
   for (const auto& entry : fs::directory_iterator(configDir_ + "/preferences")) {
     std::string name = entry.path().filename();
@@ -140,7 +140,7 @@ TEST_F(JsonPreferencesTest, ReplacingAKeyKeepsTheOthersAndLeavesNoTemporaries) {
 // wrote after it would drop the other's keys.
 void WriteKeys(SXPreferences& prefs, const std::string& prefix, int count) {
   for (int i = 0; i < count; ++i) {
-    if (prefs.setValue(kDomain, prefix + std::to_string(i), SXValue(i))) return;
+    if (!prefs.setValue(kDomain, prefix + std::to_string(i), SXValue(i)).ok()) return;
   }
 }
 

@@ -360,9 +360,8 @@ TEST_F(OtlpHttpExporterTest, ThreadExportsUntilStoppedAndStopCancelsThePost) {
 }
 
 TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
-  std::string error;
-  auto defaults = SXOtlpExportOptions::fromJson(SXValue::object(), error);
-  ASSERT_TRUE(defaults);
+  auto defaults = SXOtlpExportOptions::fromJson(SXValue::object());
+  ASSERT_TRUE(defaults.ok());
   EXPECT_EQ(defaults->endpoint, "http://127.0.0.1:4318/v1/logs");
   EXPECT_EQ(defaults->batchSize, 256u);
   EXPECT_EQ(defaults->maxBackoff, 60s);
@@ -378,9 +377,9 @@ TEST(OtlpExportOptions, ReadsTheOtlpHttpObject) {
         R"({"compression": "zstd"})", R"({"encoding": "grpc"})",
         R"({"resourceAttributes": {"a": 1}})"}) {
     SCOPED_TRACE(bad);
-    error.clear();
-    EXPECT_FALSE(SXOtlpExportOptions::fromJson(SXValue::parse(bad), error));
-    EXPECT_FALSE(error.empty());
+    auto refused = SXOtlpExportOptions::fromJson(SXValue::parse(bad));
+    EXPECT_FALSE(refused.ok());
+    EXPECT_FALSE(refused.error().empty());
   }
 }
 
@@ -429,10 +428,8 @@ TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.file);
-    std::string error;
-    auto options =
-        SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment, error);
-    ASSERT_TRUE(options) << error;
+    auto options = SXOtlpExportOptions::fromSources(SXValue::parse(row.file), row.environment);
+    ASSERT_TRUE(options.ok()) << options.error();
     row.check(*options);
   }
   for (const auto& [name, value] : std::vector<std::pair<std::string, std::string>>{
@@ -442,9 +439,9 @@ TEST(OtlpExportOptions, EnvironmentFillsWhatTheFileLeavesOut) {
            {"OTEL_EXPORTER_OTLP_COMPRESSION", "br"},
            {"OTEL_EXPORTER_OTLP_ENDPOINT", "c:4318"}}) {
     SCOPED_TRACE(name);
-    std::string error;
-    EXPECT_FALSE(SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}}, error));
-    EXPECT_TRUE(error.starts_with("environment: ")) << error;
+    auto refused = SXOtlpExportOptions::fromSources(SXValue::object(), {{name, value}});
+    EXPECT_FALSE(refused.ok());
+    EXPECT_TRUE(refused.error().starts_with("environment: ")) << refused.error();
   }
 }
 

@@ -21,11 +21,11 @@ namespace {
 constexpr double kDay = 86400;
 
 void Exec(const std::string& db, const std::string& sql) {
-  std::string error;
   auto connection = SXSqliteConnection::open(db, SXSqliteConnection::Mode::kReadWrite,
-                                             std::chrono::seconds(5), "", error);
-  ASSERT_TRUE(connection) << error;
-  EXPECT_EQ(connection->exec(sql), std::nullopt);
+                                             std::chrono::seconds(5), "");
+  ASSERT_TRUE(connection.ok()) << connection.error();
+  SXStatus done = (*connection)->exec(sql);
+  EXPECT_TRUE(done.ok()) << done.error();
 }
 
 std::shared_ptr<SXRetention> Retention(const SXTestTempDir& dir, SXRetentionPolicy policy,
@@ -87,13 +87,12 @@ TEST(RetentionPolicy, TheSectionSetsWhatItNamesAndRefusesAnythingElse) {
   };
   for (const PolicyCase& c : cases) {
     SCOPED_TRACE(c.json);
-    std::string error;
-    auto policy = SXRetentionPolicy::fromJson(SXValue::parse(c.json), error);
-    EXPECT_EQ(error, c.error);
-    EXPECT_EQ(policy.has_value(), *c.error == '\0');
+    auto policy = SXRetentionPolicy::fromJson(SXValue::parse(c.json));
+    EXPECT_EQ(policy.error(), c.error);
+    EXPECT_EQ(policy.ok(), *c.error == '\0');
     SXRetentionPolicy expected;
     c.expected(expected);
-    if (policy) {
+    if (policy.ok()) {
       EXPECT_EQ(*policy, expected);
     }
   }
@@ -221,12 +220,12 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
   EXPECT_EQ(count, last - first + 1);  // and only the oldest went
   EXPECT_GT(first, 20);                // the aged rows among them
   EXPECT_GT(count, 100);               // not more than the cap needs
-  std::string error;
   auto connection = SXSqliteConnection::open(db, SXSqliteConnection::Mode::kReadOnly,
-                                             std::chrono::seconds(5), "", error);
-  ASSERT_TRUE(connection) << error;
-  uint64_t used = 0;
-  EXPECT_EQ(connection->usedBytes(used), std::nullopt);
+                                             std::chrono::seconds(5), "");
+  ASSERT_TRUE(connection.ok()) << connection.error();
+  auto usedBytes = (*connection)->usedBytes();
+  ASSERT_TRUE(usedBytes.ok()) << usedBytes.error();
+  const uint64_t used = *usedBytes;
   EXPECT_LE(used, kCap);
   EXPECT_EQ(retention->counters()["rows_pruned"][store.name], written - count);
   EXPECT_EQ(retention->gauges()["store_bytes"][store.name], used);
@@ -282,7 +281,7 @@ TEST(RetentionSpool, MessagesGoOnceTheExporterHasThemAndSessionsOnceNoMessageNee
          "UPDATE flushes SET time = time - 40 * 86400 WHERE id = 1");
     auto fresh = spool.openSession({}, {}, {});
     SXOtlpSpoolReader reader(db);
-    ASSERT_EQ(reader.advance(c.cursor), std::nullopt);
+    ASSERT_TRUE(reader.advance(c.cursor).ok());
 
     Retention(dir, SXRetentionPolicy(), c.exported)->runPass();
 

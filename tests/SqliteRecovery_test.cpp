@@ -93,16 +93,20 @@ TEST(SqliteRecovery, OnlyDamageIsMovedAsidePermissionsProblemsAreNot) {
 TEST(SqliteRecovery, AStoreThisUserCannotWriteIsLeftInPlaceAndItsRowsCounted) {
   SXTestTempDir dir;
   std::string path = dir.file("tallyvane.db");
-  std::string error, recovered;
-  ASSERT_TRUE(SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered)) << error;
+  std::string recovered;
+  auto made = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+  ASSERT_TRUE(made.ok()) << made.error();
+  made->reset();  // closed before its mode changes
   for (const char* extra : {"-wal", "-shm"}) std::filesystem::remove(path + extra);
   UnwritableFile unwritable(path);
   if (!unwritable.ok()) GTEST_SKIP() << "cannot make a file unwritable here";
 
-  EXPECT_FALSE(SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered));
+  auto refused = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+  EXPECT_FALSE(refused.ok());
   EXPECT_TRUE(recovered.empty()) << recovered;
-  EXPECT_NE(error.find("cannot open " + path + ": not writable by this user"), std::string::npos)
-      << error;
+  EXPECT_NE(refused.error().find("cannot open " + path + ": not writable by this user"),
+            std::string::npos)
+      << refused.error();
   EXPECT_EQ(entries(dir.file("")), std::vector<std::string>{"tallyvane.db"});
 
   auto log = std::make_shared<FakeLog>();
@@ -122,13 +126,13 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
   std::string path = dir.file("store.db");
   std::ofstream(path, std::ios::binary) << std::string(4096, 'G');
   std::ofstream(path + "-wal", std::ios::binary) << "stale log";
-  std::string error, recovered;
-  auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered);
-  ASSERT_TRUE(db) << error;
+  std::string recovered;
+  auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+  ASSERT_TRUE(db.ok()) << db.error();
   EXPECT_NE(recovered.find("cannot open " + path), std::string::npos) << recovered;
   EXPECT_NE(recovered.find("file is not a database"), std::string::npos) << recovered;
   EXPECT_NE(recovered.find(" and started a new store"), std::string::npos) << recovered;
-  EXPECT_FALSE(db->exec("INSERT INTO t VALUES (1)"));
+  EXPECT_TRUE((*db)->exec("INSERT INTO t VALUES (1)").ok());
 
   auto names = entries(dir.file(""));
   auto aside = std::find_if(names.begin(), names.end(), [](const std::string& n) {
@@ -141,12 +145,13 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
   EXPECT_NE(recovered.find(dir.file(*aside)), std::string::npos);
 
   // A second damage the same second gets a name of its own.
-  db.reset();
+  db->reset();
   std::filesystem::remove(path + "-wal");
   std::filesystem::remove(path + "-shm");
   std::ofstream(path, std::ios::binary | std::ios::trunc) << std::string(4096, 'H');
   recovered.clear();
-  ASSERT_TRUE(SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered)) << error;
+  auto again = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+  ASSERT_TRUE(again.ok()) << again.error();
   EXPECT_FALSE(recovered.empty());
   size_t moved = 0;
   for (const auto& n : entries(dir.file(""))) {
@@ -158,22 +163,23 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
 
 TEST(SqliteRecovery, WhatIsNotTheFilesFaultIsNeverMovedAside) {
   SXTestTempDir dir;
-  std::string error, recovered;
+  std::string recovered;
   // A missing directory: nothing to move, the open just fails.
-  EXPECT_FALSE(
-      SXSqliteConnection::openOrRecover(dir.file("none/store.db"), 1s, kSchema, error, recovered));
+  auto missing =
+      SXSqliteConnection::openOrRecover(dir.file("none/store.db"), 1s, kSchema, recovered);
+  EXPECT_FALSE(missing.ok());
   EXPECT_TRUE(recovered.empty());
-  EXPECT_NE(error.find("cannot open"), std::string::npos);
+  EXPECT_NE(missing.error().find("cannot open"), std::string::npos);
 
   // A healthy store opens as it is, even while another connection holds its write lock.
   std::string path = dir.file("store.db");
   {
-    auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered);
-    ASSERT_TRUE(db) << error;
-    ASSERT_FALSE(db->exec("INSERT INTO t VALUES (7)"));
+    auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+    ASSERT_TRUE(db.ok()) << db.error();
+    ASSERT_TRUE((*db)->exec("INSERT INTO t VALUES (7)").ok());
   }
   SXTestWriteLock lock(path);
-  auto db = SXSqliteConnection::openOrRecover(path, 100ms, kSchema, error, recovered);
+  auto db = SXSqliteConnection::openOrRecover(path, 100ms, kSchema, recovered);
   EXPECT_TRUE(recovered.empty()) << recovered;
   EXPECT_EQ(entries(dir.file("")).size(), 3u);  // store.db, -wal, -shm
   EXPECT_EQ(SXTestQuery(path, "SELECT x FROM t").size(), 1u);
@@ -189,21 +195,21 @@ TEST(SqliteRecovery, AStoreMadeWithoutIncrementalVacuumIsConvertedOnceByItsOwner
             SQLITE_OK);
   sqlite3_close(raw);
   auto autoVacuum = [&](SXSqliteConnection& db) {
-    int64_t mode = -1;
-    EXPECT_EQ(db.queryInt("PRAGMA auto_vacuum", {}, mode), std::nullopt);
-    return mode;
+    auto mode = db.queryInt("PRAGMA auto_vacuum", {});
+    EXPECT_TRUE(mode.ok()) << mode.error();
+    return mode.ok() ? *mode : -1;
   };
-  std::string error, recovered;
+  std::string recovered;
   // Other connections never convert: the copy would hold the store's writers up.
-  auto other = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadWrite, 1s, "", error);
-  ASSERT_TRUE(other) << error;
-  EXPECT_EQ(autoVacuum(*other), 0);
-  other.reset();
-  auto owner = SXSqliteConnection::openOrRecover(path, 1s, kSchema, error, recovered);
-  ASSERT_TRUE(owner) << error;
-  EXPECT_EQ(autoVacuum(*owner), 2);  // incremental
+  auto other = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadWrite, 1s, "");
+  ASSERT_TRUE(other.ok()) << other.error();
+  EXPECT_EQ(autoVacuum(**other), 0);
+  other->reset();
+  auto owner = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
+  ASSERT_TRUE(owner.ok()) << owner.error();
+  EXPECT_EQ(autoVacuum(**owner), 2);  // incremental
   EXPECT_EQ(recovered, "");
-  int64_t rows = 0;
-  EXPECT_EQ(owner->queryInt("SELECT COUNT(*) FROM t", {}, rows), std::nullopt);
-  EXPECT_EQ(rows, 2);
+  auto rows = (*owner)->queryInt("SELECT COUNT(*) FROM t", {});
+  ASSERT_TRUE(rows.ok()) << rows.error();
+  EXPECT_EQ(*rows, 2);
 }

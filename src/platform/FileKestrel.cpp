@@ -276,7 +276,7 @@ std::optional<int64_t> SXFileKestrel::readCounter(
     // A channel that went away since the subscription is simply not sampled.
     if (errno != ENOENT && errno != ENOTDIR) {
       SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot read kestrel channel: %s",
-            SXPosixError(path, errno));
+            SXErrnoText(path, errno));
     }
     return std::nullopt;
   }
@@ -289,7 +289,7 @@ std::optional<int64_t> SXFileKestrel::readCounter(
   ssize_t length = readUpTo(fd.get(), buffer);
   if (length < 0) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot read kestrel channel: %s",
-          SXPosixError(path, errno));
+          SXErrnoText(path, errno));
     return std::nullopt;
   }
   auto value = static_cast<size_t>(length) <= kMaxCounterBytes

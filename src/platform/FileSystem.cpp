@@ -49,17 +49,13 @@ SXScopedFd::~SXScopedFd() {
   if (fd_ >= 0) ::close(fd_);
 }
 
-std::string SXPosixError(const std::string& context, int errnum) {
-  return context + ": " + std::strerror(errnum);
-}
-
 std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string& path,
                                                               unsigned mode) {
-  if (path.empty()) return SXPosixError(path, ENOENT);
+  if (path.empty()) return SXErrnoText(path, ENOENT);
   // Each component is made and opened relative to its parent's descriptor, so a directory made
   // here and swapped for a symlink before its child is made is never followed.
   SXScopedFd parent(::open(path[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
-  if (parent.get() < 0) return SXPosixError(path[0] == '/' ? "/" : ".", errno);
+  if (parent.get() < 0) return SXErrnoText(path[0] == '/' ? "/" : ".", errno);
   int dir = parent.get();
   std::optional<SXScopedFd> child;
   size_t start = 0;
@@ -72,11 +68,11 @@ std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string&
     if (name.empty() || name == ".") continue;
     // The umask narrows `mode`: the daemon's directories are never more open than it allows.
     bool made = ::mkdirat(dir, name.c_str(), static_cast<mode_t>(mode)) == 0;
-    if (!made && errno != EEXIST) return SXPosixError(partial, errno);
+    if (!made && errno != EEXIST) return SXErrnoText(partial, errno);
     // A directory that was there already may be a symlink the administrator set up.
     int next =
         ::openat(dir, name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC | (made ? O_NOFOLLOW : 0));
-    if (next < 0) return SXPosixError(partial, errno);
+    if (next < 0) return SXErrnoText(partial, errno);
     child.emplace(next);
     dir = child->get();
   }
@@ -100,7 +96,7 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
   size_t slash = path.rfind('/');
   std::string directory = slash == std::string::npos ? "." : path.substr(0, slash ? slash : 1);
   std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-  if (name.empty() || name == "." || name == "..") return SXPosixError(path, EINVAL);
+  if (name.empty() || name == "." || name == "..") return SXErrnoText(path, EINVAL);
   // Everything below happens relative to this descriptor: a symlink put in the directory's
   // place, before or during the write, cannot move the file elsewhere.
   SXScopedFd dir(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
@@ -110,7 +106,7 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
     if (::lstat(directory.c_str(), &st) == 0 && S_ISLNK(st.st_mode)) {
       return directory + ": is a symbolic link, not followed";
     }
-    return SXPosixError(directory, err);
+    return SXErrnoText(directory, err);
   }
   // A fresh name that nobody can plant anything at ahead of time; O_EXCL refuses whatever is
   // there all the same, a symlink included.
@@ -122,13 +118,13 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
                   0640);
     if (fd < 0 && errno != EEXIST) break;
   }
-  if (fd < 0) return SXPosixError(directory + "/" + temp, errno);
+  if (fd < 0) return SXErrnoText(directory + "/" + temp, errno);
   int err = writeAll(fd, contents);
   if (err == 0 && ::fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && err == 0) err = errno;
   if (err != 0) {
     ::unlinkat(dir.get(), temp.c_str(), 0);
-    return SXPosixError(directory + "/" + temp, err);
+    return SXErrnoText(directory + "/" + temp, err);
   }
   // rename replaces a symlink at `name` instead of writing through it; link refuses anything
   // at `name`, a symlink included.
@@ -140,6 +136,6 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
     *taken = true;
     return std::nullopt;
   }
-  if (err != 0) return SXPosixError(path, err);
+  if (err != 0) return SXErrnoText(path, err);
   return std::nullopt;
 }

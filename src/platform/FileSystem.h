@@ -4,6 +4,8 @@
 #include <optional>
 #include <string>
 
+#include "platform/Status.h"
+
 class SXFileSystem {
  public:
   virtual ~SXFileSystem() = default;
@@ -51,6 +53,3 @@ class SXScopedFd {
  private:
   int fd_;
 };
-
-// "<context>: <strerror(errno)>", the one place errno becomes text.
-std::string SXPosixError(const std::string& context, int errnum);

@@ -9,6 +9,8 @@
 #include <ctime>
 #include <type_traits>
 
+#include "platform/Status.h"
+
 namespace {
 
 constexpr size_t kKeptResponseBytes = 4096;
@@ -29,9 +31,9 @@ struct CurlApi {
   decltype(&curl_slist_free_all) slistFreeAll = nullptr;
 };
 
-// The loaded library, or nullptr with `why`. Loads and initialises once (curl_global_init is
-// not thread-safe); the library stays loaded for the life of the process.
-const CurlApi* Curl(std::string& why) {
+// The loaded library. Loads and initialises once (curl_global_init is not thread-safe); the
+// library stays loaded for the life of the process.
+SXResult<const CurlApi*> Curl() {
   static std::string failure;
   static const CurlApi* api = []() -> const CurlApi* {
     void* library = ::dlopen("libcurl.so.4", RTLD_NOW | RTLD_LOCAL);
@@ -64,7 +66,7 @@ const CurlApi* Curl(std::string& why) {
     loaded.globalInit(CURL_GLOBAL_DEFAULT);  // a failure shows up as a failing easyInit
     return &loaded;
   }();
-  if (!api) why = failure;
+  if (!api) return SXFailure(failure);
   return api;
 }
 
@@ -173,9 +175,12 @@ SXHttpResult SXCurlHttpPost::post(const SXHttpRequest& request) {
     return result;
   }
   if (!handle_) {
-    const CurlApi* api = Curl(result.error);
-    if (!api) return result;
-    handle_ = std::make_unique<Handle>(*api);
+    SXResult<const CurlApi*> api = Curl();
+    if (!api.ok()) {
+      result.error = api.error();
+      return result;
+    }
+    handle_ = std::make_unique<Handle>(**api);
   }
   const CurlApi& api = handle_->api;
   if (!handle_->curl) handle_->curl.reset(api.easyInit());

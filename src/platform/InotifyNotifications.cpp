@@ -56,7 +56,7 @@ SXInotifyNotifications::SXInotifyNotifications(std::string runtimeDir,
   setupError_ = setUp();
   if (setupError_ != 0) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot watch notifications: %s",
-          SXPosixError(directory_, setupError_));
+          SXErrnoText(directory_, setupError_));
     CloseIfOpen(inotifyFd_);
     CloseIfOpen(wakeFd_);
   }
@@ -116,8 +116,11 @@ int SXInotifyNotifications::registerDispatch(const std::string& name, int& token
 
 int SXInotifyNotifications::post(const std::string& name) { return PostTo(directory_, name); }
 
-int SXInotifyNotifications::postIn(const std::string& runtimeDir, const std::string& name) {
-  return PostTo(runtimeDir + "/notify", name);
+SXStatus SXInotifyNotifications::postIn(const std::string& runtimeDir, const std::string& name) {
+  if (int error = PostTo(runtimeDir + "/notify", name)) {
+    return SXErrnoStatus("cannot post " + name, error);
+  }
+  return {};
 }
 
 void SXInotifyNotifications::watch() {
@@ -126,7 +129,7 @@ void SXInotifyNotifications::watch() {
     if (::poll(fds, 2, -1) < 0) {
       if (errno == EINTR) continue;
       SXLOG(*log_, nullptr, SXLogLevel::kError, "notification watcher stops: %s",
-            SXPosixError("poll", errno));
+            SXErrnoText("poll", errno));
       return;
     }
     if (fds[1].revents != 0) return;
@@ -148,7 +151,7 @@ SXInotifyNotifications::WatchState SXInotifyNotifications::readEvents() {
     if (n < 0 && errno == EAGAIN) break;
     if (n <= 0) {
       SXLOG(*log_, nullptr, SXLogLevel::kError, "notification watcher stops: %s",
-            SXPosixError("inotify read", n < 0 ? errno : EIO));
+            SXErrnoText("inotify read", n < 0 ? errno : EIO));
       state = WatchState::kBroken;
       break;
     }
@@ -177,7 +180,7 @@ SXInotifyNotifications::WatchState SXInotifyNotifications::rewatch() {
   SXPosixFileSystem().createDirectory(directory_, kDirectoryMode);
   if (::inotify_add_watch(inotifyFd_, directory_.c_str(), kWatchMask) < 0) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "notification watcher stops: %s",
-          SXPosixError(directory_, errno));
+          SXErrnoText(directory_, errno));
     return WatchState::kBroken;
   }
   SXLOG(*log_, nullptr, SXLogLevel::kInfo, "notify directory %s watched again", directory_);

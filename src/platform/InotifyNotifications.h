@@ -24,6 +24,7 @@
 #include "common/SXThreadSafety.h"
 #include "platform/Log.h"
 #include "platform/Notify.h"
+#include "platform/Status.h"
 
 class SXInotifyNotifications final : public SXNotifications {
  public:
@@ -37,7 +38,8 @@ class SXInotifyNotifications final : public SXNotifications {
                        SXNotifyHandler handler) override;
   int post(const std::string& name) override;
   // The same post from a process that watches nothing (the admin tool): no watcher is set up.
-  static int postIn(const std::string& runtimeDir, const std::string& name);
+  // The failure says "cannot post <name>: <why>".
+  static SXStatus postIn(const std::string& runtimeDir, const std::string& name);
 
   // 0 when `name` can name a file in the notify directory, otherwise EINVAL or ENAMETOOLONG.
   static int checkName(const std::string& name);

@@ -80,7 +80,7 @@ SXValue SXJsonPreferences::readDomain(const std::string& path, std::string* unus
   FileRead file = ReadWholeFile(path);
   if (!file.contents) {
     if (file.error != ENOENT) {
-      std::string error = SXPosixError(path, file.error);
+      std::string error = SXErrnoText(path, file.error);
       SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot read preferences: %s", error);
       if (unusable) *unusable = "cannot read preferences: " + error;
     }
@@ -110,36 +110,38 @@ SXValue SXJsonPreferences::copyDomain(const std::string& domain) {
   return readDomain(domainPath(domain));
 }
 
-std::optional<std::string> SXJsonPreferences::setValue(const std::string& domain,
-                                                       const std::string& key,
-                                                       const std::optional<SXValue>& value) {
+SXStatus SXJsonPreferences::setValue(const std::string& domain, const std::string& key,
+                                     const std::optional<SXValue>& value) {
   if (!isValidDomain(domain)) {
-    return "preferences domain \"" + domain + "\" is not a valid name";
+    return SXFailure("preferences domain \"" + domain + "\" is not a valid name");
   }
-  if (value && value->is_discarded()) return "preferences value for \"" + key + "\" is invalid";
+  if (value && value->is_discarded()) {
+    return SXFailure("preferences value for \"" + key + "\" is invalid");
+  }
   SXPosixFileSystem fileSystem;
-  if (auto error = fileSystem.createDirectory(directory_, kDirectoryMode)) return error;
+  if (auto error = fileSystem.createDirectory(directory_, kDirectoryMode)) return SXFailure(*error);
 
   // The lock spans read-modify-write so a concurrent writer's keys are read before we replace
   // the file; the lock file itself is never replaced, unlike the domain file.
   std::string path = domainPath(domain);
   std::string lockPath = path + ".lock";
   SXScopedFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0644));
-  if (lock.get() < 0) return SXPosixError(lockPath, errno);
-  if (int err = LockExclusive(lock.get())) return SXPosixError(lockPath, err);
+  if (lock.get() < 0) return SXErrnoStatus(lockPath, errno);
+  if (int err = LockExclusive(lock.get())) return SXErrnoStatus(lockPath, err);
 
   // A file we cannot read or parse may still be someone's: replacing it would lose it.
   std::string unusable;
   SXValue object = readDomain(path, &unusable);
-  if (!unusable.empty()) return unusable;
+  if (!unusable.empty()) return SXFailure(unusable);
   if (value) {
     object[key] = *value;
   } else if (object.erase(key) == 0) {
-    return std::nullopt;  // nothing to remove: leave the file as it is
+    return {};  // nothing to remove: leave the file as it is
   }
   std::optional<std::string> text = Serialize(object);
-  if (!text) return "preferences value for \"" + key + "\" is not valid UTF-8";
-  return fileSystem.writeFileAtomically(path, *text);
+  if (!text) return SXFailure("preferences value for \"" + key + "\" is not valid UTF-8");
+  if (auto error = fileSystem.writeFileAtomically(path, *text)) return SXFailure(*error);
+  return {};
 }
 
 // A boolean is deliberately not a string: a switch stored where a name belongs is a mistake,

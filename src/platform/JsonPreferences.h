@@ -27,8 +27,8 @@ class SXJsonPreferences final : public SXPreferences {
 
   std::optional<SXValue> copyValue(const std::string& domain, const std::string& key) override;
   SXValue copyDomain(const std::string& domain) override;
-  std::optional<std::string> setValue(const std::string& domain, const std::string& key,
-                                      const std::optional<SXValue>& value) override;
+  SXStatus setValue(const std::string& domain, const std::string& key,
+                    const std::optional<SXValue>& value) override;
 
   // Whether `domain` may name a file of its own in the preferences directory.
   static bool isValidDomain(const std::string& domain);

@@ -25,6 +25,7 @@
 
 #include "platform/Log.h"
 #include "platform/OtlpLogsBody.h"
+#include "platform/Status.h"
 #include "sxreporting/types.h"
 
 // Environment variables by name.
@@ -47,15 +48,14 @@ struct SXOtlpExportOptions {
 
   // The options of the "otlp-http" object of fernreporting.json alone: endpoint, headers,
   // batchSize, maxBatchBytes, intervalMs, initialBackoffMs, maxBackoffMs, timeoutMs,
-  // compression, encoding, resourceAttributes; absent keys keep their defaults. On a key it
-  // does not know or a bad value returns none and sets `error`.
-  static std::optional<SXOtlpExportOptions> fromJson(const SXValue& section, std::string& error);
+  // compression, encoding, resourceAttributes; absent keys keep their defaults. Fails on a
+  // key it does not know or a bad value.
+  static SXResult<SXOtlpExportOptions> fromJson(const SXValue& section);
 
-  // The options of `section` with `environment` filling in what it leaves out (see above). On
-  // a bad value, in the file or in a variable, returns none and sets `error`.
-  static std::optional<SXOtlpExportOptions> fromSources(const SXValue& section,
-                                                        const SXEnvironment& environment,
-                                                        std::string& error);
+  // The options of `section` with `environment` filling in what it leaves out (see above).
+  // Fails on a bad value, in the file or in a variable.
+  static SXResult<SXOtlpExportOptions> fromSources(const SXValue& section,
+                                                   const SXEnvironment& environment);
 
   // The options in the config file `configPath` and the process environment when `backends`
   // lists "otlp-http"; none when it does not, or after an error line on `log` when a value is

@@ -68,8 +68,8 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::exportOnce() {
   retryAfter_.reset();
   std::vector<SXValue> rows;
   size_t limit = std::min(sizeLimit_, paceLimit_);
-  if (auto failed = spool_.read(limit, options_.maxBatchBytes, rows)) {
-    return this->failed("cannot read the spool: " + *failed);
+  if (SXStatus read = spool_.read(limit, options_.maxBatchBytes, rows); !read.ok()) {
+    return failed("cannot read the spool: " + read.error());
   }
   if (rows.empty()) {
     // The backlog that met a size limit or a slow collector is gone.
@@ -82,15 +82,14 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::exportOnce() {
   return pass;
 }
 
-std::optional<SXHttpRequest> SXOtlpHttpExporter::request(const std::vector<SXValue>& rows,
-                                                         std::string& error) const {
+SXResult<SXHttpRequest> SXOtlpHttpExporter::request(const std::vector<SXValue>& rows) const {
   SXHttpRequest request{options_.endpoint, options_.headers, "", timeout_};
   request.body = SXOtlpLogsRequest(rows, options_.resource, clock_->now())
                      .dump(-1, ' ', false, SXValue::error_handler_t::replace);
   request.headers["Content-Type"] = "application/json";
   if (options_.encoding == SXOtlpExportOptions::Encoding::kProtobuf) {
-    auto bytes = SXOtlpRequestProtobuf(request.body, error);
-    if (!bytes) return std::nullopt;
+    auto bytes = SXOtlpRequestProtobuf(request.body);
+    if (!bytes.ok()) return bytes.status();
     request.body = std::move(*bytes);
     request.headers["Content-Type"] = "application/x-protobuf";
   }
@@ -106,9 +105,10 @@ std::optional<SXHttpRequest> SXOtlpHttpExporter::request(const std::vector<SXVal
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::post(const std::vector<SXValue>& rows) {
   int64_t first = RowId(rows.front()), last = RowId(rows.back());
-  std::string error;
-  auto request = this->request(rows, error);
-  if (!request) return dropped(first, last, rows.size(), "cannot encode them: " + error);
+  auto request = this->request(rows);
+  if (!request.ok()) {
+    return dropped(first, last, rows.size(), "cannot encode them: " + request.error());
+  }
   SXHttpResult result = http_->post(*request);
   if (!result.status) {
     if (result.timedOut) slowedDown(rows.size());
@@ -145,9 +145,10 @@ SXOtlpHttpExporter::Pass SXOtlpHttpExporter::dropped(int64_t first, int64_t last
 }
 
 SXOtlpHttpExporter::Pass SXOtlpHttpExporter::moved(int64_t last, Outcome outcome, size_t rows) {
-  if (auto failedWrite = spool_.advance(last)) {
+  if (SXStatus written = spool_.advance(last); !written.ok()) {
     // The cursor moved in memory, so nothing goes twice while this process runs.
-    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot store the export cursor: %@", *failedWrite);
+    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot store the export cursor: %@",
+          written.error());
   }
   succeeded();
   return {outcome, rows};

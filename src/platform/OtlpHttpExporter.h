@@ -101,7 +101,7 @@ class SXOtlpHttpExporter {
   std::chrono::milliseconds delayAfter(const Pass& pass);
 
  private:
-  std::optional<SXHttpRequest> request(const std::vector<SXValue>& rows, std::string& error) const;
+  SXResult<SXHttpRequest> request(const std::vector<SXValue>& rows) const;
   Pass post(const std::vector<SXValue>& rows);
   // Moves the cursor past `last` after an answer that settles the batch.
   Pass moved(int64_t last, Outcome outcome, size_t rows);

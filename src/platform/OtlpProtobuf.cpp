@@ -6,18 +6,12 @@
 
 namespace otlp = opentelemetry::proto::collector::logs::v1;
 
-std::optional<std::string> SXOtlpRequestProtobuf(const std::string& json, std::string& error) {
+SXResult<std::string> SXOtlpRequestProtobuf(const std::string& json) {
   otlp::ExportLogsServiceRequest request;
   auto status = google::protobuf::util::JsonStringToMessage(json, &request);
-  if (!status.ok()) {
-    error = status.ToString();
-    return std::nullopt;
-  }
+  if (!status.ok()) return SXFailure(status.ToString());
   std::string bytes;
-  if (!request.SerializeToString(&bytes)) {
-    error = "cannot serialise the request";
-    return std::nullopt;
-  }
+  if (!request.SerializeToString(&bytes)) return SXFailure("cannot serialise the request");
   return bytes;
 }
 

@@ -4,12 +4,13 @@
 // of the spool serves both encodings. Pure functions, callable from any thread.
 #pragma once
 
-#include <optional>
 #include <string>
 
-// The ExportLogsServiceRequest written as OTLP JSON in `json`, serialised as protobuf. On
-// failure (a field or value the message cannot hold) returns none and sets `error`.
-std::optional<std::string> SXOtlpRequestProtobuf(const std::string& json, std::string& error);
+#include "platform/Status.h"
+
+// The ExportLogsServiceRequest written as OTLP JSON in `json`, serialised as protobuf. Fails
+// on a field or value the message cannot hold.
+SXResult<std::string> SXOtlpRequestProtobuf(const std::string& json);
 
 // An ExportLogsServiceResponse in protobuf as OTLP JSON text; empty when it cannot be decoded.
 std::string SXOtlpResponseJson(const std::string& protobuf);

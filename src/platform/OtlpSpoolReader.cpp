@@ -51,19 +51,18 @@ SXOtlpSpoolReader::SXOtlpSpoolReader(std::string dbPath, std::chrono::millisecon
 
 SXOtlpSpoolReader::~SXOtlpSpoolReader() = default;
 
-std::optional<std::string> SXOtlpSpoolReader::fail(const std::string& what) {
+SXStatus SXOtlpSpoolReader::fail(const SXStatus& failed) {
   db_.reset();  // the next call starts on a fresh connection
-  return path_ + ": " + what;
+  return SXFailure(path_ + ": " + failed.error());
 }
 
-std::optional<std::string> SXOtlpSpoolReader::ensureOpen() {
-  if (db_) return std::nullopt;
-  std::string error;
-  auto connection = SXSqliteConnection::open(path_, SXSqliteConnection::Mode::kReadWrite,
-                                             busyTimeout_, kSchema, error);
-  if (!connection) return error;
+SXStatus SXOtlpSpoolReader::ensureOpen() {
+  if (db_) return {};
+  auto connection =
+      SXSqliteConnection::open(path_, SXSqliteConnection::Mode::kReadWrite, busyTimeout_, kSchema);
+  if (!connection.ok()) return connection.status();
   db_ = std::make_unique<Db>();
-  db_->connection = std::move(connection);
+  db_->connection = std::move(*connection);
   std::pair<const char*, SXSqliteStatement*> statements[] = {{kSelectSizes, &db_->selectSizes},
                                                              {kSelectBatch, &db_->selectBatch},
                                                              {kSelectCursor, &db_->selectCursor},
@@ -71,48 +70,51 @@ std::optional<std::string> SXOtlpSpoolReader::ensureOpen() {
                                                              {kCountBeyond, &db_->countBeyond}};
   for (auto& [sql, statement] : statements) {
     // A spool not yet made by its writer has no messages table: a failure to retry later.
-    if (auto failed = db_->connection->prepare(sql, *statement)) return fail(*failed);
+    if (SXStatus failed = db_->connection->prepare(sql, *statement); !failed.ok()) {
+      return fail(failed);
+    }
   }
-  if (cursorLoaded_) return std::nullopt;
+  if (cursorLoaded_) return {};
   std::vector<SXValue> rows;
-  if (auto failed = db_->selectCursor.query({}, rows)) return fail(*failed);
+  if (SXStatus failed = db_->selectCursor.query({}, rows); !failed.ok()) return fail(failed);
   if (!rows.empty() && rows[0]["last_message_id"].is_number_integer()) {
     cursor_ = rows[0]["last_message_id"].get<int64_t>();
   }
   cursorLoaded_ = true;
-  return std::nullopt;
+  return {};
 }
 
-std::optional<std::string> SXOtlpSpoolReader::persistCursor() {
-  if (!cursorDirty_) return std::nullopt;
-  if (auto failed = db_->storeCursor.run({cursor_})) return fail(*failed);
+SXStatus SXOtlpSpoolReader::persistCursor() {
+  if (!cursorDirty_) return {};
+  if (SXStatus failed = db_->storeCursor.run({cursor_}); !failed.ok()) return fail(failed);
   cursorDirty_ = false;
-  return std::nullopt;
+  return {};
 }
 
-std::optional<std::string> SXOtlpSpoolReader::read(size_t limit, size_t maxBytes,
-                                                   std::vector<SXValue>& rows) {
+SXStatus SXOtlpSpoolReader::read(size_t limit, size_t maxBytes, std::vector<SXValue>& rows) {
   SXMutexLock lock(mutex_);
-  if (auto failed = ensureOpen()) return failed;
-  if (auto failed = persistCursor()) return failed;
+  if (SXStatus failed = ensureOpen(); !failed.ok()) return failed;
+  if (SXStatus failed = persistCursor(); !failed.ok()) return failed;
   std::vector<SXValue> sizes;
-  if (auto failed = db_->selectSizes.query({cursor_, static_cast<int64_t>(limit)}, sizes)) {
-    return fail(*failed);
+  if (SXStatus failed = db_->selectSizes.query({cursor_, static_cast<int64_t>(limit)}, sizes);
+      !failed.ok()) {
+    return fail(failed);
   }
-  if (sizes.empty()) return std::nullopt;
-  if (auto failed = db_->selectBatch.query({cursor_, LastThatFits(sizes, maxBytes)}, rows)) {
-    return fail(*failed);
+  if (sizes.empty()) return {};
+  if (SXStatus failed = db_->selectBatch.query({cursor_, LastThatFits(sizes, maxBytes)}, rows);
+      !failed.ok()) {
+    return fail(failed);
   }
-  return std::nullopt;
+  return {};
 }
 
-std::optional<std::string> SXOtlpSpoolReader::advance(int64_t lastMessageId) {
+SXStatus SXOtlpSpoolReader::advance(int64_t lastMessageId) {
   SXMutexLock lock(mutex_);
   if (lastMessageId > cursor_) {
     cursor_ = lastMessageId;
     cursorDirty_ = true;
   }
-  if (auto failed = ensureOpen()) return failed;
+  if (SXStatus failed = ensureOpen(); !failed.ok()) return failed;
   return persistCursor();
 }
 
@@ -125,7 +127,7 @@ uint64_t SXOtlpSpoolReader::backlog() const {
   SXMutexLock lock(mutex_);
   if (!db_) return lastBacklog_;  // opening is left to the exporting thread
   std::vector<SXValue> rows;
-  if (!db_->countBeyond.query({cursor_}, rows) && !rows.empty() && rows[0]["n"].is_number()) {
+  if (db_->countBeyond.query({cursor_}, rows).ok() && !rows.empty() && rows[0]["n"].is_number()) {
     lastBacklog_ = rows[0]["n"].get<uint64_t>();
   }
   return lastBacklog_;

@@ -7,8 +7,8 @@
 // Row ids only grow, because writes are serialised and nothing deletes rows, so a cursor on
 // `messages.id` never skips a message committed after it was read.
 //
-// All methods may be called from any thread; a mutex serialises them. On failure a method
-// returns why ("<path>: <what SQLite says>"), and the next call opens the database again.
+// All methods may be called from any thread; a mutex serialises them. A failure says
+// "<path>: <what SQLite says>", and the next call opens the database again.
 #pragma once
 
 #include <chrono>
@@ -33,12 +33,12 @@ class SXOtlpSpoolReader {
   // Appends to `rows` the next messages beyond the cursor, in id order: at most `limit`, and
   // no more once their payloads pass `maxBytes` (one at least). Each row is an object with the
   // columns of SXOtlpSpooledRow; a session message has its session's info, user info and token.
-  std::optional<std::string> read(size_t limit, size_t maxBytes, std::vector<SXValue>& rows);
+  SXStatus read(size_t limit, size_t maxBytes, std::vector<SXValue>& rows);
 
   // Moves the cursor to `lastMessageId`, at once in memory (read() goes on from there) and
   // durably. When the durable write fails the cursor still moves in memory, and the write is
   // tried again by the next read() or advance().
-  std::optional<std::string> advance(int64_t lastMessageId);
+  SXStatus advance(int64_t lastMessageId);
 
   // The cursor: the id of the last message done with; 0 before the first.
   int64_t cursor() const;
@@ -49,9 +49,9 @@ class SXOtlpSpoolReader {
  private:
   struct Db;
 
-  std::optional<std::string> ensureOpen() SX_REQUIRES(mutex_);
-  std::optional<std::string> persistCursor() SX_REQUIRES(mutex_);
-  std::optional<std::string> fail(const std::string& what) SX_REQUIRES(mutex_);
+  SXStatus ensureOpen() SX_REQUIRES(mutex_);
+  SXStatus persistCursor() SX_REQUIRES(mutex_);
+  SXStatus fail(const SXStatus& failed) SX_REQUIRES(mutex_);
 
   const std::string path_;
   const std::chrono::milliseconds busyTimeout_;

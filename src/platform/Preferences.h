@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/Status.h"
 #include "sxreporting/types.h"
 
 class SXPreferences {
@@ -14,9 +15,9 @@ class SXPreferences {
   virtual std::optional<SXValue> copyValue(const std::string& domain, const std::string& key) = 0;
   // The whole domain as a dictionary (empty when it holds nothing).
   virtual SXValue copyDomain(const std::string& domain) = 0;
-  // Stores `value` (nothing: removes the key). On failure returns the failure's description.
-  virtual std::optional<std::string> setValue(const std::string& domain, const std::string& key,
-                                              const std::optional<SXValue>& value) = 0;
+  // Stores `value` (nothing: removes the key).
+  virtual SXStatus setValue(const std::string& domain, const std::string& key,
+                            const std::optional<SXValue>& value) = 0;
 };
 
 // A stored value read as a string: strings as they are, numbers in decimal (floating values in

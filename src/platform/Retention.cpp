@@ -151,50 +151,48 @@ void SXRetention::pruneStore(size_t index, const SXStoreRetention& limits) {
   const std::string path = options_.stateDir + "/" + store.file;
   std::error_code ec;
   if (!fs::exists(path, ec)) return;  // its adapter has not made it (yet)
-  std::string error;
   auto db = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadWrite,
-                                     kSXSqliteBusyTimeout, "", error);
-  if (!db) return reportError(index, error);
-  SXSqlitePruner pruner(*db, options_.pruning);
+                                     kSXSqliteBusyTimeout, "");
+  if (!db.ok()) return reportError(index, db.error());
+  SXSqlitePruner pruner(**db, options_.pruning);
   const double cutoff = SXSqliteNow() - limits.maxAgeDays * kSecondsPerDay;
   uint64_t deleted = 0;
-  auto failed = pruner.deleteOlderThan(store.table, cutoff, "1", deleted);
-  if (!failed && index == kSpool) failed = pruneSpoolExtras(pruner, cutoff, *db, deleted);
-  if (!failed) failed = pruner.deleteToSize(store.table, limits.maxBytes, deleted);
-  if (!failed) failed = pruner.releaseFreePages();
-  uint64_t bytes = 0;
-  if (!failed) failed = db->usedBytes(bytes);
+  SXStatus failed = pruner.deleteOlderThan(store.table, cutoff, "1", deleted);
+  if (failed.ok() && index == kSpool) failed = pruneSpoolExtras(pruner, cutoff, **db, deleted);
+  if (failed.ok()) failed = pruner.deleteToSize(store.table, limits.maxBytes, deleted);
+  if (failed.ok()) failed = pruner.releaseFreePages();
+  SXResult<uint64_t> used = failed.ok() ? (*db)->usedBytes() : SXResult<uint64_t>(failed);
+  const uint64_t bytes = used.ok() ? *used : 0;
+  failed = used.status();
   rowsPruned_[index] += deleted;
-  if (!failed) storeBytes_[index] = static_cast<int64_t>(bytes);
+  if (failed.ok()) storeBytes_[index] = static_cast<int64_t>(bytes);
   if (deleted > 0) {
     SXLOG(*options_.log, nullptr, SXLogLevel::kDefault,
           "retention: pruned %llu rows of %s; it now holds %llu bytes",
           static_cast<unsigned long long>(deleted), path, static_cast<unsigned long long>(bytes));
   }
-  reportError(index, failed ? path + ": " + *failed : "");
+  reportError(index, failed.ok() ? "" : path + ": " + failed.error());
 }
 
-std::optional<std::string> SXRetention::pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff,
-                                                         SXSqliteConnection& db,
-                                                         uint64_t& deleted) {
+SXStatus SXRetention::pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff,
+                                       SXSqliteConnection& db, uint64_t& deleted) {
   if (spoolExported_.load()) {
     // The exporter makes its table when it first runs; until then it has taken nothing.
-    int64_t hasCursor = 0;
-    int64_t cursor = 0;
-    if (auto failed = db.queryInt(
-            "SELECT COUNT(*) FROM sqlite_master WHERE type = 'table' AND name = 'otlp_export'", {},
-            hasCursor)) {
+    SXResult<int64_t> hasCursor = db.queryInt(
+        "SELECT COUNT(*) FROM sqlite_master WHERE type = 'table' AND name = 'otlp_export'", {});
+    if (!hasCursor.ok()) return hasCursor.status();
+    SXResult<int64_t> cursor = int64_t{0};
+    if (*hasCursor != 0) {
+      cursor = db.queryInt("SELECT last_message_id FROM otlp_export WHERE id = 1", {});
+      if (!cursor.ok()) return cursor.status();
+    }
+    if (SXStatus failed = pruner.deleteThrough("messages", *cursor, deleted); !failed.ok()) {
       return failed;
     }
-    if (hasCursor != 0) {
-      if (auto failed =
-              db.queryInt("SELECT last_message_id FROM otlp_export WHERE id = 1", {}, cursor)) {
-        return failed;
-      }
-    }
-    if (auto failed = pruner.deleteThrough("messages", cursor, deleted)) return failed;
   }
-  if (auto failed = pruner.deleteOlderThan("flushes", cutoff, "1", deleted)) return failed;
+  if (SXStatus failed = pruner.deleteOlderThan("flushes", cutoff, "1", deleted); !failed.ok()) {
+    return failed;
+  }
   // A session's row carries the info of its messages, so it stays while one refers to it.
   return pruner.deleteOlderThan(
       "sessions", cutoff, "NOT EXISTS (SELECT 1 FROM messages WHERE session_id = sessions.id)",

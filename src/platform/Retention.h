@@ -73,8 +73,8 @@ class SXRetention : public std::enable_shared_from_this<SXRetention> {
   explicit SXRetention(Options options, SXRetentionPolicy policy);
   void scheduleNext(std::chrono::nanoseconds delay);
   void pruneStore(size_t index, const SXStoreRetention& limits) SX_REQUIRES(passMutex_);
-  std::optional<std::string> pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff,
-                                              SXSqliteConnection& db, uint64_t& deleted);
+  SXStatus pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff, SXSqliteConnection& db,
+                            uint64_t& deleted);
   void ageOutFiles(const SXRetentionPolicy& policy) SX_REQUIRES(passMutex_);
   void reportError(size_t slot, const std::string& error) SX_REQUIRES(passMutex_);
 

@@ -20,22 +20,19 @@ std::string Shown(const SXValue& value) {
   return value.dump(-1, ' ', false, SXValue::error_handler_t::replace);
 }
 
-bool ReadField(const Field& field, const SXValue& value, const std::string& path,
-               std::string& error) {
+SXStatus ReadField(const Field& field, const SXValue& value, const std::string& path) {
   if (field.number) {
     if (value.is_number() && std::isfinite(value.get<double>()) && value.get<double>() > 0) {
       *field.number = value.get<double>();
-      return true;
+      return {};
     }
-    error = path + ": expected a positive number, got " + Shown(value);
-    return false;
+    return SXFailure(path + ": expected a positive number, got " + Shown(value));
   }
   if (value.is_number_unsigned() && value.get<uint64_t>() > 0) {
     *field.integer = value.get<uint64_t>();
-    return true;
+    return {};
   }
-  error = path + ": expected a positive integer, got " + Shown(value);
-  return false;
+  return SXFailure(path + ": expected a positive integer, got " + Shown(value));
 }
 
 std::string KeyList(const std::vector<Field>& fields) {
@@ -45,24 +42,20 @@ std::string KeyList(const std::vector<Field>& fields) {
 }
 
 // Sets what `object` names among `fields`; `path` names the object in error texts.
-bool ReadObject(const SXValue& object, const std::string& path, const std::vector<Field>& fields,
-                std::string& error) {
-  if (!object.is_object()) {
-    error = path + ": expected an object, got " + Shown(object);
-    return false;
-  }
+SXStatus ReadObject(const SXValue& object, const std::string& path,
+                    const std::vector<Field>& fields) {
+  if (!object.is_object()) return SXFailure(path + ": expected an object, got " + Shown(object));
   for (const auto& [key, value] : object.items()) {
     const Field* field = nullptr;
     for (const Field& candidate : fields) {
       if (key == candidate.key) field = &candidate;
     }
     if (!field) {
-      error = path + ": unknown key \"" + key + "\" (expected " + KeyList(fields) + ")";
-      return false;
+      return SXFailure(path + ": unknown key \"" + key + "\" (expected " + KeyList(fields) + ")");
     }
-    if (!ReadField(*field, value, path + "." + key, error)) return false;
+    if (SXStatus read = ReadField(*field, value, path + "." + key); !read.ok()) return read;
   }
-  return true;
+  return {};
 }
 
 std::vector<Field> StoreFields(SXStoreRetention& store) {
@@ -78,8 +71,7 @@ std::string StoreText(const char* name, const SXStoreRetention& store) {
 
 }  // namespace
 
-std::optional<SXRetentionPolicy> SXRetentionPolicy::fromJson(const SXValue& section,
-                                                             std::string& error) {
+SXResult<SXRetentionPolicy> SXRetentionPolicy::fromJson(const SXValue& section) {
   SXRetentionPolicy policy;
   if (section.is_null()) return policy;
   const std::vector<std::pair<std::string, std::vector<Field>>> sections = {
@@ -98,18 +90,19 @@ std::optional<SXRetentionPolicy> SXRetentionPolicy::fromJson(const SXValue& sect
   SXValue rest = section;
   for (const auto& [key, fields] : sections) {
     if (!rest.is_object() || !rest.contains(key)) continue;
-    if (!ReadObject(rest[key], "retention." + key, fields, error)) return std::nullopt;
+    if (SXStatus read = ReadObject(rest[key], "retention." + key, fields); !read.ok()) {
+      return read;
+    }
     rest.erase(key);
   }
-  if (!ReadObject(rest, "retention", top, error)) return std::nullopt;
+  if (SXStatus read = ReadObject(rest, "retention", top); !read.ok()) return read;
   return policy;
 }
 
-std::optional<SXRetentionPolicy> SXRetentionPolicy::fromConfigFile(const SXValue& file,
-                                                                   std::string& error) {
+SXResult<SXRetentionPolicy> SXRetentionPolicy::fromConfigFile(const SXValue& file) {
   auto it = file.find("retention");
   if (it == file.end()) return SXRetentionPolicy();
-  return fromJson(*it, error);
+  return fromJson(*it);
 }
 
 std::string SXRetentionPolicy::description() const {

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "platform/Log.h"
+#include "platform/Status.h"
 #include "sxreporting/types.h"
 
 // A store's rows older than `maxAgeDays`, and its oldest rows while it holds more than
@@ -43,14 +44,13 @@ struct SXRetentionPolicy {
   double intervalSeconds = 60;  // between two passes
 
   // The policy `section` describes (a JSON object, or null for all defaults). On an unknown
-  // key or a bad value returns nothing and says which in `error`, e.g.
+  // key or a bad value the failure says which, e.g.
   // "retention.analytics.maxBytes: expected a positive integer, got -1".
-  static std::optional<SXRetentionPolicy> fromJson(const SXValue& section, std::string& error);
+  static SXResult<SXRetentionPolicy> fromJson(const SXValue& section);
 
   // The policy of the "retention" section of the daemon's configuration file `file` (an
-  // object): the defaults when it has none; nothing, with `error` set, when it is bad.
-  static std::optional<SXRetentionPolicy> fromConfigFile(const SXValue& file,
-                                                         std::string& error);
+  // object): the defaults when it has none; a failure when it is bad.
+  static SXResult<SXRetentionPolicy> fromConfigFile(const SXValue& file);
 
   // One line for the log, e.g. "analytics 30 days or 268435456 bytes, ...".
   std::string description() const;

@@ -17,9 +17,9 @@ struct SXSqliteBatchWriter::Core {
 
   void run();
   // REQUIRES: writer thread (or the constructor, before the thread starts).
-  bool ensureOpen(std::string& error);
+  SXStatus ensureOpen();
   void writeBatch(std::vector<RowProducer>& batch);
-  std::optional<std::string> commit(const std::vector<SXSqliteRow>& rows);
+  SXStatus commit(const std::vector<SXSqliteRow>& rows);
   std::vector<SXSqliteRow> produceRows(std::vector<RowProducer>& batch);
 
   const Options options;
@@ -42,21 +42,20 @@ struct SXSqliteBatchWriter::Core {
   SXSqliteStatement insert;
 };
 
-bool SXSqliteBatchWriter::Core::ensureOpen(std::string& error) {
-  if (db) return true;
+SXStatus SXSqliteBatchWriter::Core::ensureOpen() {
+  if (db) return {};
   std::string recovered;
   auto connection = SXSqliteConnection::openOrRecover(options.path, options.busyTimeout,
-                                                      options.schema, error, recovered);
+                                                      options.schema, recovered);
   if (!recovered.empty()) SXLOG(*log, nullptr, SXLogLevel::kError, "%s", recovered);
-  if (!connection) return false;
+  if (!connection.ok()) return connection.status();
   SXSqliteStatement statement;
-  if (auto failed = connection->prepare(options.insertSql, statement)) {
-    error = options.path + ": " + *failed;
-    return false;
+  if (SXStatus failed = (*connection)->prepare(options.insertSql, statement); !failed.ok()) {
+    return SXFailure(options.path + ": " + failed.error());
   }
-  db = std::move(connection);
+  db = std::move(*connection);
   insert = std::move(statement);
-  return true;
+  return {};
 }
 
 std::vector<SXSqliteRow> SXSqliteBatchWriter::Core::produceRows(std::vector<RowProducer>& batch) {
@@ -76,35 +75,34 @@ std::vector<SXSqliteRow> SXSqliteBatchWriter::Core::produceRows(std::vector<RowP
   return rows;
 }
 
-std::optional<std::string> SXSqliteBatchWriter::Core::commit(const std::vector<SXSqliteRow>& rows) {
-  if (auto error = db->exec("BEGIN IMMEDIATE")) return error;
+SXStatus SXSqliteBatchWriter::Core::commit(const std::vector<SXSqliteRow>& rows) {
+  if (SXStatus failed = db->exec("BEGIN IMMEDIATE"); !failed.ok()) return failed;
   for (const auto& row : rows) {
-    if (auto error = insert.run(row)) {
-      db->exec("ROLLBACK");
-      return error;
+    if (SXStatus failed = insert.run(row); !failed.ok()) {
+      (void)db->exec("ROLLBACK");
+      return failed;
     }
   }
-  if (auto error = db->exec("COMMIT")) {
-    db->exec("ROLLBACK");
-    return error;
+  if (SXStatus failed = db->exec("COMMIT"); !failed.ok()) {
+    (void)db->exec("ROLLBACK");
+    return failed;
   }
-  return std::nullopt;
+  return {};
 }
 
 void SXSqliteBatchWriter::Core::writeBatch(std::vector<RowProducer>& batch) {
   std::vector<SXSqliteRow> rows = produceRows(batch);
   if (rows.empty()) return;
-  std::string error;
-  if (!ensureOpen(error)) {
+  if (SXStatus opened = ensureOpen(); !opened.ok()) {
     writeErrors += rows.size();
     SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s", rows.size(), options.rowNoun,
-          error);
+          opened.error());
     return;
   }
-  if (auto failed = commit(rows)) {
+  if (SXStatus failed = commit(rows); !failed.ok()) {
     writeErrors += rows.size();
     SXLOG(*log, nullptr, SXLogLevel::kError, "dropped %zu %s: %s: %s", rows.size(), options.rowNoun,
-          options.path, *failed);
+          options.path, failed.error());
     // Start the next batch on a fresh connection, in case this one is what went wrong.
     insert = SXSqliteStatement();
     db.reset();
@@ -142,8 +140,9 @@ void SXSqliteBatchWriter::Core::run() {
 
 SXSqliteBatchWriter::SXSqliteBatchWriter(Options options, std::shared_ptr<SXLogFacility> log)
     : core_(std::make_shared<Core>(std::move(options), std::move(log))) {
-  std::string error;
-  if (!core_->ensureOpen(error)) SXLOG(*core_->log, nullptr, SXLogLevel::kError, "%s", error);
+  if (SXStatus opened = core_->ensureOpen(); !opened.ok()) {
+    SXLOG(*core_->log, nullptr, SXLogLevel::kError, "%s", opened.error());
+  }
   thread_ = std::thread([core = core_] {
     pthread_setname_np(pthread_self(), core->options.threadName.substr(0, 15).c_str());
     core->run();

@@ -40,8 +40,8 @@ std::string SXSqliteStatement::failure(const char* context) const {
   return Describe(db_, std::string(context) + " \"" + sql.substr(0, sql.find('(')) + "\"");
 }
 
-std::optional<std::string> SXSqliteStatement::bind(const SXSqliteRow& params) {
-  if (!stmt_) return "statement was never prepared";
+SXStatus SXSqliteStatement::bind(const SXSqliteRow& params) {
+  if (!stmt_) return SXFailure("statement was never prepared");
   sqlite3_reset(stmt_.get());
   sqlite3_clear_bindings(stmt_.get());
   for (size_t i = 0; i < params.size(); ++i) {
@@ -61,27 +61,26 @@ std::optional<std::string> SXSqliteStatement::bind(const SXSqliteRow& params) {
           }
         },
         params[i]);
-    if (rc != SQLITE_OK) return failure("bind");
+    if (rc != SQLITE_OK) return SXFailure(failure("bind"));
   }
-  return std::nullopt;
+  return {};
 }
 
-std::optional<std::string> SXSqliteStatement::run(const SXSqliteRow& params) {
-  if (auto error = bind(params)) return error;
+SXStatus SXSqliteStatement::run(const SXSqliteRow& params) {
+  if (SXStatus bound = bind(params); !bound.ok()) return bound;
   int rc;
   while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {
   }
-  std::optional<std::string> error;
-  if (rc != SQLITE_DONE) error = failure("step");
+  SXStatus status;
+  if (rc != SQLITE_DONE) status = SXFailure(failure("step"));
   // Resetting releases the statement's read of the database and the bound texts (SQLITE_STATIC).
   sqlite3_reset(stmt_.get());
   sqlite3_clear_bindings(stmt_.get());
-  return error;
+  return status;
 }
 
-std::optional<std::string> SXSqliteStatement::query(const SXSqliteRow& params,
-                                                    std::vector<SXValue>& rows) {
-  if (auto error = bind(params)) return error;
+SXStatus SXSqliteStatement::query(const SXSqliteRow& params, std::vector<SXValue>& rows) {
+  if (SXStatus bound = bind(params); !bound.ok()) return bound;
   int rc;
   int columns = sqlite3_column_count(stmt_.get());
   while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {
@@ -91,33 +90,32 @@ std::optional<std::string> SXSqliteStatement::query(const SXSqliteRow& params,
     }
     rows.push_back(std::move(row));
   }
-  std::optional<std::string> error;
-  if (rc != SQLITE_DONE) error = failure("step");
+  SXStatus status;
+  if (rc != SQLITE_DONE) status = SXFailure(failure("step"));
   sqlite3_reset(stmt_.get());
   sqlite3_clear_bindings(stmt_.get());
-  return error;
+  return status;
 }
 
-std::unique_ptr<SXSqliteConnection> SXSqliteConnection::open(const std::string& path, Mode mode,
-                                                             std::chrono::milliseconds busyTimeout,
-                                                             const std::string& schema,
-                                                             std::string& error) {
-  int code = SQLITE_OK;
-  return openWithCode(path, mode, busyTimeout, schema, error, code);
-}
-
-std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
+SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::open(
     const std::string& path, Mode mode, std::chrono::milliseconds busyTimeout,
-    const std::string& schema, std::string& error, int& code) {
+    const std::string& schema) {
+  int code = SQLITE_OK;
+  return openWithCode(path, mode, busyTimeout, schema, code);
+}
+
+SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::openWithCode(
+    const std::string& path, Mode mode, std::chrono::milliseconds busyTimeout,
+    const std::string& schema, int& code) {
   sqlite3* db = nullptr;
   int flags =
       mode == Mode::kReadOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
   // The owner serialises calls, so SQLite's own per-connection mutex is not needed.
   code = sqlite3_open_v2(path.c_str(), &db, flags | SQLITE_OPEN_NOMUTEX, nullptr);
   if (code != SQLITE_OK) {
-    error = Describe(db, "cannot open " + path);
+    SXStatus failed = SXFailure(Describe(db, "cannot open " + path));
     sqlite3_close_v2(db);
-    return nullptr;
+    return failed;
   }
   auto connection = std::make_unique<SXSqliteConnection>(Key(), db);
   sqlite3_busy_timeout(db, static_cast<int>(busyTimeout.count()));
@@ -125,8 +123,7 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
   // SQLite quietly falls back to reading a file it may not write; a store must be writable.
   if (sqlite3_db_readonly(db, "main") == 1) {
     code = SQLITE_READONLY;
-    error = "cannot open " + path + ": " + sqlite3_errstr(SQLITE_READONLY);
-    return nullptr;
+    return SXFailure("cannot open " + path + ": " + sqlite3_errstr(SQLITE_READONLY));
   }
   // auto_vacuum must come before the first table; on an existing store it is only a wish that
   // convertToIncrementalVacuum() fulfils.
@@ -134,10 +131,9 @@ std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openWithCode(
        {std::string("PRAGMA auto_vacuum=INCREMENTAL"), std::string("PRAGMA journal_mode=WAL"),
         std::string("PRAGMA synchronous=NORMAL"),
         "PRAGMA journal_size_limit=" + std::to_string(kSXSqliteJournalSizeLimit), schema}) {
-    if (auto failed = connection->exec(sql)) {
+    if (SXStatus failed = connection->exec(sql); !failed.ok()) {
       code = sqlite3_errcode(db);
-      error = "cannot open " + path + ": " + *failed;
-      return nullptr;
+      return SXFailure("cannot open " + path + ": " + failed.error());
     }
   }
   return connection;
@@ -155,14 +151,14 @@ std::string DamagedSuffix() {
 }
 
 // Renames `path` and its -wal and -shm files with the same new suffix; the database's own name.
-std::optional<std::string> MoveAside(const std::string& path, std::string& aside) {
+SXStatus MoveAside(const std::string& path, std::string& aside) {
   std::string suffix = DamagedSuffix();
   std::error_code ec;
   for (int n = 2; std::filesystem::exists(path + suffix, ec); ++n) {
     suffix = DamagedSuffix() + "-" + std::to_string(n);
   }
   aside = path + suffix;
-  if (::rename(path.c_str(), aside.c_str()) != 0) return SXPosixError("rename " + path, errno);
+  if (::rename(path.c_str(), aside.c_str()) != 0) return SXErrnoStatus("rename " + path, errno);
   for (const char* extra : {"-wal", "-shm"}) {
     // A stale log of the old file must not be replayed into the new one.
     std::string from = path + extra;
@@ -170,7 +166,7 @@ std::optional<std::string> MoveAside(const std::string& path, std::string& aside
       ::unlink(from.c_str());
     }
   }
-  return std::nullopt;
+  return {};
 }
 
 bool IsPermissionErrno(int errnum) {
@@ -221,67 +217,59 @@ SXSqliteOpenFailure SXSqliteClassifyOpenFailure(int code, const SXSqliteFileProb
   }
 }
 
-std::unique_ptr<SXSqliteConnection> SXSqliteConnection::openOrRecover(
+SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::openOrRecover(
     const std::string& path, std::chrono::milliseconds busyTimeout, const std::string& schema,
-    std::string& error, std::string& recovered) {
+    std::string& recovered) {
   int code = SQLITE_OK;
-  auto connection = openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
-  if (connection) {
-    connection->convertToIncrementalVacuum();
+  auto connection = openWithCode(path, Mode::kReadWrite, busyTimeout, schema, code);
+  if (connection.ok()) {
+    (*connection)->convertToIncrementalVacuum();
     return connection;
   }
   SXSqliteFileProbe probe = SXSqliteProbeFile(path);
   switch (SXSqliteClassifyOpenFailure(code, probe)) {
     case SXSqliteOpenFailure::kNotWritable:
-      error = NotWritable(path, probe, code);
-      return nullptr;
+      return SXFailure(NotWritable(path, probe, code));
     case SXSqliteOpenFailure::kOther:
-      return nullptr;
+      return connection;
     case SXSqliteOpenFailure::kDamaged:
       break;
   }
   std::string aside;
-  if (auto failed = MoveAside(path, aside)) {
-    error += "; cannot move it aside: " + *failed;
-    return nullptr;
+  if (SXStatus moved = MoveAside(path, aside); !moved.ok()) {
+    return SXFailure(connection.error() + "; cannot move it aside: " + moved.error());
   }
-  recovered = error + "; moved it to " + aside + " and started a new store";
-  error.clear();
-  return openWithCode(path, Mode::kReadWrite, busyTimeout, schema, error, code);
+  recovered = connection.error() + "; moved it to " + aside + " and started a new store";
+  return openWithCode(path, Mode::kReadWrite, busyTimeout, schema, code);
 }
 
 void SXSqliteConnection::convertToIncrementalVacuum() {
   constexpr int64_t kIncremental = 2;
-  int64_t mode = 0;
-  if (queryInt("PRAGMA auto_vacuum", {}, mode) || mode == kIncremental) return;
+  SXResult<int64_t> mode = queryInt("PRAGMA auto_vacuum", {});
+  if (!mode.ok() || *mode == kIncremental) return;
   // The copy holds the write lock and needs room for a second copy of the file. When it cannot
   // be made (busy, disk full) the store works as before and the next open tries again.
-  exec("VACUUM");
+  (void)exec("VACUUM");
 }
 
-std::optional<std::string> SXSqliteConnection::queryInt(const std::string& sql,
-                                                        const SXSqliteRow& params, int64_t& value) {
+SXResult<int64_t> SXSqliteConnection::queryInt(const std::string& sql, const SXSqliteRow& params) {
   SXSqliteStatement statement;
   std::vector<SXValue> rows;
-  if (auto failed = prepare(sql, statement)) return failed;
-  if (auto failed = statement.query(params, rows)) return failed;
-  value = 0;
+  if (SXStatus failed = prepare(sql, statement); !failed.ok()) return failed;
+  if (SXStatus failed = statement.query(params, rows); !failed.ok()) return failed;
   if (!rows.empty() && !rows[0].empty() && rows[0].begin()->is_number_integer()) {
-    value = rows[0].begin()->get<int64_t>();
+    return rows[0].begin()->get<int64_t>();
   }
-  return std::nullopt;
+  return int64_t{0};
 }
 
-std::optional<std::string> SXSqliteConnection::usedBytes(uint64_t& bytes) {
-  int64_t used = 0;
-  if (auto failed =
-          queryInt("SELECT (p.page_count - f.freelist_count) * s.page_size "
-                   "FROM pragma_page_count() p, pragma_freelist_count() f, pragma_page_size() s",
-                   {}, used)) {
-    return failed;
-  }
-  bytes = static_cast<uint64_t>(std::max<int64_t>(used, 0));
-  return std::nullopt;
+SXResult<uint64_t> SXSqliteConnection::usedBytes() {
+  SXResult<int64_t> used = queryInt(
+      "SELECT (p.page_count - f.freelist_count) * s.page_size "
+      "FROM pragma_page_count() p, pragma_freelist_count() f, pragma_page_size() s",
+      {});
+  if (!used.ok()) return used.status();
+  return static_cast<uint64_t>(std::max<int64_t>(*used, 0));
 }
 
 int64_t SXSqliteConnection::changes() const { return sqlite3_changes64(db_); }
@@ -291,28 +279,27 @@ SXSqliteConnection::~SXSqliteConnection() {
   sqlite3_close_v2(db_);
 }
 
-std::optional<std::string> SXSqliteConnection::exec(const std::string& sql) {
+SXStatus SXSqliteConnection::exec(const std::string& sql) {
   char* message = nullptr;
   int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
-  if (rc == SQLITE_OK) return std::nullopt;
+  if (rc == SQLITE_OK) return {};
   std::string text = message ? message : sqlite3_errstr(rc);
   sqlite3_free(message);
   std::string first = sql.substr(0, sql.find_first_of(";("));
-  return first + ": " + text;
+  return SXFailure(first + ": " + text);
 }
 
-std::optional<std::string> SXSqliteConnection::prepare(const std::string& sql,
-                                                       SXSqliteStatement& out) {
+SXStatus SXSqliteConnection::prepare(const std::string& sql, SXSqliteStatement& out) {
   sqlite3_stmt* stmt = nullptr;
   int rc = sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()),
                               SQLITE_PREPARE_PERSISTENT, &stmt, nullptr);
   if (rc != SQLITE_OK) {
     sqlite3_finalize(stmt);
-    return Describe(db_, "prepare \"" + sql + "\"");
+    return SXFailure(Describe(db_, "prepare \"" + sql + "\""));
   }
   out.stmt_.reset(stmt);
   out.db_ = db_;
-  return std::nullopt;
+  return {};
 }
 
 int64_t SXSqliteConnection::lastInsertRowId() const { return sqlite3_last_insert_rowid(db_); }

@@ -1,8 +1,8 @@
 // A SQLite connection and its prepared statements: the one place the durable stores (analytics
 // events, power log, server-reporting spool) talk to libsqlite3.
 //
-// Errors are values: every call that can fail returns the failure's text
-// ("<context>: <what SQLite says>"), or nothing on success. Nothing throws.
+// Errors are values: every call that can fail returns a status (platform/Status.h) whose
+// failure text is "<context>: <what SQLite says>". Nothing throws.
 //
 // A connection and its statements are not thread-safe: their owner serialises every call (a
 // writer thread of its own, or a mutex). A statement must not outlive its connection.
@@ -18,6 +18,7 @@
 #include <variant>
 #include <vector>
 
+#include "platform/Status.h"
 #include "sxreporting/types.h"
 
 // One bound parameter or one stored column.
@@ -37,12 +38,12 @@ class SXSqliteStatement {
 
   explicit operator bool() const { return stmt_ != nullptr; }
 
-  // Binds `params` to ?1..?n, steps until done and resets. On failure returns why.
-  std::optional<std::string> run(const SXSqliteRow& params);
+  // Binds `params` to ?1..?n, steps until done and resets.
+  SXStatus run(const SXSqliteRow& params);
 
   // Binds `params` and appends each result row to `rows` as an object keyed by column name
-  // (integers, floating values, texts, nulls; blobs as texts). On failure returns why.
-  std::optional<std::string> query(const SXSqliteRow& params, std::vector<SXValue>& rows);
+  // (integers, floating values, texts, nulls; blobs as texts).
+  SXStatus query(const SXSqliteRow& params, std::vector<SXValue>& rows);
 
  private:
   friend class SXSqliteConnection;
@@ -50,7 +51,7 @@ class SXSqliteStatement {
     void operator()(sqlite3_stmt* stmt) const { sqlite3_finalize(stmt); }
   };
 
-  std::optional<std::string> bind(const SXSqliteRow& params);
+  SXStatus bind(const SXSqliteRow& params);
   std::string failure(const char* context) const;
 
   std::unique_ptr<sqlite3_stmt, Finalizer> stmt_;
@@ -65,11 +66,10 @@ class SXSqliteConnection {
   // WAL with synchronous=NORMAL (committed rows survive a crash of this process, not a power
   // loss), caps the WAL at kSXSqliteJournalSizeLimit after checkpoints and runs `schema`; a
   // file that can only be opened for reading is a failure (SQLITE_READONLY).
-  // Both modes wait up to `busyTimeout` for another connection's lock. On failure returns
-  // nullptr and sets `error`.
-  static std::unique_ptr<SXSqliteConnection> open(const std::string& path, Mode mode,
-                                                  std::chrono::milliseconds busyTimeout,
-                                                  const std::string& schema, std::string& error);
+  // Both modes wait up to `busyTimeout` for another connection's lock.
+  static SXResult<std::unique_ptr<SXSqliteConnection>> open(const std::string& path, Mode mode,
+                                                            std::chrono::milliseconds busyTimeout,
+                                                            const std::string& schema);
 
   // Opens `path` read-write like open(), and converts a store made without incremental
   // auto-vacuum once (a VACUUM: it holds the write lock while it copies the file, so only the
@@ -77,14 +77,11 @@ class SXSqliteConnection {
   // database (not a database, damaged, or not a regular file), it and its -wal and -shm files are
   // renamed with the suffix ".damaged-<yyyyMMdd-HHmmss>" and a new store is created; `recovered`
   // then says what was moved where, for the owner's error line. A store this user may not write
-  // (see SXSqliteClassifyOpenFailure), a busy store or a full disk is never moved aside. On
-  // failure returns nullptr and sets `error` ("... not writable by this user ..." for the
-  // permissions problem).
-  static std::unique_ptr<SXSqliteConnection> openOrRecover(const std::string& path,
-                                                           std::chrono::milliseconds busyTimeout,
-                                                           const std::string& schema,
-                                                           std::string& error,
-                                                           std::string& recovered);
+  // (see SXSqliteClassifyOpenFailure), a busy store or a full disk is never moved aside (the
+  // failure then says "... not writable by this user ..." for the permissions problem).
+  static SXResult<std::unique_ptr<SXSqliteConnection>> openOrRecover(
+      const std::string& path, std::chrono::milliseconds busyTimeout, const std::string& schema,
+      std::string& recovered);
 
   struct Key {  // only open() makes connections
    private:
@@ -97,26 +94,24 @@ class SXSqliteConnection {
   SXSqliteConnection& operator=(const SXSqliteConnection&) = delete;
 
   // Runs one or more statements that return nothing of interest.
-  std::optional<std::string> exec(const std::string& sql);
-  std::optional<std::string> prepare(const std::string& sql, SXSqliteStatement& out);
+  SXStatus exec(const std::string& sql);
+  SXStatus prepare(const std::string& sql, SXSqliteStatement& out);
   int64_t lastInsertRowId() const;
   // Rows the last INSERT, UPDATE or DELETE changed.
   int64_t changes() const;
   // The integer that `sql`, a query of one column, returns in its first row (0 when there is
-  // no row or no integer). On failure returns why.
-  std::optional<std::string> queryInt(const std::string& sql, const SXSqliteRow& params,
-                                      int64_t& value);
+  // no row or no integer).
+  SXResult<int64_t> queryInt(const std::string& sql, const SXSqliteRow& params);
   // The bytes the database's pages hold: (page_count - freelist_count) * page_size.
-  std::optional<std::string> usedBytes(uint64_t& bytes);
+  SXResult<uint64_t> usedBytes();
 
  private:
   void convertToIncrementalVacuum();
 
   // open(), also saying which SQLite result code made it fail (SQLITE_OK on success).
-  static std::unique_ptr<SXSqliteConnection> openWithCode(const std::string& path, Mode mode,
-                                                          std::chrono::milliseconds busyTimeout,
-                                                          const std::string& schema,
-                                                          std::string& error, int& code);
+  static SXResult<std::unique_ptr<SXSqliteConnection>> openWithCode(
+      const std::string& path, Mode mode, std::chrono::milliseconds busyTimeout,
+      const std::string& schema, int& code);
 
   sqlite3* db_;
 };

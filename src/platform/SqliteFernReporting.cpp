@@ -65,35 +65,35 @@ class SXSqliteFernReporting::Spool {
         busyTimeout_(busyTimeout),
         completions_("sxr-fernreport", log_) {}
 
-  // Stores one row; sets `rowId` to its id. On failure returns why.
-  std::optional<std::string> insert(Kind kind, const SXSqliteRow& row, int64_t* rowId = nullptr) {
-    PendingRow mine{kind, &row, rowId, std::nullopt, false};
+  // Stores one row; sets `rowId` to its id.
+  SXStatus insert(Kind kind, const SXSqliteRow& row, int64_t* rowId = nullptr) {
+    PendingRow mine{kind, &row, rowId, {}, false};
     PendingRow* rows[] = {&mine};
     insertAll(rows);
     return mine.result;
   }
 
   // Stores `rows` in order, in one transaction; returns each row's outcome.
-  std::vector<std::optional<std::string>> insertAll(Kind kind,
-                                                    const std::vector<SXSqliteRow>& rows) {
+  std::vector<SXStatus> insertAll(Kind kind, const std::vector<SXSqliteRow>& rows) {
     std::vector<PendingRow> mine;
     mine.reserve(rows.size());
-    for (const SXSqliteRow& row : rows) mine.push_back({kind, &row, nullptr, std::nullopt, false});
+    for (const SXSqliteRow& row : rows) mine.push_back({kind, &row, nullptr, {}, false});
     std::vector<PendingRow*> pointers;
     for (PendingRow& pending : mine) pointers.push_back(&pending);
     insertAll(pointers);
-    std::vector<std::optional<std::string>> results;
+    std::vector<SXStatus> results;
     for (PendingRow& pending : mine) results.push_back(std::move(pending.result));
     return results;
   }
 
   // Copies the WAL into the database; SQLite syncs the WAL before it does.
-  std::optional<std::string> checkpoint() {
+  SXStatus checkpoint() {
     Exclusive exclusive(*this);
-    std::string error;
-    if (!ensureOpen(error)) return error;
-    if (auto failed = db_->exec("PRAGMA wal_checkpoint(PASSIVE)")) return path_ + ": " + *failed;
-    return std::nullopt;
+    if (SXStatus opened = ensureOpen(); !opened.ok()) return opened;
+    if (SXStatus failed = db_->exec("PRAGMA wal_checkpoint(PASSIVE)"); !failed.ok()) {
+      return SXFailure(path_ + ": " + failed.error());
+    }
+    return {};
   }
 
   void post(std::function<void()> task) { completions_.post(std::move(task)); }
@@ -109,18 +109,20 @@ class SXSqliteFernReporting::Spool {
   const std::shared_ptr<SXLogFacility>& log() const { return log_; }
 
   // REQUIRES: the connection is ours (busy_ set by us), or no other thread knows this spool.
-  bool ensureOpen(std::string& error) {
-    if (db_) return true;
+  SXStatus ensureOpen() {
+    if (db_) return {};
     std::string recovered;
-    db_ = SXSqliteConnection::openOrRecover(path_, busyTimeout_, kSchema, error, recovered);
+    auto connection = SXSqliteConnection::openOrRecover(path_, busyTimeout_, kSchema, recovered);
     if (!recovered.empty()) SXLOG(*log_, nullptr, SXLogLevel::kError, "%s", recovered);
-    for (int kind = 0; db_ && kind < kKinds; ++kind) {
-      if (auto failed = db_->prepare(kInsert[kind], insert_[kind])) {
-        error = path_ + ": " + *failed;
+    if (!connection.ok()) return connection.status();
+    db_ = std::move(*connection);
+    for (int kind = 0; kind < kKinds; ++kind) {
+      if (SXStatus failed = db_->prepare(kInsert[kind], insert_[kind]); !failed.ok()) {
         close();
+        return SXFailure(path_ + ": " + failed.error());
       }
     }
-    return db_ != nullptr;
+    return {};
   }
 
  private:
@@ -129,7 +131,7 @@ class SXSqliteFernReporting::Spool {
     Kind kind;
     const SXSqliteRow* row;
     int64_t* rowId;
-    std::optional<std::string> result;  // written by the committer before `done`
+    SXStatus result;                    // written by the committer before `done`
     bool done = false;                  // under the spool's mutex_
   };
 
@@ -178,36 +180,33 @@ class SXSqliteFernReporting::Spool {
   // REQUIRES: busy_ set by this thread. Writes `batch` in one transaction; every row gets the
   // transaction's outcome.
   void commitBatch(const std::vector<PendingRow*>& batch) {
-    std::string error;
-    std::optional<std::string> failed;
-    if (!ensureOpen(error)) {
-      failed = error;
-    } else {
+    SXStatus failed = ensureOpen();
+    if (failed.ok()) {
       failed = writeRows(batch);
-      if (failed) {
-        if (batch.size() > 1) db_->exec("ROLLBACK");
+      if (!failed.ok()) {
+        if (batch.size() > 1) (void)db_->exec("ROLLBACK");
         close();  // the next batch starts on a fresh connection
-        failed = path_ + ": " + *failed;
+        failed = SXFailure(path_ + ": " + failed.error());
       }
     }
-    if (failed) writeErrors_ += batch.size();
+    if (!failed.ok()) writeErrors_ += batch.size();
     for (PendingRow* pending : batch) pending->result = failed;
   }
 
   // REQUIRES: busy_ set by this thread and the connection open.
-  std::optional<std::string> writeRows(const std::vector<PendingRow*>& batch) {
+  SXStatus writeRows(const std::vector<PendingRow*>& batch) {
     if (batch.size() == 1) return writeRow(*batch.front());  // its own transaction
-    if (auto failed = db_->exec("BEGIN IMMEDIATE")) return failed;
+    if (SXStatus failed = db_->exec("BEGIN IMMEDIATE"); !failed.ok()) return failed;
     for (PendingRow* pending : batch) {
-      if (auto failed = writeRow(*pending)) return failed;
+      if (SXStatus failed = writeRow(*pending); !failed.ok()) return failed;
     }
     return db_->exec("COMMIT");
   }
 
-  std::optional<std::string> writeRow(PendingRow& pending) {
-    if (auto failed = insert_[pending.kind].run(*pending.row)) return failed;
+  SXStatus writeRow(PendingRow& pending) {
+    if (SXStatus failed = insert_[pending.kind].run(*pending.row); !failed.ok()) return failed;
     if (pending.rowId) *pending.rowId = db_->lastInsertRowId();
-    return std::nullopt;
+    return {};
   }
 
   // REQUIRES: busy_ set by this thread. Statements go before the connection they belong to.
@@ -270,20 +269,22 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
     auto results = spool_->insertAll(kMessageRow, rows);
     std::vector<FernSendOutcome> outcomes(messages.size());
     for (size_t i = 0; i < results.size(); ++i) {
-      outcomes[i].sent = !results[i];
-      if (results[i]) outcomes[i].error = FernError{"cannot store the message: " + *results[i]};
+      outcomes[i].sent = results[i].ok();
+      if (!results[i].ok()) {
+        outcomes[i].error = FernError{"cannot store the message: " + results[i].error()};
+      }
     }
     return outcomes;
   }
 
   void flushMessages(FernFlushCompletion completion) override {
     // The flush row is stored now, so that it follows exactly the messages sent before it.
-    auto failed = spool_->insert(kFlushRow, {SXSqliteNow(), id_});
+    SXStatus failed = spool_->insert(kFlushRow, {SXSqliteNow(), id_});
     spool_->post([spool = spool_, failed, completion = std::move(completion)]() mutable {
-      if (!failed) failed = spool->checkpoint();
+      if (failed.ok()) failed = spool->checkpoint();
       if (!completion) return;
-      if (failed) {
-        completion(FernError{"cannot flush the messages: " + *failed});
+      if (!failed.ok()) {
+        completion(FernError{"cannot flush the messages: " + failed.error()});
       } else {
         completion(std::nullopt);
       }
@@ -303,8 +304,9 @@ SXSqliteFernReporting::SXSqliteFernReporting(std::string dbPath, std::string con
   log = SXLogOrDiscard(std::move(log));
   std::vector<std::string> backends = loadBackends(configPath_, log.get());
   spool_ = std::make_shared<Spool>(std::move(dbPath), std::move(backends), log, busyTimeout);
-  std::string error;
-  if (!spool_->ensureOpen(error)) SXLOG(*log, nullptr, SXLogLevel::kError, "%s", error);
+  if (SXStatus opened = spool_->ensureOpen(); !opened.ok()) {
+    SXLOG(*log, nullptr, SXLogLevel::kError, "%s", opened.error());
+  }
 }
 
 SXSqliteFernReporting::~SXSqliteFernReporting() = default;
@@ -341,10 +343,11 @@ std::shared_ptr<FernReportingSession> SXSqliteFernReporting::openSession(const S
     if (it != sessionInfo.end() && it->is_string()) token = it->get<std::string>();
   }
   int64_t id = 0;
-  auto failed =
+  SXStatus failed =
       spool_->insert(kSessionRow, {SXSqliteNow(), Json(sessionInfo), Json(userInfo), token}, &id);
-  if (failed) {
-    SXLOG(*spool_->log(), nullptr, SXLogLevel::kError, "cannot store the session: %s", *failed);
+  if (!failed.ok()) {
+    SXLOG(*spool_->log(), nullptr, SXLogLevel::kError, "cannot store the session: %s",
+          failed.error());
     return nullptr;
   }
   std::string serviceName = "(null)";
@@ -357,11 +360,11 @@ std::shared_ptr<FernReportingSession> SXSqliteFernReporting::openSession(const S
 bool SXSqliteFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue& userInfo,
                                            uint16_t category, uint16_t type, const SXValue& payload,
                                            std::optional<FernError>& error) {
-  auto failed =
+  SXStatus failed =
       spool_->insert(kMessageRow, {SXSqliteNow(), nullptr, Json(sessionInfo), Json(userInfo),
                                    int64_t(category), int64_t(type), Json(payload)});
-  if (!failed) return true;
-  error = FernError{"cannot store the message: " + *failed};
+  if (failed.ok()) return true;
+  error = FernError{"cannot store the message: " + failed.error()};
   return false;
 }
 

@@ -15,7 +15,6 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <optional>
 #include <string>
 
 #include "platform/SqliteConnection.h"
@@ -35,28 +34,26 @@ class SXSqlitePruner {
   // that also meet `condition` (SQL over the table's columns, "1" for all), oldest first. Rows
   // are taken in the order they were added, up to the first `chunkRows` of them that are all
   // younger than the cutoff: a row stamped older after a clock went back waits for its turn.
-  std::optional<std::string> deleteOlderThan(const std::string& table, double cutoff,
-                                             const std::string& condition, uint64_t& deleted);
+  SXStatus deleteOlderThan(const std::string& table, double cutoff, const std::string& condition,
+                           uint64_t& deleted);
 
   // Deletes the rows of `table` whose id is at most `lastId`.
-  std::optional<std::string> deleteThrough(const std::string& table, int64_t lastId,
-                                           uint64_t& deleted);
+  SXStatus deleteThrough(const std::string& table, int64_t lastId, uint64_t& deleted);
 
   // Deletes the oldest rows of `table` (by id) while the database holds more than `maxBytes`
   // (SXSqliteConnection::usedBytes), among the rows there when it began.
-  std::optional<std::string> deleteToSize(const std::string& table, uint64_t maxBytes,
-                                          uint64_t& deleted);
+  SXStatus deleteToSize(const std::string& table, uint64_t maxBytes, uint64_t& deleted);
 
   // Hands free pages back to the file system (incremental vacuum), then copies the WAL into
   // the database where no reader needs it (a passive checkpoint), so that the file shrinks.
-  std::optional<std::string> releaseFreePages();
+  SXStatus releaseFreePages();
 
  private:
   // Deletes, chunk by chunk, up to `maxRows` rows of `table` that meet `condition` (with
   // `params` as ?1...), in `order`.
-  std::optional<std::string> deleteInChunks(const std::string& table, const std::string& condition,
-                                            const std::string& order, const SXSqliteRow& params,
-                                            int64_t maxRows, uint64_t& deleted);
+  SXStatus deleteInChunks(const std::string& table, const std::string& condition,
+                          const std::string& order, const SXSqliteRow& params, int64_t maxRows,
+                          uint64_t& deleted);
   bool cancelled() const { return options_.cancelled && options_.cancelled->load(); }
   void pauseAfter(std::chrono::steady_clock::time_point start) const;
 

@@ -44,26 +44,25 @@ bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider
 
 void SXSqliteTallyvane::flush() { writer_.flush(); }
 
-std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
-                                                   std::optional<std::string> nameFilter,
-                                                   int64_t limit, std::string& error,
-                                                   std::optional<double> since) {
+SXResult<std::vector<SXValue>> SXSqliteTallyvane::readEvents(const std::string& dbPath,
+                                                             std::optional<std::string> nameFilter,
+                                                             int64_t limit,
+                                                             std::optional<double> since) {
   auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
-                                     kSXSqliteBusyTimeout, "", error);
-  if (!db) return {};
+                                     kSXSqliteBusyTimeout, "");
+  if (!db.ok()) return db.status();
   SXSqliteStatement select;
   std::vector<SXValue> rows;
-  if (auto failed = db->prepare(kSelect, select)) {
-    error = dbPath + ": " + *failed;
-    return {};
+  if (SXStatus failed = (*db)->prepare(kSelect, select); !failed.ok()) {
+    return SXFailure(dbPath + ": " + failed.error());
   }
   SXSqliteField filter = nullptr;
   if (nameFilter) filter = *nameFilter;
   SXSqliteField from = nullptr;
   if (since) from = *since;
-  if (auto failed = select.query({filter, limit > 0 ? limit : int64_t(-1), from}, rows)) {
-    error = dbPath + ": " + *failed;
-    return {};
+  if (SXStatus failed = select.query({filter, limit > 0 ? limit : int64_t(-1), from}, rows);
+      !failed.ok()) {
+    return SXFailure(dbPath + ": " + failed.error());
   }
   for (SXValue& row : rows) {
     SXValue& stored = row["payload_json"];
@@ -79,6 +78,6 @@ std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
 std::vector<SXValue> SXSqliteTallyvane::readEvents(const std::string& dbPath,
                                                    std::optional<std::string> nameFilter,
                                                    int64_t limit) {
-  std::string ignored;
-  return readEvents(dbPath, std::move(nameFilter), limit, ignored);
+  auto rows = readEvents(dbPath, std::move(nameFilter), limit, std::nullopt);
+  return rows.ok() ? std::move(*rows) : std::vector<SXValue>{};
 }

@@ -46,11 +46,10 @@ class SXSqliteTallyvane final : public SXTallyvane {
   // `nameFilter` (an exact name matches itself) and, with `since`, stored at or after that
   // time (seconds since the epoch), oldest first, as objects {"id", "time", "name",
   // "payload"}; "payload" is the stored JSON parsed (its text when it does not parse).
-  // Opens `dbPath` read-only. On failure returns no rows and sets `error`.
-  static std::vector<SXValue> readEvents(const std::string& dbPath,
-                                         std::optional<std::string> nameFilter, int64_t limit,
-                                         std::string& error,
-                                         std::optional<double> since = std::nullopt);
+  // Opens `dbPath` read-only.
+  static SXResult<std::vector<SXValue>> readEvents(const std::string& dbPath,
+                                                   std::optional<std::string> nameFilter,
+                                                   int64_t limit, std::optional<double> since);
   // The same, for callers that treat an unreadable store as an empty one.
   static std::vector<SXValue> readEvents(const std::string& dbPath,
                                          std::optional<std::string> nameFilter, int64_t limit);

@@ -407,27 +407,22 @@ void SXUnixSocketListener::resumePaused() {
   for (const auto& connection : live) connection->resumeIfAllowed();
 }
 
-bool SXUnixSocketListener::open(std::string& error) {
+SXStatus SXUnixSocketListener::open() {
   std::error_code ec;
   // Clears LISTEN_FDS and LISTEN_PID, so that nothing this process starts takes them as its own.
   int passed = sd_listen_fds(1);
-  if (passed < 0) {
-    error = SXPosixError("sd_listen_fds", -passed);
-    return false;
-  }
+  if (passed < 0) return SXErrnoStatus("sd_listen_fds", -passed);
   if (passed > 0) {
     if (passed != 1 || sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) <= 0) {
-      error = "the service manager passed " + std::to_string(passed) +
-              " descriptors; expected one listening Unix stream socket";
-      return false;
+      return SXFailure("the service manager passed " + std::to_string(passed) +
+                       " descriptors; expected one listening Unix stream socket");
     }
     acceptor_.assign(asio::local::stream_protocol(), SD_LISTEN_FDS_START, ec);
     if (ec) {
-      error = "cannot adopt the socket passed by the service manager: " + ec.message();
-      return false;
+      return SXFailure("cannot adopt the socket passed by the service manager: " + ec.message());
     }
     activated_ = true;
-    return true;
+    return {};
   }
   ::unlink(options_.socketPath.c_str());  // a stale socket of an earlier run
   asio::local::stream_protocol::endpoint endpoint(options_.socketPath);
@@ -444,17 +439,13 @@ bool SXUnixSocketListener::open(std::string& error) {
     ::umask(processMask);
   }
   if (!ec) acceptor_.listen(asio::socket_base::max_listen_connections, ec);
-  if (ec) {
-    error = options_.socketPath + ": " + ec.message();
-    return false;
-  }
+  if (ec) return SXFailure(options_.socketPath + ": " + ec.message());
   // The umask can only take bits away, so the exact mode (perhaps wider than the umask) is set
   // here; until then the socket is at most as open as the mode.
   if (::chmod(options_.socketPath.c_str(), static_cast<mode_t>(options_.socketMode)) != 0) {
-    error = SXPosixError(options_.socketPath, errno);
-    return false;
+    return SXErrnoStatus(options_.socketPath, errno);
   }
-  return true;
+  return {};
 }
 
 void SXUnixSocketListener::setDelegate(std::shared_ptr<SXIpcListenerDelegate> delegate) {

@@ -39,6 +39,7 @@
 #include "platform/Dispatch.h"
 #include "platform/Ipc.h"
 #include "platform/Log.h"
+#include "platform/Status.h"
 
 class SXUnixSocketConnection;
 
@@ -61,8 +62,8 @@ class SXUnixSocketListener final : public SXIpcListener {
   SXUnixSocketListener(Options options, std::shared_ptr<SXLogFacility> log);
   ~SXUnixSocketListener() override;
 
-  // Binds and listens, or adopts a socket-activated one. On failure returns false and says why.
-  bool open(std::string& error);
+  // Binds and listens, or adopts a socket-activated one.
+  SXStatus open();
   // Whether `open` adopted a socket from the service manager.
   bool socketActivated() const { return activated_; }
 

@@ -36,11 +36,9 @@ RowsById readRows(SXSqliteConnection& db, const Store& store) {
   SXSqliteStatement select;
   std::vector<SXValue> rows;
   std::string sql = std::string("SELECT id, payload_json FROM ") + store.table;
-  if (auto failed = db.prepare(sql, select)) {
-    ADD_FAILURE() << *failed;
-    return {};
-  }
-  if (auto failed = select.query({}, rows)) ADD_FAILURE() << *failed;
+  SXStatus failed = db.prepare(sql, select);
+  if (failed.ok()) failed = select.query({}, rows);
+  if (!failed.ok()) ADD_FAILURE() << failed.error();
   RowsById out;
   for (const auto& row : rows) {
     out[row["id"].get<int64_t>()] = row["payload_json"].get<std::string>();
@@ -54,11 +52,10 @@ class CommittedRows {
  public:
   explicit CommittedRows(const TestDaemon& daemon) {
     for (const Store& store : kStores) {
-      std::string error;
       auto db = SXSqliteConnection::open(daemon.stateFile(store.db),
-                                         SXSqliteConnection::Mode::kReadOnly, 5s, "", error);
-      EXPECT_TRUE(db) << error;
-      connections_.push_back(std::move(db));
+                                         SXSqliteConnection::Mode::kReadOnly, 5s, "");
+      EXPECT_TRUE(db.ok()) << db.error();
+      connections_.push_back(db.ok() ? std::move(*db) : nullptr);
     }
   }
 
@@ -300,11 +297,10 @@ TEST(CrashSafetyEndToEnd, KillNineUnderLoadLosesNoCommittedRow) {
   int64_t after[3];
   for (size_t i = 0; i < 3; ++i) {
     const Store& store = kStores[i];
-    std::string error;
     auto db = SXSqliteConnection::open(restarted.stateFile(store.db),
-                                       SXSqliteConnection::Mode::kReadOnly, 5s, "", error);
-    ASSERT_TRUE(db) << error;
-    RowsById now = readRows(*db, store);
+                                       SXSqliteConnection::Mode::kReadOnly, 5s, "");
+    ASSERT_TRUE(db.ok()) << db.error();
+    RowsById now = readRows(**db, store);
     size_t missing = 0;
     for (const auto& [id, payload] : committed->seen(i)) {
       auto found = now.find(id);

@@ -42,20 +42,17 @@ inline std::string SXTestReadFile(const std::string& path) {
 
 // Every row `sql` returns, read through a connection of its own.
 inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::string& sql) {
-  std::string error;
   auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
-                                     std::chrono::seconds(5), "", error);
-  if (!db) {
-    ADD_FAILURE() << error;
+                                     std::chrono::seconds(5), "");
+  if (!db.ok()) {
+    ADD_FAILURE() << db.error();
     return {};
   }
   SXSqliteStatement statement;
   std::vector<SXValue> rows;
-  if (auto failed = db->prepare(sql, statement)) {
-    ADD_FAILURE() << *failed;
-  } else if (auto failed = statement.query({}, rows)) {
-    ADD_FAILURE() << *failed;
-  }
+  SXStatus failed = (*db)->prepare(sql, statement);
+  if (failed.ok()) failed = statement.query({}, rows);
+  if (!failed.ok()) ADD_FAILURE() << failed.error();
   return rows;
 }
 
@@ -63,17 +60,14 @@ inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::st
 class SXTestWriteLock {
  public:
   explicit SXTestWriteLock(const std::string& dbPath) {
-    std::string error;
-    db_ = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadWrite,
-                                   std::chrono::seconds(5), "", error);
-    if (!db_) {
-      ADD_FAILURE() << error;
-    } else if (auto failed = db_->exec("BEGIN EXCLUSIVE")) {
-      ADD_FAILURE() << *failed;
-    }
+    auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadWrite,
+                                       std::chrono::seconds(5), "");
+    SXStatus failed = db.ok() ? (*db)->exec("BEGIN EXCLUSIVE") : db.status();
+    if (!failed.ok()) ADD_FAILURE() << failed.error();
+    if (db.ok()) db_ = std::move(*db);
   }
   ~SXTestWriteLock() {
-    if (db_) db_->exec("ROLLBACK");
+    if (db_) (void)db_->exec("ROLLBACK");
   }
 
  private:

@@ -388,9 +388,8 @@ SXUnixSocketListener::Options listenerOptions(const Options& options,
 // Serves until a stop has drained; returns the exit status.
 int serve(Service& s) {
   SXLogFacility& log = s.environment.log();
-  std::string error;
-  if (!s.listener.open(error)) {
-    SXLOG(log, nullptr, SXLogLevel::kError, "cannot listen: %@", error);
+  if (SXStatus opened = s.listener.open(); !opened.ok()) {
+    SXLOG(log, nullptr, SXLogLevel::kError, "cannot listen: %@", opened.error());
     return 1;
   }
   s.listener.setDelegate(s.delegate.shared_from_this());
@@ -459,11 +458,10 @@ int main(int argc, char** argv) {
                                         .log = log},
                                        SXRetentionPolicy());
   configFile.addSection([&retention, &configFile, &log](const SXValue& file) {
-    std::string error;
-    auto policy = SXRetentionPolicy::fromConfigFile(file, error);
-    if (!policy) {
+    auto policy = SXRetentionPolicy::fromConfigFile(file);
+    if (!policy.ok()) {
       SXLOG(*log, nullptr, SXLogLevel::kError, "%@: %@; keeping the retention as it was",
-            configFile.path(), error);
+            configFile.path(), policy.error());
       return false;
     }
     SXLOG(*log, nullptr, SXLogLevel::kDefault, "retention: %@", policy->description());

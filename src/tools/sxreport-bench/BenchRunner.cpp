@@ -111,7 +111,9 @@ TargetFigures RunScenario(const BenchScenario& scenario, const BenchOptions& opt
   StoreRows rows(target.stateDir, BenchScenario::eventName(), BenchScenario::kCategory & 0xFFFF,
                  BenchScenario::kType);
   if (countRows) {
-    if (auto failed = rows.mark()) return fail("cannot read the stores: " + *failed);
+    if (SXStatus marked = rows.mark(); !marked.ok()) {
+      return fail("cannot read the stores: " + marked.error());
+    }
   }
   auto cpuBefore = cpuSeconds(target, pid);
   RssSampler sampler(target, pid, figures.messages, options.rssSamples, pool, figures);

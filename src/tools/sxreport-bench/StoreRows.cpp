@@ -12,41 +12,41 @@ StoreRows::StoreRows(std::string stateDir, std::string eventName, int64_t catego
       category_(category),
       type_(type) {}
 
-std::optional<std::string> StoreRows::query(const std::string& db, const std::string& sql,
-                                            int64_t& value) const {
-  value = 0;
+SXResult<int64_t> StoreRows::query(const std::string& db, const std::string& sql) const {
   std::string path = stateDir_ + "/" + db;
-  if (!std::filesystem::exists(path)) return std::nullopt;  // nothing written yet
-  std::string error;
-  auto connection = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadOnly,
-                                             kSXSqliteBusyTimeout, "", error);
-  if (!connection) return error;
+  if (!std::filesystem::exists(path)) return int64_t{0};  // nothing written yet
+  auto connection =
+      SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadOnly, kSXSqliteBusyTimeout, "");
+  if (!connection.ok()) return connection.status();
   SXSqliteStatement statement;
-  if (auto failed = connection->prepare(sql, statement)) return *failed;
+  if (SXStatus failed = (*connection)->prepare(sql, statement); !failed.ok()) return failed;
   std::vector<SXValue> rows;
-  if (auto failed = statement.query({}, rows)) return *failed;
-  if (rows.size() == 1 && rows[0]["n"].is_number_integer()) value = rows[0]["n"].get<int64_t>();
-  return std::nullopt;
+  if (SXStatus failed = statement.query({}, rows); !failed.ok()) return failed;
+  if (rows.size() == 1 && rows[0]["n"].is_number_integer()) return rows[0]["n"].get<int64_t>();
+  return int64_t{0};
 }
 
-std::optional<std::string> StoreRows::mark() {
-  if (auto failed =
-          query("tallyvane.db", "SELECT coalesce(max(id), 0) AS n FROM events", mark_.tallyvane)) {
-    return failed;
-  }
-  return query("fernreporting.db", "SELECT coalesce(max(id), 0) AS n FROM messages",
-               mark_.fernReporting);
+SXStatus StoreRows::mark() {
+  auto events = query("tallyvane.db", "SELECT coalesce(max(id), 0) AS n FROM events");
+  if (!events.ok()) return events.status();
+  auto messages = query("fernreporting.db", "SELECT coalesce(max(id), 0) AS n FROM messages");
+  if (!messages.ok()) return messages.status();
+  mark_ = {*events, *messages};
+  return {};
 }
 
-std::optional<std::string> StoreRows::count(StoreCounts& counts) const {
+SXResult<StoreCounts> StoreRows::count() const {
   // Names and numbers are the benchmark's own, never user text, so they go in as literals.
-  std::string events = "SELECT count(*) AS n FROM events WHERE id > " +
-                       std::to_string(mark_.tallyvane) + " AND name = '" + eventName_ + "'";
-  if (auto failed = query("tallyvane.db", events, counts.tallyvane)) return failed;
-  std::string messages =
-      "SELECT count(*) AS n FROM messages WHERE id > " + std::to_string(mark_.fernReporting) +
-      " AND category = " + std::to_string(category_) + " AND type = " + std::to_string(type_);
-  return query("fernreporting.db", messages, counts.fernReporting);
+  auto events = query("tallyvane.db", "SELECT count(*) AS n FROM events WHERE id > " +
+                                          std::to_string(mark_.tallyvane) + " AND name = '" +
+                                          eventName_ + "'");
+  if (!events.ok()) return events.status();
+  auto messages = query("fernreporting.db", "SELECT count(*) AS n FROM messages WHERE id > " +
+                                                std::to_string(mark_.fernReporting) +
+                                                " AND category = " + std::to_string(category_) +
+                                                " AND type = " + std::to_string(type_));
+  if (!messages.ok()) return messages.status();
+  return StoreCounts{*events, *messages};
 }
 
 StoreCounts StoreRows::waitFor(const StoreCounts& expected, std::chrono::milliseconds quiet,
@@ -54,12 +54,13 @@ StoreCounts StoreRows::waitFor(const StoreCounts& expected, std::chrono::millise
   StoreCounts counts;
   auto lastProgress = std::chrono::steady_clock::now();
   for (;;) {
-    StoreCounts now;
     auto started = std::chrono::steady_clock::now();
-    if (auto failed = count(now)) {
-      error = *failed;
+    SXResult<StoreCounts> counted = count();
+    if (!counted.ok()) {
+      error = counted.error();
       return counts;
     }
+    const StoreCounts& now = *counted;
     if (now.tallyvane != counts.tallyvane || now.fernReporting != counts.fernReporting) {
       lastProgress = std::chrono::steady_clock::now();
     }

@@ -7,8 +7,9 @@
 
 #include <chrono>
 #include <cstdint>
-#include <optional>
 #include <string>
+
+#include "platform/Status.h"
 
 struct StoreCounts {
   int64_t tallyvane = 0;
@@ -21,17 +22,18 @@ class StoreRows {
   StoreRows(std::string stateDir, std::string eventName, int64_t category, int64_t type);
 
   // Remembers the newest row of each store; later counts see only rows after it.
-  std::optional<std::string> mark();
+  SXStatus mark();
   // The rows of the run so far.
-  std::optional<std::string> count(StoreCounts& counts) const;
+  SXResult<StoreCounts> count() const;
   // Polls until both stores hold `expected` rows, or no new row has come for `quiet`.
   // Returns the last counts; `error` is set when a store could not be read.
   StoreCounts waitFor(const StoreCounts& expected, std::chrono::milliseconds quiet,
                       std::string& error) const;
 
  private:
-  std::optional<std::string> query(const std::string& db, const std::string& sql,
-                                   int64_t& value) const;
+  // The integer column "n" of the one row `sql` returns from the store file `db`; 0 when
+  // there is no such row or no such file yet.
+  SXResult<int64_t> query(const std::string& db, const std::string& sql) const;
 
   const std::string stateDir_;
   const std::string eventName_;

@@ -1,7 +1,6 @@
 #include "CtlLocal.h"
 
 #include <cstdio>
-#include <cstring>
 #include <ctime>
 #include <filesystem>
 #include <iostream>
@@ -41,16 +40,14 @@ void printEvent(const SXValue& event) {
 int SXCtlRunEvents(const SXCtlRequest& r, const SXPaths& paths) {
   const std::string path = paths.stateDir + "/tallyvane.db";
   if (!fs::exists(path)) return fail("events: no analytics store at " + path);
-  std::string error;
-  std::vector<SXValue> events =
-      SXSqliteTallyvane::readEvents(path, r.eventName, r.limit.value_or(0), error, r.since);
-  if (!error.empty()) return fail("events: cannot read " + error);
+  auto events = SXSqliteTallyvane::readEvents(path, r.eventName, r.limit.value_or(0), r.since);
+  if (!events.ok()) return fail("events: cannot read " + events.error());
   if (r.json) {
-    std::cout << jsonText(SXValue(std::move(events))) << "\n";
-  } else if (events.empty()) {
+    std::cout << jsonText(SXValue(std::move(*events))) << "\n";
+  } else if (events->empty()) {
     std::cout << "(none)\n";
   } else {
-    for (const SXValue& event : events) printEvent(event);
+    for (const SXValue& event : *events) printEvent(event);
   }
   return 0;
 }
@@ -74,31 +71,26 @@ uint64_t fileBytes(const std::string& path) {
 }
 
 // {"store", "rows", "oldest" (seconds since the epoch, or null), "usedBytes", "fileBytes",
-// "walBytes"}, or an error.
-std::optional<std::string> measureStore(const std::string& dir, const StoreFile& store,
-                                        SXValue& out) {
+// "walBytes"}.
+SXResult<SXValue> measureStore(const std::string& dir, const StoreFile& store) {
   const std::string path = dir + "/" + store.file;
-  std::string error;
   auto db = SXSqliteConnection::open(path, SXSqliteConnection::Mode::kReadOnly,
-                                     std::chrono::seconds(2), "", error);
-  if (!db) return error;
+                                     std::chrono::seconds(2), "");
+  if (!db.ok()) return db.status();
   SXSqliteStatement statement;
   std::vector<SXValue> rows;
-  uint64_t used = 0;
   const std::string table = store.table;
-  if (auto failed =
-          db->prepare("SELECT COUNT(*) AS rows, MIN(time) AS oldest FROM " + table, statement)) {
-    return path + ": " + *failed;
-  }
-  if (auto failed = statement.query({}, rows)) return path + ": " + *failed;
-  if (auto failed = db->usedBytes(used)) return path + ": " + *failed;
-  out = {{"store", store.file},
-         {"rows", rows.at(0)["rows"]},
-         {"oldest", rows.at(0)["oldest"]},
-         {"usedBytes", used},
-         {"fileBytes", fileBytes(path)},
-         {"walBytes", fileBytes(path + "-wal")}};
-  return std::nullopt;
+  SXStatus failed =
+      (*db)->prepare("SELECT COUNT(*) AS rows, MIN(time) AS oldest FROM " + table, statement);
+  if (failed.ok()) failed = statement.query({}, rows);
+  SXResult<uint64_t> used = failed.ok() ? (*db)->usedBytes() : SXResult<uint64_t>(failed);
+  if (!used.ok()) return SXFailure(path + ": " + used.error());
+  return SXValue{{"store", store.file},
+                 {"rows", rows.at(0)["rows"]},
+                 {"oldest", rows.at(0)["oldest"]},
+                 {"usedBytes", *used},
+                 {"fileBytes", fileBytes(path)},
+                 {"walBytes", fileBytes(path + "-wal")}};
 }
 
 std::string bytesText(uint64_t bytes) {
@@ -135,12 +127,10 @@ int SXCtlRunSizes(const SXCtlRequest& r, const SXPaths& paths) {
   for (const StoreFile& store : kStoreFiles) {
     const std::string path = paths.stateDir + "/" + store.file;
     if (!fs::exists(path)) continue;
-    SXValue measured;
-    if (auto failed = measureStore(paths.stateDir, store, measured)) {
-      return fail("sizes: " + *failed);
-    }
-    if (!r.json) printStore(measured);
-    all.push_back(std::move(measured));
+    SXResult<SXValue> measured = measureStore(paths.stateDir, store);
+    if (!measured.ok()) return fail("sizes: " + measured.error());
+    if (!r.json) printStore(*measured);
+    all.push_back(std::move(*measured));
   }
   if (r.json) std::cout << jsonText(all) << "\n";
   if (!r.json && all.empty()) std::cout << "(no stores in " << paths.stateDir << ")\n";
@@ -198,15 +188,16 @@ int SXCtlRunDefaults(const SXCtlRequest& r, const SXPaths& paths) {
   SXJsonPreferences preferences(paths.preferencesDirectory(), std::make_shared<SXDiscardLog>());
   std::optional<SXValue> value;
   if (r.defaultsAction == "write") value = r.value;
-  if (auto error = preferences.setValue(kSXCtlPreferencesDomain, *r.key, value)) {
-    return fail("defaults: " + *error);
+  if (SXStatus set = preferences.setValue(kSXCtlPreferencesDomain, *r.key, value); !set.ok()) {
+    return fail("defaults: " + set.error());
   }
   return 0;
 }
 
 int SXCtlRunNotify(const SXCtlRequest& r, const SXPaths& paths) {
-  if (int error = SXInotifyNotifications::postIn(paths.runtimeDir, r.notificationName)) {
-    return fail("notify: cannot post " + r.notificationName + ": " + std::strerror(error));
+  if (SXStatus posted = SXInotifyNotifications::postIn(paths.runtimeDir, r.notificationName);
+      !posted.ok()) {
+    return fail("notify: " + posted.error());
   }
   return 0;
 }
