@@ -31,7 +31,7 @@ else()
   file(GLOB SXR_FUZZ_FAKES CONFIGURE_DEPENDS tests/fakes/*.cpp)
   add_library(sxreporting_fuzzsupport STATIC ${SXR_FUZZ_FAKES} tests/support/TestEnvironment.cpp)
   target_include_directories(sxreporting_fuzzsupport PUBLIC tests)
-  target_link_libraries(sxreporting_fuzzsupport PUBLIC sxr_service)
+  target_link_libraries(sxreporting_fuzzsupport PUBLIC sxr_service ${SXR_ADAPTER_LAYERS})
   target_compile_options(sxreporting_fuzzsupport PRIVATE
                          -fsanitize=fuzzer-no-link,${SXR_FUZZ_SANITIZERS} -fno-omit-frame-pointer)
   set(SXR_FUZZ_SUPPORT sxreporting_fuzzsupport)

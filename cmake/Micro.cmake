@@ -6,7 +6,7 @@ if(benchmark_FOUND)
   if(SXR_MICRO_SOURCES)
     add_executable(sxr-micro ${SXR_MICRO_SOURCES})
     target_precompile_headers(sxr-micro PRIVATE <nlohmann/json.hpp> <msgpack.hpp>)
-    target_link_libraries(sxr-micro PRIVATE sxr_service benchmark::benchmark
+    target_link_libraries(sxr-micro PRIVATE sxr_service sxr_sqlite benchmark::benchmark
                           benchmark::benchmark_main)
   endif()
 endif()

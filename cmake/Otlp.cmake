@@ -3,7 +3,7 @@
 find_package(Protobuf REQUIRED)
 find_package(ZLIB REQUIRED)
 add_subdirectory(third_party/opentelemetry-proto)
-target_link_libraries(sxr_platform PUBLIC sxreporting_otlp_proto ZLIB::ZLIB)
+target_link_libraries(sxr_export PRIVATE sxreporting_otlp_proto ZLIB::ZLIB)
 # service.version of the exported resource.
-set_property(SOURCE src/platform/OtlpExportOptions.cpp APPEND PROPERTY
+set_property(SOURCE src/export/OtlpExportOptions.cpp APPEND PROPERTY
              COMPILE_DEFINITIONS SXR_PROJECT_VERSION="${PROJECT_VERSION}")

@@ -11,11 +11,6 @@ class SXClock {
   virtual SXDate now() const = 0;
 };
 
-class SXSystemClock final : public SXClock {
- public:
-  SXDate now() const override { return std::chrono::system_clock::now(); }
-};
-
 // Seconds between two dates, as a floating value (b - a).
 inline double SXSecondsBetween(SXDate a, SXDate b) {
   return std::chrono::duration<double>(b - a).count();

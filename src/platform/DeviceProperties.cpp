@@ -1,4 +1,4 @@
-#include "platform/DeviceProperties.h"
+#include "platform/JsonDeviceProperties.h"
 
 #include <fstream>
 

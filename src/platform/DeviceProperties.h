@@ -1,11 +1,9 @@
 // Device properties ("InternalBuild", "DeviceClassNumber"). May be called from any thread.
 #pragma once
 
-#include <mutex>
 #include <optional>
 #include <string>
 
-#include "common/SXThreadSafety.h"
 #include "sxreporting/types.h"
 
 class SXDeviceProperties {
@@ -13,19 +11,4 @@ class SXDeviceProperties {
   virtual ~SXDeviceProperties() = default;
   // The property's value, or nothing when the device gives no answer.
   virtual std::optional<SXValue> property(const std::string& key) const = 0;
-};
-
-// Production: the JSON object in `<config-dir>/device.json`, read at construction and again
-// by reload(). An absent or unreadable file answers nothing for every key.
-class SXJsonDeviceProperties final : public SXDeviceProperties {
- public:
-  explicit SXJsonDeviceProperties(std::string path);
-  std::optional<SXValue> property(const std::string& key) const override;
-  // Reads the file again; returns whether the answers changed. Any thread.
-  bool reload();
-
- private:
-  const std::string path_;
-  mutable SXMutex mutex_;
-  SXValue properties_ SX_GUARDED_BY(mutex_);
 };

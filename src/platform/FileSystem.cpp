@@ -1,4 +1,4 @@
-#include "platform/FileSystem.h"
+#include "platform/PosixFileSystem.h"
 
 #include <fcntl.h>
 #include <sys/random.h>

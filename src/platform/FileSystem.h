@@ -25,31 +25,3 @@ class SXFileSystem {
                                                             const std::string& contents,
                                                             bool& taken) = 0;
 };
-
-class SXPosixFileSystem final : public SXFileSystem {
- public:
-  std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override;
-  std::optional<std::string> writeFileAtomically(const std::string& path,
-                                                 const std::string& contents) override;
-  std::optional<std::string> writeNewFileAtomically(const std::string& path,
-                                                    const std::string& contents,
-                                                    bool& taken) override;
-
- private:
-  // `taken`: null to replace what is at `path`, else set when something is there.
-  std::optional<std::string> write(const std::string& path, const std::string& contents,
-                                   bool* taken);
-};
-
-// Owns one file descriptor and closes it (which also releases an flock taken through it).
-class SXScopedFd {
- public:
-  explicit SXScopedFd(int fd) : fd_(fd) {}
-  ~SXScopedFd();
-  SXScopedFd(const SXScopedFd&) = delete;
-  SXScopedFd& operator=(const SXScopedFd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};

@@ -1,4 +1,4 @@
-#include "platform/Orientation.h"
+#include "platform/NoSensorOrientation.h"
 
 std::string SXNoSensorOrientationService::orientationName(int32_t orientation) const {
   switch (orientation) {

@@ -19,13 +19,3 @@ class SXOrientationService {
   virtual void unregisterInterfaceOrientationCallback(const std::string& id) = 0;
   virtual std::string orientationName(int32_t orientation) const = 0;
 };
-
-// Production: the device has no orientation sensor. Registrations succeed; no callback comes.
-class SXNoSensorOrientationService final : public SXOrientationService {
- public:
-  void registerDeviceOrientationCallback(const std::string&, SXOrientationCallback) override {}
-  void registerInterfaceOrientationCallback(const std::string&, SXOrientationCallback) override {}
-  void unregisterDeviceOrientationCallback(const std::string&) override {}
-  void unregisterInterfaceOrientationCallback(const std::string&) override {}
-  std::string orientationName(int32_t orientation) const override;
-};

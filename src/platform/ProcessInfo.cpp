@@ -1,4 +1,4 @@
-#include "platform/ProcessInfo.h"
+#include "platform/ProcProcessInfo.h"
 
 #include <unistd.h>
 

@@ -15,12 +15,3 @@ class SXProcessInfo {
   // Ends the process at once with `status`, running no destructors.
   virtual void exitProcess(int status) = 0;
 };
-
-// Production: getpid(), /proc/<pid>/comm, _exit.
-class SXProcProcessInfo final : public SXProcessInfo {
- public:
-  int32_t processIdentifier() const override;
-  std::string processName() const override;
-  std::optional<std::string> commandName(int32_t pid) const override;
-  void exitProcess(int status) override;
-};

@@ -1,4 +1,4 @@
-#include "platform/Trace.h"
+#include "platform/UsdtTracer.h"
 
 #include <sys/sdt.h>
 

@@ -1,5 +1,4 @@
-// Kernel trace points: a 32-bit code with four zero arguments.
-// Production fires the USDT probe sxreporting:trace(code). May be called from any thread.
+// Kernel trace points: a 32-bit code with four zero arguments. May be called from any thread.
 #pragma once
 
 #include <cstdint>
@@ -8,9 +7,4 @@ class SXTracer {
  public:
   virtual ~SXTracer() = default;
   virtual void trace(uint32_t code) = 0;
-};
-
-class SXUsdtTracer final : public SXTracer {
- public:
-  void trace(uint32_t code) override;
 };
