@@ -1,4 +1,4 @@
-#include "platform/FileKestrel.h"
+#include "linux/FileKestrel.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -10,7 +10,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "SXReportingDriverUtility.h"
+#include "Statistics/SXReportingDriverUtility.h"
 #include "fakes/FakeLog.h"
 #include "support/SqliteTestSupport.h"
 

@@ -1,4 +1,4 @@
-#include "platform/InotifyNotifications.h"
+#include "linux/InotifyNotifications.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -18,7 +18,7 @@
 
 #include "common/SXThreadSafety.h"
 #include "fakes/FakeLog.h"
-#include "platform/AsioDispatch.h"
+#include "linux/AsioDispatch.h"
 #include "support/SqliteTestSupport.h"
 
 namespace fs = std::filesystem;

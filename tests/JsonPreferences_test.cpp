@@ -1,4 +1,4 @@
-#include "platform/JsonPreferences.h"
+#include "linux/JsonPreferences.h"
 
 #include <gtest/gtest.h>
 #include <sys/wait.h>

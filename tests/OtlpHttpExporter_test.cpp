@@ -1,4 +1,4 @@
-#include "platform/OtlpHttpExporter.h"
+#include "export/OtlpHttpExporter.h"
 
 #include <gtest/gtest.h>
 
@@ -8,8 +8,9 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeHttpPost.h"
 #include "fakes/FakeLog.h"
+#include "linux/SystemClock.h"
 #include "opentelemetry/proto/collector/logs/v1/logs_service.pb.h"
-#include "platform/SqliteFernReporting.h"
+#include "sqlite/SqliteFernReporting.h"
 #include "support/Daemon.h"
 #include "support/OtlpReceiver.h"
 #include "support/SqliteTestSupport.h"

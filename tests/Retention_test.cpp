@@ -1,4 +1,4 @@
-#include "platform/Retention.h"
+#include "sqlite/Retention.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -7,12 +7,12 @@
 #include <set>
 #include <thread>
 
+#include "export/OtlpSpoolReader.h"
 #include "fakes/FakeLog.h"
-#include "platform/AsioDispatch.h"
-#include "platform/OtlpSpoolReader.h"
-#include "platform/SqliteFernReporting.h"
-#include "platform/SqliteJoulebook.h"
-#include "platform/SqliteTallyvane.h"
+#include "linux/AsioDispatch.h"
+#include "sqlite/SqliteFernReporting.h"
+#include "sqlite/SqliteJoulebook.h"
+#include "sqlite/SqliteTallyvane.h"
 #include "support/Daemon.h"
 #include "support/SqliteTestSupport.h"
 

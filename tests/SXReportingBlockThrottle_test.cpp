@@ -1,4 +1,4 @@
-#include "SXReportingBlockThrottle.h"
+#include "Service/SXReportingBlockThrottle.h"
 
 #include <gtest/gtest.h>
 

@@ -1,7 +1,7 @@
 // The driver utility over a driver library that fails one query, sampling or delta at a time:
 // each failure leaves out, or falls back for, its own driver only. (The fake is the production
 // library on a real counter tree; the daemon's session stop reads the deltas end to end.)
-#include "SXReportingDriverUtility.h"
+#include "Statistics/SXReportingDriverUtility.h"
 
 #include <gtest/gtest.h>
 

@@ -1,7 +1,7 @@
 // The guardrails: session limits, request sizes, the aggregate caps, the standalone budget and
 // the error-line budget. Each keeps what it refuses visible (error reply or log line, and a
 // counter), and none loses a message it accepted.
-#include "SXReportingLimits.h"
+#include "Statistics/SXReportingLimits.h"
 
 #include <gtest/gtest.h>
 

@@ -1,9 +1,10 @@
-#include "SXReportingSession.h"
+#include "Service/SXReportingSession.h"
 
 #include <gtest/gtest.h>
 
-#include "SXReportingUtility.h"
-#include "platform/AsioDispatch.h"
+#include "Statistics/SXReportingUtility.h"
+#include "linux/AsioDispatch.h"
+#include "linux/SystemRandom.h"
 #include "support/TestEnvironment.h"
 
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/SqliteBatchWriter.h"
+#include "sqlite/SqliteBatchWriter.h"
 
 #include <gtest/gtest.h>
 

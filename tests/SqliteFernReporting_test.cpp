@@ -1,4 +1,4 @@
-#include "platform/SqliteFernReporting.h"
+#include "sqlite/SqliteFernReporting.h"
 
 #include <gtest/gtest.h>
 

@@ -12,7 +12,7 @@
 #include <fstream>
 
 #include "fakes/FakeLog.h"
-#include "platform/SqliteTallyvane.h"
+#include "sqlite/SqliteTallyvane.h"
 #include "support/SqliteTestSupport.h"
 
 namespace {

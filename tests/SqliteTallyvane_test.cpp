@@ -1,7 +1,7 @@
 // The analytics store, written by a batch writer of its own: what it stores of odd payloads,
 // that sends never wait for it, reading back, and failures. (Events landing, and the power
 // log, are checked through the daemon: e2e/Messages, e2e/CrashSafety.)
-#include "platform/SqliteTallyvane.h"
+#include "sqlite/SqliteTallyvane.h"
 
 #include <gtest/gtest.h>
 

@@ -1,7 +1,7 @@
 // Where the production log writes: the journal when it is attached to stderr, priority-prefixed
 // lines for pipes and files, bare lines on a terminal. (The prefixed lines themselves are read
 // through the daemon: e2e/Registry, e2e/CrashSafety.)
-#include "platform/StderrLog.h"
+#include "linux/StderrLog.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

@@ -7,12 +7,12 @@
 #include <filesystem>
 #include <thread>
 
-#include "SXReportingTallyvaneBridge.h"
-#include "SXReportingUtility.h"
+#include "Statistics/SXReportingTallyvaneBridge.h"
+#include "Statistics/SXReportingUtility.h"
 #include "common/MsgpackValue.h"
 #include "common/RpcCodec.h"
-#include "platform/SqliteFernReporting.h"
-#include "platform/SqliteTallyvane.h"
+#include "sqlite/SqliteFernReporting.h"
+#include "sqlite/SqliteTallyvane.h"
 
 namespace {
 

@@ -8,7 +8,7 @@
 #include <vector>
 
 #include "common/SXThreadSafety.h"
-#include "platform/HttpPost.h"
+#include "export/HttpPost.h"
 #include "sxreporting/types.h"
 
 class FakeHttpPost final : public SXHttpPost {

@@ -14,8 +14,8 @@
 #include <string>
 
 #include "common/SXThreadSafety.h"
+#include "linux/FileKestrel.h"
 #include "platform/DiscardLog.h"
-#include "platform/FileKestrel.h"
 
 class FakeKestrel final : public Kestrel {
  public:

@@ -15,8 +15,8 @@
 #include <string>
 #include <vector>
 
-#include "SXReportingBlockThrottle.h"
-#include "SXReportingSession.h"
+#include "Service/SXReportingBlockThrottle.h"
+#include "Service/SXReportingSession.h"
 #include "common/MsgpackValue.h"
 #include "common/RpcCodec.h"
 #include "common/SXThreadSafety.h"

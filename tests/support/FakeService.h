@@ -6,7 +6,7 @@
 #include <memory>
 #include <string_view>
 
-#include "SXReportingServiceDelegate.h"
+#include "Service/SXReportingServiceDelegate.h"
 #include "fakes/FakeIpc.h"
 #include "support/TestEnvironment.h"
 

@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/SqliteConnection.h"
+#include "sqlite/SqliteConnection.h"
 
 // A fresh directory under the system's temporary directory, removed with everything in it.
 class SXTestTempDir {

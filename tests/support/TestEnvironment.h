@@ -6,7 +6,7 @@
 #include <optional>
 #include <string>
 
-#include "SXReportingEnvironment.h"
+#include "Statistics/SXReportingEnvironment.h"
 #include "fakes/FakeClock.h"
 #include "fakes/FakeDevice.h"
 #include "fakes/FakeFernReporting.h"
@@ -14,7 +14,8 @@
 #include "fakes/FakeLog.h"
 #include "fakes/FakeTallyvane.h"
 #include "fakes/ManualDispatch.h"
-#include "platform/JsonPreferences.h"
+#include "linux/JsonPreferences.h"
+#include "linux/UsdtTracer.h"
 #include "platform/Notify.h"
 #include "platform/Random.h"
 #include "platform/Trace.h"

@@ -4,7 +4,7 @@
 #include <filesystem>
 #include <thread>
 
-#include "platform/SqliteConnection.h"
+#include "sqlite/SqliteConnection.h"
 
 StoreRows::StoreRows(std::string stateDir, std::string eventName, int64_t category, int64_t type)
     : stateDir_(std::move(stateDir)),

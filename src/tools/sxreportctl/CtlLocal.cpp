@@ -7,11 +7,11 @@
 #include <memory>
 
 #include "common/SXValueText.h"
+#include "linux/InotifyNotifications.h"
+#include "linux/JsonPreferences.h"
 #include "platform/DiscardLog.h"
-#include "platform/InotifyNotifications.h"
-#include "platform/JsonPreferences.h"
-#include "platform/SqliteConnection.h"
-#include "platform/SqliteTallyvane.h"
+#include "sqlite/SqliteConnection.h"
+#include "sqlite/SqliteTallyvane.h"
 
 namespace fs = std::filesystem;
 

@@ -1,0 +1,44 @@
+// What a connection exports: decodes each request's params, checks their number, types,
+// ranges and sizes, and calls the server instance. A request that fails the checks gets an
+// error reply saying what is wrong and changes nothing. A message's payload carries a charge
+// of the connection's byte budget for as long as any store or queue holds it.
+//
+// Threads: `handleRequest` runs on the connection's thread; replies go out from wherever the
+// operation answers.
+#pragma once
+
+#include <memory>
+
+#include "SXReportingServerInstance.h"
+#include "Statistics/SXReportingEnvironment.h"
+#include "platform/Ipc.h"
+
+class SXReportingServiceDelegate;
+
+class SXReportingServiceExport final : public SXIpcExportedObject {
+ public:
+  SXReportingServiceExport(std::shared_ptr<SXReportingServerInstance> instance,
+                           std::weak_ptr<SXReportingServiceDelegate> delegate,
+                           std::shared_ptr<SXReportingEnvironment> environment,
+                           std::shared_ptr<SXByteBudget> budget = nullptr);
+
+  void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
+                     SXIpcReplyFn reply) override;
+
+  // Checks a request without running it: an empty string when it is well formed, else why not.
+  static std::string validate(std::string_view method, const SXValue& params);
+
+ private:
+  // Empty when the request is within the size limits, else why not (and counted).
+  std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes);
+  void dispatch(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply);
+
+  const std::shared_ptr<SXReportingServerInstance> instance_;
+  const std::weak_ptr<SXReportingServiceDelegate> delegate_;
+  const std::shared_ptr<SXReportingEnvironment> environment_;
+  const std::shared_ptr<SXByteBudget> budget_;  // may be null
+};
+
+// Removes repeated reporter IDs, keeping each one's first place: a message reaches a session
+// once however often a list names it.
+void SXReportingRemoveRepeatedIDs(std::vector<int64_t>& reporterIDs);
