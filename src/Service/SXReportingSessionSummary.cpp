@@ -112,9 +112,9 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
   SXFileSystem& fs = *environment_->platform().fileSystem;
   // The mode the platform asks for; the daemon's umask narrows it (0750). The write below
   // refuses a directory that is a symlink.
-  if (auto error = fs.createDirectory(directory, 0777)) {
+  if (SXStatus made = fs.createDirectory(directory, 0777); !made.ok()) {
     SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError,
-             "can't create logging directory at %@: %@", directory, *error);
+             "can't create logging directory at %@: %@", directory, made.error());
   }
   auto host = info.find("HostApplicationDisplayID");
   std::string hostName = fileNameComponent(host != info.end() ? SXValueText(*host) : "unknown");
@@ -124,11 +124,11 @@ void SXReportingSession::writeSummaryFile(const std::shared_ptr<SXReportingAggre
   for (int n = 1; n <= kMaxSameNameFiles; ++n) {
     std::string path = directory + "/" + summaryFileName(stamp, hostName, typeName, n);
     bool taken = false;
-    auto error = fs.writeNewFileAtomically(path, json, taken);
+    SXStatus written = fs.writeNewFileAtomically(path, json, taken);
     if (taken) continue;
-    if (error) {
+    if (!written.ok()) {
       SXLOG_IN(kSummaryFunction, log(), scope(), SXLogLevel::kError, "jsonOutput writeToURL: %@",
-               *error);
+               written.error());
     }
     return;
   }

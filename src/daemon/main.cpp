@@ -445,8 +445,8 @@ int main(int argc, char** argv) {
   // lets that group reach the socket and the notify directory.
   for (const auto& dir :
        {options.paths.stateDir, options.paths.configDir, options.paths.runtimeDir}) {
-    if (auto error = fs.createDirectory(dir, 0750)) {
-      SXLOG(*log, nullptr, SXLogLevel::kError, "cannot create %@: %@", dir, *error);
+    if (SXStatus made = fs.createDirectory(dir, 0750); !made.ok()) {
+      SXLOG(*log, nullptr, SXLogLevel::kError, "cannot create %@: %@", dir, made.error());
       return 1;
     }
   }

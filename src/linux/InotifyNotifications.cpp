@@ -39,7 +39,7 @@ int PostTo(const std::string& directory, const std::string& name) {
   int fd = ::open(path.c_str(), flags, 0644);
   if (fd < 0 && errno == ENOENT) {
     // The directory is not there (yet, or any more); a post (re)creates it.
-    SXPosixFileSystem().createDirectory(directory, kDirectoryMode);
+    (void)SXPosixFileSystem().createDirectory(directory, kDirectoryMode);  // the open tells
     fd = ::open(path.c_str(), flags, 0644);
   }
   if (fd < 0) return errno;
@@ -75,8 +75,8 @@ SXInotifyNotifications::~SXInotifyNotifications() {
 }
 
 int SXInotifyNotifications::setUp() {
-  if (auto error = SXPosixFileSystem().createDirectory(directory_, kDirectoryMode)) {
-    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot create notify directory: %s", *error);
+  if (SXStatus made = SXPosixFileSystem().createDirectory(directory_, kDirectoryMode); !made.ok()) {
+    SXLOG(*log_, nullptr, SXLogLevel::kError, "cannot create notify directory: %s", made.error());
   }
   inotifyFd_ = ::inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
   if (inotifyFd_ < 0) return errno;
@@ -177,7 +177,7 @@ SXInotifyNotifications::WatchState SXInotifyNotifications::readEvents() {
 SXInotifyNotifications::WatchState SXInotifyNotifications::rewatch() {
   // The directory was removed (or its file system unmounted): start over on a new one, so an
   // administrator's clean-up does not silence notifications for the rest of the process's life.
-  SXPosixFileSystem().createDirectory(directory_, kDirectoryMode);
+  (void)SXPosixFileSystem().createDirectory(directory_, kDirectoryMode);  // the watch tells
   if (::inotify_add_watch(inotifyFd_, directory_.c_str(), kWatchMask) < 0) {
     SXLOG(*log_, nullptr, SXLogLevel::kError, "notification watcher stops: %s",
           SXErrnoText(directory_, errno));

@@ -119,7 +119,9 @@ SXStatus SXJsonPreferences::setValue(const std::string& domain, const std::strin
     return SXFailure("preferences value for \"" + key + "\" is invalid");
   }
   SXPosixFileSystem fileSystem;
-  if (auto error = fileSystem.createDirectory(directory_, kDirectoryMode)) return SXFailure(*error);
+  if (SXStatus made = fileSystem.createDirectory(directory_, kDirectoryMode); !made.ok()) {
+    return made;
+  }
 
   // The lock spans read-modify-write so a concurrent writer's keys are read before we replace
   // the file; the lock file itself is never replaced, unlike the domain file.
@@ -140,7 +142,9 @@ SXStatus SXJsonPreferences::setValue(const std::string& domain, const std::strin
   }
   std::optional<std::string> text = Serialize(object);
   if (!text) return SXFailure("preferences value for \"" + key + "\" is not valid UTF-8");
-  if (auto error = fileSystem.writeFileAtomically(path, *text)) return SXFailure(*error);
+  if (SXStatus written = fileSystem.writeFileAtomically(path, *text); !written.ok()) {
+    return written;
+  }
   return {};
 }
 

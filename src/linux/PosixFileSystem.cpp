@@ -49,13 +49,12 @@ SXScopedFd::~SXScopedFd() {
   if (fd_ >= 0) ::close(fd_);
 }
 
-std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string& path,
-                                                              unsigned mode) {
-  if (path.empty()) return SXErrnoText(path, ENOENT);
+SXStatus SXPosixFileSystem::createDirectory(const std::string& path, unsigned mode) {
+  if (path.empty()) return SXErrnoStatus(path, ENOENT);
   // Each component is made and opened relative to its parent's descriptor, so a directory made
   // here and swapped for a symlink before its child is made is never followed.
   SXScopedFd parent(::open(path[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
-  if (parent.get() < 0) return SXErrnoText(path[0] == '/' ? "/" : ".", errno);
+  if (parent.get() < 0) return SXErrnoStatus(path[0] == '/' ? "/" : ".", errno);
   int dir = parent.get();
   std::optional<SXScopedFd> child;
   size_t start = 0;
@@ -68,35 +67,34 @@ std::optional<std::string> SXPosixFileSystem::createDirectory(const std::string&
     if (name.empty() || name == ".") continue;
     // The umask narrows `mode`: the daemon's directories are never more open than it allows.
     bool made = ::mkdirat(dir, name.c_str(), static_cast<mode_t>(mode)) == 0;
-    if (!made && errno != EEXIST) return SXErrnoText(partial, errno);
+    if (!made && errno != EEXIST) return SXErrnoStatus(partial, errno);
     // A directory that was there already may be a symlink the administrator set up.
     int next =
         ::openat(dir, name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC | (made ? O_NOFOLLOW : 0));
-    if (next < 0) return SXErrnoText(partial, errno);
+    if (next < 0) return SXErrnoStatus(partial, errno);
     child.emplace(next);
     dir = child->get();
   }
-  return std::nullopt;
+  return {};
 }
 
-std::optional<std::string> SXPosixFileSystem::writeFileAtomically(const std::string& path,
-                                                                  const std::string& contents) {
+SXStatus SXPosixFileSystem::writeFileAtomically(const std::string& path,
+                                                const std::string& contents) {
   return write(path, contents, nullptr);
 }
 
-std::optional<std::string> SXPosixFileSystem::writeNewFileAtomically(const std::string& path,
-                                                                     const std::string& contents,
-                                                                     bool& taken) {
+SXStatus SXPosixFileSystem::writeNewFileAtomically(const std::string& path,
+                                                   const std::string& contents, bool& taken) {
   taken = false;
   return write(path, contents, &taken);
 }
 
-std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
-                                                    const std::string& contents, bool* taken) {
+SXStatus SXPosixFileSystem::write(const std::string& path, const std::string& contents,
+                                  bool* taken) {
   size_t slash = path.rfind('/');
   std::string directory = slash == std::string::npos ? "." : path.substr(0, slash ? slash : 1);
   std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-  if (name.empty() || name == "." || name == "..") return SXErrnoText(path, EINVAL);
+  if (name.empty() || name == "." || name == "..") return SXErrnoStatus(path, EINVAL);
   // Everything below happens relative to this descriptor: a symlink put in the directory's
   // place, before or during the write, cannot move the file elsewhere.
   SXScopedFd dir(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
@@ -104,9 +102,9 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
     int err = errno;
     struct stat st {};
     if (::lstat(directory.c_str(), &st) == 0 && S_ISLNK(st.st_mode)) {
-      return directory + ": is a symbolic link, not followed";
+      return SXFailure(directory + ": is a symbolic link, not followed");
     }
-    return SXErrnoText(directory, err);
+    return SXErrnoStatus(directory, err);
   }
   // A fresh name that nobody can plant anything at ahead of time; O_EXCL refuses whatever is
   // there all the same, a symlink included.
@@ -118,13 +116,13 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
                   0640);
     if (fd < 0 && errno != EEXIST) break;
   }
-  if (fd < 0) return SXErrnoText(directory + "/" + temp, errno);
+  if (fd < 0) return SXErrnoStatus(directory + "/" + temp, errno);
   int err = writeAll(fd, contents);
   if (err == 0 && ::fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && err == 0) err = errno;
   if (err != 0) {
     ::unlinkat(dir.get(), temp.c_str(), 0);
-    return SXErrnoText(directory + "/" + temp, err);
+    return SXErrnoStatus(directory + "/" + temp, err);
   }
   // rename replaces a symlink at `name` instead of writing through it; link refuses anything
   // at `name`, a symlink included.
@@ -134,8 +132,8 @@ std::optional<std::string> SXPosixFileSystem::write(const std::string& path,
   if (!placed || taken) ::unlinkat(dir.get(), temp.c_str(), 0);
   if (taken && err == EEXIST) {
     *taken = true;
-    return std::nullopt;
+    return {};
   }
-  if (err != 0) return SXErrnoText(path, err);
-  return std::nullopt;
+  if (err != 0) return SXErrnoStatus(path, err);
+  return {};
 }

@@ -2,24 +2,20 @@
 // share.
 #pragma once
 
-#include <optional>
 #include <string>
 
 #include "platform/FileSystem.h"
 
 class SXPosixFileSystem final : public SXFileSystem {
  public:
-  std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override;
-  std::optional<std::string> writeFileAtomically(const std::string& path,
-                                                 const std::string& contents) override;
-  std::optional<std::string> writeNewFileAtomically(const std::string& path,
-                                                    const std::string& contents,
-                                                    bool& taken) override;
+  SXStatus createDirectory(const std::string& path, unsigned mode) override;
+  SXStatus writeFileAtomically(const std::string& path, const std::string& contents) override;
+  SXStatus writeNewFileAtomically(const std::string& path, const std::string& contents,
+                                  bool& taken) override;
 
  private:
   // `taken`: null to replace what is at `path`, else set when something is there.
-  std::optional<std::string> write(const std::string& path, const std::string& contents,
-                                   bool* taken);
+  SXStatus write(const std::string& path, const std::string& contents, bool* taken);
 };
 
 // Owns one file descriptor and closes it (which also releases an flock taken through it).

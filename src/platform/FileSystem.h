@@ -1,7 +1,6 @@
 // File-system operations of the summary files. May be called from any thread.
 #pragma once
 
-#include <optional>
 #include <string>
 
 #include "platform/Status.h"
@@ -11,17 +10,14 @@ class SXFileSystem {
   virtual ~SXFileSystem() = default;
   // Creates `path` with its missing parents and `mode` less the process umask (never wider).
   // An existing directory, or a symlink to one, is no failure; a directory made here that is
-  // swapped for a symlink is not followed. On failure returns the failure's description.
-  virtual std::optional<std::string> createDirectory(const std::string& path, unsigned mode) = 0;
+  // swapped for a symlink is not followed.
+  virtual SXStatus createDirectory(const std::string& path, unsigned mode) = 0;
   // Writes `contents` so that a reader sees either no file or the whole file, replacing a file
   // (or symlink) of the same name; the new file is 0640 less the umask. Nothing is written
-  // through a symlink: neither the directory named in `path` nor the file may be one. On
-  // failure returns the failure's description.
-  virtual std::optional<std::string> writeFileAtomically(const std::string& path,
-                                                         const std::string& contents) = 0;
+  // through a symlink: neither the directory named in `path` nor the file may be one.
+  virtual SXStatus writeFileAtomically(const std::string& path, const std::string& contents) = 0;
   // As writeFileAtomically, but whatever is at `path` already is kept: then nothing is
   // written and `taken` is set.
-  virtual std::optional<std::string> writeNewFileAtomically(const std::string& path,
-                                                            const std::string& contents,
-                                                            bool& taken) = 0;
+  virtual SXStatus writeNewFileAtomically(const std::string& path, const std::string& contents,
+                                          bool& taken) = 0;
 };

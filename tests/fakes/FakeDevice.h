@@ -45,24 +45,22 @@ class FakeProcessInfo final : public SXProcessInfo {
 // Files in memory.
 class FakeFileSystem final : public SXFileSystem {
  public:
-  std::optional<std::string> createDirectory(const std::string& path, unsigned mode) override {
+  SXStatus createDirectory(const std::string& path, unsigned mode) override {
     SXMutexLock lock(mutex_);
     directories[path] = mode;
-    return std::nullopt;
+    return {};
   }
-  std::optional<std::string> writeFileAtomically(const std::string& path,
-                                                 const std::string& contents) override {
+  SXStatus writeFileAtomically(const std::string& path, const std::string& contents) override {
     SXMutexLock lock(mutex_);
     files[path] = contents;
-    return std::nullopt;
+    return {};
   }
 
-  std::optional<std::string> writeNewFileAtomically(const std::string& path,
-                                                    const std::string& contents,
-                                                    bool& taken) override {
+  SXStatus writeNewFileAtomically(const std::string& path, const std::string& contents,
+                                  bool& taken) override {
     SXMutexLock lock(mutex_);
     taken = !files.try_emplace(path, contents).second;
-    return std::nullopt;
+    return {};
   }
 
   SXMutex mutex_;
