@@ -47,17 +47,10 @@ bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
 
 namespace {
 
-// The payload's members under their rewritten keys, in key order. Of keys that become equal
-// the last in the payload's order wins, as assigning them one after another would have it.
-std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXValue& payload) {
-  std::vector<std::pair<std::string, const SXValue*>> members;
-  if (!payload.is_object()) return members;
-  members.reserve(payload.size());
-  for (auto it = payload.cbegin(); it != payload.cend(); ++it) {
-    std::string key = it.key();
-    std::replace(key.begin(), key.end(), ' ', '_');
-    members.emplace_back(std::move(key), &it.value());
-  }
+// Puts rewritten members in key order. Of keys that became equal the last in the payload's
+// order wins, as assigning them one after another would have it.
+template <typename Value>
+void orderRewrittenMembers(std::vector<std::pair<std::string, Value>>& members) {
   std::stable_sort(members.begin(), members.end(),
                    [](const auto& a, const auto& b) { return a.first < b.first; });
   auto kept = members.begin();
@@ -67,12 +60,25 @@ std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXV
     ++kept;
   }
   members.erase(kept, members.end());
-  return members;
 }
 
-}  // namespace
+std::string underscored(std::string_view key) {
+  std::string name(key);
+  std::replace(name.begin(), name.end(), ' ', '_');
+  return name;
+}
 
-namespace {
+// The payload's members under their rewritten keys, in key order.
+std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXValue& payload) {
+  std::vector<std::pair<std::string, const SXValue*>> members;
+  if (!payload.is_object()) return members;
+  members.reserve(payload.size());
+  for (auto it = payload.cbegin(); it != payload.cend(); ++it) {
+    members.emplace_back(underscored(it.key()), &it.value());
+  }
+  orderRewrittenMembers(members);
+  return members;
+}
 
 // The rewrite's text made from the caller's dictionary text: each member's value text copied
 // under its rewritten key, in the rewritten order. Nothing when a key is not plain ASCII, whose
@@ -84,20 +90,15 @@ std::optional<std::string> underscoredText(std::string_view callerText) {
   renamed.reserve(members->size());
   for (const auto& [key, value] : *members) {
     if (std::any_of(key.begin(), key.end(), [](char c) { return c & 0x80; })) return std::nullopt;
-    std::string name(key);
-    std::replace(name.begin(), name.end(), ' ', '_');
-    renamed.emplace_back(std::move(name), value);
+    renamed.emplace_back(underscored(key), value);
   }
-  std::stable_sort(renamed.begin(), renamed.end(),
-                   [](const auto& a, const auto& b) { return a.first < b.first; });
+  orderRewrittenMembers(renamed);
   std::string text;
   text.reserve(callerText.size());
   text += '{';
-  for (auto it = renamed.begin(); it != renamed.end(); ++it) {
-    // Of keys that became equal the last in the caller's order wins.
-    if (std::next(it) != renamed.end() && std::next(it)->first == it->first) continue;
+  for (const auto& [key, value] : renamed) {
     if (text.size() > 1) text += ',';
-    text.append("\"").append(it->first).append("\":").append(it->second);
+    text.append("\"").append(key).append("\":").append(value);
   }
   text += '}';
   return text;
@@ -120,10 +121,7 @@ std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload) {
 }
 
 bool SXReportingMessagePayload::rewritesLocked() {
-  if (!rewrites_) {
-    rewrites_ = SXReportingSessionHasSpacedKeys(*caller_);
-    callerIsDictionary_ = caller_->is_object();
-  }
+  if (!rewrites_) rewrites_ = SXReportingSessionHasSpacedKeys(*caller_);
   return *rewrites_;
 }
 
@@ -169,7 +167,7 @@ const std::string& SXReportingMessagePayload::makeTextLocked() {
     text_ = std::make_shared<const std::string>(SXValueText(*rewritten_));
   } else {
     std::optional<std::string> text;
-    if (callerIsDictionary_) text = underscoredText(*callerTextLocked());
+    if (caller_->is_object()) text = underscoredText(*callerTextLocked());
     text_ = std::make_shared<const std::string>(
         text ? std::move(*text) : SXReportingSessionUnderscoreKeysText(*caller_));
   }

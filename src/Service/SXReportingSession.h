@@ -63,7 +63,6 @@ class SXReportingMessagePayload final : public SXPayloadTextSource {
   std::shared_ptr<const std::string> text_ SX_GUARDED_BY(mutex_);  // the caller's when no rewrite
   std::optional<bool> rewrites_ SX_GUARDED_BY(mutex_);
   int holds_ SX_GUARDED_BY(mutex_) = 0;  // readers that may still want callerText_
-  bool callerIsDictionary_ SX_GUARDED_BY(mutex_) = false;  // set with rewrites_
 };
 
 // One entry of a session's aggregate: a message entry ({message id: rewritten payload}) or

@@ -91,8 +91,8 @@ class JsonWriter {
     out_.append(digits, end);
   }
 
-  // The library's serializer, for binary values and strings that need
-  // escaping or repair. Made on first use: setting one up costs more than writing a payload.
+  // The library's serializer, for binary values and strings that need escaping or repair.
+  // Made on first use: setting one up costs more than writing a payload.
   nlohmann::detail::serializer<SXValue>& serializer() {
     if (!serializer_) {
       serializer_.emplace(nlohmann::detail::output_adapter<char, std::string>(out_), ' ',
