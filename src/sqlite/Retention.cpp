@@ -193,10 +193,19 @@ SXStatus SXRetention::pruneSpoolExtras(SXSqlitePruner& pruner, double cutoff,
   if (SXStatus failed = pruner.deleteOlderThan("flushes", cutoff, "1", deleted); !failed.ok()) {
     return failed;
   }
-  // A session's row carries the info of its messages, so it stays while one refers to it.
-  return pruner.deleteOlderThan(
-      "sessions", cutoff, "NOT EXISTS (SELECT 1 FROM messages WHERE session_id = sessions.id)",
-      deleted);
+  // A session's row carries the info of its messages, so it stays while one refers to it: while
+  // the id of its newest message is not below every id left (its other messages have lower ids).
+  if (SXStatus failed = pruner.deleteOlderThan(
+          "sessions", cutoff,
+          "NOT EXISTS (SELECT 1 FROM session_refs WHERE session_id = sessions.id AND "
+          "last_message_id >= (SELECT MIN(id) FROM messages))",
+          deleted);
+      !failed.ok()) {
+    return failed;
+  }
+  return db.exec(
+      "DELETE FROM session_refs WHERE NOT EXISTS "
+      "(SELECT 1 FROM sessions WHERE sessions.id = session_refs.session_id)");
 }
 
 void SXRetention::ageOutFiles(const SXRetentionPolicy& policy) {

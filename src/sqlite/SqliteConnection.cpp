@@ -125,10 +125,11 @@ SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::openWithCode(
     code = SQLITE_READONLY;
     return SXFailure("cannot open " + path + ": " + sqlite3_errstr(SQLITE_READONLY));
   }
-  // auto_vacuum must come before the first table; on an existing store it is only a wish that
-  // convertToIncrementalVacuum() fulfils.
+  // page_size and auto_vacuum must come before the first table; on an existing store they are
+  // no-ops (auto_vacuum is then a wish that convertToIncrementalVacuum() fulfils).
   for (const std::string& sql :
-       {std::string("PRAGMA auto_vacuum=INCREMENTAL"), std::string("PRAGMA journal_mode=WAL"),
+       {"PRAGMA page_size=" + std::to_string(kSXSqlitePageSize),
+        std::string("PRAGMA auto_vacuum=INCREMENTAL"), std::string("PRAGMA journal_mode=WAL"),
         std::string("PRAGMA synchronous=NORMAL"),
         "PRAGMA journal_size_limit=" + std::to_string(kSXSqliteJournalSizeLimit), schema}) {
     if (SXStatus failed = connection->exec(sql); !failed.ok()) {

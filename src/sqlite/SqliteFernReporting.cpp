@@ -23,14 +23,15 @@ constexpr const char* kSchema =
     "session_info_json TEXT, user_info_json TEXT, category INTEGER, type INTEGER, "
     "payload_json TEXT);"
     "CREATE TABLE IF NOT EXISTS flushes(id INTEGER PRIMARY KEY, time REAL, session_id INTEGER);"
-    // Retention keeps a session while a message refers to it. It finds old rows by id: an
-    // index on time costs every insert.
-    "CREATE INDEX IF NOT EXISTS messages_session ON messages(session_id);"
+    // Each session's newest message, so that retention can tell which sessions messages still
+    // refer to. One row per session and commit costs less than an index entry per message.
+    "CREATE TABLE IF NOT EXISTS session_refs(session_id INTEGER PRIMARY KEY, "
+    "last_message_id INTEGER);"
     "DROP INDEX IF EXISTS messages_time;"
     "DROP INDEX IF EXISTS sessions_time;"
     "DROP INDEX IF EXISTS flushes_time";
 
-enum Kind { kSessionRow, kMessageRow, kFlushRow, kKinds };
+enum Kind { kSessionRow, kMessageRow, kFlushRow, kSessionRefRow, kKinds };
 
 constexpr const char* kInsert[kKinds] = {
     "INSERT INTO sessions(time, session_info_json, user_info_json, token) "
@@ -38,7 +39,18 @@ constexpr const char* kInsert[kKinds] = {
     "INSERT INTO messages(time, session_id, session_info_json, user_info_json, category, type, "
     "payload_json) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7)",
     "INSERT INTO flushes(time, session_id) VALUES (?1, ?2)",
+    // Written right after the session's last message row, whose id last_insert_rowid() holds.
+    "INSERT INTO session_refs(session_id, last_message_id) VALUES (?1, last_insert_rowid()) "
+    "ON CONFLICT(session_id) DO UPDATE SET last_message_id = excluded.last_message_id",
 };
+
+// Stores made before session_refs had an index on messages(session_id) instead.
+constexpr const char* kMigrateSessionIndex =
+    "BEGIN IMMEDIATE;"
+    "INSERT OR IGNORE INTO session_refs(session_id, last_message_id) "
+    "SELECT session_id, MAX(id) FROM messages WHERE session_id IS NOT NULL GROUP BY session_id;"
+    "DROP INDEX messages_session;"
+    "COMMIT";
 
 std::string Json(const SXValue& value) {
   return value.dump(-1, ' ', false, SXValue::error_handler_t::replace);
@@ -73,16 +85,19 @@ class SXSqliteFernReporting::Spool {
     return mine.result;
   }
 
-  // Stores `rows` in order, in one transaction; returns each row's outcome.
-  std::vector<SXStatus> insertAll(Kind kind, const std::vector<SXSqliteRow>& rows) {
+  // Stores session `sessionId`'s message `rows` in order, in one transaction with the session's
+  // reference; returns each row's outcome.
+  std::vector<SXStatus> insertMessages(int64_t sessionId, const std::vector<SXSqliteRow>& rows) {
+    const SXSqliteRow ref = {sessionId};
     std::vector<PendingRow> mine;
-    mine.reserve(rows.size());
-    for (const SXSqliteRow& row : rows) mine.push_back({kind, &row, nullptr, {}, false});
+    mine.reserve(rows.size() + 1);
+    for (const SXSqliteRow& row : rows) mine.push_back({kMessageRow, &row, nullptr, {}, false});
+    if (!rows.empty()) mine.push_back({kSessionRefRow, &ref, nullptr, {}, false});
     std::vector<PendingRow*> pointers;
     for (PendingRow& pending : mine) pointers.push_back(&pending);
     insertAll(pointers);
     std::vector<SXStatus> results;
-    for (PendingRow& pending : mine) results.push_back(std::move(pending.result));
+    for (size_t i = 0; i < rows.size(); ++i) results.push_back(std::move(mine[i].result));
     return results;
   }
 
@@ -116,6 +131,16 @@ class SXSqliteFernReporting::Spool {
     if (!recovered.empty()) SXLOG(*log_, nullptr, SXLogLevel::kError, "%s", recovered);
     if (!connection.ok()) return connection.status();
     db_ = std::move(*connection);
+    SXResult<int64_t> oldIndex = db_->queryInt(
+        "SELECT COUNT(*) FROM sqlite_master WHERE type = 'index' AND name = 'messages_session'",
+        {});
+    SXStatus migrated = oldIndex.status();
+    if (migrated.ok() && *oldIndex != 0) migrated = db_->exec(kMigrateSessionIndex);
+    if (!migrated.ok()) {
+      (void)db_->exec("ROLLBACK");
+      close();
+      return SXFailure(path_ + ": " + migrated.error());
+    }
     for (int kind = 0; kind < kKinds; ++kind) {
       if (SXStatus failed = db_->prepare(kInsert[kind], insert_[kind]); !failed.ok()) {
         close();
@@ -266,7 +291,7 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
       rows.push_back({time, id_, nullptr, nullptr, int64_t(message.category), int64_t(message.type),
                       message.payloadJson ? *message.payloadJson : Json(*message.payload)});
     }
-    auto results = spool_->insertAll(kMessageRow, rows);
+    auto results = spool_->insertMessages(id_, rows);
     std::vector<FernSendOutcome> outcomes(messages.size());
     for (size_t i = 0; i < results.size(); ++i) {
       outcomes[i].sent = results[i].ok();
