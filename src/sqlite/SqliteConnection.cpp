@@ -137,6 +137,14 @@ SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::openWithCode(
       return SXFailure("cannot open " + path + ": " + failed.error());
     }
   }
+  // Checkpoint when the WAL reaches its cap rather than at SQLite's 1,000 pages, so that the
+  // WAL is written over in place instead of being cut back and grown again after every
+  // checkpoint.
+  if (SXResult<int64_t> pageSize = connection->queryInt("PRAGMA page_size", {});
+      pageSize.ok() && *pageSize > 0) {
+    (void)connection->exec("PRAGMA wal_autocheckpoint=" +
+                           std::to_string(kSXSqliteJournalSizeLimit / *pageSize));
+  }
   return connection;
 }
 

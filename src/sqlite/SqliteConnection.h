@@ -68,7 +68,7 @@ class SXSqliteConnection {
 
   // Opens `path`. Read-write creates the file (with incremental auto-vacuum), switches it to
   // WAL with synchronous=NORMAL (committed rows survive a crash of this process, not a power
-  // loss), caps the WAL at kSXSqliteJournalSizeLimit after checkpoints and runs `schema`; a
+  // loss), checkpoints the WAL when it reaches kSXSqliteJournalSizeLimit and runs `schema`; a
   // file that can only be opened for reading is a failure (SQLITE_READONLY).
   // Both modes wait up to `busyTimeout` for another connection's lock.
   static SXResult<std::unique_ptr<SXSqliteConnection>> open(const std::string& path, Mode mode,
