@@ -182,9 +182,10 @@ const std::string& SXReportingMessagePayload::textLocked() {
   return *text_;
 }
 
-std::string SXReportingMessagePayload::text() {
+std::shared_ptr<const std::string> SXReportingMessagePayload::text() {
   SXMutexLock lock(mutex_);
-  return textLocked();
+  textLocked();
+  return text_;
 }
 
 void SXReportingMessagePayload::keepOnlyText() {

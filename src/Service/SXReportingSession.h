@@ -35,7 +35,7 @@ class SXReportingMessagePayload final : public SXPayloadTextSource {
   // The payload with every space in its keys replaced by "_".
   std::shared_ptr<const SXValue> rewritten();
   // SXValueText of the rewritten payload (compact JSON).
-  std::string text();
+  std::shared_ptr<const std::string> text();
   // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
   void keepOnlyText();
   // SXValueText of the caller's own payload when it is a dictionary, made now if need be; null
@@ -90,7 +90,7 @@ class SXReportingAggregateEntry {
 template <typename Visit>
 void SXReportingAggregateEntry::forEachText(Visit&& visit) const {
   if (!dictionary_) {
-    visit(messageId_, payload_->text());
+    visit(messageId_, *payload_->text());
     return;
   }
   for (const auto& [key, value] : dictionary_->items()) visit(key, SXValueText(value));

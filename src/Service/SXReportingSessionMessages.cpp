@@ -149,15 +149,15 @@ void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& s
     return;
   }
   // The service stores text: the one the aggregate keeps, made once for both, straight from
-  // the caller's dictionary. (Reserved up front, so the messages' pointers stay valid.)
-  std::vector<std::string> texts;
+  // the caller's dictionary, and held here while the messages point at it.
+  std::vector<std::shared_ptr<const std::string>> texts;
   std::vector<FernMessage> messages;
   texts.reserve(sends.size());
   messages.reserve(sends.size());
   for (const PendingSend& send : sends) {
     texts.push_back(send.payload->text());
     messages.push_back(
-        {static_cast<uint16_t>(send.category & 0xFFFF), send.type, nullptr, &texts.back()});
+        {static_cast<uint16_t>(send.category & 0xFFFF), send.type, nullptr, texts.back().get()});
   }
   std::vector<FernSendOutcome> outcomes = fernSession->sendMessages(messages);
   // The verbose line's arguments cost a description per message; build them only when wanted.
