@@ -106,7 +106,7 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
     EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced), expected);
     SXReportingMessagePayload prepared(std::make_shared<const SXValue>(spaced));
     prepared.hold();  // an analytics event still to come keeps the caller's text
-    EXPECT_EQ(prepared.text(), expected) << spaced.dump();
+    EXPECT_EQ(*prepared.text(), expected) << spaced.dump();
     auto own = prepared.payloadText();
     EXPECT_EQ(own ? *own : "", spaced.is_object() ? SXValueText(spaced) : "");
     prepared.release();
