@@ -23,12 +23,12 @@ SXValue internalBuild(int deviceClass = 1) {
 }
 
 // The summary file's name on internal builds: the host application name comes from a client
-// and stands in the name as it is, but it must never name another directory or overrun a name.
-// The part of the file name that the host application name became.
+// and stands in the name as it is, but it must never name another directory or overrun a name
+// (that it stays one name in its directory, FuzzCorpus checks). The part of the file name that
+// the host application name became.
 std::string hostPart(const SXValue& host) {
   TestEnvironment t(SXValue{{"InternalBuild", true}});
-  auto session = SXReportingSession::initWithID(t.environment, 42, SXValue::array());
-  session->setServiceType(7);
+  auto session = makeSession(t);
   SXValue config = {{"HostApplicationDisplayID", host}};
   session->setConfiguration(&config);
   session->start();
@@ -40,8 +40,6 @@ std::string hostPart(const SXValue& host) {
     return "";
   }
   std::string path = t.fileSystem->files.begin()->first;
-  EXPECT_EQ(path.rfind("/diag/", 0), 0u) << path;
-  EXPECT_EQ(path.find('/', 6), std::string::npos) << path;
   size_t from = path.find("-sonex-") + 7;
   size_t to = path.rfind("-longformaudio.json");
   EXPECT_NE(to, std::string::npos) << path;
@@ -52,7 +50,7 @@ std::string hostPart(const SXValue& host) {
 
 TEST(SXReportingSessionRecord, DefaultsFillWhatTheConfigurationLeavesOut) {
   TestEnvironment t;
-  auto session = SXReportingSession::initWithID(t.environment, 42, SXValue::array({1}));
+  auto session = makeSession(t);
   SXValue config = {{"a", 1}};
   SXValue defaults = {{"a", 2}, {"b", 3}};
   session->setConfiguration(&config);
@@ -362,8 +360,7 @@ TEST(SummaryFileName, SessionsStoppingInTheSameSecondKeepTheirOwnFiles) {
   TestEnvironment t(SXValue{{"InternalBuild", true}});
   SXValue config = {{"HostApplicationDisplayID", "player"}};
   for (int64_t id : {1, 2, 3}) {
-    auto session = SXReportingSession::initWithID(t.environment, id, SXValue::array());
-    session->setServiceType(7);
+    auto session = makeSession(t, id);
     session->setConfiguration(&config);
     session->start();
     session->sendMessage({{"n", id}}, 3, 1, nullptr);
