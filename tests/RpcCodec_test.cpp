@@ -2,11 +2,11 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
+
 #include "common/MsgpackValue.h"
 #include "common/SXFormat.h"
 #include "common/SXValueText.h"
-
-#include <cmath>
 
 namespace {
 
@@ -51,31 +51,30 @@ TEST(RpcStreamDecoder, MessagesSurviveAnyChunkBoundary) {
   }
 }
 
-TEST(RpcStreamDecoder, BreaksOnGarbageOversizeAndDeepNesting) {
-  RpcStreamDecoder garbage;
-  feed(garbage, std::string("\xc1\xc1\xc1", 3));  // 0xc1 is never used by MessagePack
-  SXValue message;
-  EXPECT_EQ(garbage.next(message), RpcStreamDecoder::Status::kBroken);
-
-  RpcLimits limits;
-  limits.maxMessageBytes = 1024;
-  RpcStreamDecoder big(limits);
-  feed(big, encodeRequest(1, "m", SXValue::array({std::string(2000, 'x')})).substr(0, 1500));
-  EXPECT_EQ(big.next(message), RpcStreamDecoder::Status::kBroken);
-
-  RpcStreamDecoder ok;
-  feed(ok, encodeRequest(1, "m", SXValue::array({nested(32)})));
-  EXPECT_EQ(ok.next(message), RpcStreamDecoder::Status::kMessage);
-  RpcStreamDecoder deep;
-  feed(deep, encodeRequest(1, "m", SXValue::array({nested(33)})));
-  EXPECT_EQ(deep.next(message), RpcStreamDecoder::Status::kBroken);
-}
-
-TEST(RpcStreamDecoder, HugeDeclaredContainerIsRefusedNotAllocated) {
-  RpcStreamDecoder decoder;
-  feed(decoder, std::string("\x94\x00\x01\xa1m\xdd\xff\xff\xff\xff", 10));  // array32 of 4G
-  SXValue message;
-  EXPECT_EQ(decoder.next(message), RpcStreamDecoder::Status::kBroken);
+TEST(RpcStreamDecoder, BreaksOnGarbageOversizeDeepNestingAndHugeDeclaredContainers) {
+  using Status = RpcStreamDecoder::Status;
+  struct Case {
+    std::string bytes;
+    Status status;
+    RpcLimits limits = {};
+  };
+  const Case cases[] = {
+      {std::string("\xc1\xc1\xc1", 3), Status::kBroken},  // 0xc1 is never used by MessagePack
+      // Over the limit before the message is even whole.
+      {encodeRequest(1, "m", SXValue::array({std::string(2000, 'x')})).substr(0, 1500),
+       Status::kBroken,
+       {.maxMessageBytes = 1024}},
+      {encodeRequest(1, "m", SXValue::array({nested(32)})), Status::kMessage},
+      {encodeRequest(1, "m", SXValue::array({nested(33)})), Status::kBroken},
+      // An array32 that declares 4G entries: refused, not allocated.
+      {std::string("\x94\x00\x01\xa1m\xdd\xff\xff\xff\xff", 10), Status::kBroken},
+  };
+  for (const Case& c : cases) {
+    RpcStreamDecoder decoder(c.limits);
+    feed(decoder, c.bytes);
+    SXValue message;
+    EXPECT_EQ(decoder.next(message), c.status) << testing::PrintToString(c.bytes.substr(0, 16));
+  }
 }
 
 TEST(RpcParseRequest, SaysWhatIsWrongAndKeepsAnyUsableMsgid) {

@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include "common/SXServiceTypes.h"
 #include "tools/sxreportctl/CtlArgs.h"
 
 using namespace std::chrono_literals;
@@ -32,69 +31,44 @@ TEST(SXCtlArgsTest, GlobalOptionsGoAnywhereInEitherForm) {
 }
 
 // Everything a command line can end with instead of a run: one line naming what is wrong
-// (status 2), or the help or version (status 0).
+// (status 2), or the help or version (status 0). One row per kind of check.
 TEST(SXCtlArgsTest, UsageErrorsHelpAndVersion) {
   struct Row {
     std::vector<std::string> args;
     int status;
     std::string text;  // how the error line begins, a part of the help
   };
+  const std::string notID = "ID: not a reporter ID (a signed 64-bit number): ";
   const Row rows[] = {
       {{}, 2, "no command given; see sxreportctl --help"},
       {{"frob"}, 2, "unknown command 'frob'"},
       {{"create"}, 2, "create: ID is required"},
       {{"create", "1", "2"}, 2, "create: The following argument was not expected: 2"},
-      {{"create", "x1"}, 2, "create: ID: not a reporter ID (a signed 64-bit number): 'x1'"},
-      {{"create", "99999999999999999999"},
-       2,
-       "create: ID: not a reporter ID (a signed 64-bit number): '99999999999999999999'"},
+      {{"create", "x1"}, 2, "create: " + notID + "'x1'"},
+      {{"create", "99999999999999999999"}, 2, "create: " + notID + "'99999999999999999999'"},
       // An unknown option is named, not what its value did to the arguments after it.
       {{"create", "--config", "{}", "1"}, 2, "create: unknown option --config"},
       {{"--ids", "1", "send", "{}"}, 2, "unknown option --ids (a command's own options follow it)"},
-      {{"list", "--metrics"}, 2, "list: unknown option --metrics"},
       {{"status", "--metrics=1"}, 2, "status: metrics was given a disallowed flag override"},
       {{"list", "--socket"}, 2, "list: --socket: 1 required PATH missing"},
-      {{"list", "--timeout", "-1"}, 2, "list: --timeout: not a time-out in seconds: '-1'"},
       {{"list", "--timeout", "inf"}, 2, "list: --timeout: not a time-out in seconds: 'inf'"},
-      {{"notify", "a/b"}, 2, "notify: NAME: not a notification name: 'a/b'"},
       {{"set-type", "65536", "1"}, 2, "set-type: TYPE: not a service type: '65536' (0-65535"},
-      {{"send", "{}"},
-       2,
-       "send: send needs either --ids ID,ID,... (--ids '' for none) or --broadcast"},
+      {{"send", "{}"}, 2, "send: send needs either --ids ID,ID,... (--ids '' for none)"},
       {{"send", "--broadcast", "--ids", "1", "{}"}, 2, "send: send needs either"},
-      {{"send", "--ids", "1,,2", "{}"},
-       2,
-       "send: --ids: not a reporter ID (a signed 64-bit number): ''"},
-      {{"send", "--broadcast", "--type", "65536", "{}"},
-       2,
-       "send: --type: not a message type (0 to 65535): '65536'"},
+      {{"send", "--ids", "1,,2", "{}"}, 2, "send: --ids: not a reporter ID"},
       {{"send", "--broadcast", "--category", "4294967296", "{}"},
        2,
        "send: --category: not a category (0 to 4294967295): '4294967296'"},
       {{"send", "--broadcast", "[1]"}, 2, "send: PAYLOAD_JSON: not a JSON object"},
       {{"send", "--broadcast", "{"}, 2, "send: PAYLOAD_JSON: not valid JSON: {"},
       {{"configure", "5"}, 2, "configure: --config is required"},
-      {{"configure", "--config", "[1]", "5"}, 2, "configure: --config: not a JSON object or null"},
-      {{"defaults"}, 2, "defaults: needs one of: read, write, delete"},
       {{"defaults", "erase", "K"}, 2, "defaults: unknown command 'erase'"},
-      {{"defaults", "write", "K"}, 2, "defaults write: VALUE is required"},
-      {{"defaults", "read", "--int", "K"}, 2, "defaults read: unknown option --int"},
-      {{"defaults", "write", "--bool", "K", "maybe"},
-       2,
-       "defaults write: VALUE: not a boolean: 'maybe' (true, false, yes, no, 1 or 0)"},
-      {{"defaults", "write", "--int", "K", "1x"}, 2, "defaults write: VALUE: not an integer: '1x'"},
-      {{"defaults", "write", "--int", "--bool", "K", "1"},
-       2,
-       "defaults write: --bool excludes --int"},
-      {{"events", "--limit", "-1"}, 2, "events: --limit: not a count (0 or more): '-1'"},
-      {{"events", "--since", "yesterday"}, 2, "events: --since: not a time: 'yesterday'"},
+      {{"defaults", "write", "--bool", "K", "maybe"}, 2, "defaults write: VALUE: not a boolean"},
+      {{"defaults", "write", "--int", "--bool", "K", "1"}, 2, "defaults write: --bool excludes"},
       {{"list", "then"}, 2, "'then' must stand between two commands"},
       {{"list", "then", "create"}, 2, "create: ID is required"},
-      // The help of the command it follows, wherever in a chain; an unknown one gets the overview.
+      // The help of the command it follows, wherever in a chain.
       {{"list", "then", "create", "1", "--help"}, 0, "Usage: sxreportctl create [OPTIONS] ID\n"},
-      {{"help", "send"}, 0, "Usage: sxreportctl send [OPTIONS] PAYLOAD_JSON\n"},
-      {{"defaults", "write", "-h"}, 0, "Usage: sxreportctl defaults write [OPTIONS] KEY VALUE\n"},
-      {{"help", "frob"}, 0, "Usage: sxreportctl [OPTIONS] COMMAND\n"},
       {{"list", "--version"}, 0, "sxreportctl "},
   };
   for (const auto& row : rows) {
@@ -111,22 +85,10 @@ TEST(SXCtlArgsTest, UsageErrorsHelpAndVersion) {
   }
 }
 
-TEST(SXCtlArgsTest, ServiceTypesByNumberOrName) {
-  const std::pair<const char*, SXReportingServiceType> types[] = {
-      {"telephony", 2}, {"TEST", 11}, {"65535", 65535}, {"unknown", 65535}, {"12", 12}};
-  for (const auto& [text, type] : types) {
-    EXPECT_EQ(parse({"set-type", text, "42"}).serviceType, type) << text;
-  }
-  for (SXReportingServiceType type : {0, 1, 11, 12, 65534, 65535}) {
-    EXPECT_EQ(SXServiceTypeFromText(SXServiceTypeName(type)), type);
-  }
-  EXPECT_EQ(SXServiceTypeName(12), "servicetype12");
-}
-
 TEST(SXCtlArgsTest, CommandsTakeTheirArguments) {
+  EXPECT_EQ(parse({"set-type", "TEST", "42"}).serviceType, 11);  // names in any case
+  EXPECT_EQ(parse({"set-type", "12", "42"}).serviceType, 12);
   auto r = parse({"send", "--ids", "1,-2,3", "{\"k\": 1}"});
-  EXPECT_EQ(r.category, 3u);
-  EXPECT_EQ(r.messageType, 1);
   EXPECT_EQ(r.reporterIDs, (std::vector<int64_t>{1, -2, 3}));
   EXPECT_EQ(r.payload, (SXValue{{"k", 1}}));
 
@@ -137,60 +99,27 @@ TEST(SXCtlArgsTest, CommandsTakeTheirArguments) {
   EXPECT_EQ(r.messageType, 10);
   EXPECT_FALSE(parse({"send", "--broadcast", "{}"}).reporterIDs.has_value());
 
-  EXPECT_EQ(parse({"configure", "--config", "{\"a\":1}", "5"}).configuration, (SXValue{{"a", 1}}));
   auto cleared = parse({"configure", "--config", "null", "5"});
   EXPECT_FALSE(cleared.configuration.has_value());
   EXPECT_EQ(cleared.reporterID, 5);
-
-  r = parse({"events", "--name", "com.x", "--limit", "3", "--since", "2026-11-25T06:30:15Z"});
-  EXPECT_EQ(r.eventName, "com.x");
-  EXPECT_EQ(r.limit, 3);
-  EXPECT_EQ(r.since, 1795588215.0);
-  r = parse({"events"});
-  EXPECT_FALSE(r.limit.has_value());
-  EXPECT_FALSE(r.since.has_value());
-
-  EXPECT_TRUE(parse({"status", "--metrics"}).metrics);
-  EXPECT_FALSE(parse({"status"}).metrics);
   EXPECT_EQ(parse({"notify", "--", "then"}).notificationName, "then");
-}
 
-TEST(SXCtlArgsTest, DefaultsActionsAndTypedValues) {
-  struct Row {
-    std::vector<std::string> args;
-    std::string action;
-    std::optional<std::string> key;
-    SXValue value;
-  };
-  const Row rows[] = {
-      {{"defaults", "read"}, "read", std::nullopt, nullptr},
-      {{"defaults", "read", "K"}, "read", "K", nullptr},
-      {{"defaults", "write", "K", "v"}, "write", "K", "v"},
-      {{"defaults", "write", "--int", "K", "-5"}, "write", "K", -5},
-      {{"defaults", "write", "K", "--bool", "NO"}, "write", "K", false},
-      {{"defaults", "write", "--string", "K", "12"}, "write", "K", "12"},
-      {{"defaults", "delete", "K", "--json"}, "delete", "K", nullptr},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(testing::PrintToString(row.args));
-    auto r = parse(row.args);
-    EXPECT_EQ(r.command, "defaults");
-    EXPECT_EQ(r.defaultsAction, row.action);
-    EXPECT_EQ(r.key, row.key);
-    EXPECT_EQ(r.value, row.value);
-  }
+  // Defaults values take their type from a flag that may follow them; "-5" is no option.
+  EXPECT_FALSE(parse({"defaults", "read"}).key.has_value());
+  EXPECT_EQ(parse({"defaults", "write", "--int", "K", "-5"}).value, -5);
+  EXPECT_EQ(parse({"defaults", "write", "K", "--bool", "NO"}).value, false);
+  auto typed = parse({"defaults", "write", "--string", "K", "12"});
+  EXPECT_EQ(typed.key, "K");
+  EXPECT_EQ(typed.value, "12");
 }
 
 TEST(SXCtlArgsTest, SinceTakesUtcTimesAndAges) {
   const double now = 1795588215.5;  // 2026-11-25T06:30:15.5Z
   const std::pair<const char*, double> good[] = {
       {"2026-11-25T06:30:15Z", 1795588215},
-      {"2026-11-25T06:30:15", 1795588215},
       {"2026-11-25 06:30", 1795588200},
       {"2026-11-25", 1795564800},
       {"90s", now - 90},
-      {"10m", now - 600},
-      {"2h", now - 7200},
       {"1.5d", now - 129600},
   };
   for (const auto& [text, expected] : good) {
@@ -238,7 +167,6 @@ TEST(SXCtlArgsTest, SocketAndPreferencesFollowTheirDirectoriesUnlessGiven) {
   EXPECT_EQ(paths.socketPath, "/r/com.vendra.audio.kitbench.reporting.service");
   paths = SXCtlPaths(parse({"--runtime-dir", "/r", "--socket", "/s", "list"}));
   EXPECT_EQ(paths.socketPath, "/s");
-  EXPECT_EQ(SXCtlPaths(parse({"--state-dir", "/st", "list"})).stateDir, "/st");
 
   ::unsetenv("SXREPORTING_PREFERENCES_DIR");
   auto preferences = [](std::vector<std::string> args) {

@@ -67,34 +67,6 @@ struct Rig {
 
 // ---- Message keys ----
 
-TEST(SXReportingBlockThrottleKeyTest, KeyListsSortedFieldsThenReporterCategoryAndType) {
-  const std::string tail = "|reporterID|42|Playback|Start";
-  const std::pair<SXValue, std::string> rows[] = {
-      {{{"b", 2}, {"a", "x"}, {"systemuptime_sec", 100}}, "a|x|b|2|systemuptime_sec|^" + tail},
-      // Keys in byte order: upper case before "_" before lower case before non-ASCII.
-      {{{"\xC3\xA9", 1}, {"a", 2}, {"_x", 3}, {"B", 4}}, "B|4|_x|3|a|2|\xC3\xA9|1" + tail},
-      // A payload that is not a dictionary counts as empty.
-      {SXValue::array({1, 2}), tail.substr(1)},
-      {SXValue(), tail.substr(1)},
-      // The volume pair is left out only together.
-      {{{"Volume", 0.5}, {"VolumeOperationTime", 3}}, "Volume|^|VolumeOperationTime|^" + tail},
-      {{{"Volume", 0.5}}, "Volume|0.5" + tail},
-      // A message's own blacklist applies to it; one that is not an array is ignored.
-      {{{"a", 1}, {"b", 2}, {"_comparison_field_blacklist", {"b", 7}}},
-       "_comparison_field_blacklist|^|a|1|b|^" + tail},
-      {{{"b", 2}, {"_comparison_field_blacklist", "b"}},
-       "_comparison_field_blacklist|^|b|2" + tail},
-      {{{"n", 1e20}}, "n|100000000000000000000" + tail},
-      {{{"n", 0.1}}, "n|0.1" + tail},
-      // Dictionaries nest in ascending key order.
-      {{{"d", {{"z", 1}, {"a", {{"y", "s"}}}}}}, "d|{\"a\":{\"y\":\"s\"},\"z\":1}" + tail},
-  };
-  for (const auto& [payload, expected] : rows) EXPECT_EQ(key(payload), expected) << payload;
-  EXPECT_EQ(SXReportingBlockThrottle::buildMessageKey(SXValue::object(), 7, 1, 1),
-            "reporterID|7|Generic|Start");
-  EXPECT_EQ(key({{"a", 1}}, -1), "a|1|reporterID|-1|Playback|Start");
-}
-
 // Two messages share a key exactly when their values' texts are equal, once the excluded
 // fields' values are left out (their keys still count).
 TEST(SXReportingBlockThrottleKeyTest, EqualKeysMeanEqualValuesBarTheExcludedOnes) {
@@ -111,6 +83,13 @@ TEST(SXReportingBlockThrottleKeyTest, EqualKeysMeanEqualValuesBarTheExcludedOnes
       {{{"b", 2}, {"_comparison_field_blacklist", {"b"}}},
        {{"b", 99}, {"_comparison_field_blacklist", {"b"}}},
        true},
+      // A blacklist that is not an array is ignored.
+      {{{"b", 2}, {"_comparison_field_blacklist", "b"}},
+       {{"b", 99}, {"_comparison_field_blacklist", "b"}},
+       false},
+      // A payload that is not a dictionary counts as empty.
+      {SXValue::array({1, 2}), SXValue::object(), true},
+      {SXValue(), SXValue::object(), true},
       // Numbers compare by value, whatever their kind; booleans are the numbers 1 and 0.
       {{{"n", 1}}, {{"n", 1.0}}, true},
       {{{"n", {1, -2, 3u}}}, {{"n", {1.0, -2.0, 3.0}}}, true},
@@ -132,45 +111,45 @@ TEST(SXReportingBlockThrottleKeyTest, EqualKeysMeanEqualValuesBarTheExcludedOnes
   }
   for (const Row& row : rows) EXPECT_EQ(key(row.a) == key(row.b), row.same) << row.a << row.b;
   EXPECT_NE(key({{"a", 1}}, 1), key({{"a", 1}}, -1));
+  const SXValue empty = SXValue::object();
+  EXPECT_NE(SXReportingBlockThrottle::buildMessageKey(empty, 7, 1, 1),
+            SXReportingBlockThrottle::buildMessageKey(empty, 7, 3, 1));
+  EXPECT_NE(SXReportingBlockThrottle::buildMessageKey(empty, 7, 3, 1),
+            SXReportingBlockThrottle::buildMessageKey(empty, 7, 3, 2));
 }
 
 // ---- Throttle time ----
 
-TEST(SXReportingBlockThrottleSleepTimeTest, AcceptedValuesNarrowToSinglePrecision) {
-  FakeLog log;
-  auto sleepTime = [&](SXValue value) {
-    return SXReportingBlockThrottle::determineSleepTime({{"_throttle_seconds", value}}, log);
-  };
-  EXPECT_EQ(SXReportingBlockThrottle::determineSleepTime({{"a", 1}}, log), 0.5);
-  EXPECT_EQ(SXReportingBlockThrottle::determineSleepTime("not a dictionary", log), 0.5);
-  EXPECT_EQ(sleepTime(4.9), 4.900000095367432);
-  EXPECT_NEAR(sleepTime(4.99), 4.99, 1e-6);
-  EXPECT_EQ(sleepTime(4), 4.0);
-  EXPECT_EQ(sleepTime(0), 0.0);
-  EXPECT_EQ(sleepTime(-1), -1.0);
-  EXPECT_EQ(sleepTime(-1e300), -std::numeric_limits<double>::infinity());
-  EXPECT_TRUE(log.lines().empty());
-}
-
-TEST(SXReportingBlockThrottleSleepTimeTest, RejectedValuesFallBackWithOneInfoLine) {
+// Accepted values narrow to single precision; rejected ones fall back to 0.5 s with one info
+// line of the default log.
+TEST(SXReportingBlockThrottleSleepTimeTest, AcceptedValuesNarrowRejectedOnesFallBack) {
   struct Case {
-    SXValue value;
-    std::string line;
+    SXValue payload;
+    double seconds;
+    std::string line;  // "": none
   };
-  std::vector<Case> cases = {
-      {5, "Rejecting large throttle time. {time=5, max=5.000000}"},
-      {5u, "Rejecting large throttle time. {time=5, max=5.000000}"},
-      {5.0, "Rejecting large throttle time. {time=5, max=5.000000}"},
-      {7.5, "Rejecting large throttle time. {time=7.5, max=5.000000}"},
-      {std::nan(""), "Rejecting large throttle time. {time=nan, max=5.000000}"},
-      {"2", "Rejecting non Numbox value of throttle time. {time=2}"},
-      {SXValue::array({1}), "Rejecting non Numbox value of throttle time. {time=[1]}"},
+  const std::string large = "Rejecting large throttle time. {time=";
+  const std::string notNumber = "Rejecting non Numbox value of throttle time. {time=";
+  auto throttle = [](SXValue value) { return SXValue{{"_throttle_seconds", value}}; };
+  const Case cases[] = {
+      {{{"a", 1}}, 0.5, ""},
+      {"not a dictionary", 0.5, ""},
+      {throttle(4.9), 4.900000095367432, ""},
+      {throttle(4), 4.0, ""},
+      {throttle(-1), -1.0, ""},
+      {throttle(-1e300), -std::numeric_limits<double>::infinity(), ""},
+      {throttle(5u), 0.5, large + "5, max=5.000000}"},
+      {throttle(5.0), 0.5, large + "5, max=5.000000}"},
+      {throttle(7.5), 0.5, large + "7.5, max=5.000000}"},
+      {throttle(std::nan("")), 0.5, large + "nan, max=5.000000}"},
+      {throttle("2"), 0.5, notNumber + "2}"},
+      {throttle(SXValue::array({1})), 0.5, notNumber + "[1]}"},
   };
   for (const auto& c : cases) {
     FakeLog log;
-    SXValue payload = {{"_throttle_seconds", c.value}};
-    EXPECT_EQ(SXReportingBlockThrottle::determineSleepTime(payload, log), 0.5) << c.line;
-    ASSERT_EQ(log.lines().size(), 1u) << c.line;
+    EXPECT_EQ(SXReportingBlockThrottle::determineSleepTime(c.payload, log), c.seconds) << c.payload;
+    ASSERT_EQ(log.lines().size(), c.line.empty() ? 0u : 1u) << c.payload;
+    if (c.line.empty()) continue;
     EXPECT_EQ(log.lines()[0].message, c.line);
     EXPECT_EQ(log.lines()[0].level, SXLogLevel::kInfo);
     EXPECT_EQ(log.lines()[0].scope, "");

@@ -77,42 +77,38 @@ TEST_F(SXReportingClientTest, DefaultTimeoutComesFromTheOptions) {
   EXPECT_EQ(await(quick.killService()).status, SXCallStatus::kTimedOut);
 }
 
+// However the connection ends, every pending call completes, and later calls fail at once.
 TEST_F(SXReportingClientTest, ConnectionLossCompletesEveryPendingCall) {
   server_.on(kStart, [](auto&) { return Answer::none(); });
-  std::vector<std::future<SXCallResult<bool>>> starts;
-  for (int i = 1; i <= 5; ++i)
-    starts.push_back(client_->startReportingSessionForID(i, kSXWaitForever));
-  ASSERT_TRUE(server_.waitForRequests(5));
-  server_.closeConnections();
-  for (auto& start : starts) {
-    auto result = await(std::move(start));
-    EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
-    EXPECT_EQ(result.error, "the service closed the connection");
+  enum End { kServiceCloses, kServiceSendsGarbage, kClientDestroyed };
+  const std::pair<End, std::string> cases[] = {
+      {kServiceCloses, "the service closed the connection"},
+      {kServiceSendsGarbage, "not MessagePack-RPC"},
+      {kClientDestroyed, "the client closed the connection"},
+  };
+  for (const auto& [end, error] : cases) {
+    SCOPED_TRACE(error);
+    auto client = std::make_unique<SXReportingClient>(SXClientOptions{server_.socketPath()});
+    ASSERT_TRUE(client->connect());
+    const size_t before = server_.requests().size();
+    std::vector<std::future<SXCallResult<bool>>> starts;
+    for (int i = 1; i <= 3; ++i) {
+      starts.push_back(client->startReportingSessionForID(i, kSXWaitForever));
+    }
+    ASSERT_TRUE(server_.waitForRequests(before + 3));
+    if (end == kServiceCloses) server_.closeConnections();
+    if (end == kServiceSendsGarbage) server_.sendBytes("\xc1");  // a byte MessagePack never uses
+    if (end == kClientDestroyed) client.reset();
+    for (auto& start : starts) {
+      auto result = await(std::move(start));
+      EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
+      EXPECT_NE(result.error.find(error), std::string::npos) << result.error;
+    }
+    if (client) {
+      EXPECT_FALSE(client->connected());
+      EXPECT_EQ(await(client->createReportingSession(1)).status, SXCallStatus::kConnectionLost);
+    }
   }
-  EXPECT_FALSE(client_->connected());
-  auto after = await(client_->createReportingSession(1));
-  EXPECT_EQ(after.status, SXCallStatus::kConnectionLost);
-  EXPECT_EQ(after.error, "the service closed the connection");
-}
-
-TEST_F(SXReportingClientTest, BytesThatAreNotMessagePackEndTheConnection) {
-  server_.on(kValid, [](auto&) { return Answer::none(); });
-  auto valid = client_->reporterID(1);
-  ASSERT_TRUE(server_.waitForRequests(1));
-  server_.sendBytes(std::string(1, '\xc1'));  // a byte MessagePack never uses
-  auto result = await(std::move(valid));
-  EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
-  EXPECT_NE(result.error.find("not MessagePack-RPC"), std::string::npos) << result.error;
-}
-
-TEST_F(SXReportingClientTest, DestroyingTheClientCompletesPendingCalls) {
-  server_.on(kStart, [](auto&) { return Answer::none(); });
-  auto start = client_->startReportingSessionForID(1, kSXWaitForever);
-  ASSERT_TRUE(server_.waitForRequests(1));
-  client_.reset();
-  auto result = await(std::move(start));
-  EXPECT_EQ(result.status, SXCallStatus::kConnectionLost);
-  EXPECT_EQ(result.error, "the client closed the connection");
 }
 
 TEST_F(SXReportingClientTest, CallbacksRunOnTheIoThreadWhichMayDestroyTheClient) {

@@ -10,36 +10,32 @@
 #include "common/SXThreadSafety.h"
 #include "support/FakeService.h"
 
+using namespace sxr::method;
 using Kind = FakeFernReporting::Event::Kind;
 
 TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing) {
   FakeService s({.maxSessionsPerClient = 2, .maxSessions = 3});
   auto a = s.connect(10);
   auto b = s.connect(11);
-  for (int64_t id : {1, 2, 3}) EXPECT_EQ(s.call(*a, sxr::method::kCreate, {id}), true) << id;
-  EXPECT_EQ(s.call(*a, sxr::method::kGetAllReporters, SXValue::array()), SXValue({1, 2}));
-  EXPECT_TRUE(
-      s.t.log->contains("session limit reached: client 10 already has 2 sessions "
-                        "(--max-sessions-per-client); reporter 3 not created"));
-  EXPECT_EQ(s.call(*a, sxr::method::kCreate, {2}), true);  // replacing takes no new room
+  for (int64_t id : {1, 2, 3}) EXPECT_EQ(s.call(*a, kCreate, {id}), true) << id;
+  EXPECT_EQ(s.call(*a, kGetAllReporters, SXValue::array()), SXValue({1, 2}));
+  EXPECT_TRUE(s.t.log->contains("(--max-sessions-per-client); reporter 3 not created"));
+  EXPECT_EQ(s.call(*a, kCreate, {2}), true);  // replacing takes no new room
   EXPECT_EQ(s.dropped("sessions_per_client"), 1u);
 
-  EXPECT_EQ(s.call(*b, sxr::method::kCreate, {4}), true);
-  EXPECT_EQ(s.call(*b, sxr::method::kCreate, {5}), true);
-  EXPECT_TRUE(
-      s.t.log->contains("session limit reached: the service already has 3 sessions "
-                        "(--max-sessions); reporter 5 of client 11 not created"));
+  EXPECT_EQ(s.call(*b, kCreate, {4}), true);
+  EXPECT_EQ(s.call(*b, kCreate, {5}), true);
+  EXPECT_TRUE(s.t.log->contains("(--max-sessions); reporter 5 of client 11 not created"));
   EXPECT_EQ(s.dropped("sessions_total"), 1u);
   EXPECT_EQ(s.status()["gauges"]["sessions_live"], 3u);
   // A refused session really is absent: lookups miss it.
-  EXPECT_EQ(s.call(*b, sxr::method::kValid, {5}),
-            (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
+  EXPECT_EQ(s.call(*b, kValid, {5}), (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
 
-  EXPECT_EQ(s.call(*a, sxr::method::kDestroy, {1}), true);
-  EXPECT_EQ(s.call(*a, sxr::method::kDestroy, {1}), true);  // already gone: gives nothing back
+  EXPECT_EQ(s.call(*a, kDestroy, {1}), true);
+  EXPECT_EQ(s.call(*a, kDestroy, {1}), true);  // already gone: gives nothing back
   EXPECT_EQ(s.status()["gauges"]["sessions_live"], 2u);
-  EXPECT_EQ(s.call(*b, sxr::method::kCreate, {5}), true);
-  EXPECT_EQ(s.call(*a, sxr::method::kGetAllReporters, SXValue::array()), SXValue({2, 4, 5}));
+  EXPECT_EQ(s.call(*b, kCreate, {5}), true);
+  EXPECT_EQ(s.call(*a, kGetAllReporters, SXValue::array()), SXValue({2, 4, 5}));
   EXPECT_EQ(s.dropped("sessions_total"), 1u);
 
   // A client that goes away gives its sessions back once its instance is gone.
@@ -76,7 +72,6 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
     EXPECT_EQ(session->aggregatedPayloadEntries().size(), c.kept);
     EXPECT_EQ(environment->counters().droppedBy(c.guardrail), 5 - c.kept);
     EXPECT_EQ(t.log->countContaining("aggregate of reporter 42 is full"), 1u);
-    EXPECT_TRUE(t.log->contains("further messages are sent but left out of its summary"));
     t.drain();
     EXPECT_EQ(t.fern->events(Kind::kMessage).size(), 5u);
 
@@ -121,10 +116,7 @@ TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
             (std::vector<std::chrono::nanoseconds>{seconds(59), seconds(59)}));
   EXPECT_EQ(t.fern->events(Kind::kSingleMessage).size(), 2u);
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kStandalonePending), 2u);
-  EXPECT_EQ(t.log->count("client 10 has 8 bytes of standalone sends waiting for their delay "
-                         "(--max-pending-standalone-bytes 8); further ones are refused until "
-                         "they drain"),
-            1u);
+  EXPECT_EQ(t.log->countContaining("(--max-pending-standalone-bytes 8)"), 1u);
   EXPECT_EQ(budget->pending(), 0u);  // every slot came back once its send ran
 
   // With room again, sends wait as before.
@@ -168,8 +160,8 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
 TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliverOnce) {
   FakeService s({.maxPayloadBytes = 64, .maxConfigurationBytes = 64, .maxReporterIDs = 3});
   auto c = s.connect(10);
-  ASSERT_EQ(s.call(*c, sxr::method::kCreate, {7}), true);
-  ASSERT_EQ(s.call(*c, sxr::method::kStart, {7}), "no reply");  // answered at stop
+  ASSERT_EQ(s.call(*c, kCreate, {7}), true);
+  ASSERT_EQ(s.call(*c, kStart, {7}), "no reply");  // answered at stop
   SXValue big = {{"k", std::string(100, 'x')}};
   struct Case {
     const char* method;
@@ -178,21 +170,9 @@ TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliver
     const char* guardrail;
   };
   const Case cases[] = {
-      {sxr::method::kSendMessage,
-       {big, 3, 1, {7}},
-       "payload of 105 bytes is larger than the limit "
-       "of 64 bytes (--max-payload-bytes)",
-       "payload_bytes"},
-      {sxr::method::kSetConfiguration,
-       {big, 7},
-       "configuration of 105 bytes is larger than the "
-       "limit of 64 bytes (--max-configuration-bytes)",
-       "configuration_bytes"},
-      {sxr::method::kSendMessage,
-       {{{"k", 1}}, 3, 1, {1, 2, 3, 7}},
-       "reporterIDs holds 4 reporter "
-       "IDs, more than the limit of 3 (--max-reporter-ids)",
-       "reporter_ids"},
+      {kSendMessage, {big, 3, 1, {7}}, "(--max-payload-bytes)", "payload_bytes"},
+      {kSetConfiguration, {big, 7}, "(--max-configuration-bytes)", "configuration_bytes"},
+      {kSendMessage, {{{"k", 1}}, 3, 1, {1, 2, 3, 7}}, "(--max-reporter-ids)", "reporter_ids"},
   };
   for (const Case& k : cases) {
     c->request(k.method, k.params);
@@ -203,10 +183,10 @@ TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliver
     EXPECT_EQ(s.dropped(k.guardrail), 1u) << k.guardrail;
   }
   EXPECT_TRUE(s.t.fern->events(Kind::kMessage).empty());
-  EXPECT_EQ(s.call(*c, sxr::method::kSendMessage, {{{"k", 1}}, 3, 1, {7, 7, 7}}), nullptr);
+  EXPECT_EQ(s.call(*c, kSendMessage, {{{"k", 1}}, 3, 1, {7, 7, 7}}), nullptr);
   s.t.drain();
   EXPECT_EQ(s.t.fern->events(Kind::kMessage).size(), 1u);
-  EXPECT_EQ(s.t.tallyvane->events().size(), 1u);
+  EXPECT_EQ(s.t.tallyvane->eventCount(), 1u);
 }
 
 // One client's unknown reporter IDs cost at most the per-minute number of error lines; the
@@ -214,15 +194,12 @@ TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliver
 TEST(SXReportingLimitsErrorLines, ABadClientCostsAFewLinesAMinute) {
   FakeService s({.maxErrorLines = 2});
   auto c = s.connect(10);
-  EXPECT_EQ(s.call(*c, sxr::method::kSendMessage, {{{"k", 1}}, 3, 1, {1, 2, 3, 4, 5}}), nullptr);
+  EXPECT_EQ(s.call(*c, kSendMessage, {{{"k", 1}}, 3, 1, {1, 2, 3, 4, 5}}), nullptr);
   EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 2u);
   EXPECT_EQ(s.dropped("error_lines"), 3u);
   s.t.clock->advance(61);
-  EXPECT_EQ(s.call(*c, sxr::method::kValid, {6}),
-            (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
-  EXPECT_TRUE(
-      s.t.log->contains("client 10 caused 3 more error lines than the 2 a minute written "
-                        "(--max-error-lines); they were left out"));
+  EXPECT_EQ(s.call(*c, kValid, {6}), (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
+  EXPECT_TRUE(s.t.log->contains("client 10 caused 3 more error lines than the 2 a minute"));
   EXPECT_EQ(s.t.log->countContaining("failed to find reporting session"), 3u);
 }
 

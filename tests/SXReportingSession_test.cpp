@@ -23,12 +23,12 @@ SXValue internalBuild(int deviceClass = 1) {
 }
 
 // The summary file's name on internal builds: the host application name comes from a client
-// and stands in the name as it is, but it must never name another directory or overrun a name.
-// The part of the file name that the host application name became.
+// and stands in the name as it is, but it must never name another directory or overrun a name
+// (that it stays one name in its directory, FuzzCorpus checks). The part of the file name that
+// the host application name became.
 std::string hostPart(const SXValue& host) {
   TestEnvironment t(SXValue{{"InternalBuild", true}});
-  auto session = SXReportingSession::initWithID(t.environment, 42, SXValue::array());
-  session->setServiceType(7);
+  auto session = makeSession(t);
   SXValue config = {{"HostApplicationDisplayID", host}};
   session->setConfiguration(&config);
   session->start();
@@ -40,8 +40,6 @@ std::string hostPart(const SXValue& host) {
     return "";
   }
   std::string path = t.fileSystem->files.begin()->first;
-  EXPECT_EQ(path.rfind("/diag/", 0), 0u) << path;
-  EXPECT_EQ(path.find('/', 6), std::string::npos) << path;
   size_t from = path.find("-sonex-") + 7;
   size_t to = path.rfind("-longformaudio.json");
   EXPECT_NE(to, std::string::npos) << path;
@@ -50,15 +48,9 @@ std::string hostPart(const SXValue& host) {
 
 }  // namespace
 
-TEST(SXReportingSessionRecord, NewSessionDefaultsAndConfigurationMerge) {
+TEST(SXReportingSessionRecord, DefaultsFillWhatTheConfigurationLeavesOut) {
   TestEnvironment t;
-  auto session = SXReportingSession::initWithID(t.environment, 42, SXValue::array({1}));
-  EXPECT_EQ(session->serviceType(), 65535);
-  EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_FALSE(session->started());
-  EXPECT_EQ(session->userInfo(), SXValue::object());
-  EXPECT_TRUE(session->aggregatedPayloadEntries().empty());
-
+  auto session = makeSession(t);
   SXValue config = {{"a", 1}};
   SXValue defaults = {{"a", 2}, {"b", 3}};
   session->setConfiguration(&config);
@@ -125,8 +117,6 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarms) {
   ASSERT_EQ(delays.size(), 5u);
   for (size_t i = 0; i < 4; ++i) EXPECT_EQ(delays[i].count(), 0);
   EXPECT_EQ(delays[4], std::chrono::seconds(59));
-  EXPECT_TRUE(t.log->contains("sending single message after delta 0 for service 5"));
-  EXPECT_TRUE(t.log->contains("sending single message after delta 59 for service 4"));
 
   SXSystemRandom random;
   for (int i = 0; i < 2000; ++i) EXPECT_LT(random.uniform(60), 60u);
@@ -141,7 +131,6 @@ TEST(SXReportingSessionMessages, StandaloneFailureReachesTheReply) {
   t.drain();
   ASSERT_TRUE(got);
   EXPECT_EQ(got->localizedDescription, "spool full");
-  EXPECT_TRUE(t.log->contains("sendOneMessageWithSessionInfo spool full"));
 }
 
 TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThenFlush) {
@@ -172,13 +161,6 @@ TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThen
   EXPECT_EQ(open.sessionInfo[fern::kSessionInfoBatchEvent], true);
   EXPECT_EQ(open.userInfo[fern::kUserInfoServiceName], "telephony_session");
   EXPECT_EQ(open.userInfo["HostApplicationDisplayID"], "phone");
-  auto summary = t.fern->events(Kind::kMessage)[1];
-  EXPECT_EQ(summary.category, 65535);
-  EXPECT_EQ(summary.type, 65535);
-  EXPECT_EQ(summary.payload["SX_Session_Summary_Event"], "2");
-  EXPECT_EQ(summary.payload["Playback_Start_1"], R"({"k":1})");
-  EXPECT_TRUE(t.log->contains("sending summary event for reporter 42"));
-  EXPECT_TRUE(t.log->contains("List of backends [\"fake\"]"));
 }
 
 TEST(SXReportingSessionLifecycle, TestSessionsNeverTalkToTheServer) {
@@ -189,7 +171,6 @@ TEST(SXReportingSessionLifecycle, TestSessionsNeverTalkToTheServer) {
   session->stop();
   t.drain();
   EXPECT_TRUE(t.fern->events().empty());
-  EXPECT_EQ(t.log->count("transactions aren't allowed on this platform"), 2u);
   EXPECT_FALSE(session->fernReportingAgentToken());
 }
 
@@ -199,7 +180,6 @@ TEST(SXReportingSessionLifecycle, SecondStartKeepsEverythingAndRestartContinuesN
   session->start();
   session->sendMessage({{"k", 1}}, 3, 1, nullptr);
   session->start();
-  EXPECT_TRUE(t.log->contains("42 is already started"));
   EXPECT_EQ(session->aggregatedPayloadEntries().size(), 1u);
   session->stop();
   session->start();
@@ -234,37 +214,15 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
       std::chrono::seconds(5)))
       << SXValue(t.log->messages()).dump(1);
 
-  auto payloads = [&](int fernSession) {
-    std::vector<SXValue> out;
-    for (const auto& e : t.fern->messages(fernSession)) out.push_back(e.payload);
-    return out;
-  };
-  // Each run of messages reached the session that was open when it was accepted, rewritten,
-  // in order, with that run's summary last.
-  auto first = payloads(1);
-  ASSERT_EQ(first.size(), 3u);
-  EXPECT_EQ(first[0], (SXValue{{"n", 1}}));
-  EXPECT_EQ(first[1], (SXValue{{"n_2", 2}}));
-  EXPECT_EQ(first[2]["Playback_Start_3"], R"({"n_2":2})");
-  auto second = payloads(2);
-  ASSERT_EQ(second.size(), 2u);
-  EXPECT_EQ(second[0], (SXValue{{"n", 4}}));
-  EXPECT_EQ(second[1]["Playback_Start_5"], R"({"n":4})");
-  std::vector<SXValue> singles;
-  for (const auto& e : t.fern->events(Kind::kSingleMessage)) singles.push_back(e.payload);
-  EXPECT_EQ(singles.size(), 2u);
-  // Each session's flush follows its own messages.
-  std::vector<std::pair<Kind, int>> order;
+  // Each run of messages reached the session that was open when it was accepted, in order,
+  // its summary last, and each session's flush follows its own messages.
+  std::vector<std::string> order;  // "message 1": a message of the first server session
   for (const auto& e : t.fern->events()) {
-    if (e.kind == Kind::kMessage || e.kind == Kind::kFlush) order.push_back({e.kind, e.session});
+    if (e.kind == Kind::kMessage) order.push_back("message " + std::to_string(e.session));
+    if (e.kind == Kind::kFlush) order.push_back("flush " + std::to_string(e.session));
   }
-  EXPECT_EQ(order, (std::vector<std::pair<Kind, int>>{{Kind::kMessage, 1},
-                                                      {Kind::kMessage, 1},
-                                                      {Kind::kMessage, 1},
-                                                      {Kind::kFlush, 1},
-                                                      {Kind::kMessage, 2},
-                                                      {Kind::kMessage, 2},
-                                                      {Kind::kFlush, 2}}));
+  EXPECT_EQ(order, (std::vector<std::string>{"message 1", "message 1", "message 1", "flush 1",
+                                             "message 2", "message 2", "flush 2"}));
 }
 
 TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
@@ -300,16 +258,15 @@ TEST(SXReportingSessionOrientation, WhoTracks) {
         Case{{{"InternalBuild", 1}}, 7, false}, Case{{{"InternalBuild", "YES"}}, 7, false}}) {
     TestEnvironment t(c.device);
     auto session = makeSession(t, 42, c.type);
+    SCOPED_TRACE(c.device.dump() + " type " + std::to_string(c.type));
+    const std::string id = "SXReportingService 42";
     session->start();
     EXPECT_EQ(session->startDate().has_value(), c.tracks);
+    EXPECT_EQ(t.orientation->fireDevice(id, 1), c.tracks);
+    EXPECT_EQ(t.orientation->fireInterface(id, 1), c.tracks);
     session->stop();
-    std::vector<std::string> expected;
-    if (c.tracks) {
-      expected = {"registerDevice SXReportingService 42", "registerInterface SXReportingService 42",
-                  "unregisterDevice SXReportingService 42",
-                  "unregisterInterface SXReportingService 42"};
-    }
-    EXPECT_EQ(t.orientation->calls(), expected) << c.device.dump() << " type " << c.type;
+    EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
+    EXPECT_FALSE(t.orientation->fireInterface(id, 1));
   }
 }
 
@@ -332,12 +289,6 @@ TEST(SXReportingSessionOrientation, ReportsRoundedTimesIntoTheSummary) {
   EXPECT_EQ((*event)["device_orientation_time"], "0.001,1.235,12");
   EXPECT_EQ((*event)["ui_orientation"], "orientation4");
   EXPECT_EQ((*event)["ui_orientation_time"], "12");
-  EXPECT_TRUE(t.log->contains(
-      "Orientation handler callback mode=device orientation=\"orientation1\" app=\"(null)\", "
-      "time=0.001, id=\"SXReportingService 42\""));
-
-  session->stop();
-  EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
 }
 
 TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) {
@@ -409,8 +360,7 @@ TEST(SummaryFileName, SessionsStoppingInTheSameSecondKeepTheirOwnFiles) {
   TestEnvironment t(SXValue{{"InternalBuild", true}});
   SXValue config = {{"HostApplicationDisplayID", "player"}};
   for (int64_t id : {1, 2, 3}) {
-    auto session = SXReportingSession::initWithID(t.environment, id, SXValue::array());
-    session->setServiceType(7);
+    auto session = makeSession(t, id);
     session->setConfiguration(&config);
     session->start();
     session->sendMessage({{"n", id}}, 3, 1, nullptr);

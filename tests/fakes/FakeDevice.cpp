@@ -3,7 +3,6 @@
 void FakeOrientationService::add(bool interface, const std::string& id, SXOrientationCallback cb) {
   SXMutexLock lock(mutex_);
   callbacks(interface)[id] = std::move(cb);
-  calls_.push_back("register" + what(interface) + id);
 }
 
 void FakeOrientationService::remove(bool interface, const std::string& id) {
@@ -13,7 +12,6 @@ void FakeOrientationService::remove(bool interface, const std::string& id) {
     dropped = std::move(it->second);
     callbacks(interface).erase(it);
   }
-  calls_.push_back("unregister" + what(interface) + id);
 }
 
 bool FakeOrientationService::fire(bool interface, const std::string& id, int32_t orientation) {
@@ -26,11 +24,6 @@ bool FakeOrientationService::fire(bool interface, const std::string& id, int32_t
   }
   cb(orientation);
   return true;
-}
-
-std::vector<std::string> FakeOrientationService::calls() const {
-  SXMutexLock lock(mutex_);
-  return calls_;
 }
 
 void FakeOrientationService::clear() {

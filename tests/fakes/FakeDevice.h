@@ -4,8 +4,6 @@
 
 #include <map>
 #include <mutex>
-#include <set>
-#include <vector>
 
 #include "common/SXThreadSafety.h"
 #include "platform/DeviceProperties.h"
@@ -27,19 +25,13 @@ class FakeDeviceProperties final : public SXDeviceProperties {
   const SXValue properties_;  // never changed: read from any thread
 };
 
+// No other process has a name, and the test's own never exits.
 class FakeProcessInfo final : public SXProcessInfo {
  public:
   int32_t processIdentifier() const override { return 4242; }
   std::string processName() const override { return "sxreportingd"; }
-  std::optional<std::string> commandName(int32_t pid) const override {
-    auto it = names.find(pid);
-    if (pid < 1 || it == names.end()) return std::nullopt;
-    return it->second;
-  }
-  void exitProcess(int status) override { exitStatus = status; }
-
-  std::map<int32_t, std::string> names;
-  std::optional<int> exitStatus;
+  std::optional<std::string> commandName(int32_t) const override { return std::nullopt; }
+  void exitProcess(int) override {}
 };
 
 // Files in memory.
@@ -91,7 +83,6 @@ class FakeOrientationService final : public SXOrientationService {
   bool fireInterface(const std::string& id, int32_t orientation) {
     return fire(true, id, orientation);
   }
-  std::vector<std::string> calls() const;  // "registerDevice <id>", ...
   // Drops every registration (callbacks hold their sessions).
   void clear();
 
@@ -104,10 +95,8 @@ class FakeOrientationService final : public SXOrientationService {
   Callbacks& callbacks(bool interface) SX_REQUIRES(mutex_) {
     return interface ? interface_ : device_;
   }
-  static std::string what(bool interface) { return interface ? "Interface " : "Device "; }
 
   mutable SXMutex mutex_;
   Callbacks device_ SX_GUARDED_BY(mutex_);
   Callbacks interface_ SX_GUARDED_BY(mutex_);
-  std::vector<std::string> calls_ SX_GUARDED_BY(mutex_);
 };

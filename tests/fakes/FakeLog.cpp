@@ -29,35 +29,32 @@ std::vector<FakeLog::Line> FakeLog::lines() const {
 }
 
 std::vector<std::string> FakeLog::messages() const {
-  SXMutexLock lock(mutex_);
   std::vector<std::string> out;
-  for (const auto& l : lines_) out.push_back(l.message);
+  for (const auto& l : lines()) out.push_back(l.message);
   return out;
+}
+
+size_t FakeLog::countLocked(const std::string& text, bool whole) const {
+  size_t n = 0;
+  for (const auto& l : lines_) {
+    n += whole ? l.message == text : l.message.find(text) != std::string::npos;
+  }
+  return n;
 }
 
 size_t FakeLog::count(const std::string& message) const {
   SXMutexLock lock(mutex_);
-  return countLocked(message);
+  return countLocked(message, true);
 }
 
-size_t FakeLog::countLocked(const std::string& message) const {
-  size_t n = 0;
-  for (const auto& l : lines_) n += l.message == message;
-  return n;
+size_t FakeLog::countContaining(const std::string& fragment) const {
+  SXMutexLock lock(mutex_);
+  return countLocked(fragment, false);
 }
 
 bool FakeLog::waitFor(const std::string& message, size_t times,
                       std::chrono::milliseconds timeout) const {
   SXMutexLock lock(mutex_);
   return lock.waitFor(written_, timeout,
-                      [&]() SX_REQUIRES(mutex_) { return countLocked(message) >= times; });
+                      [&]() SX_REQUIRES(mutex_) { return countLocked(message, true) >= times; });
 }
-
-size_t FakeLog::countContaining(const std::string& fragment) const {
-  SXMutexLock lock(mutex_);
-  size_t n = 0;
-  for (const auto& l : lines_) n += l.message.find(fragment) != std::string::npos;
-  return n;
-}
-
-bool FakeLog::contains(const std::string& fragment) const { return countContaining(fragment) > 0; }

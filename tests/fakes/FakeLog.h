@@ -33,13 +33,14 @@ class FakeLog final : public SXLogFacility {
   size_t count(const std::string& message) const;
   // Number of lines whose message contains `fragment`, and whether there is one.
   size_t countContaining(const std::string& fragment) const;
-  bool contains(const std::string& fragment) const;
+  bool contains(const std::string& fragment) const { return countContaining(fragment) > 0; }
   // Waits until `times` lines have the message `message`; false when `timeout` passes first.
   bool waitFor(const std::string& message, size_t times = 1,
                std::chrono::milliseconds timeout = std::chrono::seconds(20)) const;
 
  private:
-  size_t countLocked(const std::string& message) const;  // REQUIRES(mutex_)
+  // Lines whose message is `text` (`whole`) or contains it.
+  size_t countLocked(const std::string& text, bool whole) const SX_REQUIRES(mutex_);
 
   mutable SXMutex mutex_;
   mutable std::condition_variable written_;

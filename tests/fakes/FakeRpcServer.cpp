@@ -1,125 +1,105 @@
 #include "fakes/FakeRpcServer.h"
 
 #include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
-#include <deque>
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <stdexcept>
 
 #include "common/RpcCodec.h"
 
-class FakeRpcServer::Connection : public std::enable_shared_from_this<Connection> {
- public:
-  Connection(FakeRpcServer& server, asio::local::stream_protocol::socket socket)
-      : server_(server), socket_(std::move(socket)) {}
-
-  void read() {
-    char* buffer = decoder_.prepare(4096);
-    socket_.async_read_some(asio::buffer(buffer, 4096), [self = shared_from_this()](
-                                                            const asio::error_code& ec, size_t n) {
-      if (ec) return self->close();
-      self->decoder_.commit(n);
-      SXValue message;
-      RpcStreamDecoder::Status status;
-      while ((status = self->decoder_.next(message)) == RpcStreamDecoder::Status::kMessage) {
-        self->server_.handle(self, message);
-      }
-      if (status == RpcStreamDecoder::Status::kBroken) return self->close();
-      self->read();
-    });
-  }
-
-  void send(std::string bytes) {
-    outbox_.push_back(std::move(bytes));
-    if (outbox_.size() == 1) writeNext();
-  }
-
-  void close() {
-    asio::error_code ignored;
-    socket_.close(ignored);
-    server_.connections_.erase(shared_from_this());
-  }
-
- private:
-  void writeNext() {
-    asio::async_write(socket_, asio::buffer(outbox_.front()),
-                      [self = shared_from_this()](const asio::error_code& ec, size_t) {
-                        if (ec) return self->close();
-                        self->outbox_.pop_front();
-                        if (!self->outbox_.empty()) self->writeNext();
-                      });
-  }
-
-  FakeRpcServer& server_;
-  asio::local::stream_protocol::socket socket_;
-  RpcStreamDecoder decoder_;
-  std::deque<std::string> outbox_;
-};
-
-namespace {
-
-std::string makeTempDirectory() {
+FakeRpcServer::FakeRpcServer() {
   std::string pattern = (std::filesystem::temp_directory_path() / "sxr-fake-XXXXXX").string();
   if (!::mkdtemp(pattern.data())) throw std::runtime_error("mkdtemp failed");
-  return pattern;
-}
-
-std::string encodeResponse(uint32_t msgid, const SXValue& error, const SXValue& result) {
-  msgpack::sbuffer buffer;
-  RpcEncodeResponse(buffer, msgid, error, result);
-  return std::string(buffer.data(), buffer.size());
-}
-
-}  // namespace
-
-FakeRpcServer::FakeRpcServer()
-    : directory_(makeTempDirectory()),
-      socketPath_(directory_ + "/rpc.sock"),
-      acceptor_(io_, asio::local::stream_protocol::endpoint(socketPath_)) {
-  accept();
-  thread_ = std::thread([this] { io_.run(); });
+  directory_ = pattern;
+  socketPath_ = directory_ + "/rpc.sock";
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, socketPath_.c_str(), sizeof address.sun_path - 1);
+  listener_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (::bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+      ::listen(listener_, 64) != 0) {
+    throw std::runtime_error("cannot listen on " + socketPath_);
+  }
+  acceptor_ = std::thread([this] { acceptLoop(); });
 }
 
 FakeRpcServer::~FakeRpcServer() {
-  io_.stop();
-  thread_.join();
+  ::shutdown(listener_, SHUT_RDWR);  // ends the accept loop
+  acceptor_.join();
+  ::close(listener_);
+  closeConnections();  // ends every read loop
+  std::vector<std::thread> readers;
+  {
+    SXMutexLock lock(mutex_);
+    readers.swap(readers_);
+  }
+  for (auto& reader : readers) reader.join();
+  SXMutexLock lock(mutex_);
+  for (const auto& connection : connections_) ::close(connection.fd);
   std::error_code ignored;
   std::filesystem::remove_all(directory_, ignored);
 }
 
-void FakeRpcServer::accept() {
-  acceptor_.async_accept(
-      [this](const asio::error_code& ec, asio::local::stream_protocol::socket socket) {
-        if (ec) return;
-        auto connection = std::make_shared<Connection>(*this, std::move(socket));
-        connections_.insert(connection);
-        connection->read();
-        {
-          SXMutexLock lock(mutex_);
-          ++connectionCount_;
-        }
-        changed_.notify_all();
-        accept();
-      });
+void FakeRpcServer::acceptLoop() {
+  for (;;) {
+    int fd = ::accept4(listener_, nullptr, nullptr, SOCK_CLOEXEC);
+    if (fd < 0 && errno == EINTR) continue;
+    if (fd < 0) return;
+    SXMutexLock lock(mutex_);
+    connections_.push_back({fd, true});
+    readers_.emplace_back([this, fd] { readLoop(fd); });
+  }
 }
 
-void FakeRpcServer::handle(const std::shared_ptr<Connection>& connection, const SXValue& message) {
-  std::string why;
-  std::optional<uint32_t> msgid;
-  auto request = RpcParseRequest(message, why, msgid);
-  if (!request) return;
-  Handler handler;
-  {
-    SXMutexLock lock(mutex_);
-    requests_.push_back({request->msgid, request->method, request->params});
-    auto it = handlers_.find(request->method);
-    if (it != handlers_.end()) handler = it->second;
+void FakeRpcServer::readLoop(int fd) {
+  RpcStreamDecoder decoder;
+  for (;;) {
+    ssize_t n = ::read(fd, decoder.prepare(4096), 4096);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) break;
+    decoder.commit(n);
+    SXValue message;
+    RpcStreamDecoder::Status status;
+    while ((status = decoder.next(message)) == RpcStreamDecoder::Status::kMessage) {
+      std::string why;
+      std::optional<uint32_t> msgid;
+      auto request = RpcParseRequest(message, why, msgid);
+      if (!request) continue;
+      Handler handler;
+      {
+        SXMutexLock lock(mutex_);
+        requests_.push_back({request->msgid, request->method, request->params});
+        if (auto it = handlers_.find(request->method); it != handlers_.end()) handler = it->second;
+      }
+      changed_.notify_all();
+      Answer answer =
+          handler ? handler(request->params) : Answer::fail("unknown method " + request->method);
+      if (answer.withhold) continue;
+      std::string bytes;
+      RpcEncodeResponse(bytes, request->msgid, answer.error, answer.result);
+      SXMutexLock lock(mutex_);  // not to interleave with respond() and sendBytes()
+      sendTo(fd, bytes);
+    }
+    if (status == RpcStreamDecoder::Status::kBroken) break;
   }
-  changed_.notify_all();
-  Answer answer =
-      handler ? handler(request->params) : Answer::fail("unknown method " + request->method);
-  if (answer.withhold) return;
-  connection->send(encodeResponse(request->msgid, answer.error, answer.result));
+  SXMutexLock lock(mutex_);
+  for (auto& connection : connections_) {
+    if (connection.fd == fd) connection.open = false;
+  }
+}
+
+void FakeRpcServer::sendTo(int fd, const std::string& bytes) {
+  for (size_t sent = 0; sent < bytes.size();) {
+    ssize_t n = ::send(fd, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return;  // the connection is gone
+    sent += n;
+  }
 }
 
 void FakeRpcServer::on(const std::string& method, Handler handler) {
@@ -140,24 +120,26 @@ bool FakeRpcServer::waitForRequests(size_t count, std::chrono::milliseconds time
 
 size_t FakeRpcServer::connectionCount() const {
   SXMutexLock lock(mutex_);
-  return connectionCount_;
-}
-
-void FakeRpcServer::forEachConnection(std::function<void(Connection&)> action) {
-  asio::post(io_, [this, action = std::move(action)] {
-    auto connections = connections_;  // `close` changes the set
-    for (const auto& connection : connections) action(*connection);
-  });
+  return connections_.size();
 }
 
 void FakeRpcServer::respond(uint32_t msgid, const SXValue& error, const SXValue& result) {
-  sendBytes(encodeResponse(msgid, error, result));
+  std::string bytes;
+  RpcEncodeResponse(bytes, msgid, error, result);
+  sendBytes(bytes);
 }
 
-void FakeRpcServer::sendBytes(std::string bytes) {
-  forEachConnection([bytes = std::move(bytes)](Connection& c) { c.send(bytes); });
+void FakeRpcServer::sendBytes(const std::string& bytes) {
+  SXMutexLock lock(mutex_);
+  for (const auto& connection : connections_) {
+    if (connection.open) sendTo(connection.fd, bytes);
+  }
 }
 
 void FakeRpcServer::closeConnections() {
-  forEachConnection([](Connection& c) { c.close(); });
+  SXMutexLock lock(mutex_);
+  for (auto& connection : connections_) {
+    if (connection.open) ::shutdown(connection.fd, SHUT_RDWR);
+    connection.open = false;
+  }
 }

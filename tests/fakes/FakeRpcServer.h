@@ -3,17 +3,14 @@
 // (a method without one gets an error response), records every request, can withhold replies
 // and answer them later in any order, send raw bytes, and drop its connections.
 //
-// All methods may be called from any thread; handlers run on the server's own I/O thread.
+// All methods may be called from any thread; each connection's handlers run on its own thread.
 #pragma once
 
-#include <asio.hpp>
 #include <chrono>
 #include <condition_variable>
 #include <functional>
 #include <map>
-#include <memory>
 #include <mutex>
-#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -58,26 +55,28 @@ class FakeRpcServer {
 
   // Sends to every open connection.
   void respond(uint32_t msgid, const SXValue& error, const SXValue& result);
-  void sendBytes(std::string bytes);
+  void sendBytes(const std::string& bytes);
   void closeConnections();
 
  private:
-  class Connection;
-  void accept();
-  void handle(const std::shared_ptr<Connection>& connection, const SXValue& message);
-  void forEachConnection(std::function<void(Connection&)> action);
+  struct Connection {
+    int fd;
+    bool open;
+  };
+  void acceptLoop();
+  void readLoop(int fd);
+  // Sockets are closed only by the destructor, so that a number is never reused meanwhile.
+  void sendTo(int fd, const std::string& bytes) SX_REQUIRES(mutex_);
 
   std::string directory_;
   std::string socketPath_;
-  asio::io_context io_;
-  asio::local::stream_protocol::acceptor acceptor_;
-  std::set<std::shared_ptr<Connection>> connections_;  // I/O thread only
+  int listener_ = -1;
 
   mutable SXMutex mutex_;
   std::condition_variable changed_;
   std::map<std::string, Handler> handlers_ SX_GUARDED_BY(mutex_);
   std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
-  size_t connectionCount_ SX_GUARDED_BY(mutex_) = 0;  // accepted so far
-
-  std::thread thread_;
+  std::vector<Connection> connections_ SX_GUARDED_BY(mutex_);  // every one accepted
+  std::vector<std::thread> readers_ SX_GUARDED_BY(mutex_);
+  std::thread acceptor_;
 };

@@ -8,7 +8,7 @@ class ManualQueue final : public SXWorkQueue {
  public:
   ManualQueue(std::string label, ManualDispatch& dispatch)
       : label_(std::move(label)), dispatch_(dispatch) {}
-  void async(SXTask task) override { dispatch_.enqueue(label_, std::move(task), suspended_); }
+  void async(SXTask task) override { dispatch_.enqueue(std::move(task), suspended_); }
   const std::string& label() const override { return label_; }
   void suspend() override { ++*suspended_; }
   void resume() override {
@@ -72,10 +72,9 @@ size_t ManualDispatch::advance(std::chrono::nanoseconds delay) {
   return ran + runAll();
 }
 
-void ManualDispatch::enqueue(const std::string& label, SXTask task,
-                             std::shared_ptr<const std::atomic<int>> suspended) {
+void ManualDispatch::enqueue(SXTask task, std::shared_ptr<const std::atomic<int>> suspended) {
   SXMutexLock lock(mutex_);
-  tasks_.push_back({label, std::move(task), std::move(suspended)});
+  tasks_.push_back({std::move(task), std::move(suspended)});
 }
 
 size_t ManualDispatch::runAll() {

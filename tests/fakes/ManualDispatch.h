@@ -36,12 +36,10 @@ class ManualDispatch final : public SXDispatch {
 
   // `suspended`, when given, is the count of the queue's suspensions: the task waits while it
   // is above zero.
-  void enqueue(const std::string& label, SXTask task,
-               std::shared_ptr<const std::atomic<int>> suspended = nullptr);
+  void enqueue(SXTask task, std::shared_ptr<const std::atomic<int>> suspended = nullptr);
 
  private:
   struct Queued {
-    std::string label;
     SXTask task;
     std::shared_ptr<const std::atomic<int>> suspended;
   };

@@ -2,7 +2,6 @@
 // queues run by hand.
 #pragma once
 
-#include <functional>
 #include <memory>
 #include <string_view>
 
@@ -11,21 +10,16 @@
 #include "support/TestEnvironment.h"
 
 struct FakeService {
-  // `adjust` may swap a facility of the platform before the service is made of it.
-  explicit FakeService(SXReportingLimits limits = {},
-                       const std::function<void(TestEnvironment&, SXPlatform&)>& adjust = {}) {
-    platform = t.platform();
-    if (adjust) adjust(t, platform);
-    environment = t.makeEnvironment(limits, platform);
-    delegate = SXReportingServiceDelegate::init(environment);
-  }
+  explicit FakeService(SXReportingLimits limits = {})
+      : environment(t.makeEnvironment(limits)),
+        delegate(SXReportingServiceDelegate::init(environment)) {}
   ~FakeService() { t.drain(); }
 
-  // A connection the delegate accepted; its registration has run unless `settle` is false.
-  std::shared_ptr<FakeIpcConnection> connect(int32_t pid, bool settle = true) {
+  // A connection the delegate accepted, its registration run.
+  std::shared_ptr<FakeIpcConnection> connect(int32_t pid) {
     auto connection = std::make_shared<FakeIpcConnection>(pid);
     EXPECT_TRUE(delegate->shouldAcceptNewConnection(connection)) << pid;
-    if (settle) t.drain();
+    t.drain();
     return connection;
   }
   // The result of the request's reply, or "no reply" when none came once the queues ran.
@@ -47,7 +41,6 @@ struct FakeService {
   }
 
   TestEnvironment t;
-  SXPlatform platform;  // what the service was made of
   std::shared_ptr<SXReportingEnvironment> environment;
   std::shared_ptr<SXReportingServiceDelegate> delegate;
 };
