@@ -78,11 +78,9 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
 
   // The session's message, its summary and the standalone message.
   daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 3);
-  ASSERT_TRUE(receiver.waitFor([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
+  ASSERT_TRUE(waitUntil([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
       << daemon.log();
   auto request = receiver.requests().front();
-  EXPECT_EQ(request.method, "POST");
-  EXPECT_EQ(request.target, "/v1/logs");
   EXPECT_EQ(request.headers["content-type"], "application/json");
   EXPECT_EQ(request.headers["content-encoding"], "gzip");  // decoded by the receiver
   EXPECT_EQ(request.headers["x-test"], "yes");             // the file wins
@@ -123,12 +121,6 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
   ASSERT_TRUE(byKind.count("standalone 3"));
   EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.service_name"), "unknown");
   EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.session.token"), "");
-
-  auto cursor = daemon.rows("fernreporting.db", "SELECT last_message_id FROM otlp_export");
-  EXPECT_TRUE(waitUntil([&] {
-    cursor = daemon.rows("fernreporting.db", "SELECT last_message_id FROM otlp_export");
-    return !cursor.empty() && cursor[0]["last_message_id"] == SpooledIds(daemon).back();
-  }));
   EXPECT_TRUE(daemon.waitForLog("exporting spooled messages to " + receiver.endpoint()));
 }
 
@@ -138,13 +130,13 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   auto client = first.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   SendStandalone(*client, 1, 3);
-  ASSERT_TRUE(receiver.waitFor([&] { return Deliveries(receiver).size() == 3; }));
+  ASSERT_TRUE(waitUntil([&] { return Deliveries(receiver).size() == 3; }));
 
   // The collector fails: the new messages wait in the spool, retried with one error line.
   receiver.failNext(1000000, 503);
   size_t before = receiver.requests().size();
   SendStandalone(*client, 4, 3);
-  ASSERT_TRUE(receiver.waitFor([&] { return receiver.requests().size() >= before + 3; }));
+  ASSERT_TRUE(waitUntil([&] { return receiver.requests().size() >= before + 3; }));
   EXPECT_EQ(first.countInLog("cannot export to " + receiver.endpoint()), 1u) << first.log();
   EXPECT_EQ(Deliveries(receiver).size(), 3u);
 
@@ -160,7 +152,7 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   SendStandalone(*again, 7, 2);
 
   auto ids = SpooledIds(first);
-  ASSERT_TRUE(receiver.waitFor([&] {
+  ASSERT_TRUE(waitUntil([&] {
     ids = SpooledIds(first);
     return ids.size() == 8 && AllDeliveredOnce(receiver, ids);
   })) << second.log();
@@ -184,7 +176,7 @@ TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
   daemon.writeConfig("fernreporting.json", Exporting(receiver).fernConfig);
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
   // What was spooled before the reload goes too.
-  ASSERT_TRUE(receiver.waitFor([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
+  ASSERT_TRUE(waitUntil([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
       << daemon.log();
   EXPECT_EQ(Deliveries(receiver).size(), 2u);
   EXPECT_TRUE(replied(client->status()).at("gauges").contains("spool_backlog"));
@@ -198,7 +190,7 @@ TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
   EXPECT_EQ(Deliveries(receiver).size(), 2u);
 }
 
-TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusAndSizesShowIt) {
+TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusShowsIt) {
   OtlpReceiver receiver;
   TestDaemon::Options options = Exporting(receiver);
   options.daemonConfig = {{"retention", {{"intervalSeconds", 0.1}}}};
@@ -206,7 +198,7 @@ TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusAndSizesShowIt) {
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   SendStandalone(*client, 1, 5);
-  ASSERT_TRUE(receiver.waitFor([&] { return Deliveries(receiver).size() == 5; }));
+  ASSERT_TRUE(waitUntil([&] { return Deliveries(receiver).size() == 5; }));
 
   // Once exported they go, but for the newest (message ids must never come back).
   EXPECT_TRUE(waitUntil([&] { return SpooledIds(daemon) == std::vector<int64_t>{5}; }))
@@ -216,14 +208,4 @@ TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusAndSizesShowIt) {
   SXValue status = SXValue::parse(out);
   EXPECT_EQ(status["counters"]["rows_pruned"]["fernreporting"], 4);
   EXPECT_GT(status["gauges"]["store_bytes"]["fernreporting"], 0);
-  ASSERT_EQ(daemon.ctl({"status", "--metrics"}, &out), 0);
-  EXPECT_NE(out.find("sxreporting_rows_pruned_total{store=\"fernreporting\"} 4\n"),
-            std::string::npos)
-      << out;
-  ASSERT_EQ(daemon.ctl({"--json", "sizes"}, &out), 0);
-  SXValue sizes = SXValue::parse(out);
-  ASSERT_EQ(sizes.size(), 3u) << out;
-  EXPECT_EQ(sizes[2]["store"], "fernreporting.db");
-  EXPECT_EQ(sizes[2]["rows"], 1);
-  EXPECT_TRUE(daemon.waitForLog("retention: analytics 30 days or 268435456 bytes"));
 }

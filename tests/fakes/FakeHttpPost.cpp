@@ -1,6 +1,5 @@
 #include "fakes/FakeHttpPost.h"
 
-
 SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
   SXMutexLock lock(mutex_);
   requests_.push_back(request);
@@ -20,10 +19,6 @@ void FakeHttpPost::answer(int status, std::string body,
                           std::map<std::string, std::string> headers) {
   SXMutexLock lock(mutex_);
   script_.push_back({status, std::move(headers), std::move(body), ""});
-}
-
-void FakeHttpPost::answerTimes(size_t count, int status) {
-  for (size_t i = 0; i < count; ++i) answer(status);
 }
 
 void FakeHttpPost::fail(std::string error) {
