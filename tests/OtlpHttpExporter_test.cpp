@@ -51,15 +51,16 @@ class OtlpHttpExporterTest : public ::testing::Test {
     auto rows = SXTestQuery(db_, "SELECT last_message_id FROM otlp_export");
     return rows.empty() ? 0 : rows[0]["last_message_id"].get<int64_t>();
   }
-  // The sxr.message.id of every record of a request body.
-  static std::vector<int64_t> Ids(const SXValue& body) {
+  // The sxr.message.id of every record of a request's JSON body.
+  static std::vector<int64_t> Ids(const SXHttpRequest& request) {
     std::vector<int64_t> ids;
+    SXValue body = SXValue::parse(request.body);
     for (const SXValue& record : body["resourceLogs"][0]["scopeLogs"][0]["logRecords"]) {
       ids.push_back(std::stoll(record["attributes"][0]["value"]["intValue"].get<std::string>()));
     }
     return ids;
   }
-  std::vector<int64_t> LastIds() { return Ids(http_->bodies().back()); }
+  std::vector<int64_t> LastIds() { return Ids(http_->requests().back()); }
 
   SXTestTempDir dir_;
   std::string db_ = dir_.file("fernreporting.db");
@@ -191,7 +192,7 @@ TEST_F(OtlpHttpExporterTest, CursorMovesOnlyAfterA2xxAndFailuresBackOff) {
 
   Standalone({{"i", 2}});
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);
-  for (const SXValue& body : http_->bodies()) EXPECT_EQ(Ids(body)[0], 1);  // the same batch
+  for (const auto& request : http_->requests()) EXPECT_EQ(Ids(request)[0], 1);  // the same batch
   EXPECT_EQ(LastIds(), (std::vector<int64_t>{1, 2}));
   EXPECT_EQ(DurableCursor(), 2);
   EXPECT_TRUE(
@@ -248,7 +249,7 @@ TEST_F(OtlpHttpExporterTest, TimeoutsHalveTheBatchAndLengthenTheTimeUntilDrained
   }
   std::vector<std::pair<size_t, int64_t>> posts;  // (records, timeout in ms)
   for (const SXHttpRequest& request : http_->requests()) {
-    posts.emplace_back(Ids(SXValue::parse(request.body)).size(), request.timeout.count());
+    posts.emplace_back(Ids(request).size(), request.timeout.count());
   }
   // Halved down to one message and doubled up to 8 times the timeout; then the batch grows
   // back by doubling after each 2xx while the longer timeout stays for the backlog.

@@ -36,14 +36,6 @@ std::vector<SXHttpRequest> FakeHttpPost::requests() const {
   return requests_;
 }
 
-std::vector<SXValue> FakeHttpPost::bodies() const {
-  std::vector<SXValue> bodies;
-  for (const SXHttpRequest& request : requests()) {
-    bodies.push_back(SXValue::parse(request.body, nullptr, false));
-  }
-  return bodies;
-}
-
 bool FakeHttpPost::cancelled() const {
   SXMutexLock lock(mutex_);
   return cancelled_;

@@ -24,8 +24,6 @@ class FakeHttpPost final : public SXHttpPost {
   void timeOut();
 
   std::vector<SXHttpRequest> requests() const;
-  // The bodies of the requests so far, parsed.
-  std::vector<SXValue> bodies() const;
   bool cancelled() const;
 
  private:

@@ -234,12 +234,10 @@ const SXValue* AttributeValue(const SXValue& record, const std::string& key) {
 }  // namespace
 
 std::optional<int64_t> OtlpReceiver::intAttribute(const SXValue& record, const std::string& key) {
+  // Both the exporter and protobuf's JSON mapping write 64-bit integers as strings.
   const SXValue* value = AttributeValue(record, key);
   if (!value || !value->contains("intValue")) return std::nullopt;
-  const SXValue& number = (*value)["intValue"];
-  if (number.is_string()) return std::strtoll(number.get<std::string>().c_str(), nullptr, 10);
-  if (number.is_number_integer()) return number.get<int64_t>();
-  return std::nullopt;
+  return std::strtoll((*value)["intValue"].get<std::string>().c_str(), nullptr, 10);
 }
 
 std::string OtlpReceiver::stringAttribute(const SXValue& record, const std::string& key) {
