@@ -309,9 +309,8 @@ TEST_F(OtlpHttpExporterTest, RejectedBatchesAreDroppedAndOversizedOnesHalved) {
 }
 
 TEST_F(OtlpHttpExporterTest, ASpoolThatCannotBeOpenedIsAFailedAttempt) {
-  auto exporter =
-      std::make_unique<SXOtlpHttpExporter>(dir_.file("missing/dir/spool.db"), options_, http_,
-                                           clock_, std::make_shared<FixedRandom>(0), log_);
+  db_ = dir_.file("missing/dir/spool.db");
+  auto exporter = Make();
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kFailed);
   EXPECT_EQ(exporter->backlog(), 0u);
   EXPECT_TRUE(http_->requests().empty());
