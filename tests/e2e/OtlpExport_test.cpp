@@ -164,42 +164,25 @@ TEST(OtlpExportEndToEnd, FailingCollectorAndRestartLoseNothingAndRepeatNothing) 
   EXPECT_EQ(receiver.requests().back().headers["content-type"], "application/x-protobuf");
 }
 
-TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportWithoutARestart) {
+TEST(OtlpExportEndToEnd, SighupStartsAndStopsTheExportAndExportedMessagesLeaveTheSpool) {
   OtlpReceiver receiver;
-  TestDaemon daemon;
-  auto client = daemon.client();
-  ASSERT_TRUE(replied(client->createReportingSession(7)));
-  SendStandalone(*client, 1, 2);
-  ASSERT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
-  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
-
-  daemon.writeConfig("fernreporting.json", Exporting(receiver).fernConfig);
-  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  // What was spooled before the reload goes too.
-  ASSERT_TRUE(waitUntil([&] { return AllDeliveredOnce(receiver, SpooledIds(daemon)); }))
-      << daemon.log();
-  EXPECT_EQ(Deliveries(receiver).size(), 2u);
-  EXPECT_TRUE(replied(client->status()).at("gauges").contains("spool_backlog"));
-
-  daemon.writeConfig("fernreporting.json", {{"backends", {"spool"}}});
-  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  ASSERT_TRUE(daemon.waitForLog("otlp-http export stopped")) << daemon.log();
-  SendStandalone(*client, 3, 1);
-  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 3).size(), 3u);
-  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
-  EXPECT_EQ(Deliveries(receiver).size(), 2u);
-}
-
-TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusShowsIt) {
-  OtlpReceiver receiver;
-  TestDaemon::Options options = Exporting(receiver);
+  TestDaemon::Options options;
   options.daemonConfig = {{"retention", {{"intervalSeconds", 0.1}}}};
   TestDaemon daemon(options);
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   SendStandalone(*client, 1, 5);
-  ASSERT_TRUE(waitUntil([&] { return Deliveries(receiver).size() == 5; }));
+  ASSERT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 5).size(), 5u);
+  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
 
+  daemon.writeConfig("fernreporting.json", Exporting(receiver).fernConfig);
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  // What was spooled before the reload goes too.
+  ASSERT_TRUE(waitUntil([&] {
+    return AllDeliveredOnce(receiver, {1, 2, 3, 4, 5});
+  })) << daemon.log();
+  EXPECT_EQ(Deliveries(receiver).size(), 5u);
+  EXPECT_TRUE(replied(client->status()).at("gauges").contains("spool_backlog"));
   // Once exported they go, but for the newest (message ids must never come back).
   EXPECT_TRUE(waitUntil([&] { return SpooledIds(daemon) == std::vector<int64_t>{5}; }))
       << daemon.log();
@@ -211,4 +194,13 @@ TEST(OtlpExportEndToEnd, ExportedMessagesLeaveTheSpoolAndStatusShowsIt) {
     return status.is_object() && status["counters"]["rows_pruned"]["fernreporting"] == 4;
   })) << status.dump();
   EXPECT_GT(status["gauges"]["store_bytes"]["fernreporting"], 0);
+
+  daemon.writeConfig("fernreporting.json", {{"backends", {"spool"}}});
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.waitForLog("otlp-http export stopped")) << daemon.log();
+  SendStandalone(*client, 6, 1);
+  EXPECT_EQ(
+      daemon.waitForRows("fernreporting.db", "SELECT id FROM messages WHERE id = 6", 1).size(), 1u);
+  EXPECT_FALSE(replied(client->status()).at("gauges").contains("spool_backlog"));
+  EXPECT_EQ(Deliveries(receiver).size(), 5u);
 }
