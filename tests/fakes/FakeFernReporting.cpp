@@ -68,28 +68,10 @@ class Deliverer {
 
 }  // namespace
 
+// What the fake and its sessions share; sessions refer to it weakly.
 class FakeFernReporting::State {
  public:
   using Kind = Event::Kind;
-
-  std::shared_ptr<FernSecureHierarchyToken> token(
-      const std::shared_ptr<FernSecureHierarchyToken>& parent) {
-    SXMutexLock lock(mutex);
-    append({.kind = Kind::kToken});
-    std::string identifier = "fake-token-" + std::to_string(++tokens);
-    if (parent) identifier = parent->identifier() + "/" + identifier;
-    return std::make_shared<FernSecureHierarchyToken>(identifier);
-  }
-
-  // Returns the new session's number.
-  int open(const SXValue& sessionInfo, const SXValue& userInfo) {
-    SXMutexLock lock(mutex);
-    append({.kind = Kind::kOpen,
-            .session = ++sessions,
-            .sessionInfo = sessionInfo,
-            .userInfo = userInfo});
-    return sessions;
-  }
 
   void startConfiguration(int session, FernBackendsCompletion completion) {
     SXMutexLock lock(mutex);
@@ -102,18 +84,10 @@ class FakeFernReporting::State {
     deliver();
   }
 
-  bool send(Kind kind, int session, const SXValue* sessionInfo, const SXValue* userInfo,
-            uint16_t category, uint16_t type, const SXValue& payload,
-            std::optional<FernError>& error) {
+  bool send(Event event, std::optional<FernError>& error) {
     SXMutexLock lock(mutex);
-    const SendFailure failure = kind == Kind::kSingleMessage ? singleFailure : SendFailure{};
-    append({.kind = kind,
-            .session = session,
-            .sessionInfo = sessionInfo ? *sessionInfo : SXValue(),
-            .userInfo = userInfo ? *userInfo : SXValue(),
-            .category = category,
-            .type = type,
-            .payload = payload});
+    const SendFailure failure = event.kind == Kind::kSingleMessage ? singleFailure : SendFailure{};
+    append(std::move(event));
     if (failure.fails && failure.error) error = failure.error;
     return !failure.fails;
   }
@@ -126,33 +100,20 @@ class FakeFernReporting::State {
     });
   }
 
-  void deliverHeld() {
-    SXMutexLock lock(mutex);
-    for (auto& task : held) deliverer.post(std::move(task));
-    held.clear();
-  }
-
-  bool waitFor(const std::function<bool(const std::vector<Event>&)>& ready,
-               std::chrono::milliseconds timeout) {
-    SXMutexLock lock(mutex);
-    return lock.waitFor(changed, timeout, [&]() SX_REQUIRES(mutex) { return ready(events); });
+  void append(Event event) SX_REQUIRES(mutex) {
+    events.push_back(std::move(event));
+    changed.notify_all();
   }
 
   SXMutex mutex;
   std::condition_variable changed;
   std::vector<Event> events SX_GUARDED_BY(mutex);
   Delivery configurationDelivery SX_GUARDED_BY(mutex) = Delivery::kInline;
-  SendFailure singleFailure;
-  int sessions = 0;
-  int tokens = 0;
-  std::vector<std::function<void()>> held;  // kNever completions
-  Deliverer deliverer;                      // declared last: stopped before the rest goes
-
- private:
-  void append(Event event) SX_REQUIRES(mutex) {
-    events.push_back(std::move(event));
-    changed.notify_all();
-  }
+  SendFailure singleFailure SX_GUARDED_BY(mutex);
+  int sessions SX_GUARDED_BY(mutex) = 0;
+  int tokens SX_GUARDED_BY(mutex) = 0;
+  std::vector<std::function<void()>> held SX_GUARDED_BY(mutex);  // kNever completions
+  Deliverer deliverer;  // declared last: stopped before the rest goes
 };
 
 class FakeFernReporting::Session final : public FernReportingSession {
@@ -172,7 +133,11 @@ class FakeFernReporting::Session final : public FernReportingSession {
       error = FernError{"the fake server-reporting service is gone"};
       return false;
     }
-    return state->send(Event::Kind::kMessage, number_, nullptr, nullptr, category, type, payload,
+    return state->send({.kind = Event::Kind::kMessage,
+                        .session = number_,
+                        .category = category,
+                        .type = type,
+                        .payload = payload},
                        error);
   }
   void flushMessages(FernFlushCompletion completion) override {
@@ -190,20 +155,35 @@ FakeFernReporting::~FakeFernReporting() = default;
 
 std::shared_ptr<FernSecureHierarchyToken> FakeFernReporting::newHierarchyToken(
     const std::shared_ptr<FernSecureHierarchyToken>& parent) {
-  return state_->token(parent);
+  SXMutexLock lock(state_->mutex);
+  state_->append({.kind = Event::Kind::kToken});
+  std::string identifier = "fake-token-" + std::to_string(++state_->tokens);
+  if (parent) identifier = parent->identifier() + "/" + identifier;
+  return std::make_shared<FernSecureHierarchyToken>(identifier);
 }
 
 std::shared_ptr<FernReportingSession> FakeFernReporting::openSession(const SXValue& sessionInfo,
                                                                      const SXValue& userInfo,
                                                                      const SXValue&) {
-  return std::make_shared<Session>(state_, state_->open(sessionInfo, userInfo));
+  SXMutexLock lock(state_->mutex);
+  const int number = ++state_->sessions;
+  state_->append({.kind = Event::Kind::kOpen,
+                  .session = number,
+                  .sessionInfo = sessionInfo,
+                  .userInfo = userInfo});
+  return std::make_shared<Session>(state_, number);
 }
 
 bool FakeFernReporting::sendOneMessage(const SXValue& sessionInfo, const SXValue& userInfo,
                                        uint16_t category, uint16_t type, const SXValue& payload,
                                        std::optional<FernError>& error) {
-  return state_->send(Event::Kind::kSingleMessage, 0, &sessionInfo, &userInfo, category, type,
-                      payload, error);
+  return state_->send({.kind = Event::Kind::kSingleMessage,
+                       .sessionInfo = sessionInfo,
+                       .userInfo = userInfo,
+                       .category = category,
+                       .type = type,
+                       .payload = payload},
+                      error);
 }
 
 void FakeFernReporting::setConfigurationDelivery(Delivery delivery) {
@@ -216,7 +196,11 @@ void FakeFernReporting::setSingleMessageFailure(SendFailure failure) {
   state_->singleFailure = std::move(failure);
 }
 
-void FakeFernReporting::deliverHeld() { state_->deliverHeld(); }
+void FakeFernReporting::deliverHeld() {
+  SXMutexLock lock(state_->mutex);
+  for (auto& task : state_->held) state_->deliverer.post(std::move(task));
+  state_->held.clear();
+}
 
 std::vector<FakeFernReporting::Event> FakeFernReporting::events() const {
   SXMutexLock lock(state_->mutex);
@@ -224,22 +208,20 @@ std::vector<FakeFernReporting::Event> FakeFernReporting::events() const {
 }
 
 std::vector<FakeFernReporting::Event> FakeFernReporting::events(Event::Kind kind) const {
-  std::vector<Event> out;
-  for (auto& e : events()) {
-    if (e.kind == kind) out.push_back(std::move(e));
-  }
+  auto out = events();
+  std::erase_if(out, [kind](const Event& e) { return e.kind != kind; });
   return out;
 }
 
 std::vector<FakeFernReporting::Event> FakeFernReporting::messages(int session) const {
-  std::vector<Event> out;
-  for (auto& e : events(Event::Kind::kMessage)) {
-    if (e.session == session) out.push_back(std::move(e));
-  }
+  auto out = events(Event::Kind::kMessage);
+  std::erase_if(out, [session](const Event& e) { return e.session != session; });
   return out;
 }
 
 bool FakeFernReporting::waitFor(const std::function<bool(const std::vector<Event>&)>& ready,
                                 std::chrono::milliseconds timeout) const {
-  return state_->waitFor(ready, timeout);
+  SXMutexLock lock(state_->mutex);
+  return lock.waitFor(state_->changed, timeout,
+                      [&]() SX_REQUIRES(state_->mutex) { return ready(state_->events); });
 }

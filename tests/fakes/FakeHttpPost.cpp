@@ -1,6 +1,5 @@
 #include "fakes/FakeHttpPost.h"
 
-
 SXHttpResult FakeHttpPost::post(const SXHttpRequest& request) {
   SXMutexLock lock(mutex_);
   requests_.push_back(request);
@@ -22,10 +21,6 @@ void FakeHttpPost::answer(int status, std::string body,
   script_.push_back({status, std::move(headers), std::move(body), ""});
 }
 
-void FakeHttpPost::answerTimes(size_t count, int status) {
-  for (size_t i = 0; i < count; ++i) answer(status);
-}
-
 void FakeHttpPost::fail(std::string error) {
   SXMutexLock lock(mutex_);
   script_.push_back({std::nullopt, {}, "", std::move(error)});
@@ -39,14 +34,6 @@ void FakeHttpPost::timeOut() {
 std::vector<SXHttpRequest> FakeHttpPost::requests() const {
   SXMutexLock lock(mutex_);
   return requests_;
-}
-
-std::vector<SXValue> FakeHttpPost::bodies() const {
-  std::vector<SXValue> bodies;
-  for (const SXHttpRequest& request : requests()) {
-    bodies.push_back(SXValue::parse(request.body, nullptr, false));
-  }
-  return bodies;
 }
 
 bool FakeHttpPost::cancelled() const {

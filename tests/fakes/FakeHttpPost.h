@@ -18,16 +18,12 @@ class FakeHttpPost final : public SXHttpPost {
 
   // Answers the next post with `status` (and `body`, `headers`).
   void answer(int status, std::string body = "", std::map<std::string, std::string> headers = {});
-  // Answers the next `count` posts with `status`.
-  void answerTimes(size_t count, int status);
   // The next post gets no response, with `error`.
   void fail(std::string error = "connection refused");
   // The next post gets no response within its timeout.
   void timeOut();
 
   std::vector<SXHttpRequest> requests() const;
-  // The bodies of the requests so far, parsed.
-  std::vector<SXValue> bodies() const;
   bool cancelled() const;
 
  private:

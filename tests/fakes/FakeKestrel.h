@@ -5,8 +5,6 @@
 // lies in that group and subgroup. All methods may be called from any thread.
 #pragma once
 
-#include <stdlib.h>
-
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -16,16 +14,13 @@
 #include "common/SXThreadSafety.h"
 #include "linux/FileKestrel.h"
 #include "platform/DiscardLog.h"
+#include "support/SqliteTestSupport.h"
 
 class FakeKestrel final : public Kestrel {
  public:
   using Name = std::optional<std::string>;
 
-  FakeKestrel() : root_(temporaryTree()), real_(root_, std::make_shared<SXDiscardLog>()) {}
-  ~FakeKestrel() override {  // removes the tree
-    std::error_code ignored;
-    std::filesystem::remove_all(root_, ignored);
-  }
+  FakeKestrel() : real_(root_, std::make_shared<SXDiscardLog>()) {}
 
   // Writes the counter (making its group) with `value`.
   void setValue(const Name& group, const Name& subgroup, const Name& channel, int64_t value) {
@@ -123,10 +118,6 @@ class FakeKestrel final : public Kestrel {
 
  private:
   using Query = std::pair<Name, Name>;
-  static std::string temporaryTree() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "sxr-kestrel-XXXXXX").string();
-    return ::mkdtemp(pattern.data()) ? pattern : std::string("/nonexistent");
-  }
   std::string counterPath(const Name& group, const Name& subgroup, const Name& channel) const {
     return root_ + "/" + group.value_or("-") + "/" + subgroup.value_or("-") + "/" +
            channel.value_or("-");
@@ -141,7 +132,8 @@ class FakeKestrel final : public Kestrel {
     return true;
   }
 
-  const std::string root_;
+  const SXTestTempDir tree_;  // removed with the fake
+  const std::string root_ = tree_.path();
   SXFileKestrel real_;
   mutable SXMutex mutex_;
   // Per query: the error code, and whether the channels still come back.

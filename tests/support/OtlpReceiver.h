@@ -11,7 +11,6 @@
 #include <asio.hpp>
 #include <chrono>
 #include <cstdint>
-#include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -25,12 +24,9 @@
 class OtlpReceiver {
  public:
   struct Request {
-    std::string method;
-    std::string target;
     std::map<std::string, std::string> headers;  // names in lower case
     std::string body;                            // as sent, but decompressed
     int status = 0;  // the status it was answered with; 0 when its connection was dropped
-    std::chrono::steady_clock::time_point at;  // when it had come in whole
   };
 
   OtlpReceiver();
@@ -55,9 +51,6 @@ class OtlpReceiver {
   std::vector<SXValue> acceptedRecords() const;
   // The body of `request` as OTLP JSON, protobuf bodies converted; discarded when unreadable.
   static SXValue json(const Request& request);
-  // Waits until `ready` holds (it is called under no lock); false after `timeout`.
-  bool waitFor(const std::function<bool()>& ready,
-               std::chrono::milliseconds timeout = std::chrono::seconds(15)) const;
 
   // The int attribute `key` of a log record (e.g. "sxr.message.id"); none when absent.
   static std::optional<int64_t> intAttribute(const SXValue& record, const std::string& key);
