@@ -28,26 +28,16 @@
     if (!(condition)) SXR_FUZZ_FAILED(#condition); \
   } while (0)
 
-// Reads fixed-size numbers from the front of the fuzz input; zeros once it runs out.
-class SXFuzzInput {
- public:
-  SXFuzzInput(const uint8_t* data, size_t size) : data_(data), size_(size) {}
-  template <typename T>
-  T take() {
-    T value{};
-    size_t n = std::min(sizeof(T), size_);
-    std::memcpy(&value, data_, n);
-    data_ += n;
-    size_ -= n;
-    return value;
-  }
-  const uint8_t* data() const { return data_; }
-  size_t size() const { return size_; }
-
- private:
-  const uint8_t* data_;
-  size_t size_;
-};
+// Takes a fixed-size number from the front of the fuzz input; zeros once it runs out.
+template <typename T>
+T SXFuzzTake(const uint8_t*& data, size_t& size) {
+  T value{};
+  size_t n = std::min(sizeof(T), size);
+  std::memcpy(&value, data, n);
+  data += n;
+  size -= n;
+  return value;
+}
 
 // A value from MessagePack bytes within the default limits; nothing when they are not one.
 inline std::optional<SXValue> SXFuzzUnpack(const char* bytes, size_t length) {
@@ -114,14 +104,13 @@ inline SXFuzzDecoded SXFuzzDecode(const RpcLimits& limits, const std::string& st
 // Input: one byte choosing tight or default limits, one byte giving 1-8 chunk sizes, the
 // sizes (1-64 bytes each), then the stream.
 inline void SXFuzzRpcDecoder(const uint8_t* data, size_t size) {
-  SXFuzzInput input(data, size);
   RpcLimits limits;
-  if (input.take<uint8_t>() % 2) {
+  if (SXFuzzTake<uint8_t>(data, size) % 2) {
     limits = {.maxMessageBytes = 512, .maxPayloadDepth = 4, .maxContainerEntries = 16};
   }
-  std::vector<size_t> chunks(input.take<uint8_t>() % 8 + 1);
-  for (size_t& chunk : chunks) chunk = input.take<uint8_t>() % 64 + 1;
-  std::string stream(reinterpret_cast<const char*>(input.data()), input.size());
+  std::vector<size_t> chunks(SXFuzzTake<uint8_t>(data, size) % 8 + 1);
+  for (size_t& chunk : chunks) chunk = SXFuzzTake<uint8_t>(data, size) % 64 + 1;
+  std::string stream(reinterpret_cast<const char*>(data), size);
   SXFuzzDecoded whole = SXFuzzDecode(limits, stream, {});
   SXFuzzDecoded cut = SXFuzzDecode(limits, stream, chunks);
   SXR_FUZZ_CHECK(whole.last == cut.last);
@@ -193,11 +182,10 @@ inline void SXFuzzSummary(const SXValue& payload, int64_t reporterID, uint32_t c
 
 // Input: reporter ID (8 bytes), category (4), type (2), then the value (see SXFuzzValue).
 inline void SXFuzzPayload(const uint8_t* data, size_t size) {
-  SXFuzzInput input(data, size);
-  auto reporterID = input.take<int64_t>();
-  auto category = input.take<uint32_t>();
-  auto type = input.take<uint16_t>();
-  std::optional<SXValue> payload = SXFuzzValue(input.data(), input.size());
+  auto reporterID = SXFuzzTake<int64_t>(data, size);
+  auto category = SXFuzzTake<uint32_t>(data, size);
+  auto type = SXFuzzTake<uint16_t>(data, size);
+  std::optional<SXValue> payload = SXFuzzValue(data, size);
   if (!payload) return;
   SXFuzzRewrite(*payload);
   SXFuzzThrottle(*payload, reporterID, category, type);

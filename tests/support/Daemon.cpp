@@ -21,23 +21,34 @@ bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds tim
 
 namespace {
 
-// The test's environment with `extra` set over it, as "NAME=value" strings; built before the
-// fork, since the child of a threaded process may not allocate.
-std::vector<std::string> childEnvironment(const std::map<std::string, std::string>& extra) {
-  std::vector<std::string> out;
-  for (char** entry = environ; *entry; ++entry) {
-    std::string text = *entry;
-    if (!extra.count(text.substr(0, text.find('=')))) out.push_back(std::move(text));
-  }
-  for (const auto& [name, value] : extra) out.push_back(name + "=" + value);
-  return out;
-}
-
 std::vector<char*> pointersTo(std::vector<std::string>& words) {
   std::vector<char*> out;
   for (auto& word : words) out.push_back(word.data());
   out.push_back(nullptr);
   return out;
+}
+
+// Starts `words` with the test's environment and `extra` set over it, its output and errors
+// to `output`. All is built before the fork: the child of a threaded process may not allocate.
+pid_t spawn(std::vector<std::string> words, const std::map<std::string, std::string>& extra,
+            const std::string& output) {
+  std::vector<std::string> environment;
+  for (char** entry = environ; *entry; ++entry) {
+    std::string text = *entry;
+    if (!extra.count(text.substr(0, text.find('=')))) environment.push_back(std::move(text));
+  }
+  for (const auto& [name, value] : extra) environment.push_back(name + "=" + value);
+  std::vector<char*> argv = pointersTo(words);
+  std::vector<char*> envp = pointersTo(environment);
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    int fd = ::open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    ::dup2(fd, STDERR_FILENO);
+    ::dup2(fd, STDOUT_FILENO);
+    ::execve(argv[0], argv.data(), envp.data());
+    ::_exit(127);
+  }
+  return pid;
 }
 
 }  // namespace
@@ -61,18 +72,7 @@ TestDaemon::TestDaemon(Options options) {
   if (!options.daemonConfig.is_null()) writeConfig("sxreportingd.json", options.daemonConfig);
   for (const auto& [path, value] : options.counters) setCounter(path, value);
   args.insert(args.end(), options.extraArgs.begin(), options.extraArgs.end());
-  std::string logPath = dir_.file("daemon.log");
-  std::vector<char*> argv = pointersTo(args);
-  std::vector<std::string> environment = childEnvironment(options.environment);
-  std::vector<char*> envp = pointersTo(environment);
-  pid_ = ::fork();
-  if (pid_ == 0) {
-    int fd = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    ::dup2(fd, STDERR_FILENO);
-    ::dup2(fd, STDOUT_FILENO);
-    ::execve(argv[0], argv.data(), envp.data());
-    ::_exit(127);
-  }
+  pid_ = spawn(std::move(args), options.environment, dir_.file("daemon.log"));
   if (options.waitForReady && !waitForLog("ready, listening on")) {
     ADD_FAILURE() << "daemon did not start:\n" << log();
   }
@@ -198,14 +198,7 @@ CommandRun runCommand(const std::string& command) {
 pid_t TestDaemon::spawnCtl(const std::vector<std::string>& args) const {
   std::vector<std::string> words = {SXR_CTL_PATH, "--socket", socket_};
   words.insert(words.end(), args.begin(), args.end());
-  std::vector<char*> argv = pointersTo(words);
-  pid_t pid = ::fork();
-  if (pid == 0) {
-    ::dup2(::open("/dev/null", O_WRONLY), STDOUT_FILENO);
-    ::execv(argv[0], argv.data());
-    ::_exit(127);
-  }
-  return pid;
+  return spawn(std::move(words), {}, "/dev/null");
 }
 
 long residentKiB(pid_t pid) {

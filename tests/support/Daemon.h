@@ -72,7 +72,7 @@ class TestDaemon {
 
   // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
-  // Starts sxreportctl against this daemon, its output discarded; returns its pid.
+  // Starts sxreportctl against this daemon, its output and errors discarded; returns its pid.
   pid_t spawnCtl(const std::vector<std::string>& args) const;
 
  private:

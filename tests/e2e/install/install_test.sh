@@ -36,34 +36,15 @@ wait_for() {
 echo "== install into $stage"
 cmake --install "$build" --prefix "$stage" > "$work/install.log" 2>&1 || fail "cmake --install"
 
+# Which file each package ships is the packages test's; here, what the staged tree must be to run.
 echo "== installed files"
-for file in sbin/sxreportingd bin/sxreportctl include/sxreporting/client.h \
-        include/sxreporting/types.h lib/systemd/system/sxreportingd.socket \
-        lib/systemd/system/sxreportingd.service lib/sysusers.d/sxreportingd.conf \
-        lib/tmpfiles.d/sxreportingd.conf share/bash-completion/completions/sxreportctl \
-        lib/sxreporting-bench/sxreport-bench share/doc/sxreportingd/copyright \
-        share/doc/libsxreporting0/changelog.Debian.gz; do
-    [ -e "$stage/$file" ] || fail "$file is not installed"
-done
-[ ! -e "$stage/bin/sxreport-bench" ] || fail "the benchmark is on PATH"
 # The benchmark spawns the daemon beside it by default: a link to the installed one.
 [ "$(readlink -f "$stage/lib/sxreporting-bench/sxreportingd")" = "$(readlink -f "$stage/sbin/sxreportingd")" ] ||
     fail "the benchmark's daemon link does not lead to the installed daemon"
 library=$(find "$stage" -name 'libsxreporting.so.*.*.*')
 [ -n "$library" ] || fail "libsxreporting.so.X.Y.Z is not installed"
 libdir=$(dirname "$library")
-multiarch=$(gcc -print-multiarch 2>/dev/null || true)
-[ -z "$multiarch" ] || [ "$libdir" = "$stage/lib/$multiarch" ] ||
-    fail "the library is in $libdir, not in the multiarch lib/$multiarch"
-for file in libsxreporting.so pkgconfig/sxreporting.pc cmake/SXReporting/SXReportingConfig.cmake; do
-    [ -e "$libdir/$file" ] || fail "$file is not installed beside the library"
-done
 readelf -d "$library" | grep -q 'SONAME.*\[libsxreporting\.so\.0\]' || fail "SONAME is not libsxreporting.so.0"
-if [ -f "$build/man/sxreportingd.8" ]; then
-    for page in man8/sxreportingd.8.gz man1/sxreportctl.1.gz; do
-        [ -f "$stage/share/man/$page" ] || fail "$page is not installed"
-    done
-fi
 grep -q "^ExecStart=$stage/sbin/sxreportingd " "$stage/lib/systemd/system/sxreportingd.service" ||
     fail "the service does not start the installed daemon"
 
@@ -139,7 +120,8 @@ grep -q 'ready' "$work/daemon.log" && fail "the daemon started before any connec
 ctl="$stage/bin/sxreportctl --socket $socket"
 $ctl create 42 "then" valid 42 > "$work/ctl.log" 2>&1 || fail "create then valid"
 grep -q '^reporterID 42, serviceType' "$work/ctl.log" || fail "valid 42 did not find the session"
-grep -q '(socket activated)' "$work/daemon.log" || fail "the daemon did not adopt the socket"
+# The log is written a moment after the work that logs it.
+wait_for grep -q '(socket activated)' "$work/daemon.log"
 [ "$(cat /proc/$activator/comm)" = sxreportingd ] || fail "the daemon is not the activated process"
 $ctl status > "$work/status.log" 2>&1 || fail "status"
 grep -q '^reporting enabled: yes' "$work/status.log" || fail "status did not answer"
