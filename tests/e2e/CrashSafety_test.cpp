@@ -60,16 +60,12 @@ void expectNewRowsLand(const TestDaemon& daemon, const RowsById& before) {
   EXPECT_FALSE(
       replied(client->sendMessage({{"EngineOnTime", 2.0}}, 3, 1, std::vector<int64_t>{900})));
   for (size_t i = 0; i < 3; ++i) {
-    EXPECT_TRUE(waitUntil([&] {
-      return countRows(daemon, kStores[i]) > int64_t(before[i].size());
-    })) << kStores[i].db
-        << "\n"
-        << daemon.log();
+    auto grew = [&] { return countRows(daemon, kStores[i]) > int64_t(before[i].size()); };
+    EXPECT_TRUE(waitUntil(grew)) << kStores[i].db << "\n" << daemon.log();
   }
 }
 
-// The kinds of send a flood is made of. Each client has a session of its own; `rows` is how
-// many rows each message makes in `events` and in `messages` with `clients` clients.
+// The kinds of send a flood is made of. Each client has a session of its own.
 struct FloodKind {
   const char* name;
   bool started;     // the sessions are started, else they are telephony sessions never started
