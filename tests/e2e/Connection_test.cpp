@@ -1,5 +1,5 @@
-// The defaults switch and socket activation, through the real daemon. (The end of client
-// connections is ChurnEndToEnd.)
+// The defaults switch through the real daemon. (Socket activation is the install test's, the
+// end of client connections ChurnEndToEnd.)
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -12,7 +12,7 @@ using namespace std::chrono_literals;
 TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   SXTestTempDir state;
   const std::string preferences = state.file("preferences");
-  TestDaemon daemon({{"--preferences-dir", preferences}, nullptr, nullptr, {}});
+  TestDaemon daemon({.extraArgs = {"--preferences-dir", preferences}});
   ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
   auto client = daemon.client();
   auto other = daemon.client();
@@ -54,23 +54,4 @@ TEST(ConnectionEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   EXPECT_TRUE(replied(client->stopReportingSessionForID(42)));
   EXPECT_TRUE(start.get().value);
   ::unsetenv("SXREPORTING_PREFERENCES_DIR");
-}
-
-// The service manager passes the listening socket: exactly one Unix stream socket is served,
-// anything else is a clear error at start.
-TEST(ConnectionEndToEnd, SocketActivationTakesOnePassedListeningSocket) {
-  TestDaemon::Options options;
-  options.activationSockets = 1;
-  TestDaemon daemon(options);
-  EXPECT_EQ(daemon.countInLog("(socket activated)"), 1u) << daemon.log();
-  auto client = daemon.client();
-  EXPECT_TRUE(replied(client->createReportingSession(5)));
-
-  options.activationSockets = 2;
-  options.waitForReady = false;
-  TestDaemon refused(options);
-  EXPECT_EQ(refused.waitForExit(), 1);
-  EXPECT_EQ(refused.countInLog("passed 2 descriptors; expected one listening Unix stream socket"),
-            1u)
-      << refused.log();
 }

@@ -17,32 +17,26 @@ std::string expectedWalk(const std::string& yes, int64_t id) {
          "\ndestroy: " + yes + "\n";
 }
 
-TEST(ExamplesEndToEnd, TheCExampleWalksASessionThroughItsLife) {
+TEST(ExamplesEndToEnd, TheCAndPythonExamplesWalkASessionThroughItsLife) {
   TestDaemon daemon;
-  CommandRun walk =
-      run(shellQuoted(SXR_C_EXAMPLE_PATH) + " " + shellQuoted(daemon.socket()) + " 42");
+  const std::string c = shellQuoted(SXR_C_EXAMPLE_PATH) + " ";
+  CommandRun walk = run(c + shellQuoted(daemon.socket()) + " 42");
   EXPECT_EQ(walk.status, 0) << walk.output;
   EXPECT_EQ(walk.output, expectedWalk("true", 42));
-
-  CommandRun absent =
-      run(shellQuoted(SXR_C_EXAMPLE_PATH) + " " + shellQuoted(daemon.dir("no-such-socket")));
+  CommandRun absent = run(c + shellQuoted(daemon.dir("no-such-socket")));
   EXPECT_EQ(absent.status, 2);
   EXPECT_NE(absent.output.find("no-such-socket"), std::string::npos) << absent.output;
-}
 
-TEST(ExamplesEndToEnd, ThePythonExampleWalksASessionThroughItsLife) {
   if (!std::filesystem::exists("/usr/bin/python3")) GTEST_SKIP() << "no /usr/bin/python3";
-  TestDaemon daemon;
-  const std::string script = "/usr/bin/python3 -B " + shellQuoted(SXR_PYTHON_EXAMPLE_PATH);
-  CommandRun walk = run(script + " --socket " + shellQuoted(daemon.socket()) + " --reporter-id -7");
+  const std::string python =
+      "/usr/bin/python3 -B " + shellQuoted(SXR_PYTHON_EXAMPLE_PATH) + " --socket ";
+  walk = run(python + shellQuoted(daemon.socket()) + " --reporter-id -7");
   EXPECT_EQ(walk.status, 0) << walk.output;
   EXPECT_EQ(walk.output, expectedWalk("True", -7));
-
   // The sessions of a run end with its connection.
   auto client = daemon.client();
   EXPECT_TRUE(waitUntil([&] { return replied(client->getAllReporters()).empty(); }));
-
-  CommandRun absent = run(script + " --socket " + shellQuoted(daemon.dir("no-such-socket")));
+  absent = run(python + shellQuoted(daemon.dir("no-such-socket")));
   EXPECT_EQ(absent.status, 1);
   EXPECT_NE(absent.output.find("sxreporting_client: "), std::string::npos) << absent.output;
 }

@@ -64,37 +64,27 @@ std::vector<std::string> summaryNamesAroundNow() {
 
 }  // namespace
 
-TEST(PermissionsEndToEnd, DirectoriesAndStoresTheDaemonCreatesAreClosedToOthers) {
-  SXTestTempDir fresh;
-  TestDaemon::Options options;
-  options.extraArgs = {"--state-dir",         fresh.file("new/lib"), "--config-dir",
-                       fresh.file("new/etc"), "--runtime-dir",       fresh.file("new/run")};
-  TestDaemon daemon(options);
-  auto client = daemon.client();
-  ASSERT_TRUE(replied(client->createReportingSession(1)));
-
-  EXPECT_EQ(modeOf(fresh.file("new")), 0750);
-  for (const char* dir : {"new/lib", "new/etc", "new/run", "new/run/notify"}) {
-    EXPECT_EQ(modeOf(fresh.file(dir)), 0750) << dir;
-  }
-  for (const char* store : {"tallyvane.db", "joulebook.db", "fernreporting.db"}) {
-    EXPECT_EQ(modeOf(fresh.file("new/lib/") + store), 0640) << store;
-    EXPECT_EQ(modeOf(fresh.file("new/lib/") + store + "-wal"), 0640) << store;
-  }
-  EXPECT_EQ(modeOf(daemon.socket()), 0660);
-}
-
-TEST(PermissionsEndToEnd, TheSocketGetsExactlyTheConfiguredMode) {
-  // One mode narrower than the daemon's umask allows, one wider (the umask cannot give it).
-  for (int mode : {0600, 0666}) {
-    char text[8];
-    std::snprintf(text, sizeof text, "%04o", static_cast<unsigned>(mode));
-    TestDaemon::Options options;
-    options.extraArgs = {"--socket-mode", text};
+TEST(PermissionsEndToEnd, DirectoriesStoresAndSocketTheDaemonCreatesAreClosedToOthers) {
+  // The default mode, one narrower than the daemon's umask allows and one wider (the umask
+  // cannot give it).
+  for (const char* mode : {"", "0600", "0666"}) {
+    SCOPED_TRACE(mode);
+    SXTestTempDir fresh;
+    TestDaemon::Options options{.extraArgs = {"--state-dir", fresh.file("new/lib"), "--config-dir",
+                                              fresh.file("new/etc"), "--runtime-dir",
+                                              fresh.file("new/run")}};
+    if (*mode) options.extraArgs.insert(options.extraArgs.end(), {"--socket-mode", mode});
     TestDaemon daemon(options);
-    EXPECT_EQ(modeOf(daemon.socket()), mode) << text;
     auto client = daemon.client();
-    EXPECT_TRUE(replied(client->createReportingSession(1))) << text;
+    ASSERT_TRUE(replied(client->createReportingSession(1)));
+    for (const char* dir : {"new", "new/lib", "new/etc", "new/run", "new/run/notify"}) {
+      EXPECT_EQ(modeOf(fresh.file(dir)), 0750) << dir;
+    }
+    for (const char* store : {"tallyvane.db", "joulebook.db", "fernreporting.db"}) {
+      EXPECT_EQ(modeOf(fresh.file("new/lib/") + store), 0640) << store;
+      EXPECT_EQ(modeOf(fresh.file("new/lib/") + store + "-wal"), 0640) << store;
+    }
+    EXPECT_EQ(modeOf(daemon.socket()), *mode ? std::stoi(mode, nullptr, 8) : 0660);
   }
 }
 
@@ -106,10 +96,8 @@ TEST(PermissionsEndToEnd, SummaryFilesStayInTheirOwnClosedDirectory) {
   std::string elsewhere = outside.file("elsewhere");
   fs::create_directory(elsewhere);
   std::string diag = outside.file("logs/Reporting");
-  TestDaemon::Options options;
-  options.device = {{"InternalBuild", true}};
-  options.extraArgs = {"--diagnostic-logs-dir", diag};
-  TestDaemon daemon(options);
+  TestDaemon daemon(
+      {.extraArgs = {"--diagnostic-logs-dir", diag}, .device = {{"InternalBuild", true}}});
   auto client = daemon.client();
 
   // The summary code asks for 0777; the daemon's umask takes the directory and the parent it
@@ -153,4 +141,17 @@ TEST(PermissionsEndToEnd, SummaryFilesStayInTheirOwnClosedDirectory) {
       << daemon.log();
   EXPECT_TRUE(fs::is_empty(elsewhere));
   EXPECT_EQ(daemon.countInLog("can't create logging directory"), 0u);
+
+  // A regular file where a parent directory should be: the summary file is lost, with its
+  // reason, and the summary event still reaches the spool.
+  fs::rename(outside.file("logs"), outside.file("old-logs"));
+  std::ofstream(outside.file("logs")) << "x";
+  runSession(*client, 4);
+  EXPECT_TRUE(daemon.waitForLog(
+      "-[SXReportingSession createSummaryEventForSession]: can't create logging directory at " +
+      diag + ": "));
+  EXPECT_EQ(
+      daemon.waitForRows("fernreporting.db", "SELECT id FROM messages WHERE category = 65535", 4)
+          .size(),
+      4u);
 }

@@ -1,41 +1,12 @@
 // The session registry and the protocol's guard rails, through the real daemon.
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include "support/Daemon.h"
 #include "support/RawSocket.h"
 
-namespace {
-
 using namespace std::chrono_literals;
 
-// A plain socket for bytes the client library would never send.
-class RawConnection {
- public:
-  explicit RawConnection(const std::string& path) : fd_(SXTestConnect(path)) {
-    EXPECT_GE(fd_, 0) << path;
-  }
-  ~RawConnection() { ::close(fd_); }
-  void send(const std::string& bytes) { SXTestSend(fd_, bytes.data(), bytes.size()); }
-  // True when the daemon closed the connection (EOF or reset) within `timeout`.
-  bool closedByPeer(std::chrono::milliseconds timeout = 10s) {
-    timeval tv{static_cast<time_t>(timeout.count() / 1000), 0};
-    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-    char buf[4096];
-    for (;;) {
-      ssize_t n = ::recv(fd_, buf, sizeof buf, 0);
-      if (n == 0) return true;
-      if (n < 0) return errno == ECONNRESET;
-    }
-  }
-
- private:
-  const int fd_;
-};
-
-}  // namespace
-
-TEST(RegistryEndToEnd, RepliesForKnownAndUnknownIDs) {
+TEST(RegistryEndToEnd, RepliesForKnownUnknownRepeatedAndZeroIDs) {
   TestDaemon daemon;
   auto client = daemon.client();
   EXPECT_TRUE(replied(client->createReportingSession(42)));
@@ -58,10 +29,29 @@ TEST(RegistryEndToEnd, RepliesForKnownAndUnknownIDs) {
   EXPECT_TRUE(replied(client->createReportingSession(42)));
   EXPECT_EQ(replied(client->getServiceNameForReporterID(42)), 65535);
   EXPECT_EQ(replied(client->getAllReporters()), (std::vector<int64_t>{42}));
+
+  EXPECT_FALSE(replied(client->startReportingSessionForID(5)));
+  EXPECT_TRUE(replied(client->stopReportingSessionForID(5)));
+  EXPECT_TRUE(replied(client->destroyReportingSession(5)));
+  for (auto status : {client->startReportingSessionForID(0, 300ms).get().status,
+                      client->stopReportingSessionForID(0, 300ms).get().status,
+                      client->destroyReportingSession(0, 300ms).get().status}) {
+    EXPECT_EQ(status, SXCallStatus::kTimedOut);
+  }
+  ASSERT_TRUE(replied(client->createReportingSession(42)));
+  auto first = client->startReportingSessionForID(42, kSXWaitForever);
+  auto second = client->startReportingSessionForID(42, 500ms);
+  EXPECT_EQ(second.get().status, SXCallStatus::kTimedOut);  // a repeated start gets no reply
+  // Destroying a started session stops it first, which answers the held start.
+  EXPECT_TRUE(replied(client->destroyReportingSession(42)));
+  EXPECT_TRUE(first.get().value);
+  EXPECT_EQ(replied(client->getAllReporters()), std::vector<int64_t>{});
+  // Without the verbose service scope, no line per request.
+  EXPECT_EQ(daemon.countInLog("creating session for reporter"), 0u);
 }
 
 TEST(RegistryEndToEnd, TwoClientsAndTheServiceWideLookup) {
-  TestDaemon daemon;
+  TestDaemon daemon({.extraArgs = {"--log-scope", "sxrs=5"}});
   auto first = daemon.client();
   auto second = daemon.client();
   ASSERT_TRUE(replied(first->createReportingSession(42)));
@@ -82,23 +72,9 @@ TEST(RegistryEndToEnd, TwoClientsAndTheServiceWideLookup) {
   EXPECT_EQ(replied(third->reporterID(1)), (SXReporterIDValidity{1, 65535}));
   // setConfiguration and reporterID:valid: do see other clients' sessions.
   EXPECT_EQ(replied(third->reporterID(5)), (SXReporterIDValidity{5, 65535}));
-}
-
-TEST(RegistryEndToEnd, RequestLinesOnlyWithTheVerboseServiceScope) {
-  {
-    TestDaemon quiet;
-    auto client = quiet.client();
-    replied(client->createReportingSession(42));
-    EXPECT_TRUE(quiet.waitForLog("session created for reporter 42"));
-    EXPECT_EQ(quiet.countInLog("creating session for reporter"), 0u);
-  }
-  TestDaemon verbose({{"--log-scope", "sxrs=5"}, nullptr, nullptr, {}});
-  auto client = verbose.client();
-  replied(client->createReportingSession(42));
-  replied(client->setServiceType(2, 42));
-  EXPECT_TRUE(verbose.waitForLog("<7>SXReportingServerInstance.cpp:"));
-  EXPECT_EQ(verbose.countInLog(": creating session for reporter 42"), 1u);
-  EXPECT_EQ(verbose.countInLog(": setting service type 2 for reporter 42"), 1u);
+  // The verbose service scope logs each request at debug level.
+  EXPECT_TRUE(daemon.waitForLog("<7>SXReportingServerInstance.cpp:"));
+  EXPECT_EQ(daemon.countInLog(": setting service type 2 for reporter 42"), 1u);
 }
 
 TEST(RegistryEndToEnd, BadRequestsGetAnErrorAndChangeNothing) {
@@ -130,10 +106,8 @@ TEST(RegistryEndToEnd, BadRequestsGetAnErrorAndChangeNothing) {
 }
 
 TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
-  TestDaemon daemon({{"--max-message-bytes", "65536", "--partial-frame-timeout-ms", "300"},
-                     nullptr,
-                     nullptr,
-                     {}});
+  TestDaemon daemon(
+      {.extraArgs = {"--max-message-bytes", "65536", "--partial-frame-timeout-ms", "300"}});
   auto bystander = daemon.client();
   ASSERT_TRUE(replied(bystander->createReportingSession(9)));
 
@@ -152,7 +126,7 @@ TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
       SXTestRequest(1, sxr::method::kCreate, SXValue::array({1})).substr(0, 3),  // cut short
   };
   for (const auto& bytes : attacks) {
-    RawConnection raw(daemon.socket());
+    SXTestRawClient raw(daemon.socket());
     raw.send(bytes);
     EXPECT_TRUE(raw.closedByPeer());
   }

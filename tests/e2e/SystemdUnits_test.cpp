@@ -6,50 +6,35 @@
 #include <filesystem>
 #include <fstream>
 #include <regex>
-#include <string>
 
 #include "support/Daemon.h"
 
 namespace fs = std::filesystem;
 
-namespace {
+TEST(SystemdUnitsTest, VerifyFindsNothingAndTheDaemonAcceptsTheUnitsCommandLine) {
+  SXTestTempDir dir;
+  const fs::path units = fs::path(SXR_SOURCE_DIR) / "packaging/systemd";
+  const std::string service = std::regex_replace(SXTestReadFile(units / "sxreportingd.service.in"),
+                                                 std::regex("@SXR_SBINDIR@"),
+                                                 fs::path(SXR_DAEMON_PATH).parent_path().string());
+  ASSERT_FALSE(std::regex_search(service, std::regex("@[A-Z_]+@"))) << "a variable is left";
+  std::ofstream(dir.file("sxreportingd.service")) << service;
+  fs::copy_file(units / "sxreportingd.socket", dir.file("sxreportingd.socket"));
 
-class SystemdUnitsTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    const fs::path units = fs::path(SXR_SOURCE_DIR) / "packaging/systemd";
-    std::string service = SXTestReadFile(units / "sxreportingd.service.in");
-    const std::string sbindir = fs::path(SXR_DAEMON_PATH).parent_path().string();
-    service = std::regex_replace(service, std::regex("@SXR_SBINDIR@"), sbindir);
-    ASSERT_FALSE(std::regex_search(service, std::regex("@[A-Z_]+@"))) << "a variable is left";
-    std::ofstream(dir_.file("sxreportingd.service")) << service;
-    fs::copy_file(units / "sxreportingd.socket", dir_.file("sxreportingd.socket"));
-    service_ = service;
-  }
-
-  SXTestTempDir dir_;
-  std::string service_;
-};
-
-TEST_F(SystemdUnitsTest, VerifyFindsNothing) {
-  if (runCommand("command -v systemd-analyze").status != 0) GTEST_SKIP() << "no systemd-analyze";
-  CommandRun verify = runCommand("cd '" + dir_.file("") +
-                                 "' && systemd-analyze verify --man=no ./sxreportingd.socket "
-                                 "./sxreportingd.service 2>&1");
-  EXPECT_EQ(verify.status, 0) << verify.output;
-  EXPECT_EQ(verify.output, "");
-}
-
-TEST_F(SystemdUnitsTest, TheDaemonAcceptsTheUnitsCommandLine) {
   // ExecStart with its continuation lines joined; --version last makes the daemon read every
   // flag before it and stop there, touching no directory.
-  const std::string joined = std::regex_replace(service_, std::regex("\\\\\n"), " ");
+  const std::string joined = std::regex_replace(service, std::regex("\\\\\n"), " ");
   std::smatch line;
   ASSERT_TRUE(std::regex_search(joined, line, std::regex("\nExecStart=([^\n]*)")));
   CommandRun daemon = runCommand(line[1].str() + " --version 2>&1");
   EXPECT_EQ(daemon.status, 0) << daemon.output;
   EXPECT_TRUE(std::regex_match(daemon.output, std::regex("sxreportingd [0-9.]+\n")))
       << daemon.output;
-}
 
-}  // namespace
+  if (runCommand("command -v systemd-analyze").status != 0) GTEST_SKIP() << "no systemd-analyze";
+  CommandRun verify = runCommand("cd " + shellQuoted(dir.path()) +
+                                 " && systemd-analyze verify --man=no ./sxreportingd.socket "
+                                 "./sxreportingd.service 2>&1");
+  EXPECT_EQ(verify.status, 0) << verify.output;
+  EXPECT_EQ(verify.output, "");
+}

@@ -22,7 +22,9 @@ F next(const char* name) {
   return reinterpret_cast<F>(dlsym(RTLD_NEXT, name));
 }
 
-bool faulty(int fd) {
+// True when the call must fail with ENOSPC (errno is set); a slow disk has waited and lets it
+// through.
+bool mustFail(int fd) {
   const char* dir = getenv("SXR_FAULT_DIR");
   const char* trigger = getenv("SXR_FAULT_TRIGGER");
   if (!dir || !trigger || !*dir || access(trigger, F_OK) != 0) return false;
@@ -34,17 +36,14 @@ bool faulty(int fd) {
   errno = saved;
   if (n <= 0) return false;
   target[n] = '\0';
-  return strncmp(target, dir, strlen(dir)) == 0;
-}
-
-// True when the call must fail with ENOSPC; a slow disk has waited and lets it through.
-bool mustFail(int fd) {
-  if (!faulty(fd)) return false;
+  if (strncmp(target, dir, strlen(dir)) != 0) return false;
   const char* delay = getenv("SXR_FAULT_DELAY_MS");
-  if (!delay || !*delay) return true;
+  if (!delay || !*delay) {
+    errno = ENOSPC;
+    return true;
+  }
   long ms = atol(delay);
   timespec wait{ms / 1000, (ms % 1000) * 1000000};
-  int saved = errno;
   while (nanosleep(&wait, &wait) != 0 && errno == EINTR) {
   }
   errno = saved;
@@ -57,38 +56,32 @@ extern "C" {
 
 ssize_t write(int fd, const void* buf, size_t count) {
   static auto real = next<ssize_t (*)(int, const void*, size_t)>("write");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd, buf, count);
+  return mustFail(fd) ? -1 : real(fd, buf, count);
 }
 
 ssize_t pwrite(int fd, const void* buf, size_t count, off_t offset) {
   static auto real = next<ssize_t (*)(int, const void*, size_t, off_t)>("pwrite");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd, buf, count, offset);
+  return mustFail(fd) ? -1 : real(fd, buf, count, offset);
 }
 
 ssize_t pwrite64(int fd, const void* buf, size_t count, off64_t offset) {
   static auto real = next<ssize_t (*)(int, const void*, size_t, off64_t)>("pwrite64");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd, buf, count, offset);
+  return mustFail(fd) ? -1 : real(fd, buf, count, offset);
 }
 
 ssize_t writev(int fd, const struct iovec* iov, int count) {
   static auto real = next<ssize_t (*)(int, const struct iovec*, int)>("writev");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd, iov, count);
+  return mustFail(fd) ? -1 : real(fd, iov, count);
 }
 
 int fsync(int fd) {
   static auto real = next<int (*)(int)>("fsync");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd);
+  return mustFail(fd) ? -1 : real(fd);
 }
 
 int fdatasync(int fd) {
   static auto real = next<int (*)(int)>("fdatasync");
-  if (mustFail(fd)) return errno = ENOSPC, -1;
-  return real(fd);
+  return mustFail(fd) ? -1 : real(fd);
 }
 
 }  // extern "C"

@@ -1,9 +1,6 @@
-// The fuzz targets' bodies, shared by the libFuzzer entry points (fuzz_*.cpp, clang only) and
-// by the regression test that replays the seed corpus and every input that once failed
-// (tests/FuzzCorpus_test.cpp), so both run exactly the same checks.
-//
-// A broken property calls SXR_FUZZ_FAILED(what): a trap for the fuzzer, a test failure in the
-// regression test.
+// The fuzz targets' bodies, shared by the libFuzzer entry points (fuzz_*.cpp, clang only) and by
+// the test that replays the corpus (tests/FuzzCorpus_test.cpp), so both run the same checks. A
+// broken property calls SXR_FUZZ_FAILED(what): a trap for the fuzzer, a failure in the test.
 #pragma once
 
 #include <algorithm>
@@ -31,38 +28,19 @@
     if (!(condition)) SXR_FUZZ_FAILED(#condition); \
   } while (0)
 
-// Reads fixed-size numbers from the front of the fuzz input; zeros once it runs out.
-class SXFuzzInput {
- public:
-  SXFuzzInput(const uint8_t* data, size_t size) : data_(data), size_(size) {}
-  template <typename T>
-  T take() {
-    T value{};
-    size_t n = std::min(sizeof(T), size_);
-    std::memcpy(&value, data_, n);
-    data_ += n;
-    size_ -= n;
-    return value;
-  }
-  const uint8_t* data() const { return data_; }
-  size_t size() const { return size_; }
+// Takes a fixed-size number from the front of the fuzz input; zeros once it runs out.
+template <typename T>
+T SXFuzzTake(const uint8_t*& data, size_t& size) {
+  T value{};
+  size_t n = std::min(sizeof(T), size);
+  std::memcpy(&value, data, n);
+  data += n;
+  size -= n;
+  return value;
+}
 
- private:
-  const uint8_t* data_;
-  size_t size_;
-};
-
-// A value from arbitrary bytes: MessagePack when the first byte is even, JSON text when it is
-// odd. Nothing when the bytes are neither; never throws.
-inline std::optional<SXValue> SXFuzzValue(const uint8_t* data, size_t size) {
-  if (size == 0) return std::nullopt;
-  const char* bytes = reinterpret_cast<const char*>(data + 1);
-  size_t length = size - 1;
-  if (data[0] % 2 == 1) {
-    SXValue value = SXValue::parse(bytes, bytes + length, nullptr, false);
-    if (value.is_discarded()) return std::nullopt;
-    return value;
-  }
+// A value from MessagePack bytes within the default limits; nothing when they are not one.
+inline std::optional<SXValue> SXFuzzUnpack(const char* bytes, size_t length) {
   RpcLimits limits;
   try {
     size_t offset = 0;
@@ -77,6 +55,17 @@ inline std::optional<SXValue> SXFuzzValue(const uint8_t* data, size_t size) {
   }
 }
 
+// A value from arbitrary bytes: MessagePack when the first byte is even, JSON text when it is
+// odd. Nothing when the bytes are neither; never throws.
+inline std::optional<SXValue> SXFuzzValue(const uint8_t* data, size_t size) {
+  if (size == 0) return std::nullopt;
+  const char* bytes = reinterpret_cast<const char*>(data + 1);
+  if (data[0] % 2 == 0) return SXFuzzUnpack(bytes, size - 1);
+  SXValue value = SXValue::parse(bytes, bytes + size - 1, nullptr, false);
+  if (value.is_discarded()) return std::nullopt;
+  return value;
+}
+
 // ---- The wire decoder: never crashes, and the messages it yields do not depend on where the
 // reads happened to split the stream.
 
@@ -85,35 +74,29 @@ struct SXFuzzDecoded {
   RpcStreamDecoder::Status last = RpcStreamDecoder::Status::kNeedMore;
 };
 
-// Drains every whole message; returns false once the stream is broken.
-inline bool SXFuzzDrain(RpcStreamDecoder& decoder, SXFuzzDecoded& out) {
-  SXValue message;
-  for (;;) {
-    out.last = decoder.next(message);
-    if (out.last != RpcStreamDecoder::Status::kMessage) {
-      if (out.last == RpcStreamDecoder::Status::kBroken) SXR_FUZZ_CHECK(!decoder.error().empty());
-      return out.last != RpcStreamDecoder::Status::kBroken;
-    }
-    std::string why;
-    std::optional<uint32_t> msgid;
-    if (!RpcParseRequest(message, why, msgid)) SXR_FUZZ_CHECK(!why.empty());
-    RpcParseResponse(message);
-    out.messages.push_back(message.dump(-1, ' ', false, SXValue::error_handler_t::replace));
-  }
-}
-
+// The messages of `stream` fed to a decoder in `chunks` (all at once when there are none).
 inline SXFuzzDecoded SXFuzzDecode(const RpcLimits& limits, const std::string& stream,
                                   const std::vector<size_t>& chunks) {
   RpcStreamDecoder decoder(limits);
   SXFuzzDecoded out;
-  size_t at = 0;
-  for (size_t i = 0; at < stream.size(); ++i) {
+  SXValue message;
+  for (size_t i = 0, at = 0; at < stream.size(); ++i) {
     size_t n = chunks.empty() ? stream.size() : chunks[i % chunks.size()];
     n = std::min(n, stream.size() - at);
     std::memcpy(decoder.prepare(n), stream.data() + at, n);
     decoder.commit(n);
     at += n;
-    if (!SXFuzzDrain(decoder, out)) break;
+    while ((out.last = decoder.next(message)) == RpcStreamDecoder::Status::kMessage) {
+      std::string why;
+      std::optional<uint32_t> msgid;
+      if (!RpcParseRequest(message, why, msgid)) SXR_FUZZ_CHECK(!why.empty());
+      RpcParseResponse(message);
+      out.messages.push_back(message.dump(-1, ' ', false, SXValue::error_handler_t::replace));
+    }
+    if (out.last == RpcStreamDecoder::Status::kBroken) {
+      SXR_FUZZ_CHECK(!decoder.error().empty());
+      break;
+    }
   }
   return out;
 }
@@ -121,14 +104,13 @@ inline SXFuzzDecoded SXFuzzDecode(const RpcLimits& limits, const std::string& st
 // Input: one byte choosing tight or default limits, one byte giving 1-8 chunk sizes, the
 // sizes (1-64 bytes each), then the stream.
 inline void SXFuzzRpcDecoder(const uint8_t* data, size_t size) {
-  SXFuzzInput input(data, size);
   RpcLimits limits;
-  if (input.take<uint8_t>() % 2) {
+  if (SXFuzzTake<uint8_t>(data, size) % 2) {
     limits = {.maxMessageBytes = 512, .maxPayloadDepth = 4, .maxContainerEntries = 16};
   }
-  std::vector<size_t> chunks(input.take<uint8_t>() % 8 + 1);
-  for (size_t& chunk : chunks) chunk = input.take<uint8_t>() % 64 + 1;
-  std::string stream(reinterpret_cast<const char*>(input.data()), input.size());
+  std::vector<size_t> chunks(SXFuzzTake<uint8_t>(data, size) % 8 + 1);
+  for (size_t& chunk : chunks) chunk = SXFuzzTake<uint8_t>(data, size) % 64 + 1;
+  std::string stream(reinterpret_cast<const char*>(data), size);
   SXFuzzDecoded whole = SXFuzzDecode(limits, stream, {});
   SXFuzzDecoded cut = SXFuzzDecode(limits, stream, chunks);
   SXR_FUZZ_CHECK(whole.last == cut.last);
@@ -146,14 +128,10 @@ inline std::string SXFuzzPack(const SXValue& value) {
 }
 
 inline void SXFuzzMsgpackValue(const uint8_t* data, size_t size) {
-  std::vector<uint8_t> framed(size + 1, 0);  // an even first byte: MessagePack
-  if (size) std::memcpy(framed.data() + 1, data, size);
-  std::optional<SXValue> value = SXFuzzValue(framed.data(), framed.size());
+  std::optional<SXValue> value = SXFuzzUnpack(reinterpret_cast<const char*>(data), size);
   if (!value) return;
   std::string first = SXFuzzPack(*value);
-  std::vector<uint8_t> again(first.size() + 1, 0);
-  std::memcpy(again.data() + 1, first.data(), first.size());
-  std::optional<SXValue> back = SXFuzzValue(again.data(), again.size());
+  std::optional<SXValue> back = SXFuzzUnpack(first.data(), first.size());
   SXR_FUZZ_CHECK(back.has_value());
   if (back) SXR_FUZZ_CHECK(SXFuzzPack(*back) == first);
 }
@@ -204,11 +182,10 @@ inline void SXFuzzSummary(const SXValue& payload, int64_t reporterID, uint32_t c
 
 // Input: reporter ID (8 bytes), category (4), type (2), then the value (see SXFuzzValue).
 inline void SXFuzzPayload(const uint8_t* data, size_t size) {
-  SXFuzzInput input(data, size);
-  auto reporterID = input.take<int64_t>();
-  auto category = input.take<uint32_t>();
-  auto type = input.take<uint16_t>();
-  std::optional<SXValue> payload = SXFuzzValue(input.data(), input.size());
+  auto reporterID = SXFuzzTake<int64_t>(data, size);
+  auto category = SXFuzzTake<uint32_t>(data, size);
+  auto type = SXFuzzTake<uint16_t>(data, size);
+  std::optional<SXValue> payload = SXFuzzValue(data, size);
   if (!payload) return;
   SXFuzzRewrite(*payload);
   SXFuzzThrottle(*payload, reporterID, category, type);

@@ -6,11 +6,10 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -22,21 +21,18 @@
 class TestDaemon {
  public:
   struct Options {
-    std::vector<std::string> extraArgs;  // e.g. {"--log-scope", "sxrs=5"}
-    SXValue device;                      // device.json, when not null
-    SXValue fernConfig;                  // fernreporting.json, when not null
+    std::vector<std::string> extraArgs = {};  // e.g. {"--log-scope", "sxrs=5"}
+    SXValue device = nullptr;                 // device.json, when not null
+    SXValue fernConfig = nullptr;             // fernreporting.json, when not null
     // Driver counters present at start-up: "<group>/<subgroup>/<channel>" -> value.
-    std::map<std::string, int64_t> counters;
+    std::map<std::string, int64_t> counters = {};
     // The stores' directory, when not the daemon's own temporary one: a second daemon started
     // on the same directory finds the first one's stores.
     std::string stateDir = {};
     // Variables set for the daemon process alone (LD_PRELOAD, say), beside the test's own.
     std::map<std::string, std::string> environment = {};
     SXValue daemonConfig = nullptr;  // sxreportingd.json, when not null
-    // Listening sockets passed as a service manager passes them (LISTEN_FDS, LISTEN_PID from
-    // fd 3 on): the first bound at socket(), further ones beside it.
-    int activationSockets = 0;
-    bool waitForReady = true;  // false for a daemon expected not to start
+    bool waitForReady = true;        // false for a daemon expected not to start
   };
 
   // Writes a driver counter file under the kestrel root.
@@ -49,7 +45,6 @@ class TestDaemon {
   ~TestDaemon();  // kills the daemon if it still runs
 
   const std::string& socket() const { return socket_; }
-  std::string stateFile(const std::string& name) const { return stateDir_ + "/" + name; }
   std::string dir(const std::string& name) const { return dir_.file(name); }
 
   // A connected client; fails the test when it cannot connect.
@@ -63,7 +58,8 @@ class TestDaemon {
   // How often `fragment` is in the log once the lines already logged are written.
   size_t countInLog(const std::string& fragment) const;
 
-  // Waits for the daemon to exit; its exit status, or nothing after `timeout`.
+  // Waits for the daemon to exit; its exit status (128 + the signal that killed it), or nothing
+  // after `timeout`.
   std::optional<int> waitForExit(std::chrono::milliseconds timeout = std::chrono::seconds(10));
   pid_t pid() const { return pid_; }
 
@@ -76,12 +72,10 @@ class TestDaemon {
 
   // Runs sxreportctl against this daemon; returns its exit status and fills `output`.
   int ctl(const std::vector<std::string>& args, std::string* output = nullptr) const;
-  // Starts sxreportctl against this daemon, its output discarded; returns its pid.
+  // Starts sxreportctl against this daemon, its output and errors discarded; returns its pid.
   pid_t spawnCtl(const std::vector<std::string>& args) const;
 
  private:
-  std::vector<int> listeningSockets(int count) const;
-
   SXTestTempDir dir_;
   std::string stateDir_;
   std::string socket_;
@@ -103,7 +97,6 @@ struct CommandRun {
 CommandRun runCommand(const std::string& command);
 
 // Polls `ready` until it holds or `timeout` passes.
-
 bool waitUntil(const std::function<bool()>& ready,
                std::chrono::milliseconds timeout = std::chrono::seconds(15));
 
@@ -115,24 +108,23 @@ T replied(std::future<SXCallResult<T>> future) {
   return result.value;
 }
 
-// Clients that each pipeline sends as fast as a window of unanswered ones allows, until
-// stopped or until their connection ends. Every message is {"xid": <unique id>}; the flood
-// records the id of every send answered as delivered, and when the answer came.
+// Clients that each pipeline sends, at most `window` unanswered, until stopped or until their
+// connection ends. Every message is `payload` with "xid": <unique id>; the flood records the id
+// of every send answered as delivered.
 class TestFlood {
  public:
-  using Clock = std::chrono::steady_clock;
   struct Sender {
     std::unique_ptr<SXReportingClient> client;
     std::optional<std::vector<int64_t>> reporterIDs;  // nothing: a broadcast
   };
 
-  TestFlood(std::vector<Sender> senders, size_t window);
-  ~TestFlood();  // stops, then closes the clients
+  TestFlood(std::vector<Sender> senders, size_t window, SXValue payload = SXValue::object());
+  ~TestFlood() { stop(); }
 
-  // Sends no more and waits for the senders' threads; answers may still come.
+  // Sends no more; waits for the answers still to come (or the end of their connection).
   void stop();
   size_t acknowledgedCount() const;
-  std::map<int64_t, Clock::time_point> acknowledged() const;
+  std::set<int64_t> acknowledged() const;
   // The sender a message id belongs to.
   static size_t senderOf(int64_t xid) { return static_cast<size_t>(xid / kIdsPerSender); }
   // How many rows of `table` in `db` (a table with payload_json) carry each message id.
@@ -141,19 +133,13 @@ class TestFlood {
 
  private:
   static constexpr int64_t kIdsPerSender = 1'000'000'000;
-  struct Lane {
-    Sender sender;
-    SXMutex mutex;
-    std::condition_variable room;
-    size_t unanswered SX_GUARDED_BY(mutex) = 0;
-    bool lost SX_GUARDED_BY(mutex) = false;
-  };
-  void run(Lane& lane, int64_t firstId);
+  void run(const Sender& sender, int64_t firstId);
 
   const size_t window_;
-  std::vector<std::unique_ptr<Lane>> lanes_;
+  const SXValue payload_;
+  const std::vector<Sender> senders_;
   std::vector<std::thread> threads_;
   std::atomic<bool> stop_{false};
-  mutable SXMutex ackMutex_;
-  std::map<int64_t, Clock::time_point> acknowledged_ SX_GUARDED_BY(ackMutex_);
+  mutable SXMutex mutex_;
+  std::set<int64_t> acknowledged_ SX_GUARDED_BY(mutex_);
 };

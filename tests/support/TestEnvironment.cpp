@@ -4,15 +4,11 @@
 
 #include <filesystem>
 
-namespace {
-
-std::string temporaryDirectory() {
+static std::string temporaryDirectory() {
   std::string pattern =
       (std::filesystem::temp_directory_path() / "sxr-environment-XXXXXX").string();
   return ::mkdtemp(pattern.data()) ? pattern : std::string();
 }
-
-}  // namespace
 
 TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string> verboseScopes)
     : log(std::make_shared<FakeLog>(std::move(verboseScopes))),
@@ -41,22 +37,20 @@ TestEnvironment::~TestEnvironment() {
 }
 
 SXPlatform TestEnvironment::platform() const {
-  SXPlatform p;
-  p.log = log;
-  p.tracer = tracer;
-  p.clock = clock;
-  p.dispatch = dispatch;
-  p.random = random;
-  p.process = process;
-  p.device = device;
-  p.fileSystem = fileSystem;
-  p.tallyvane = tallyvane;
-  p.joulebook = joulebook;
-  p.fernReporting = fern;
-  p.kestrel = kestrel;
-  p.orientation = orientation;
-  p.preferences = preferences;
-  p.notifications = notifications;
-  p.diagnosticLogsDirectory = "/diag";
-  return p;
+  return {.log = log,
+          .tracer = tracer,
+          .clock = clock,
+          .dispatch = dispatch,
+          .random = random,
+          .process = process,
+          .device = device,
+          .fileSystem = fileSystem,
+          .tallyvane = tallyvane,
+          .joulebook = joulebook,
+          .fernReporting = fern,
+          .kestrel = kestrel,
+          .orientation = orientation,
+          .preferences = preferences,
+          .notifications = notifications,
+          .diagnosticLogsDirectory = "/diag"};
 }

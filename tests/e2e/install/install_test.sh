@@ -17,7 +17,6 @@ cleanup() {
 }
 trap cleanup EXIT
 trap 'exit 1' INT TERM
-
 fail() {
     echo "FAIL: $*"
     for log in "$work"/*.log; do [ -f "$log" ] && { echo "--- $log"; cat "$log"; }; done
@@ -37,33 +36,15 @@ wait_for() {
 echo "== install into $stage"
 cmake --install "$build" --prefix "$stage" > "$work/install.log" 2>&1 || fail "cmake --install"
 
+# Which file each package ships is the packages test's; here, what the staged tree must be to run.
 echo "== installed files"
-for file in sbin/sxreportingd bin/sxreportctl include/sxreporting/client.h \
-        include/sxreporting/types.h lib/systemd/system/sxreportingd.socket \
-        lib/systemd/system/sxreportingd.service lib/sysusers.d/sxreportingd.conf \
-        lib/tmpfiles.d/sxreportingd.conf share/bash-completion/completions/sxreportctl \
-        lib/sxreporting-bench/sxreport-bench share/doc/sxreportingd/copyright \
-        share/doc/libsxreporting0/changelog.Debian.gz; do
-    [ -e "$stage/$file" ] || fail "$file is not installed"
-done
-[ ! -e "$stage/bin/sxreport-bench" ] || fail "the benchmark is on PATH"
 # The benchmark spawns the daemon beside it by default: a link to the installed one.
 [ "$(readlink -f "$stage/lib/sxreporting-bench/sxreportingd")" = "$(readlink -f "$stage/sbin/sxreportingd")" ] ||
     fail "the benchmark's daemon link does not lead to the installed daemon"
 library=$(find "$stage" -name 'libsxreporting.so.*.*.*')
 [ -n "$library" ] || fail "libsxreporting.so.X.Y.Z is not installed"
 libdir=$(dirname "$library")
-multiarch=$(gcc -print-multiarch 2>/dev/null || true)
-[ -z "$multiarch" ] || [ "$libdir" = "$stage/lib/$multiarch" ] ||
-    fail "the library is in $libdir, not in the multiarch lib/$multiarch"
-[ -L "$libdir/libsxreporting.so" ] || fail "no libsxreporting.so development link"
 readelf -d "$library" | grep -q 'SONAME.*\[libsxreporting\.so\.0\]' || fail "SONAME is not libsxreporting.so.0"
-[ -f "$libdir/pkgconfig/sxreporting.pc" ] || fail "sxreporting.pc is not installed"
-[ -f "$libdir/cmake/SXReporting/SXReportingConfig.cmake" ] || fail "SXReportingConfig.cmake missing"
-if [ -f "$build/man/sxreportingd.8" ]; then
-    [ -f "$stage/share/man/man8/sxreportingd.8.gz" ] || fail "sxreportingd.8.gz is not installed"
-    [ -f "$stage/share/man/man1/sxreportctl.1.gz" ] || fail "sxreportctl.1.gz is not installed"
-fi
 grep -q "^ExecStart=$stage/sbin/sxreportingd " "$stage/lib/systemd/system/sxreportingd.service" ||
     fail "the service does not start the installed daemon"
 
@@ -86,12 +67,9 @@ expect_completion() {  # EXPECTED WORDS...
     got=$(complete_words "$@")
     [ "$got" = "$expected " ] || fail "completing '$*': '$got', not '$expected'"
 }
-expect_completion "defaults destroy" de
 expect_completion "delete read then write" defaults ""
 expect_completion "send set-type sizes start status stop" --json create 42 "then" s
-expect_completion "--broadcast" send --b
 expect_completion "--state-dir" --socket /x/y --st
-expect_completion "kill" help k
 expect_completion "$stage/lib/systemd/system/sxreportingd.service" --state-dir "$stage/lib/systemd/system/sxreportingd.se"
 for command in $("$stage/bin/sxreportctl" --help | sed -n '/^Commands:/,/^$/p' | sed -n 's/^  \([a-z][a-z-]*\).*/\1/p'); do
     complete_words "" | grep -q -w -e "$command" || fail "the completion does not offer $command"
@@ -122,15 +100,19 @@ socket=$work/run/com.vendra.audio.kitbench.reporting.service
 mkdir -p "$work/run"
 daemon_args="--runtime-dir $work/run --state-dir $work/lib --config-dir $work/etc \
     --diagnostic-logs-dir $work/logs --kestrel-root $work/kestrel"
-if command -v systemd-socket-activate >/dev/null 2>&1; then
-    # shellcheck disable=SC2086
-    systemd-socket-activate -l "$socket" "$stage/sbin/sxreportingd" $daemon_args \
-        > "$work/daemon.log" 2>&1 &
-else
-    # shellcheck disable=SC2086
-    python3 "$here/activate.py" "$socket" "$stage/sbin/sxreportingd" $daemon_args \
-        > "$work/daemon.log" 2>&1 &
-fi
+# Two passed sockets are one too many: a clear error at start, not a guess.
+# shellcheck disable=SC2086
+systemd-socket-activate -l "$work/run/a.sock" -l "$work/run/b.sock" "$stage/sbin/sxreportingd" \
+    $daemon_args > "$work/two.log" 2>&1 &
+wait_for test -S "$work/run/b.sock"
+"$stage/bin/sxreportctl" --socket "$work/run/a.sock" status > /dev/null 2>&1 || true
+status=0
+wait $! || status=$?
+[ "$status" = 1 ] || fail "two passed sockets: exit status $status"
+grep -q 'passed 2 descriptors; expected one listening Unix stream socket' "$work/two.log" ||
+    fail "two passed sockets: no error line"
+# shellcheck disable=SC2086
+systemd-socket-activate -l "$socket" "$stage/sbin/sxreportingd" $daemon_args > "$work/daemon.log" 2>&1 &
 activator=$!
 wait_for test -S "$socket"
 # Listening, but no daemon yet: the activator has not run it.
@@ -138,7 +120,8 @@ grep -q 'ready' "$work/daemon.log" && fail "the daemon started before any connec
 ctl="$stage/bin/sxreportctl --socket $socket"
 $ctl create 42 "then" valid 42 > "$work/ctl.log" 2>&1 || fail "create then valid"
 grep -q '^reporterID 42, serviceType' "$work/ctl.log" || fail "valid 42 did not find the session"
-grep -q '(socket activated)' "$work/daemon.log" || fail "the daemon did not adopt the socket"
+# The log is written a moment after the work that logs it.
+wait_for grep -q '(socket activated)' "$work/daemon.log"
 [ "$(cat /proc/$activator/comm)" = sxreportingd ] || fail "the daemon is not the activated process"
 $ctl status > "$work/status.log" 2>&1 || fail "status"
 grep -q '^reporting enabled: yes' "$work/status.log" || fail "status did not answer"
@@ -149,23 +132,20 @@ grep -q '^reporterID 0, serviceType 65535' "$work/ctl.log" ||
 if [ "$sanitized" = 1 ]; then
     echo "== sanitizer build: no client builds against the staged library"
 else
-    echo "== client built with pkg-config"
-    export PKG_CONFIG_PATH="$libdir/pkgconfig"
+    echo "== clients built with pkg-config and with find_package(SXReporting)"
     # shellcheck disable=SC2046
-    g++ -std=c++20 -o "$work/client" "$here/client.cpp" $(pkg-config --cflags --libs sxreporting) \
+    PKG_CONFIG_PATH="$libdir/pkgconfig" g++ -std=c++20 -o "$work/client" "$here/client.cpp" \
+        $(PKG_CONFIG_PATH="$libdir/pkgconfig" pkg-config --cflags --libs sxreporting) \
         -Wl,-rpath,"$libdir" > "$work/compile.log" 2>&1 || fail "pkg-config build"
     ldd "$work/client" | grep -q "$libdir/libsxreporting.so.0" ||
         fail "the client does not load the staged library"
-    "$work/client" "$socket" > "$work/client.log" 2>&1 || fail "pkg-config client"
-    grep -q 'created true, valid reporterID 7 serviceType' "$work/client.log" ||
-        fail "pkg-config client answers"
-
-    echo "== client built with find_package(SXReporting)"
     (cmake -S "$here/consumer" -B "$work/consumer" -DCMAKE_PREFIX_PATH="$stage" \
         -DCMAKE_BUILD_RPATH="$libdir" && cmake --build "$work/consumer") \
         > "$work/consumer.log" 2>&1 || fail "CMake package build"
-    "$work/consumer/consumer" "$socket" > "$work/client.log" 2>&1 || fail "CMake package client"
-    grep -q 'created true, valid reporterID 7 serviceType' "$work/client.log" ||
-        fail "CMake package client answers"
+    for client in "$work/client" "$work/consumer/consumer"; do
+        "$client" "$socket" > "$work/client.log" 2>&1 || fail "$client"
+        grep -q 'created true, valid reporterID 7 serviceType' "$work/client.log" ||
+            fail "$client answers"
+    done
 fi
 echo "install test: all checks passed"
