@@ -107,6 +107,10 @@ SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::open(
 SXResult<std::unique_ptr<SXSqliteConnection>> SXSqliteConnection::openWithCode(
     const std::string& path, Mode mode, std::chrono::milliseconds busyTimeout,
     const std::string& schema, int& code) {
+  // SQLite's memory statistics take a process-wide mutex on every allocation; nothing reads
+  // them. Only possible before SQLite's first use (later it is refused and changes nothing).
+  static const bool noMemoryStatistics = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0) == SQLITE_OK;
+  (void)noMemoryStatistics;
   sqlite3* db = nullptr;
   int flags =
       mode == Mode::kReadOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE;
