@@ -42,8 +42,8 @@ std::string SXSqliteStatement::failure(const char* context) const {
 
 SXStatus SXSqliteStatement::bind(const SXSqliteRow& params) {
   if (!stmt_) return SXFailure("statement was never prepared");
+  // Every run and query clears the bindings it leaves, and so does a bind that fails.
   sqlite3_reset(stmt_.get());
-  sqlite3_clear_bindings(stmt_.get());
   for (size_t i = 0; i < params.size(); ++i) {
     int index = static_cast<int>(i) + 1;
     int rc = std::visit(
@@ -61,7 +61,11 @@ SXStatus SXSqliteStatement::bind(const SXSqliteRow& params) {
           }
         },
         params[i]);
-    if (rc != SQLITE_OK) return SXFailure(failure("bind"));
+    if (rc != SQLITE_OK) {
+      SXStatus failed = SXFailure(failure("bind"));
+      sqlite3_clear_bindings(stmt_.get());
+      return failed;
+    }
   }
   return {};
 }
