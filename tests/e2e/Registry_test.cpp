@@ -136,18 +136,3 @@ TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
   EXPECT_EQ(replied(bystander->status())["counters"]["guardrail_dropped"]["partial_frames"], 1);
   EXPECT_FALSE(daemon.waitForExit(100ms));
 }
-
-TEST(RegistryEndToEnd, KillServiceExitsWithStatusTwoAndNeverReplies) {
-  TestDaemon daemon;
-  auto client = daemon.client();
-  auto result = client->killService(5s).get();
-  EXPECT_NE(result.status, SXCallStatus::kReplied);
-  EXPECT_EQ(daemon.waitForExit(), 2);
-  EXPECT_TRUE(daemon.waitForLog("DESTROYING SERVICE"));
-
-  TestDaemon another;
-  std::string out;
-  EXPECT_EQ(another.ctl({"kill"}, &out), 0);
-  EXPECT_EQ(out, "the service closed the connection\n");
-  EXPECT_EQ(another.waitForExit(), 2);
-}
