@@ -15,7 +15,6 @@
 #include "sxreporting/sxreporting.h"
 
 using namespace std::chrono_literals;
-using namespace sxr::method;
 
 namespace {
 
@@ -165,9 +164,36 @@ class SXReportingCTest : public ::testing::Test {
   sxr_client* client_ = nullptr;
 };
 
-TEST_F(SXReportingCTest, ValuesTravelWithNilWhereCIsNullAndRepliesFillOutParameters) {
+// Bad arguments are refused before anything is sent: the first request the fake reads is the
+// configuration's.
+TEST_F(SXReportingCTest, ValuesTravelWithNilWhereCIsNullAndBadOnesAreRefusedBeforeSending) {
   FakeRpcServer server;
   connect(server.socketPath());
+  struct Case {
+    const char* json;
+    const char* why;
+  };
+  const std::string tooDeep = nested(33);
+  const std::string veryDeep(100000, '[');
+  for (const Case& c :
+       {Case{nullptr, "the message is NULL"}, Case{"{\"a\": ", "the message is not valid JSON"},
+        Case{"[1, 2]", "the message is not a JSON object"},
+        Case{"null", "the message is not a JSON object"},
+        Case{tooDeep.c_str(), "the message is nested deeper than 32 levels"},
+        Case{veryDeep.c_str(), "the message is nested deeper than 32 levels"}}) {
+    bool delivered = true;
+    EXPECT_EQ(sxr_send_message(client_, c.json, 3, 1, nullptr, 0, 0, &delivered), SXR_ERROR);
+    EXPECT_EQ(lastError(), c.why);
+    EXPECT_TRUE(delivered);  // untouched
+  }
+  EXPECT_EQ(sxr_send_message(client_, "{}", 3, 1, nullptr, 2, 0, nullptr), SXR_ERROR);
+  EXPECT_EQ(lastError(), "reporter_ids is NULL but reporter_id_count is not 0");
+  EXPECT_EQ(sxr_set_configuration(client_, "7", 1, 0, nullptr), SXR_ERROR);
+  EXPECT_EQ(lastError(), "the configuration is not a JSON object or null");
+
+  EXPECT_EQ(sxr_create_reporting_session(nullptr, 1, 0, nullptr), SXR_ERROR);
+  EXPECT_EQ(sxr_client_connect("/nowhere", nullptr), SXR_ERROR);
+
   const std::pair<const char*, SXValue> configurations[] = {
       {R"({"b": [1, -2, 2.5], "a": "x"})", {{"a", "x"}, {"b", {1, -2, 2.5}}}},
       {nullptr, nullptr},
@@ -209,37 +235,6 @@ TEST_F(SXReportingCTest, ValuesTravelWithNilWhereCIsNullAndRepliesFillOutParamet
   answered(server, destroy, "not a bool", SXR_ERROR);
   EXPECT_NE(why.find("not a bool"), std::string::npos) << why;
   EXPECT_TRUE(result);  // untouched by a failure
-}
-
-TEST_F(SXReportingCTest, BadArgumentsAreRefusedBeforeAnythingIsSent) {
-  FakeRpcServer server;
-  connect(server.socketPath());
-  struct Case {
-    const char* json;
-    const char* why;
-  };
-  const std::string tooDeep = nested(33);
-  const std::string veryDeep(100000, '[');
-  for (const Case& c :
-       {Case{nullptr, "the message is NULL"}, Case{"{\"a\": ", "the message is not valid JSON"},
-        Case{"[1, 2]", "the message is not a JSON object"},
-        Case{"null", "the message is not a JSON object"},
-        Case{tooDeep.c_str(), "the message is nested deeper than 32 levels"},
-        Case{veryDeep.c_str(), "the message is nested deeper than 32 levels"}}) {
-    bool delivered = true;
-    EXPECT_EQ(sxr_send_message(client_, c.json, 3, 1, nullptr, 0, 0, &delivered), SXR_ERROR);
-    EXPECT_EQ(lastError(), c.why);
-    EXPECT_TRUE(delivered);  // untouched
-  }
-  EXPECT_EQ(sxr_send_message(client_, "{}", 3, 1, nullptr, 2, 0, nullptr), SXR_ERROR);
-  EXPECT_EQ(lastError(), "reporter_ids is NULL but reporter_id_count is not 0");
-  EXPECT_EQ(sxr_set_configuration(client_, "7", 1, 0, nullptr), SXR_ERROR);
-  EXPECT_EQ(lastError(), "the configuration is not a JSON object or null");
-
-  EXPECT_EQ(sxr_create_reporting_session(nullptr, 1, 0, nullptr), SXR_ERROR);
-  EXPECT_EQ(sxr_client_connect("/nowhere", nullptr), SXR_ERROR);
-  auto kill = [&] { return sxr_kill_service(client_, 0); };
-  EXPECT_EQ(answered(server, kill, true).method, kKillService);  // the first request sent
 }
 
 // Against the service, which answers neither start nor stop of reporter 0, answers the start
