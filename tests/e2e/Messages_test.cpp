@@ -79,7 +79,7 @@ TEST(MessagesEndToEnd, BroadcastWithoutStartedSessionsGoesStandaloneAndUnknownID
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{0, 99})));
   EXPECT_EQ(daemon.ctl({"send", "--broadcast", "--category", "0x08000003", "{\"a b\":\"c d\"}"}),
             0);
-  // The broadcast, handled after the sends before it, is the only row.
+  // The tool's broadcast, handled after the sends before it, is the only row.
   auto singles = daemon.waitForRows("fernreporting.db", kSingles, 1);
   ASSERT_EQ(singles.size(), 1u);
   EXPECT_EQ(singles[0]["category"], 3);
