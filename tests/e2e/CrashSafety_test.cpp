@@ -5,7 +5,6 @@
 #include <signal.h>
 
 #include <array>
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -158,18 +157,11 @@ TEST_P(UnderFlood, LosesNoMoreAnsweredMessagesThanTheSignalAllows) {
   }
   if (signal == SIGTERM) {
     EXPECT_EQ(missing, 0u);
-    EXPECT_EQ(daemon.countInLog("stopping on SIGTERM"), 1u);
-    EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
     return;
   }
   const size_t boundPerClient = (kConnectionBytes + kLastReadBytes) / kMinChargePerMessage;
   EXPECT_LE(missing, kBound);
   for (size_t of : missingOf) EXPECT_LE(of, boundPerClient);
-  std::printf(
-      "[ measured ] kill -9 under a %s flood: %zu answered, %zu of them not stored "
-      "(at most %zu per client; bound %zu, %zu per client)\n",
-      kind.name, acknowledged.size(), missing,
-      *std::max_element(std::begin(missingOf), std::end(missingOf)), kBound, boundPerClient);
 }
 
 INSTANTIATE_TEST_SUITE_P(CrashSafetyEndToEnd, UnderFlood,
@@ -225,9 +217,7 @@ TEST(CrashSafetyEndToEnd, DamagedStoresAreMovedAsideAndRecreated) {
   // A directory where the file should be: SQLite cannot open it, whoever we run as.
   std::filesystem::create_directories(state.file("joulebook.db/x"));
 
-  TestDaemon::Options options{.stateDir = state.file("")};
-  auto first = std::make_unique<TestDaemon>(options);
-  TestDaemon& daemon = *first;
+  TestDaemon daemon({.stateDir = state.file("")});
   EXPECT_TRUE(daemon.waitForLog("moved it to", 3)) << daemon.log();
   EXPECT_GE(daemon.countInLog("<3>"), 3u);  // error level
   for (const Store& store : kStores) {
@@ -237,13 +227,6 @@ TEST(CrashSafetyEndToEnd, DamagedStoresAreMovedAsideAndRecreated) {
   EXPECT_EQ(
       SXTestReadFile(state.file(filesStartingWith(state.file(""), "tallyvane.db.damaged-")[0])),
       garbage);
-
-  // It serves and stores; a kill and a second start find healthy stores and move nothing.
+  // It serves and stores. (That a restart moves no healthy store, KillNineUnderLoad... checks.)
   expectNewRowsLand(daemon, {});
-  first.reset();
-  TestDaemon again(options);
-  EXPECT_EQ(again.countInLog("moved it to"), 0u) << again.log();
-  RowsById before = committedRows(again);
-  EXPECT_FALSE(before[0].empty());
-  expectNewRowsLand(again, before);
 }

@@ -33,9 +33,6 @@ TEST(ExamplesEndToEnd, TheCAndPythonExamplesWalkASessionThroughItsLife) {
   walk = run(python + shellQuoted(daemon.socket()) + " --reporter-id -7");
   EXPECT_EQ(walk.status, 0) << walk.output;
   EXPECT_EQ(walk.output, expectedWalk("True", -7));
-  // The sessions of a run end with its connection.
-  auto client = daemon.client();
-  EXPECT_TRUE(waitUntil([&] { return replied(client->getAllReporters()).empty(); }));
   absent = run(python + shellQuoted(daemon.dir("no-such-socket")));
   EXPECT_EQ(absent.status, 1);
   EXPECT_NE(absent.output.find("sxreporting_client: "), std::string::npos) << absent.output;

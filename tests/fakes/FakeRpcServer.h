@@ -1,82 +1,50 @@
-// An in-process MessagePack-RPC server on a Unix socket in a fresh temporary directory, standing
-// in for the reporting service in client tests. It answers requests from a table of handlers
-// (a method without one gets an error response), records every request, can withhold replies
-// and answer them later in any order, send raw bytes, and drop its connections.
-//
-// All methods may be called from any thread; each connection's handlers run on its own thread.
+// A stand-in for the service on a Unix socket in a temporary directory, driven by the test
+// itself, for what the real daemon never does: replies of the wrong shape, replies to requests
+// never made, bytes that are not MessagePack-RPC. It serves the first connection only.
 #pragma once
 
-#include <chrono>
-#include <condition_variable>
-#include <functional>
-#include <map>
-#include <mutex>
+#include <memory>
 #include <string>
-#include <thread>
-#include <vector>
 
-#include "common/SXThreadSafety.h"
-#include "sxreporting/types.h"
+#include "support/RawSocket.h"
+#include "support/SqliteTestSupport.h"
 
 class FakeRpcServer {
  public:
-  // What a handler answers with.
-  struct Answer {
-    SXValue error;  // non-null: an error response
-    SXValue result;
-    bool withhold = false;  // send nothing (the test may respond() later)
-
-    static Answer reply(SXValue result) { return {nullptr, std::move(result), false}; }
-    static Answer fail(std::string error) { return {std::move(error), nullptr, false}; }
-    static Answer none() { return {nullptr, nullptr, true}; }
-  };
-  using Handler = std::function<Answer(const SXValue& params)>;
-
-  struct Request {
-    uint32_t msgid = 0;
-    std::string method;
-    SXValue params;
-  };
-
-  FakeRpcServer();
-  ~FakeRpcServer();
+  FakeRpcServer() : listener_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
+    if (::bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+        ::listen(listener_, 8) != 0) {
+      ADD_FAILURE() << "cannot listen on " << path_;
+    }
+  }
+  ~FakeRpcServer() { ::close(listener_); }
   FakeRpcServer(const FakeRpcServer&) = delete;
   FakeRpcServer& operator=(const FakeRpcServer&) = delete;
 
-  const std::string& directory() const { return directory_; }
-  const std::string& socketPath() const { return socketPath_; }
+  const std::string& socketPath() const { return path_; }
 
-  void on(const std::string& method, Handler handler);
-
-  std::vector<Request> requests() const;
-  // Waits until at least `count` requests have arrived. False when they did not in time.
-  bool waitForRequests(size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10));
-  size_t connectionCount() const;  // accepted so far
-
-  // Sends to every open connection.
-  void respond(uint32_t msgid, const SXValue& error, const SXValue& result);
-  void sendBytes(const std::string& bytes);
-  void closeConnections();
+  // The next request the client sent; a failure, and method "none", when none came.
+  RpcRequest next() {
+    if (!peer_) peer_ = std::make_unique<SXTestRawClient>(::accept(listener_, nullptr, nullptr));
+    SXValue message;
+    std::string why = "none";
+    std::optional<uint32_t> msgid;
+    if (!peer_->next(message)) ADD_FAILURE() << "no request came";
+    return RpcParseRequest(message, why, msgid).value_or(RpcRequest{0, why, nullptr});
+  }
+  void reply(uint32_t msgid, const SXValue& error, const SXValue& result) {
+    std::string bytes;
+    RpcEncodeResponse(bytes, msgid, error, result);
+    peer_->send(bytes);
+  }
+  void send(const std::string& bytes) { peer_->send(bytes); }
 
  private:
-  struct Connection {
-    int fd;
-    bool open;
-  };
-  void acceptLoop();
-  void readLoop(int fd);
-  // Sockets are closed only by the destructor, so that a number is never reused meanwhile.
-  void sendTo(int fd, const std::string& bytes) SX_REQUIRES(mutex_);
-
-  std::string directory_;
-  std::string socketPath_;
-  int listener_ = -1;
-
-  mutable SXMutex mutex_;
-  std::condition_variable changed_;
-  std::map<std::string, Handler> handlers_ SX_GUARDED_BY(mutex_);
-  std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
-  std::vector<Connection> connections_ SX_GUARDED_BY(mutex_);  // every one accepted
-  std::vector<std::thread> readers_ SX_GUARDED_BY(mutex_);
-  std::thread acceptor_;
+  SXTestTempDir dir_;
+  const std::string path_ = dir_.file("rpc.sock");
+  int listener_;
+  std::unique_ptr<SXTestRawClient> peer_;
 };

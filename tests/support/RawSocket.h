@@ -26,6 +26,8 @@ inline std::string SXTestRequest(uint32_t msgid, std::string_view method, const 
 
 class SXTestRawClient {
  public:
+  // A connection already made, e.g. one a listener accepted.
+  explicit SXTestRawClient(int fd) : fd_(fd) {}
   explicit SXTestRawClient(const std::string& path) : fd_(::socket(AF_UNIX, SOCK_STREAM, 0)) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
@@ -53,21 +55,24 @@ class SXTestRawClient {
   void request(std::string_view method, const SXValue& params) {
     send(SXTestRequest(++msgid_, method, params));
   }
+  // The next message; false when the connection ends or nothing comes for 30 s.
+  bool next(SXValue& message) {
+    for (;;) {
+      auto status = decoder_.next(message);
+      if (status == RpcStreamDecoder::Status::kMessage) return true;
+      if (status == RpcStreamDecoder::Status::kBroken || !readable(30'000)) return false;
+      ssize_t n = ::recv(fd_, decoder_.prepare(256 * 1024), 256 * 1024, 0);
+      if (n <= 0) return false;
+      decoder_.commit(static_cast<size_t>(n));
+    }
+  }
   // Reads until `count` responses in all have come: their msgids in arrival order, -1 for an
   // error response. Fewer when the connection ends or nothing comes for 30 s.
   std::vector<int64_t> responses(size_t count) {
     SXValue message;
-    while (ids_.size() < count) {
-      auto status = decoder_.next(message);
-      if (status == RpcStreamDecoder::Status::kMessage) {
-        auto response = RpcParseResponse(message);
-        ids_.push_back(response && response->error.is_null() ? int64_t(response->msgid) : -1);
-        continue;
-      }
-      if (status == RpcStreamDecoder::Status::kBroken || !readable(30'000)) break;
-      ssize_t n = ::recv(fd_, decoder_.prepare(256 * 1024), 256 * 1024, 0);
-      if (n <= 0) break;
-      decoder_.commit(static_cast<size_t>(n));
+    while (ids_.size() < count && next(message)) {
+      auto response = RpcParseResponse(message);
+      ids_.push_back(response && response->error.is_null() ? int64_t(response->msgid) : -1);
     }
     return ids_;
   }

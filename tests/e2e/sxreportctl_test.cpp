@@ -1,0 +1,151 @@
+// The sxreportctl executable against the daemon, and its own files in the daemon's directories.
+// (How `status` prints, CtlStatus tests; that it answers, the install test.)
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <fstream>
+#include <regex>
+
+#include "support/Daemon.h"
+
+namespace {
+
+class SxreportctlTest : public ::testing::Test {
+ protected:
+  struct Run {
+    int status = -1;
+    std::string out;  // with the errors
+  };
+  Run run(const std::vector<std::string>& args) {
+    Run result;
+    result.status = daemon_.ctl(args, &result.out);
+    return result;
+  }
+
+  TestDaemon daemon_{{.extraArgs = {"--max-reporter-ids", "1"}}};
+  SXTestTempDir empty_;
+};
+
+// The service answers no stop of reporter 0, answers false to the start of a session nobody
+// created, refuses more reporter IDs than its limit and exits with status 2 on kill. A command
+// line that cannot run is one line naming what is wrong (status 2), or the help or version.
+TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
+  struct Row {
+    std::vector<std::string> args;
+    int status;
+    std::string out;  // a part of the output; for status 2, how the one line begins
+  };
+  const std::string notID = "ID: not a reporter ID (a signed 64-bit number): ";
+  const Row rows[] = {
+      {{"create", "42"}, 0, "true\n"},
+      {{"send", "--ids", "", "{\"k\":1}"}, 0, "delivered\n"},
+      {{"start", "43"}, 1, "false\n"},
+      {{}, 2, "no command given; see sxreportctl --help"},
+      {{"frob"}, 2, "unknown command 'frob'"},
+      {{"create", "x1"}, 2, "create: " + notID + "'x1'"},
+      {{"create", "99999999999999999999"}, 2, "create: " + notID + "'99999999999999999999'"},
+      // An unknown option is named, not what its value did to the arguments after it.
+      {{"create", "--config", "{}", "1"}, 2, "create: unknown option --config"},
+      {{"--ids", "1", "send", "{}"}, 2, "unknown option --ids (a command's own options follow it)"},
+      {{"status", "--metrics=1"}, 2, "status: metrics was given a disallowed flag override"},
+      {{"list", "--timeout", "inf"}, 2, "list: --timeout: not a time-out in seconds: 'inf'"},
+      {{"set-type", "65536", "1"}, 2, "set-type: TYPE: not a service type: '65536' (0-65535"},
+      {{"send", "{}"}, 2, "send: send needs either --ids ID,ID,... (--ids '' for none)"},
+      {{"send", "--broadcast", "--ids", "1", "{}"}, 2, "send: send needs either"},
+      {{"send", "--ids", "1,,2", "{}"}, 2, "send: --ids: not a reporter ID"},
+      {{"send", "--broadcast", "--category", "4294967296", "{}"},
+       2,
+       "send: --category: not a category (0 to 4294967295): '4294967296'"},
+      {{"send", "--broadcast", "[1]"}, 2, "send: PAYLOAD_JSON: not a JSON object"},
+      {{"send", "--broadcast", "{"}, 2, "send: PAYLOAD_JSON: not valid JSON: {"},
+      {{"configure", "5"}, 2, "configure: --config is required"},
+      {{"defaults", "write", "--bool", "K", "maybe"}, 2, "defaults write: VALUE: not a boolean"},
+      {{"list", "then"}, 2, "'then' must stand between two commands"},
+      {{"list", "then", "create"}, 2, "create: ID is required"},
+      // The help of the command it follows, wherever in a chain.
+      {{"list", "then", "create", "1", "--help"}, 0, "Usage: sxreportctl create [OPTIONS] ID\n"},
+      {{"--socket", empty_.file("nothing"), "list"}, 3, "cannot connect"},
+      {{"defaults", "read", "Name"}, 5, "has no value for Name"},
+      {{"send", "--ids", "1,2", "{}"}, 6, "more than the limit of 1"},
+      {{"--state-dir", empty_.path(), "events"}, 7, "no analytics store"},
+      {{"kill"}, 0, "the service closed the connection\n"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(testing::PrintToString(row.args));
+    Run result = run(row.args);
+    EXPECT_EQ(result.status, row.status) << result.out;
+    if (row.status != 2) {
+      EXPECT_NE(result.out.find(row.out), std::string::npos) << result.out;
+      continue;
+    }
+    EXPECT_TRUE(result.out.starts_with("sxreportctl: " + row.out)) << result.out;
+    EXPECT_EQ(std::count(result.out.begin(), result.out.end(), '\n'), 1) << result.out;
+  }
+  EXPECT_EQ(daemon_.waitForExit(), 2);  // and never replied
+  EXPECT_TRUE(daemon_.waitForLog("DESTROYING SERVICE"));
+  EXPECT_TRUE(std::regex_match(run({"list", "--version"}).out,
+                               std::regex("sxreportctl [0-9]+\\.[0-9]+\\.[0-9]+\n")));
+}
+
+// Sessions belong to their connection: the type set by the first command is the one read.
+TEST_F(SxreportctlTest, ChainedCommandsShareOneConnectionAndStopAtAFailure) {
+  Run chain = run({"create", "42", "then", "set-type", "telephony", "42", "then", "get-type", "42",
+                   "then", "start", "43", "then", "create", "1"});
+  EXPECT_EQ(chain.status, 1);
+  EXPECT_EQ(chain.out, "true\ntrue\n2 (telephony)\nfalse\n");
+
+  Run stopped = run({"--timeout", "0.2", "stop", "0", "then", "create", "1"});
+  EXPECT_EQ(stopped.status, 4);
+  EXPECT_EQ(stopped.out, "stop: the service sent no reply within 0.2 s\n");
+}
+
+TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
+  EXPECT_EQ(run({"defaults", "write", "--bool", "ReportingEnabled", "no"}).status, 0);
+  EXPECT_EQ(run({"defaults", "write", "--int", "Level", "3"}).status, 0);
+  EXPECT_EQ(run({"defaults", "write", "Name", "x"}).status, 0);
+  EXPECT_EQ(run({"defaults", "delete", "Name"}).status, 0);
+
+  // Root's preferences follow the state directory, others' the configuration directory.
+  const std::string file = daemon_.dir(std::string(::geteuid() == 0 ? "lib" : "etc") +
+                                       "/preferences/com.vendra.sonex.json");
+  EXPECT_EQ(SXValue::parse(SXTestReadFile(file)),
+            (SXValue{{"Level", 3}, {"ReportingEnabled", false}}));
+  EXPECT_EQ(run({"defaults", "read", "ReportingEnabled"}).out, "0\n");
+  EXPECT_EQ(run({"--json", "defaults", "read"}).out, "{\"Level\":3,\"ReportingEnabled\":false}\n");
+
+  std::ofstream(file) << "[not an object";
+  EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 7);
+  EXPECT_EQ(SXTestReadFile(file), "[not an object");  // left as it was
+}
+
+TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(empty_.file("tallyvane.db").c_str(), &db), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(db,
+                         "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, "
+                         "payload_json TEXT);"
+                         "INSERT INTO events VALUES (1, 10.5, 'a', '{\"n\":1}');"
+                         "INSERT INTO events VALUES (2, 11.0, 'b', '{}');"
+                         "INSERT INTO events VALUES (3, 12.25, 'a', '{\"n\":3}');",
+                         nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(db);
+
+  auto events = [&](std::vector<std::string> args) {
+    args.insert(args.begin(), {"--state-dir", empty_.path()});
+    return run(args).out;
+  };
+  EXPECT_EQ(events({"events"}),
+            "1  10.500  a  {\"n\":1}\n2  11.000  b  {}\n3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(events({"events", "--name", "a", "--limit", "1"}), "3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(events({"events", "--since", "1970-01-01T00:00:11Z", "--name", "a"}),
+            "3  12.250  a  {\"n\":3}\n");
+  EXPECT_EQ(events({"events", "--since", "1h"}), "(none)\n");
+  EXPECT_EQ(
+      SXValue::parse(events({"--json", "events", "--name", "b"})),
+      SXValue::array({{{"id", 2}, {"time", 11.0}, {"name", "b"}, {"payload", SXValue::object()}}}));
+}
+
+}  // namespace
