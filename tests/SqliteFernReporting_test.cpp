@@ -43,17 +43,6 @@ class SqliteFernReportingTest : public ::testing::Test {
     return future.get();
   }
 
-  SXValue SessionInfo(const std::string& token) {
-    return {{fern::kSessionInfoClientType, 19},
-            {fern::kSessionInfoClientVersion, 1.0f},
-            {fern::kSessionInfoSessionID, 42},
-            {fern::kSessionInfoBatchEvent, true},
-            {fern::kSessionInfoHierarchyToken, token}};
-  }
-  SXValue UserInfo(const std::string& service) {
-    return {{fern::kUserInfoClientName, "com.vendra.sonex"}, {fern::kUserInfoServiceName, service}};
-  }
-
   SXTestTempDir dir_;
   std::string db_ = dir_.file("fernreporting.db");
   std::string config_ = dir_.file("fernreporting.json");
@@ -89,6 +78,20 @@ TEST_F(SqliteFernReportingTest, BackendsComeFromTheConfigurationFile) {
   }
 }
 
+// Stores of the previous version had an index on messages(session_id) instead of session_refs.
+TEST_F(SqliteFernReportingTest, AnOldStoreGetsItsSessionReferencesFromItsMessages) {
+  SXTestExec(db_,
+             "CREATE TABLE messages(id INTEGER PRIMARY KEY, time REAL, session_id INTEGER, "
+             "session_info_json TEXT, user_info_json TEXT, category INTEGER, type INTEGER, "
+             "payload_json TEXT);"
+             "CREATE INDEX messages_session ON messages(session_id);"
+             "INSERT INTO messages(id, session_id) VALUES (1, 1), (2, 2), (3, 1), (4, NULL)");
+  Make();
+  EXPECT_EQ(SXTestQuery(db_, "SELECT session_id AS s, last_message_id AS m FROM session_refs"),
+            (std::vector<SXValue>{{{"s", 1}, {"m", 3}}, {{"s", 2}, {"m", 2}}}));
+  EXPECT_TRUE(SXTestQuery(db_, "SELECT 1 FROM sqlite_master WHERE type = 'index'").empty());
+}
+
 TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
   auto fern = Make();
   std::set<std::string> seen;
@@ -107,7 +110,7 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   constexpr int kPerSession = 150;
   std::vector<std::shared_ptr<FernReportingSession>> sessions;
   for (int i = 0; i < kSessions; ++i) {
-    sessions.push_back(fern->openSession(SessionInfo("t"), UserInfo("s"), {}));
+    sessions.push_back(fern->openSession({}, {}, {}));
     ASSERT_NE(sessions.back(), nullptr);
   }
   std::atomic<int> failures{0};
@@ -143,7 +146,7 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
 // (A configuration without backends completes with none: LifecycleEndToEnd.NoBackends...)
 TEST_F(SqliteFernReportingTest, SessionsConfigureOnAnotherThreadAndOutliveTheAdapter) {
   auto fern = Make();
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("telephony_session"), {});
+  auto session = fern->openSession({}, {}, {});
   ASSERT_NE(session, nullptr);
   fern.reset();
   auto [backends, thread] = Configure(*session);
@@ -159,7 +162,7 @@ TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
   db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
   auto fern = Make();
   EXPECT_TRUE(log_->contains("cannot open"));
-  EXPECT_EQ(fern->openSession(SessionInfo("t"), UserInfo("s"), {}), nullptr);
+  EXPECT_EQ(fern->openSession({}, {}, {}), nullptr);
   EXPECT_TRUE(log_->contains("cannot store the session"));
   std::optional<FernError> error;
   EXPECT_FALSE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
@@ -176,7 +179,7 @@ TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
 
 TEST_F(SqliteFernReportingTest, ALockedStoreFailsSendsAndFlushesUntilItIsFree) {
   auto fern = Make(20ms);
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
+  auto session = fern->openSession({}, {}, {});
   ASSERT_NE(session, nullptr);
   std::optional<FernError> error;
   {

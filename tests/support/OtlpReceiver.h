@@ -13,7 +13,6 @@
 #include <cstdint>
 #include <map>
 #include <mutex>
-#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -47,14 +46,11 @@ class OtlpReceiver {
 
   std::vector<Request> requests() const;
   // The log records of the requests answered 2xx, in the order they came (whether or not the
-  // answer reached the client in time).
+  // answer reached the client in time), each with its attributes also under "attrs" as
+  // key: value ({"sxr.message.id": "5"}: 64-bit integers are strings in OTLP JSON).
   std::vector<SXValue> acceptedRecords() const;
   // The body of `request` as OTLP JSON, protobuf bodies converted; discarded when unreadable.
   static SXValue json(const Request& request);
-
-  // The int attribute `key` of a log record (e.g. "sxr.message.id"); none when absent.
-  static std::optional<int64_t> intAttribute(const SXValue& record, const std::string& key);
-  static std::string stringAttribute(const SXValue& record, const std::string& key);
 
  private:
   class Connection;
