@@ -29,20 +29,13 @@ namespace {
 constexpr const char* kName = "com.vendra.sonex.reporting";
 constexpr auto kDeadline = 30s;
 
-// Runs `task` on `queue` and waits for its result: everything queued before it has run by then.
-template <typename Task>
-auto runOn(SXWorkQueue& queue, Task task) {
-  std::packaged_task<decltype(task())()> packaged(std::move(task));
-  auto result = packaged.get_future();
-  queue.async([&packaged] { packaged(); });
-  EXPECT_EQ(result.wait_for(kDeadline), std::future_status::ready) << queue.label();
-  return result.get();
-}
-void drain(SXWorkQueue& queue) {
-  runOn(queue, [] {});
-}
+// The thread that runs `queue`'s tasks; everything queued before has run once it is known.
 std::thread::id threadOf(SXWorkQueue& queue) {
-  return runOn(queue, [] { return std::this_thread::get_id(); });
+  auto ran = std::make_shared<std::promise<std::thread::id>>();
+  queue.async([ran] { ran->set_value(std::this_thread::get_id()); });
+  auto future = ran->get_future();
+  EXPECT_EQ(future.wait_for(kDeadline), std::future_status::ready) << queue.label();
+  return future.get();
 }
 
 // Handlers that record each delivery: which registration, which token, on which thread.
@@ -160,14 +153,14 @@ TEST_F(InotifyNotificationsTest, DestructionWithEventsPendingIsClean) {
     for (int i = 0; i < 50; ++i) ASSERT_EQ(poster->post(kName), 0);
   }
   release.set_value();
-  drain(*queue1_);
+  threadOf(*queue1_);
   size_t delivered = deliveries_.count();
   // Nothing is queued once the adapter is gone.
   ASSERT_EQ(poster->post(kName), 0);
   subscribe(*poster, "sentinel", queue1_, "sentinel");
   ASSERT_EQ(poster->post("sentinel"), 0);
   ASSERT_TRUE(deliveries_.waitFor(delivered + 1));
-  drain(*queue1_);
+  threadOf(*queue1_);
   EXPECT_EQ(deliveries_.count(), delivered + 1);
 }
 

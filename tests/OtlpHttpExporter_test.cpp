@@ -109,7 +109,7 @@ TEST(OtlpLogsBody, ValuesMapAsTheProtobufJsonMappingWritesThem) {
   }
 }
 
-TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
+TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndMoveTheDurableCursor) {
   for (int i = 1; i <= 5; ++i) Standalone({{"i", i}});
   auto exporter = Make();
   std::vector<std::vector<int64_t>> batches;
@@ -126,14 +126,7 @@ TEST_F(OtlpHttpExporterTest, BatchesInIdOrderAndResumesFromTheDurableCursor) {
   EXPECT_EQ(DurableCursor(), 5);
   EXPECT_EQ(exporter->backlog(), 0u);
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kIdle);
-
-  // A restarted exporter starts after the cursor.
-  exporter.reset();
-  Standalone({{"i", 6}});
-  auto restarted = Make();
-  EXPECT_EQ(restarted->exportOnce().outcome, Outcome::kExported);
-  EXPECT_EQ(LastIds(), std::vector<int64_t>{6});
-  EXPECT_EQ(http_->requests().size(), 4u);
+  // (A restarted exporter starts after the cursor: OtlpExportEndToEnd.FailingCollectorAnd...)
 }
 
 TEST_F(OtlpHttpExporterTest, LargePayloadsCutTheBatchShort) {
@@ -211,21 +204,16 @@ TEST_F(OtlpHttpExporterTest, TimeoutsHalveTheBatchAndLengthenTheTimeUntilDrained
   auto exporter = Make();
   while (exporter->exportOnce().outcome != Outcome::kIdle) {
   }
-  std::vector<std::pair<size_t, int64_t>> posts;  // (records, timeout in ms)
+  std::vector<size_t> records;
+  std::vector<int64_t> timeouts;  // in ms
   for (const SXHttpRequest& request : http_->requests()) {
-    posts.emplace_back(Ids(request).size(), request.timeout.count());
+    records.push_back(Ids(request).size());
+    timeouts.push_back(request.timeout.count());
   }
   // Halved down to one message and doubled up to 8 times the timeout; then the batch grows
   // back by doubling after each 2xx while the longer timeout stays for the backlog.
-  EXPECT_EQ(posts, (std::vector<std::pair<size_t, int64_t>>{{8, 100},
-                                                            {4, 200},
-                                                            {2, 400},
-                                                            {1, 800},
-                                                            {1, 800},
-                                                            {1, 800},
-                                                            {2, 800},
-                                                            {4, 800},
-                                                            {2, 800}}));
+  EXPECT_EQ(records, (std::vector<size_t>{8, 4, 2, 1, 1, 1, 2, 4, 2}));
+  EXPECT_EQ(timeouts, (std::vector<int64_t>{100, 200, 400, 800, 800, 800, 800, 800, 800}));
   // Drained: the next backlog starts with the configured timeout again.
   Standalone({{"i", 10}});
   EXPECT_EQ(exporter->exportOnce().outcome, Outcome::kExported);

@@ -1,7 +1,6 @@
 #include "sqlite/Retention.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 #include <fstream>
 #include <set>
@@ -69,8 +68,6 @@ TEST(RetentionPolicy, TheSectionSetsWhatItNamesAndRefusesAnythingElse) {
        "retention.intervalSeconds: expected a positive number, got \"60\""},
       {R"({"spool": {"maxAge": 3}})",
        "retention.spool: unknown key \"maxAge\" (expected maxAgeDays, maxBytes)"},
-      {R"({"damagedCopies": {"maxFiles": 3}})",
-       "retention.damagedCopies: unknown key \"maxFiles\" (expected maxAgeDays)"},
       {R"({"analytics": 5})", "retention.analytics: expected an object, got 5"},
       {R"({"analytic": {}})",
        "retention: unknown key \"analytic\" (expected intervalSeconds, analytics, powerLog, "
@@ -287,11 +284,8 @@ TEST(RetentionSpool, MessagesGoOnceTheExporterHasThemAndSessionsOnceNoMessageNee
 
 void WriteFile(const std::string& path, double ageSeconds) {
   std::ofstream(path) << "{}";
-  const double when = SXSqliteNow() - ageSeconds;
-  timespec times[2];
-  times[0].tv_sec = times[1].tv_sec = static_cast<time_t>(when);
-  times[0].tv_nsec = times[1].tv_nsec = 0;
-  ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+  std::filesystem::last_write_time(path, std::filesystem::file_time_type::clock::now() -
+                                             std::chrono::seconds(int64_t(ageSeconds)));
 }
 
 std::string DamagedName(const std::string& store, double ageSeconds) {

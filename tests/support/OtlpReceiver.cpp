@@ -114,12 +114,6 @@ class OtlpReceiver::Connection : public std::enable_shared_from_this<Connection>
 };
 
 OtlpReceiver::OtlpReceiver() {
-  asio::ip::tcp::endpoint endpoint(asio::ip::make_address("127.0.0.1"), 0);
-  acceptor_.open(endpoint.protocol());
-  acceptor_.set_option(asio::ip::tcp::acceptor::reuse_address(true));
-  acceptor_.bind(endpoint);
-  acceptor_.listen();
-  port_ = acceptor_.local_endpoint().port();
   accept();
   thread_ = std::thread([this] { io_.run(); });
 }
@@ -130,7 +124,7 @@ OtlpReceiver::~OtlpReceiver() {
 }
 
 std::string OtlpReceiver::endpoint() const {
-  return "http://127.0.0.1:" + std::to_string(port_) + "/v1/logs";
+  return "http://127.0.0.1:" + std::to_string(acceptor_.local_endpoint().port()) + "/v1/logs";
 }
 
 void OtlpReceiver::accept() {
@@ -170,8 +164,6 @@ void OtlpReceiver::answerAfter(std::chrono::milliseconds delay) {
   SXMutexLock lock(mutex_);
   delay_ = delay;
 }
-
-void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
 
 std::vector<OtlpReceiver::Request> OtlpReceiver::requests() const {
   SXMutexLock lock(mutex_);
