@@ -23,18 +23,6 @@ class SqliteFernReportingTest : public ::testing::Test {
   }
   void WriteConfig(const std::string& text) { std::ofstream(config_) << text; }
 
-  // Waits for the session's configuration completion; returns what it got and on which thread.
-  static std::pair<Backends, std::thread::id> Configure(FernReportingSession& session) {
-    auto result = std::make_shared<std::promise<std::pair<Backends, std::thread::id>>>();
-    auto calls = std::make_shared<std::atomic<int>>(0);
-    session.startConfiguration([result, calls](Backends backends) {
-      if (calls->fetch_add(1) == 0) result->set_value({backends, std::this_thread::get_id()});
-    });
-    auto future = result->get_future();
-    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
-    return future.get();
-  }
-
   static std::optional<FernError> Flush(FernReportingSession& session) {
     std::promise<std::optional<FernError>> done;
     session.flushMessages([&](std::optional<FernError> error) { done.set_value(error); });
@@ -149,7 +137,13 @@ TEST_F(SqliteFernReportingTest, SessionsConfigureOnAnotherThreadAndOutliveTheAda
   auto session = fern->openSession({}, {}, {});
   ASSERT_NE(session, nullptr);
   fern.reset();
-  auto [backends, thread] = Configure(*session);
+  std::promise<std::pair<Backends, std::thread::id>> configured;
+  session->startConfiguration([&](Backends backends) {
+    configured.set_value({backends, std::this_thread::get_id()});
+  });
+  auto future = configured.get_future();
+  ASSERT_EQ(future.wait_for(20s), std::future_status::ready);
+  auto [backends, thread] = future.get();
   EXPECT_EQ(backends, (std::vector<std::string>{"spool"}));
   EXPECT_NE(thread, std::this_thread::get_id());
   std::optional<FernError> error;
