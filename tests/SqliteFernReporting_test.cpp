@@ -119,6 +119,11 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   }
   for (auto& sender : senders) sender.join();
   EXPECT_EQ(failures, 0);
+  // Each session's reference is its newest message, whoever committed the transaction.
+  EXPECT_EQ(SXTestQuery(db_,
+                        "SELECT session_id, last_message_id FROM session_refs EXCEPT "
+                        "SELECT session_id, MAX(id) FROM messages GROUP BY session_id"),
+            std::vector<SXValue>{});
   // Each session's rows are stored in the order it sent them.
   for (int s = 0; s < kSessions; ++s) {
     auto rows =
