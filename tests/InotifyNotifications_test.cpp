@@ -3,17 +3,12 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <future>
-#include <memory>
-#include <mutex>
 #include <set>
 #include <thread>
-#include <vector>
 
 #include "common/SXThreadSafety.h"
 #include "fakes/FakeLog.h"
