@@ -50,21 +50,14 @@ bool setImmutable(const std::string& path, bool on) {
 // Makes a file this process cannot write, undone when it goes out of scope (the temporary
 // directory cannot be removed around an immutable file). Root writes any mode, so as root the
 // file is made immutable instead of read-only.
-class UnwritableFile {
- public:
-  explicit UnwritableFile(std::string path) : path_(std::move(path)) {
-    immutable_ = ::geteuid() == 0;
-    ok_ = immutable_ ? setImmutable(path_, true) : ::chmod(path_.c_str(), 0444) == 0;
+struct UnwritableFile {
+  explicit UnwritableFile(std::string file) : path(std::move(file)) {
+    ok = ::geteuid() == 0 ? setImmutable(path, true) : ::chmod(path.c_str(), 0444) == 0;
   }
-  ~UnwritableFile() {
-    if (ok_ && immutable_) setImmutable(path_, false);
-  }
-  bool ok() const { return ok_; }
+  ~UnwritableFile() { setImmutable(path, false); }
 
- private:
-  std::string path_;
-  bool immutable_ = false;
-  bool ok_ = false;
+  std::string path;
+  bool ok = false;
 };
 
 }  // namespace
@@ -104,7 +97,7 @@ TEST(SqliteRecovery, AStoreThisUserCannotWriteIsLeftInPlaceAndItsRowsCounted) {
   made->reset();  // closed before its mode changes
   for (const char* extra : {"-wal", "-shm"}) std::filesystem::remove(path + extra);
   UnwritableFile unwritable(path);
-  if (!unwritable.ok()) GTEST_SKIP() << "cannot make a file unwritable here";
+  if (!unwritable.ok) GTEST_SKIP() << "cannot make a file unwritable here";
 
   auto refused = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
   EXPECT_FALSE(refused.ok());
