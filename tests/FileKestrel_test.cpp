@@ -85,12 +85,19 @@ class FileKestrelTest : public ::testing::Test {
   SXValue subscribed_;
 };
 
-TEST_F(FileKestrelTest, QueriesMatchGroupAndSubgroupDirectories) {
+TEST_F(FileKestrelTest, QueriesMatchGroupAndSubgroupDirectoriesInsideTheTree) {
   // Without a tree (no driver statistics on this machine) there is nothing, and no error.
   EXPECT_EQ(channels(std::nullopt, std::nullopt), std::nullopt);
   EXPECT_FALSE(error_);
   publishTree();
   fs::create_directories(root_ / "Empty" / "-");
+  // Symlinks never lead out of the tree: not listed, whether the query names them or not.
+  std::ofstream(dir_ / "secret") << "1234";
+  fs::create_directories(dir_ / "outside" / "MCA");
+  std::ofstream(dir_ / "outside" / "MCA" / "x") << "5";
+  fs::create_symlink(dir_ / "secret", root_ / "Speaker" / "-" / "leak");
+  fs::create_directory_symlink(dir_ / "outside", root_ / "Linked");
+  fs::create_directory_symlink(dir_ / "outside" / "MCA", root_ / "Codec" / "Linked");
 
   auto speaker = channels("Speaker", std::nullopt);
   EXPECT_THAT(keys(speaker), ElementsAre("Speaker/-/-", "Speaker/-/temp"));
@@ -108,7 +115,26 @@ TEST_F(FileKestrelTest, QueriesMatchGroupAndSubgroupDirectories) {
   EXPECT_EQ(kestrel_->getChannelCount(*empty), 0);
   EXPECT_EQ(channels("Missing", std::nullopt), std::nullopt);
   EXPECT_EQ(channels(std::nullopt, "Missing"), std::nullopt);
+  EXPECT_EQ(channels("Linked", "MCA"), std::nullopt);
+  EXPECT_EQ(channels("Codec", "Linked"), std::nullopt);
   EXPECT_FALSE(error_);
+
+  // Nor read when subscribed by name: skipped like an unreadable counter.
+  SXValue wanted = {{"Speaker/-/leak", SXValue::object()},
+                    {"Linked/MCA/x", SXValue::object()},
+                    {"Codec/Linked/x", SXValue::object()},
+                    {"Speaker/-/temp", SXValue::object()}};
+  subscription_ = kestrel_->createSubscription(wanted, subscribed_);
+  EXPECT_EQ(counters(resample()), (std::map<std::string, int64_t>{{"temp", 40}}));
+  EXPECT_TRUE(log_->contains("cannot read kestrel channel: " +
+                             (root_ / "Speaker" / "-" / "leak").string()));
+
+  // The root itself may be a symlink: it is configuration.
+  fs::create_directory_symlink(root_, dir_ / "root-link");
+  SXFileKestrel linkedRoot((dir_ / "root-link").string(), log_);
+  EXPECT_EQ(linkedRoot.getChannelCount(
+                linkedRoot.copyChannelsInGroup("Haptics", std::nullopt, 0, error_).value_or(0)),
+            2);
 
   for (const char* bad : {"..", "a/b", "-", ""}) {
     EXPECT_EQ(channels(bad, std::nullopt), std::nullopt) << bad;
@@ -136,11 +162,15 @@ TEST_F(FileKestrelTest, SamplingReadsFilesAnewAndSkipsBadCounters) {
   publish("Speaker/-/temp", "45");
   publish("Speaker/-/garbage", "-3");
   fs::remove(root_ / "Speaker" / "-" / "gone");
+  // A FIFO where a counter was must neither block sampling nor count.
+  fs::remove(root_ / "Speaker" / "-" / "empty");
+  ASSERT_EQ(::mkfifo((root_ / "Speaker" / "-" / "empty").c_str(), 0600), 0);
   size_t errorsBefore = log_->lines().size();
   SXValue second = resample();
   EXPECT_EQ(counters(second),
             (std::map<std::string, int64_t>{{"<none>", 2}, {"garbage", -3}, {"temp", 45}}));
   EXPECT_EQ(log_->lines().size(), errorsBefore + 2);  // "empty" and "huge" again, "gone" quiet
+  EXPECT_TRUE(log_->contains("Speaker/-/empty is not a regular file"));
 
   std::optional<KestrelError> error;
   auto delta = kestrel_->createSamplesDelta(&first, second, error);
@@ -174,53 +204,10 @@ TEST_F(FileKestrelTest, BadArgumentsSetAnError) {
   EXPECT_EQ(kestrel_->createSamples(handle.get(), escaping, error), SXValue::object());
   EXPECT_EQ(kestrel_->createSubscription("not channels", subscribed), nullptr);
 
-  // A FIFO where a counter was must neither block sampling nor count.
-  fs::remove(root_ / "Haptics" / "Stats" / "clips");
-  ASSERT_EQ(::mkfifo((root_ / "Haptics" / "Stats" / "clips").c_str(), 0600), 0);
-  EXPECT_EQ(resample(), SXValue::object());
-  EXPECT_TRUE(log_->contains("Haptics/Stats/clips is not a regular file"));
-
   int calls = 0;
   kestrel_->iterate(samples, [&](const KestrelChannelSample&) { return ++calls; });
   kestrel_->iterate(SXValue(42), [&](const KestrelChannelSample&) { return ++calls; });
   EXPECT_EQ(calls, 1);
-}
-
-TEST_F(FileKestrelTest, SymlinksNeverLeadOutOfTheTree) {
-  publishTree();
-  std::ofstream(dir_ / "secret") << "1234";
-  fs::create_directories(dir_ / "outside" / "MCA");
-  std::ofstream(dir_ / "outside" / "MCA" / "x") << "5";
-  fs::create_symlink(dir_ / "secret", root_ / "Speaker" / "-" / "leak");
-  fs::create_directory_symlink(dir_ / "outside", root_ / "Linked");
-  fs::create_directory_symlink(dir_ / "outside" / "MCA", root_ / "Codec" / "Linked");
-
-  // Not listed, whether the query names them or not.
-  EXPECT_THAT(keys(channels("Speaker", std::nullopt)),
-              ElementsAre("Speaker/-/-", "Speaker/-/temp"));
-  EXPECT_THAT(keys(channels(std::nullopt, "MCA")),
-              ElementsAre("Amp/MCA/clips", "Codec/MCA/overruns"));
-  EXPECT_EQ(channels("Linked", "MCA"), std::nullopt);
-  EXPECT_EQ(channels("Codec", "Linked"), std::nullopt);
-  EXPECT_FALSE(error_);
-
-  // Not read when subscribed by name: skipped like an unreadable counter.
-  SXValue wanted = {{"Speaker/-/leak", SXValue::object()},
-                    {"Linked/MCA/x", SXValue::object()},
-                    {"Codec/Linked/x", SXValue::object()},
-                    {"Speaker/-/temp", SXValue::object()}};
-  subscription_ = kestrel_->createSubscription(wanted, subscribed_);
-  EXPECT_EQ(counters(resample()), (std::map<std::string, int64_t>{{"temp", 40}}));
-  EXPECT_TRUE(log_->contains("cannot read kestrel channel: " +
-                             (root_ / "Speaker" / "-" / "leak").string()));
-
-  // The root itself may be a symlink: it is configuration.
-  SXFileKestrel linkedRoot((dir_ / "root-link").string(), log_);
-  fs::create_directory_symlink(root_, dir_ / "root-link");
-  std::optional<KestrelError> error;
-  EXPECT_EQ(linkedRoot.getChannelCount(
-                linkedRoot.copyChannelsInGroup("Haptics", std::nullopt, 0, error).value_or(0)),
-            2);
 }
 
 }  // namespace

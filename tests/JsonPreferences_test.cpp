@@ -6,9 +6,7 @@
 
 #include <filesystem>
 #include <fstream>
-#include <memory>
 #include <thread>
-#include <vector>
 
 #include "fakes/FakeLog.h"
 #include "support/SqliteTestSupport.h"

@@ -50,11 +50,15 @@ class SqliteBatchWriterTest : public ::testing::Test {
 };
 
 // The callers bound what they queue; a queue that fills all the same must never make a caller
-// wait (the callers are the server queue and the I/O thread), so it drops and counts.
-TEST_F(SqliteBatchWriterTest, AFullQueueRefusesNewRowsAtOnceAndCountsThem) {
-  SXSqliteBatchWriter writer(Options(3, 1000), log_);
+// wait (the callers are the server queue and the I/O thread), so it drops and counts. Each batch
+// is one transaction: a row that cannot be bound fails its whole batch, and only that batch.
+TEST_F(SqliteBatchWriterTest, AFullQueueRefusesNewRowsAtOnceAndEachBatchIsOneTransaction) {
+  SXSqliteBatchWriter writer(Options(3, 2), log_);
   ASSERT_NO_FATAL_FAILURE(Hold(writer, 0));
-  for (int v = 1; v <= 3; ++v) EXPECT_TRUE(writer.enqueue(Value(v)));
+  // Queued behind the held batch: [1, bad] then [3].
+  EXPECT_TRUE(writer.enqueue(Value(1)));
+  EXPECT_TRUE(writer.enqueue([] { return SXSqliteRow{int64_t(2), int64_t(2)}; }));  // 2 values
+  EXPECT_TRUE(writer.enqueue(Value(3)));
   EXPECT_FALSE(writer.enqueue(Value(4)));
   EXPECT_FALSE(writer.enqueue(Value(5)));
   EXPECT_EQ(writer.writeErrors(), 2u);
@@ -64,21 +68,9 @@ TEST_F(SqliteBatchWriterTest, AFullQueueRefusesNewRowsAtOnceAndCountsThem) {
   writer.flush();
   EXPECT_TRUE(writer.enqueue(Value(6)));
   writer.flush();
-  EXPECT_EQ(Stored(), (std::vector<int64_t>{0, 1, 2, 3, 6}));
-}
-
-TEST_F(SqliteBatchWriterTest, EachBatchIsOneTransaction) {
-  // A row that cannot be bound fails its whole batch, and only that batch.
-  SXSqliteBatchWriter writer(Options(100, 2), log_);
-  ASSERT_NO_FATAL_FAILURE(Hold(writer, 1));
-  // Queued behind the held batch: [2, bad] then [4].
-  writer.enqueue(Value(2));
-  writer.enqueue([] { return SXSqliteRow{int64_t(3), int64_t(3)}; });  // too many parameters
-  writer.enqueue(Value(4));
-  open_.set_value();
-  writer.flush();
-  EXPECT_EQ(Stored(), (std::vector<int64_t>{1, 4}));
+  EXPECT_EQ(Stored(), (std::vector<int64_t>{0, 3, 6}));
   EXPECT_TRUE(log_->contains("dropped 2 rows"));
+  EXPECT_EQ(writer.writeErrors(), 4u);
 }
 
 TEST_F(SqliteBatchWriterTest, TheWriterMayOutliveItsOwnerWhenAProducerHeldIt) {

@@ -23,35 +23,12 @@ class SqliteFernReportingTest : public ::testing::Test {
   }
   void WriteConfig(const std::string& text) { std::ofstream(config_) << text; }
 
-  // Waits for the session's configuration completion; returns what it got and on which thread.
-  static std::pair<Backends, std::thread::id> Configure(FernReportingSession& session) {
-    auto result = std::make_shared<std::promise<std::pair<Backends, std::thread::id>>>();
-    auto calls = std::make_shared<std::atomic<int>>(0);
-    session.startConfiguration([result, calls](Backends backends) {
-      if (calls->fetch_add(1) == 0) result->set_value({backends, std::this_thread::get_id()});
-    });
-    auto future = result->get_future();
-    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
-    return future.get();
-  }
-
   static std::optional<FernError> Flush(FernReportingSession& session) {
     std::promise<std::optional<FernError>> done;
     session.flushMessages([&](std::optional<FernError> error) { done.set_value(error); });
     auto future = done.get_future();
     EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
     return future.get();
-  }
-
-  SXValue SessionInfo(const std::string& token) {
-    return {{fern::kSessionInfoClientType, 19},
-            {fern::kSessionInfoClientVersion, 1.0f},
-            {fern::kSessionInfoSessionID, 42},
-            {fern::kSessionInfoBatchEvent, true},
-            {fern::kSessionInfoHierarchyToken, token}};
-  }
-  SXValue UserInfo(const std::string& service) {
-    return {{fern::kUserInfoClientName, "com.vendra.sonex"}, {fern::kUserInfoServiceName, service}};
   }
 
   SXTestTempDir dir_;
@@ -89,6 +66,20 @@ TEST_F(SqliteFernReportingTest, BackendsComeFromTheConfigurationFile) {
   }
 }
 
+// Stores of the previous version had an index on messages(session_id) instead of session_refs.
+TEST_F(SqliteFernReportingTest, AnOldStoreGetsItsSessionReferencesFromItsMessages) {
+  SXTestExec(db_,
+             "CREATE TABLE messages(id INTEGER PRIMARY KEY, time REAL, session_id INTEGER, "
+             "session_info_json TEXT, user_info_json TEXT, category INTEGER, type INTEGER, "
+             "payload_json TEXT);"
+             "CREATE INDEX messages_session ON messages(session_id);"
+             "INSERT INTO messages(id, session_id) VALUES (1, 1), (2, 2), (3, 1), (4, NULL)");
+  Make();
+  EXPECT_EQ(SXTestQuery(db_, "SELECT session_id AS s, last_message_id AS m FROM session_refs"),
+            (std::vector<SXValue>{{{"s", 1}, {"m", 3}}, {{"s", 2}, {"m", 2}}}));
+  EXPECT_TRUE(SXTestQuery(db_, "SELECT 1 FROM sqlite_master WHERE type = 'index'").empty());
+}
+
 TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
   auto fern = Make();
   std::set<std::string> seen;
@@ -107,7 +98,7 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   constexpr int kPerSession = 150;
   std::vector<std::shared_ptr<FernReportingSession>> sessions;
   for (int i = 0; i < kSessions; ++i) {
-    sessions.push_back(fern->openSession(SessionInfo("t"), UserInfo("s"), {}));
+    sessions.push_back(fern->openSession({}, {}, {}));
     ASSERT_NE(sessions.back(), nullptr);
   }
   std::atomic<int> failures{0};
@@ -128,6 +119,11 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   }
   for (auto& sender : senders) sender.join();
   EXPECT_EQ(failures, 0);
+  // Each session's reference is its newest message, whoever committed the transaction.
+  EXPECT_EQ(SXTestQuery(db_,
+                        "SELECT session_id, last_message_id FROM session_refs EXCEPT "
+                        "SELECT session_id, MAX(id) FROM messages GROUP BY session_id"),
+            std::vector<SXValue>{});
   // Each session's rows are stored in the order it sent them.
   for (int s = 0; s < kSessions; ++s) {
     auto rows =
@@ -143,10 +139,16 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
 // (A configuration without backends completes with none: LifecycleEndToEnd.NoBackends...)
 TEST_F(SqliteFernReportingTest, SessionsConfigureOnAnotherThreadAndOutliveTheAdapter) {
   auto fern = Make();
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("telephony_session"), {});
+  auto session = fern->openSession({}, {}, {});
   ASSERT_NE(session, nullptr);
   fern.reset();
-  auto [backends, thread] = Configure(*session);
+  std::promise<std::pair<Backends, std::thread::id>> configured;
+  session->startConfiguration([&](Backends backends) {
+    configured.set_value({backends, std::this_thread::get_id()});
+  });
+  auto future = configured.get_future();
+  ASSERT_EQ(future.wait_for(20s), std::future_status::ready);
+  auto [backends, thread] = future.get();
   EXPECT_EQ(backends, (std::vector<std::string>{"spool"}));
   EXPECT_NE(thread, std::this_thread::get_id());
   std::optional<FernError> error;
@@ -155,46 +157,33 @@ TEST_F(SqliteFernReportingTest, SessionsConfigureOnAnotherThreadAndOutliveTheAda
   EXPECT_EQ(SXTestQuery(db_, "SELECT * FROM messages").size(), 1u);
 }
 
-TEST_F(SqliteFernReportingTest, AStoreThatCannotBeOpenedRefusesWithAReason) {
+// A store that cannot be opened, or one locked by another writer, refuses with a reason until
+// it can be written again.
+TEST_F(SqliteFernReportingTest, FailingStoresRefuseWithAReasonUntilTheyCanBeWritten) {
   db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
-  auto fern = Make();
+  auto fern = Make(20ms);
   EXPECT_TRUE(log_->contains("cannot open"));
-  EXPECT_EQ(fern->openSession(SessionInfo("t"), UserInfo("s"), {}), nullptr);
+  EXPECT_EQ(fern->openSession({}, {}, {}), nullptr);
   EXPECT_TRUE(log_->contains("cannot store the session"));
   std::optional<FernError> error;
   EXPECT_FALSE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
-  ASSERT_TRUE(error.has_value());
-  EXPECT_NE(error->localizedDescription.find("store.db"), std::string::npos)
-      << error->localizedDescription;
+  EXPECT_NE(error.value_or(FernError{}).localizedDescription.find("store.db"), std::string::npos);
 
-  // The store is opened again on the next call once it can be.
-  std::filesystem::create_directory(dir_.file("missing"));
-  error.reset();
-  EXPECT_TRUE(fern->sendOneMessage({}, {}, 1, 1, SXValue::object(), error));
-  EXPECT_EQ(SXTestQuery(db_, "SELECT * FROM messages").size(), 1u);
-}
-
-TEST_F(SqliteFernReportingTest, ALockedStoreFailsSendsAndFlushesUntilItIsFree) {
-  auto fern = Make(20ms);
-  auto session = fern->openSession(SessionInfo("t"), UserInfo("s"), {});
+  std::filesystem::create_directory(dir_.file("missing"));  // opened again on the next call
+  auto session = fern->openSession({}, {}, {});
   ASSERT_NE(session, nullptr);
-  std::optional<FernError> error;
   {
     SXTestWriteLock lock(db_);
+    error.reset();
     EXPECT_FALSE(session->sendMessage(1, 1, SXValue::object(), error));
-    ASSERT_TRUE(error.has_value());
-    EXPECT_NE(error->localizedDescription.find("database is locked"), std::string::npos)
-        << error->localizedDescription;
-    auto flushError = Flush(*session);
-    ASSERT_TRUE(flushError.has_value());
-    EXPECT_NE(flushError->localizedDescription.find("locked"), std::string::npos);
+    EXPECT_NE(error.value_or(FernError{}).localizedDescription.find("database is locked"),
+              std::string::npos);
+    EXPECT_NE(Flush(*session).value_or(FernError{}).localizedDescription.find("locked"),
+              std::string::npos);
   }
-  error.reset();
   EXPECT_TRUE(session->sendMessage(1, 2, SXValue::object(), error));
   EXPECT_EQ(Flush(*session), std::nullopt);
-  auto rows = SXTestQuery(db_, "SELECT type FROM messages");
-  ASSERT_EQ(rows.size(), 1u);
-  EXPECT_EQ(rows[0]["type"], 2);
+  EXPECT_EQ(SXTestQuery(db_, "SELECT type FROM messages"), (std::vector<SXValue>{{{"type", 2}}}));
 }
 
 }  // namespace

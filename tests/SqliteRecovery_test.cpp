@@ -30,6 +30,11 @@ std::vector<std::string> entries(const std::string& dir) {
   return names;
 }
 
+bool IsDamagedCopy(const std::string& name) {
+  return name.starts_with("store.db.damaged-") && !name.ends_with("-wal") &&
+         !name.ends_with("-shm");
+}
+
 // Sets or clears the immutable attribute; false where the file system or our privileges lack it.
 bool setImmutable(const std::string& path, bool on) {
   int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
@@ -45,21 +50,14 @@ bool setImmutable(const std::string& path, bool on) {
 // Makes a file this process cannot write, undone when it goes out of scope (the temporary
 // directory cannot be removed around an immutable file). Root writes any mode, so as root the
 // file is made immutable instead of read-only.
-class UnwritableFile {
- public:
-  explicit UnwritableFile(std::string path) : path_(std::move(path)) {
-    immutable_ = ::geteuid() == 0;
-    ok_ = immutable_ ? setImmutable(path_, true) : ::chmod(path_.c_str(), 0444) == 0;
+struct UnwritableFile {
+  explicit UnwritableFile(std::string file) : path(std::move(file)) {
+    ok = ::geteuid() == 0 ? setImmutable(path, true) : ::chmod(path.c_str(), 0444) == 0;
   }
-  ~UnwritableFile() {
-    if (ok_ && immutable_) setImmutable(path_, false);
-  }
-  bool ok() const { return ok_; }
+  ~UnwritableFile() { setImmutable(path, false); }
 
- private:
-  std::string path_;
-  bool immutable_ = false;
-  bool ok_ = false;
+  std::string path;
+  bool ok = false;
 };
 
 }  // namespace
@@ -99,7 +97,7 @@ TEST(SqliteRecovery, AStoreThisUserCannotWriteIsLeftInPlaceAndItsRowsCounted) {
   made->reset();  // closed before its mode changes
   for (const char* extra : {"-wal", "-shm"}) std::filesystem::remove(path + extra);
   UnwritableFile unwritable(path);
-  if (!unwritable.ok()) GTEST_SKIP() << "cannot make a file unwritable here";
+  if (!unwritable.ok) GTEST_SKIP() << "cannot make a file unwritable here";
 
   auto refused = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
   EXPECT_FALSE(refused.ok());
@@ -121,56 +119,34 @@ TEST(SqliteRecovery, AStoreThisUserCannotWriteIsLeftInPlaceAndItsRowsCounted) {
   EXPECT_EQ(entries(dir.file("")), std::vector<std::string>{"tallyvane.db"});
 }
 
-TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndReplaced) {
+// (On start-up, and a directory in a store's place: CrashSafetyEndToEnd.DamagedStoresAre...)
+TEST(SqliteRecovery, DamagedFilesAreMovedAsideWithTheirLogsAndHealthyOnesNeverAre) {
   SXTestTempDir dir;
   std::string path = dir.file("store.db");
-  std::ofstream(path, std::ios::binary) << std::string(4096, 'G');
-  std::ofstream(path + "-wal", std::ios::binary) << "stale log";
   std::string recovered;
-  auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
-  ASSERT_TRUE(db.ok()) << db.error();
-  EXPECT_NE(recovered.find("file is not a database"), std::string::npos) << recovered;
-
-  auto names = entries(dir.file(""));
-  auto aside = std::find_if(names.begin(), names.end(), [](const std::string& n) {
-    return n.rfind("store.db.damaged-", 0) == 0 && n.find("-wal") == std::string::npos;
-  });
-  ASSERT_NE(aside, names.end());
-  // The old log goes with its file (or SQLite drops it), never into the new store.
-  EXPECT_EQ(SXTestReadFile(path + "-wal").find("stale log"), std::string::npos);
-  EXPECT_NE(recovered.find(dir.file(*aside)), std::string::npos);
-
-  // A second damage the same second gets a name of its own.
-  db->reset();
-  std::filesystem::remove(path + "-wal");
-  std::filesystem::remove(path + "-shm");
-  std::ofstream(path, std::ios::binary | std::ios::trunc) << std::string(4096, 'H');
-  recovered.clear();
-  auto again = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
-  ASSERT_TRUE(again.ok()) << again.error();
-  EXPECT_FALSE(recovered.empty());
-  size_t moved = 0;
-  for (const auto& n : entries(dir.file(""))) {
-    moved += n.rfind("store.db.damaged-", 0) == 0 && n.find("-wal") == std::string::npos &&
-             n.find("-shm") == std::string::npos;
-  }
-  EXPECT_EQ(moved, 2u);
-}
-
-// (A missing directory just fails the open: SqliteTallyvaneTest.AStoreThatCannotBeOpened...)
-TEST(SqliteRecovery, AHealthyStoreOpensAsItIsEvenWhileLocked) {
-  SXTestTempDir dir;
-  std::string recovered;
-  std::string path = dir.file("store.db");
-  {
+  for (char fill : {'G', 'H'}) {  // a second damage the same second gets a name of its own
+    std::ofstream(path, std::ios::binary | std::ios::trunc) << std::string(4096, fill);
+    std::ofstream(path + "-wal", std::ios::binary | std::ios::trunc) << "stale log";
+    std::filesystem::remove(path + "-shm");
+    recovered.clear();
     auto db = SXSqliteConnection::openOrRecover(path, 1s, kSchema, recovered);
     ASSERT_TRUE(db.ok()) << db.error();
+    EXPECT_NE(recovered.find("file is not a database"), std::string::npos) << recovered;
+    // The old log goes with its file (or SQLite drops it), never into the new store.
+    EXPECT_EQ(SXTestReadFile(path + "-wal").find("stale log"), std::string::npos);
     ASSERT_TRUE((*db)->exec("INSERT INTO t VALUES (7)").ok());
   }
+  auto names = entries(dir.file(""));
+  EXPECT_EQ(std::count_if(names.begin(), names.end(), IsDamagedCopy), 2);
+
+  // A healthy store is never moved aside, even while another connection holds it locked. (A
+  // missing directory just fails the open: SqliteTallyvaneTest.FailuresDropEvents...)
   SXTestWriteLock lock(path);
-  auto db = SXSqliteConnection::openOrRecover(path, 100ms, kSchema, recovered);
+  const size_t files = entries(dir.file("")).size();
+  recovered.clear();
+  (void)SXSqliteConnection::openOrRecover(path, 100ms, kSchema, recovered);
   EXPECT_TRUE(recovered.empty()) << recovered;
-  EXPECT_EQ(entries(dir.file("")).size(), 3u);  // store.db, -wal, -shm
+  EXPECT_EQ(entries(dir.file("")).size(), files);
   EXPECT_EQ(SXTestQuery(path, "SELECT x FROM t").size(), 1u);
 }
 

@@ -26,7 +26,7 @@ SXPayloadProvider Returning(SXValue value) {
   return [value = std::move(value)] { return value; };
 }
 
-TEST_F(SqliteTallyvaneTest, PayloadsThatAreNotPlainJsonAreStillStored) {
+TEST_F(SqliteTallyvaneTest, PayloadsAreBuiltLaterOnTheWriterAndStoredEvenIfNotPlainJson) {
   SXSqliteTallyvane tallyvane(db_, log_);
   tallyvane.sendEventLazy("bad-utf8", Returning({{"s", std::string("a\xff"
                                                                    "b")}}));
@@ -42,9 +42,20 @@ TEST_F(SqliteTallyvaneTest, PayloadsThatAreNotPlainJsonAreStillStored) {
         return SXValue::object();
       },
       [] { return std::string(R"({"a":1})"); });
+  // The send returns before the provider runs, on another thread.
+  std::promise<void> sent;
+  std::thread::id ranOn;
+  EXPECT_TRUE(tallyvane.sendEventLazy("lazy", [&, sent = sent.get_future().share()] {
+    // Called on our own thread this would wait in vain; the wait is bounded so a fault fails.
+    EXPECT_EQ(sent.wait_for(10s), std::future_status::ready);
+    ranOn = std::this_thread::get_id();
+    return SXValue::object();
+  }));
+  sent.set_value();
   tallyvane.flush();
+  EXPECT_NE(ranOn, std::this_thread::get_id());
   auto rows = SXTestQuery(db_, "SELECT name, payload_json FROM events ORDER BY id");
-  ASSERT_EQ(rows.size(), 4u);
+  ASSERT_EQ(rows.size(), 5u);
   EXPECT_EQ(rows[0]["payload_json"],
             "{\"s\":\"a\xEF\xBF\xBD"
             "b\"}");
@@ -56,50 +67,28 @@ TEST_F(SqliteTallyvaneTest, PayloadsThatAreNotPlainJsonAreStillStored) {
   EXPECT_TRUE(log_->contains("boom"));
 }
 
-TEST_F(SqliteTallyvaneTest, LazySendReturnsBeforeTheProviderRunsOnAnotherThread) {
-  SXSqliteTallyvane tallyvane(db_, log_);
-  std::promise<void> sent;
-  std::shared_future<void> sentFuture = sent.get_future().share();
-  std::promise<std::pair<bool, std::thread::id>> ran;
-  auto ranFuture = ran.get_future();
-  bool accepted = tallyvane.sendEventLazy("lazy", [&, sentFuture] {
-    // Called on our own thread this would wait in vain; the wait is bounded so a fault fails.
-    bool sendReturnedFirst = sentFuture.wait_for(10s) == std::future_status::ready;
-    ran.set_value({sendReturnedFirst, std::this_thread::get_id()});
-    return SXValue{{"k", 1}};
-  });
-  sent.set_value();
-  EXPECT_TRUE(accepted);
-  ASSERT_EQ(ranFuture.wait_for(20s), std::future_status::ready);
-  auto [sendReturnedFirst, thread] = ranFuture.get();
-  EXPECT_TRUE(sendReturnedFirst);
-  EXPECT_NE(thread, std::this_thread::get_id());
-  tallyvane.flush();
-  EXPECT_EQ(SXSqliteTallyvane::readEvents(db_, "lazy", 0).size(), 1u);
-}
-
-TEST_F(SqliteTallyvaneTest, AStoreThatCannotBeOpenedLogsAndDropsEvents) {
-  db_ = dir_.file("missing/store.db");  // its directory is missing: nothing to move aside
-  SXSqliteTallyvane tallyvane(db_, log_);
-  EXPECT_TRUE(log_->contains("cannot open"));
-  EXPECT_TRUE(tallyvane.sendEventLazy("lost", Returning(1)));
-  tallyvane.flush();
-  EXPECT_TRUE(log_->contains("dropped 1 events"));
-  for (const auto& line : log_->lines()) EXPECT_EQ(line.level, SXLogLevel::kError);
-}
-
-TEST_F(SqliteTallyvaneTest, AFailedWriteDropsItsBatchAndLaterEventsAreWritten) {
+// A store that cannot be opened, or a write that fails, drops events with an error; events
+// sent later are written.
+TEST_F(SqliteTallyvaneTest, FailuresDropEventsWithAnErrorAndLaterEventsAreWritten) {
+  {
+    SXSqliteTallyvane lost(dir_.file("missing/store.db"), log_);  // nothing to move aside
+    EXPECT_TRUE(log_->contains("cannot open"));
+    EXPECT_TRUE(lost.sendEventLazy("lost", Returning(1)));
+    lost.flush();
+    EXPECT_TRUE(log_->contains("dropped 1 events"));
+  }
   SXSqliteTallyvane tallyvane(db_, log_, 20ms);
   tallyvane.sendEventLazy("before", Returning(1));
   tallyvane.flush();
+  const size_t before = log_->lines().size();
   {
     SXTestWriteLock lock(db_);
     tallyvane.sendEventLazy("while-locked", Returning(2));
     tallyvane.flush();
   }
-  ASSERT_EQ(log_->lines().size(), 1u);
-  EXPECT_TRUE(log_->contains("dropped 1 events"));
+  ASSERT_EQ(log_->lines().size(), before + 1);
   EXPECT_TRUE(log_->contains("database is locked"));
+  for (const auto& line : log_->lines()) EXPECT_EQ(line.level, SXLogLevel::kError);
   tallyvane.sendEventLazy("after", Returning(3));
   tallyvane.flush();
   auto rows = SXSqliteTallyvane::readEvents(db_, std::nullopt, 0);

@@ -56,4 +56,3 @@ TEST(StderrLog, OutputSuitsWhatStderrIs) {
   ::unsetenv("JOURNAL_STREAM");
   for (int fd : {pipeFds[0], pipeFds[1], terminal, follower}) ::close(fd);
 }
-

@@ -30,7 +30,7 @@ TestDaemon::Options Exporting(const OtlpReceiver& receiver, const char* encoding
 std::map<int64_t, int> Deliveries(const OtlpReceiver& receiver) {
   std::map<int64_t, int> deliveries;
   for (const SXValue& record : receiver.acceptedRecords()) {
-    ++deliveries[OtlpReceiver::intAttribute(record, "sxr.message.id").value_or(-1)];
+    ++deliveries[std::stoll(record["attrs"].value("sxr.message.id", "-1"))];
   }
   return deliveries;
 }
@@ -97,15 +97,16 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
 
   std::map<std::string, SXValue> byKind;  // "<kind> <category>" -> record
   for (const SXValue& record : receiver.acceptedRecords()) {
-    byKind[OtlpReceiver::stringAttribute(record, "sxr.message.kind") + " " +
-           std::to_string(*OtlpReceiver::intAttribute(record, "sxr.category"))] = record;
+    const SXValue& attrs = record["attrs"];
+    byKind[attrs.value("sxr.message.kind", "") + " " + attrs.value("sxr.category", "")] = record;
   }
   ASSERT_TRUE(byKind.count("session 3")) << receiver.acceptedRecords().size();
   const SXValue& inSession = byKind["session 3"];
-  EXPECT_EQ(OtlpReceiver::intAttribute(inSession, "sxr.reporter_id"), 42);
-  EXPECT_EQ(OtlpReceiver::stringAttribute(inSession, "sxr.service_name"), "telephony_session");
-  EXPECT_EQ(OtlpReceiver::intAttribute(inSession, "sxr.type"), 1);
-  EXPECT_FALSE(OtlpReceiver::stringAttribute(inSession, "sxr.session.token").empty());
+  const SXValue& attrs = inSession["attrs"];
+  EXPECT_EQ(attrs["sxr.reporter_id"], "42");
+  EXPECT_EQ(attrs["sxr.service_name"], "telephony_session");
+  EXPECT_EQ(attrs["sxr.type"], "1");
+  EXPECT_NE(attrs.value("sxr.session.token", ""), "");
   EXPECT_EQ(inSession["severityText"], "INFO");
   // The record's time is the message's, stored by the spool; the observed time is the export's.
   auto nanos = [](const SXValue& text) { return std::stod(text.get<std::string>()); };
@@ -119,8 +120,8 @@ TEST(OtlpExportEndToEnd, SessionAndStandaloneMessagesArriveAsLogRecords) {
             (SXValue{{"key", "peak_level"}, {"value", {{"intValue", "3"}}}}));
   EXPECT_TRUE(byKind.count("session 65535"));  // the summary
   ASSERT_TRUE(byKind.count("standalone 3"));
-  EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.service_name"), "unknown");
-  EXPECT_EQ(OtlpReceiver::stringAttribute(byKind["standalone 3"], "sxr.session.token"), "");
+  EXPECT_EQ(byKind["standalone 3"]["attrs"]["sxr.service_name"], "unknown");
+  EXPECT_EQ(byKind["standalone 3"]["attrs"].value("sxr.session.token", ""), "");
   EXPECT_TRUE(daemon.waitForLog("exporting spooled messages to " + receiver.endpoint()));
 }
 

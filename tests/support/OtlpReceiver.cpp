@@ -3,25 +3,12 @@
 #include <google/protobuf/util/json_util.h>
 #include <zlib.h>
 
-#include <algorithm>
 #include <cctype>
 #include <sstream>
 
 #include "opentelemetry/proto/collector/logs/v1/logs_service.pb.h"
 
 namespace {
-
-std::string Lower(std::string text) {
-  std::transform(text.begin(), text.end(), text.begin(),
-                 [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-  return text;
-}
-
-std::string Trim(const std::string& text) {
-  size_t first = text.find_first_not_of(" \t\r");
-  size_t last = text.find_last_not_of(" \t\r");
-  return first == std::string::npos ? "" : text.substr(first, last - first + 1);
-}
 
 // The headers of `head` (everything up to the blank line); the request line says nothing the
 // tests ask about.
@@ -33,7 +20,11 @@ OtlpReceiver::Request ParseHead(const std::string& head) {
   while (std::getline(lines, line)) {
     size_t colon = line.find(':');
     if (colon == std::string::npos) continue;
-    request.headers[Lower(Trim(line.substr(0, colon)))] = Trim(line.substr(colon + 1));
+    std::string name = line.substr(0, colon);
+    for (char& c : name) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    size_t value = line.find_first_not_of(' ', colon + 1);
+    request.headers[name] =
+        value == std::string::npos ? "" : line.substr(value, line.size() - 1 - value);
   }
   return request;
 }
@@ -123,12 +114,6 @@ class OtlpReceiver::Connection : public std::enable_shared_from_this<Connection>
 };
 
 OtlpReceiver::OtlpReceiver() {
-  asio::ip::tcp::endpoint endpoint(asio::ip::make_address("127.0.0.1"), 0);
-  acceptor_.open(endpoint.protocol());
-  acceptor_.set_option(asio::ip::tcp::acceptor::reuse_address(true));
-  acceptor_.bind(endpoint);
-  acceptor_.listen();
-  port_ = acceptor_.local_endpoint().port();
   accept();
   thread_ = std::thread([this] { io_.run(); });
 }
@@ -139,7 +124,7 @@ OtlpReceiver::~OtlpReceiver() {
 }
 
 std::string OtlpReceiver::endpoint() const {
-  return "http://127.0.0.1:" + std::to_string(port_) + "/v1/logs";
+  return "http://127.0.0.1:" + std::to_string(acceptor_.local_endpoint().port()) + "/v1/logs";
 }
 
 void OtlpReceiver::accept() {
@@ -180,8 +165,6 @@ void OtlpReceiver::answerAfter(std::chrono::milliseconds delay) {
   delay_ = delay;
 }
 
-void OtlpReceiver::dropNext(size_t count) { failNext(count, 0); }
-
 std::vector<OtlpReceiver::Request> OtlpReceiver::requests() const {
   SXMutexLock lock(mutex_);
   return requests_;
@@ -195,8 +178,13 @@ std::vector<SXValue> OtlpReceiver::acceptedRecords() const {
     if (!body.is_object()) continue;
     for (const SXValue& resource : body.value("resourceLogs", SXValue::array())) {
       for (const SXValue& scope : resource.value("scopeLogs", SXValue::array())) {
-        for (const SXValue& record : scope.value("logRecords", SXValue::array())) {
-          records.push_back(record);
+        for (SXValue record : scope.value("logRecords", SXValue::array())) {
+          record["attrs"] = SXValue::object();
+          for (const SXValue& attribute : record.value("attributes", SXValue::array())) {
+            const SXValue value = attribute.value("value", SXValue::object());
+            if (!value.empty()) record["attrs"][attribute.value("key", "")] = value.begin().value();
+          }
+          records.push_back(std::move(record));
         }
       }
     }
@@ -216,32 +204,4 @@ SXValue OtlpReceiver::json(const Request& request) {
     return SXValue(SXValue::value_t::discarded);
   }
   return SXValue::parse(text, nullptr, false);
-}
-
-namespace {
-
-const SXValue* AttributeValue(const SXValue& record, const std::string& key) {
-  auto attributes = record.find("attributes");
-  if (attributes == record.end() || !attributes->is_array()) return nullptr;
-  for (const SXValue& attribute : *attributes) {
-    if (attribute.value("key", "") == key && attribute.contains("value")) {
-      return &attribute["value"];
-    }
-  }
-  return nullptr;
-}
-
-}  // namespace
-
-std::optional<int64_t> OtlpReceiver::intAttribute(const SXValue& record, const std::string& key) {
-  // Both the exporter and protobuf's JSON mapping write 64-bit integers as strings.
-  const SXValue* value = AttributeValue(record, key);
-  if (!value || !value->contains("intValue")) return std::nullopt;
-  return std::strtoll((*value)["intValue"].get<std::string>().c_str(), nullptr, 10);
-}
-
-std::string OtlpReceiver::stringAttribute(const SXValue& record, const std::string& key) {
-  const SXValue* value = AttributeValue(record, key);
-  if (!value || !value->contains("stringValue")) return "";
-  return (*value)["stringValue"].get<std::string>();
 }

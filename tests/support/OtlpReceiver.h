@@ -10,10 +10,7 @@
 
 #include <asio.hpp>
 #include <chrono>
-#include <cstdint>
 #include <map>
-#include <mutex>
-#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -37,24 +34,20 @@ class OtlpReceiver {
   // "http://127.0.0.1:<port>/v1/logs"
   std::string endpoint() const;
 
-  // The next `count` requests are answered with `status` instead of 200, with a Retry-After
-  // header when `retryAfter` is not empty.
+  // The next `count` requests are answered with `status` instead of 200 (and a Retry-After
+  // header when `retryAfter` is not empty), or with their connection closed (dropNext).
   void failNext(size_t count, int status, std::string retryAfter = "");
+  void dropNext(size_t count) { failNext(count, 0); }
   // Every answer from now on comes `delay` after its request.
   void answerAfter(std::chrono::milliseconds delay);
-  // The next `count` requests are read and then their connection is closed, unanswered.
-  void dropNext(size_t count);
 
   std::vector<Request> requests() const;
   // The log records of the requests answered 2xx, in the order they came (whether or not the
-  // answer reached the client in time).
+  // answer reached the client in time), each with its attributes also under "attrs" as
+  // key: value ({"sxr.message.id": "5"}: 64-bit integers are strings in OTLP JSON).
   std::vector<SXValue> acceptedRecords() const;
   // The body of `request` as OTLP JSON, protobuf bodies converted; discarded when unreadable.
   static SXValue json(const Request& request);
-
-  // The int attribute `key` of a log record (e.g. "sxr.message.id"); none when absent.
-  static std::optional<int64_t> intAttribute(const SXValue& record, const std::string& key);
-  static std::string stringAttribute(const SXValue& record, const std::string& key);
 
  private:
   class Connection;
@@ -70,8 +63,7 @@ class OtlpReceiver {
   Answer judge(Request request);
 
   asio::io_context io_;
-  asio::ip::tcp::acceptor acceptor_{io_};
-  uint16_t port_ = 0;
+  asio::ip::tcp::acceptor acceptor_{io_, {asio::ip::make_address("127.0.0.1"), 0}};
   mutable SXMutex mutex_;
   std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
   size_t faultsLeft_ SX_GUARDED_BY(mutex_) = 0;

@@ -56,6 +56,14 @@ inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::st
   return rows;
 }
 
+// Runs `sql` through a connection of its own.
+inline void SXTestExec(const std::string& dbPath, const std::string& sql) {
+  auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadWrite,
+                                     std::chrono::seconds(5), "");
+  SXStatus failed = db.ok() ? (*db)->exec(sql) : db.status();
+  if (!failed.ok()) ADD_FAILURE() << failed.error();
+}
+
 // Holds the write lock of a database until destroyed, as another process's writer would.
 class SXTestWriteLock {
  public:
