@@ -11,7 +11,6 @@
 #include "support/FakeService.h"
 
 using namespace sxr::method;
-using Kind = FakeFernReporting::Event::Kind;
 
 TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing) {
   FakeService s({.maxSessionsPerClient = 2, .maxSessions = 3});
@@ -73,7 +72,7 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
     EXPECT_EQ(environment->counters().droppedBy(c.guardrail), 5 - c.kept);
     EXPECT_EQ(t.log->countContaining("aggregate of reporter 42 is full"), 1u);
     t.drain();
-    EXPECT_EQ(t.fern->events(Kind::kMessage).size(), 5u);
+    EXPECT_EQ(t.fern->count("messages"), 5);
 
     auto summary = session->createSummaryEventForSession();
     ASSERT_TRUE(summary);
@@ -97,7 +96,7 @@ TEST(SXReportingLimitsAggregate, NeverStartedSessionsAreCappedToo) {
   for (int i = 0; i < 4; ++i) session->sendMessage({{"i", i}}, 3, 1, nullptr);
   EXPECT_EQ(session->aggregatedPayloadEntries().size(), 2u);
   t.drain();
-  EXPECT_EQ(t.fern->events(Kind::kSingleMessage).size(), 4u);
+  EXPECT_EQ(t.fern->count("messages WHERE session_id IS NULL"), 4);
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kAggregateEntries), 2u);
 }
 
@@ -114,7 +113,7 @@ TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
   using std::chrono::seconds;
   EXPECT_EQ(t.dispatch->delays(),
             (std::vector<std::chrono::nanoseconds>{seconds(59), seconds(59)}));
-  EXPECT_EQ(t.fern->events(Kind::kSingleMessage).size(), 2u);
+  EXPECT_EQ(t.fern->count("messages WHERE session_id IS NULL"), 2);
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kStandalonePending), 2u);
   EXPECT_EQ(t.log->countContaining("(--max-pending-standalone-bytes 8)"), 1u);
   EXPECT_EQ(budget->pending(), 0u);  // every slot came back once its send ran
@@ -182,10 +181,10 @@ TEST(SXReportingLimitsRequests, OversizedRequestsAreRefusedAndRepeatedIDsDeliver
     EXPECT_NE(error.get<std::string>().find(k.error), std::string::npos) << error;
     EXPECT_EQ(s.dropped(k.guardrail), 1u) << k.guardrail;
   }
-  EXPECT_TRUE(s.t.fern->events(Kind::kMessage).empty());
+  EXPECT_EQ(s.t.fern->count("messages"), 0);
   EXPECT_EQ(s.call(*c, kSendMessage, {{{"k", 1}}, 3, 1, {7, 7, 7}}), nullptr);
   s.t.drain();
-  EXPECT_EQ(s.t.fern->events(Kind::kMessage).size(), 1u);
+  EXPECT_EQ(s.t.fern->count("messages"), 1);
   EXPECT_EQ(s.t.tallyvane->eventCount(), 1u);
 }
 

@@ -2,14 +2,15 @@
 
 #include <gtest/gtest.h>
 
+#include <thread>
+
 #include "Statistics/SXReportingUtility.h"
 #include "linux/AsioDispatch.h"
 #include "linux/SystemRandom.h"
+#include "sqlite/SqliteFernReporting.h"
 #include "support/TestEnvironment.h"
 
 namespace {
-
-using Kind = FakeFernReporting::Event::Kind;
 
 std::shared_ptr<SXReportingSession> makeSession(TestEnvironment& t, int64_t id = 42,
                                                 SXReportingServiceType type = 7) {
@@ -84,9 +85,7 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   EXPECT_EQ(entries[0],
             (SXValue{{"Playback_Start_3", {{"peak_level", 1}, {"route", "a b"}, {"a_b", 2}}}}));
   t.drain();
-  auto sent = t.fern->events(Kind::kMessage);
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0].payload, entries[0]["Playback_Start_3"]);
+  EXPECT_EQ(t.fern->payloads(), std::vector<SXValue>{entries[0]["Playback_Start_3"]});
   // The stored text is made without the rewritten copy, from the dictionary or from the
   // caller's own text: same members, same order.
   for (const SXValue& spaced :
@@ -124,13 +123,17 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarms) {
 
 TEST(SXReportingSessionMessages, StandaloneFailureReachesTheReply) {
   TestEnvironment t;
-  t.fern->setSingleMessageFailure({true, FernError{"spool full"}});
+  SXPlatform platform = t.platform();
+  // A spool whose directory is missing fails every store.
+  platform.fernReporting =
+      std::make_shared<SXSqliteFernReporting>(t.directory + "/absent/fern.db", "", nullptr);
   std::optional<FernError> got;
-  SXReportingSession::sendSingleMessage(t.environment, SXValue::object(), 1, 1, 2, nullptr,
-                                        [&](std::optional<FernError> e) { got = e; });
+  SXReportingSession::sendSingleMessage(t.makeEnvironment({}, platform), SXValue::object(), 1, 1, 2,
+                                        nullptr, [&](std::optional<FernError> e) { got = e; });
   t.drain();
   ASSERT_TRUE(got);
-  EXPECT_EQ(got->localizedDescription, "spool full");
+  EXPECT_TRUE(got->localizedDescription.starts_with("cannot store the message"))
+      << got->localizedDescription;
 }
 
 TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThenFlush) {
@@ -147,20 +150,20 @@ TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThen
   EXPECT_FALSE(session->started());
   EXPECT_FALSE(session->aggregatedPayloadData());
   t.drain();
-  ASSERT_TRUE(t.fern->waitFor(
-      [](const auto& events) { return !events.empty() && events.back().kind == Kind::kFlush; },
-      std::chrono::seconds(5)));
 
-  std::vector<Kind> kinds;
-  for (const auto& e : t.fern->events()) kinds.push_back(e.kind);
-  EXPECT_EQ(kinds, (std::vector<Kind>{Kind::kToken, Kind::kOpen, Kind::kStartConfiguration,
-                                      Kind::kMessage, Kind::kMessage, Kind::kFlush}));
-  auto open = t.fern->events(Kind::kOpen)[0];
-  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoClientType], 19);
-  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoSessionID], 42);
-  EXPECT_EQ(open.sessionInfo[fern::kSessionInfoBatchEvent], true);
-  EXPECT_EQ(open.userInfo[fern::kUserInfoServiceName], "telephony_session");
-  EXPECT_EQ(open.userInfo["HostApplicationDisplayID"], "phone");
+  auto opened =
+      t.fern->rows("SELECT session_info_json AS s, user_info_json AS u, token FROM sessions");
+  ASSERT_EQ(opened.size(), 1u);
+  EXPECT_TRUE(opened[0]["token"].is_string());
+  SXValue info = SXValue::parse(opened[0]["s"].get<std::string>());
+  EXPECT_EQ(info[fern::kSessionInfoClientType], 19);
+  EXPECT_EQ(info[fern::kSessionInfoSessionID], 42);
+  EXPECT_EQ(info[fern::kSessionInfoBatchEvent], true);
+  SXValue user = SXValue::parse(opened[0]["u"].get<std::string>());
+  EXPECT_EQ(user[fern::kUserInfoServiceName], "telephony_session");
+  EXPECT_EQ(user["HostApplicationDisplayID"], "phone");
+  EXPECT_EQ(t.fern->payloads("session_id = 1").size(), 2u);  // the message and the summary
+  EXPECT_EQ(t.fern->count("flushes WHERE session_id = 1"), 1);
 }
 
 TEST(SXReportingSessionLifecycle, TestSessionsNeverTalkToTheServer) {
@@ -170,7 +173,7 @@ TEST(SXReportingSessionLifecycle, TestSessionsNeverTalkToTheServer) {
   session->sendMessage({{"k", 1}}, 3, 1, nullptr);
   session->stop();
   t.drain();
-  EXPECT_TRUE(t.fern->events().empty());
+  EXPECT_EQ(t.fern->count("sessions") + t.fern->count("messages"), 0);
   EXPECT_FALSE(session->fernReportingAgentToken());
 }
 
@@ -186,7 +189,7 @@ TEST(SXReportingSessionLifecycle, SecondStartKeepsEverythingAndRestartContinuesN
   session->sendMessage({{"k", 1}}, 3, 1, nullptr);
   EXPECT_TRUE(session->aggregatedPayloadEntries()[0].contains("Playback_Start_2"));
   t.drain();
-  EXPECT_EQ(t.fern->events(Kind::kToken).size(), 2u);
+  EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
 }
 
 TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAndStop) {
@@ -203,26 +206,21 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
   session->sendMessage({{"n", 4}}, 3, 1, nullptr);
   session->stop();
   t.drain();
-  ASSERT_TRUE(t.fern->waitFor(
-      [](const auto& events) {
-        auto count = [&](Kind kind) {
-          return std::count_if(events.begin(), events.end(),
-                               [&](const auto& e) { return e.kind == kind; });
-        };
-        return count(Kind::kFlush) == 2 && count(Kind::kSingleMessage) == 2;
-      },
-      std::chrono::seconds(5)))
-      << SXValue(t.log->messages()).dump(1);
 
   // Each run of messages reached the session that was open when it was accepted, in order,
   // its summary last, and each session's flush follows its own messages.
-  std::vector<std::string> order;  // "message 1": a message of the first server session
-  for (const auto& e : t.fern->events()) {
-    if (e.kind == Kind::kMessage) order.push_back("message " + std::to_string(e.session));
-    if (e.kind == Kind::kFlush) order.push_back("flush " + std::to_string(e.session));
-  }
-  EXPECT_EQ(order, (std::vector<std::string>{"message 1", "message 1", "message 1", "flush 1",
-                                             "message 2", "message 2", "flush 2"}));
+  EXPECT_EQ(t.fern->payloads("session_id IS NULL"), (std::vector<SXValue>{{{"n", 0}}, {{"n", 3}}}));
+  auto first = t.fern->payloads("session_id = 1");
+  ASSERT_EQ(first.size(), 3u);
+  EXPECT_EQ(first[1], (SXValue{{"n_2", 2}}));
+  EXPECT_TRUE(first[2].contains("SX_Session_Summary_Event"));
+  auto second = t.fern->payloads("session_id = 2");
+  ASSERT_EQ(second.size(), 2u);
+  EXPECT_EQ(second[0], (SXValue{{"n", 4}}));
+  EXPECT_EQ(t.fern->count("flushes f JOIN messages m ON m.session_id = f.session_id "
+                          "WHERE m.time > f.time"),
+            0);
+  EXPECT_EQ(t.fern->count("flushes"), 2);
 }
 
 TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
@@ -298,15 +296,14 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
   platform.dispatch = dispatch;
   auto environment = std::make_shared<SXReportingEnvironment>(platform);
   environment->setBackendWaitSeconds(30);
-  t.fern->setConfigurationDelivery(FakeFernReporting::Delivery::kNever);
-  // Events of one kind, of one session (0: of all); `waitFor` hands its predicate the events.
-  using Events = std::vector<FakeFernReporting::Event>;
-  auto count = [](const Events& events, Kind kind, int session = 0) {
-    return std::count_if(events.begin(), events.end(), [&](const auto& e) {
-      return e.kind == kind && (session == 0 || e.session == session);
-    });
+  t.fern->holdConfigurations(true);
+  // Polls the spool until `from` holds `rows` rows.
+  auto eventually = [&](const std::string& from, int64_t rows) {
+    for (int i = 0; i < 1000 && t.fern->count(from) != rows; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return t.fern->count(from) == rows;
   };
-  auto eventually = [&](auto done) { return t.fern->waitFor(done, std::chrono::seconds(10)); };
 
   // More sessions wait at once than the pool has threads.
   constexpr int kWaiting = 400;
@@ -320,23 +317,23 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
 
   // One more, whose backends come at once: its send and its stop's flush go through while
   // every other session still waits.
-  t.fern->setConfigurationDelivery(FakeFernReporting::Delivery::kInline);
+  t.fern->holdConfigurations(false);
   auto last = SXReportingSession::initWithID(environment, kWaiting + 1, SXValue::array());
   last->start();
   last->sendMessage({{"k", 0}}, 3, 1, nullptr);
   last->stop();
-  EXPECT_TRUE(eventually([&](const Events& e) { return count(e, Kind::kFlush, kWaiting + 1); }));
-  const Events before = t.fern->events();
-  EXPECT_GE(count(before, Kind::kMessage, kWaiting + 1), 1);
-  EXPECT_EQ(count(before, Kind::kMessage), count(before, Kind::kMessage, kWaiting + 1));
+  const std::string others =
+      "messages WHERE session_id NOT IN (SELECT id FROM sessions WHERE "
+      "json_extract(session_info_json, '$.SessionID') = 401)";
+  EXPECT_TRUE(eventually("flushes", 1));
+  EXPECT_EQ(t.fern->count("messages"), 2);  // its message and its summary
+  EXPECT_EQ(t.fern->count(others), 0);
 
   // The waits end with their backends; what waited behind them follows.
   t.fern->deliverHeld();
-  EXPECT_TRUE(eventually([&](const Events& e) {
-    return count(e, Kind::kMessage) == count(e, Kind::kMessage, kWaiting + 1) + kWaiting;
-  }));
+  EXPECT_TRUE(eventually(others, kWaiting));
   for (auto& session : sessions) session->stop();
-  EXPECT_TRUE(eventually([&](const Events& e) { return count(e, Kind::kFlush) == kWaiting + 1; }));
+  EXPECT_TRUE(eventually("flushes", kWaiting + 1));
   EXPECT_EQ(t.log->count("continuing"), size_t(kWaiting));
   EXPECT_EQ(t.log->count("failed to find backend"), 0u);
 }

@@ -48,7 +48,7 @@ SXPlatform TestEnvironment::platform() const {
           .tallyvane = tallyvane,
           .joulebook = joulebook,
           .fernReporting = fern,
-          .kestrel = kestrel,
+          .kestrel = nullptr,  // no driver counters: sessions subscribe to nothing
           .orientation = orientation,
           .preferences = preferences,
           .notifications = notifications,
