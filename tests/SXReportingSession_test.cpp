@@ -105,7 +105,7 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   }
 }
 
-TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarms) {
+TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarmsAndFailureReachesTheReply) {
   TestEnvironment t;
   makeSession(t);  // registers the session scope, whose verbose lines we read
   for (SXReportingServiceType type : {0, 2, 5, 65535, 4}) {
@@ -119,12 +119,9 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarms) {
 
   SXSystemRandom random;
   for (int i = 0; i < 2000; ++i) EXPECT_LT(random.uniform(60), 60u);
-}
 
-TEST(SXReportingSessionMessages, StandaloneFailureReachesTheReply) {
-  TestEnvironment t;
+  // A spool whose directory is missing fails every store: the reply says so.
   SXPlatform platform = t.platform();
-  // A spool whose directory is missing fails every store.
   platform.fernReporting =
       std::make_shared<SXSqliteFernReporting>(t.directory + "/absent/fern.db", "", nullptr);
   std::optional<FernError> got;
@@ -172,21 +169,6 @@ TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThen
   EXPECT_FALSE(testSession->fernReportingAgentToken());
 }
 
-TEST(SXReportingSessionLifecycle, SecondStartKeepsEverythingAndRestartContinuesNumbering) {
-  TestEnvironment t;
-  auto session = makeSession(t);
-  session->start();
-  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
-  session->start();
-  EXPECT_EQ(session->aggregatedPayloadEntries().size(), 1u);
-  session->stop();
-  session->start();
-  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
-  EXPECT_TRUE(session->aggregatedPayloadEntries()[0].contains("Playback_Start_2"));
-  t.drain();
-  EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
-}
-
 TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAndStop) {
   TestEnvironment t;
   auto session = makeSession(t);
@@ -194,11 +176,15 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
   session->sendMessage({{"n", 0}}, 3, 1, nullptr);  // not started: standalone
   session->start();
   session->sendMessage({{"n", 1}}, 3, 1, nullptr);
+  session->start();  // a second start keeps everything
   session->sendMessage({{"n 2", 2}}, 3, 1, nullptr);
+  EXPECT_EQ(session->aggregatedPayloadEntries().size(), 2u);
   session->stop();
   session->sendMessage({{"n", 3}}, 3, 1, nullptr);  // stopped: standalone
   session->start();
   session->sendMessage({{"n", 4}}, 3, 1, nullptr);
+  // Numbering goes on through the restart: the fifth message of its kind.
+  EXPECT_TRUE(session->aggregatedPayloadEntries()[0].contains("Playback_Start_5"));
   session->stop();
   t.drain();
 
@@ -216,6 +202,7 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
                           "WHERE m.time > f.time"),
             0);
   EXPECT_EQ(t.fern->count("flushes"), 2);
+  EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
 }
 
 TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
