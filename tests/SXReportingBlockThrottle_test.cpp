@@ -45,11 +45,8 @@ struct Rig {
   }
 
   void add(int id, const SXValue& payload, int64_t reporterID = 42) {
-    throttle->addMessageBlock(
-        [this, id] {
-          sends.push_back({id, now()});
-        },
-        reporterID, payload, kPlayback, kStart);
+    auto send = [this, id] { sends.push_back({id, now()}); };
+    throttle->addMessageBlock(send, reporterID, payload, kPlayback, kStart);
   }
   double now() const { return SXSecondsBetween(start, clock->now()); }
   void advance(double seconds) {

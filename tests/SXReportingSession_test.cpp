@@ -72,7 +72,9 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   }
   EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
 
+  EXPECT_FALSE(session->createSummaryEventForSession());  // creation-time aggregate is empty
   session->start();
+  EXPECT_FALSE(session->createSummaryEventForSession());
   SXValue payload = {{"peak level", 1}, {"route", "a b"}, {"a b", 1}, {"a_b", 2}};
   int replies = 0;
   session->sendMessage(payload, 3, 1, [&](std::optional<FernError> error) {
@@ -86,6 +88,13 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
             (SXValue{{"Playback_Start_3", {{"peak_level", 1}, {"route", "a b"}, {"a_b", 2}}}}));
   t.drain();
   EXPECT_EQ(t.fern->payloads(), std::vector<SXValue>{entries[0]["Playback_Start_3"]});
+  EXPECT_EQ(session->createSummaryEventForSession(),
+            (SXValue{{"SX_Session_Summary_Event", "7"},
+                     {"Playback_Start_3", R"({"a_b":2,"peak_level":1,"route":"a b"})"}}));
+  // Not an internal build: no file, but the configuration now heads the aggregate.
+  EXPECT_TRUE(t.fileSystem->files.empty());
+  EXPECT_TRUE(t.fileSystem->directories.empty());
+  EXPECT_EQ(session->aggregatedPayloadEntries()[0], SXValue::object());
   // The stored text is made without the rewritten copy, from the dictionary or from the
   // caller's own text: same members, same order.
   for (const SXValue& spaced :
@@ -203,25 +212,6 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
             0);
   EXPECT_EQ(t.fern->count("flushes"), 2);
   EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
-}
-
-TEST(SXReportingSessionSummary, KeysValuesAndNothingWhenEmpty) {
-  TestEnvironment t;
-  auto session = makeSession(t);
-  EXPECT_FALSE(session->createSummaryEventForSession());  // creation-time aggregate is empty
-  session->start();
-  EXPECT_FALSE(session->createSummaryEventForSession());
-  session->sendMessage({{"a", 1}}, 3, 1, nullptr);
-  session->sendMessage({{"b", "x"}}, 3, 1, nullptr);
-  auto event = session->createSummaryEventForSession();
-  ASSERT_TRUE(event);
-  EXPECT_EQ(*event, (SXValue{{"SX_Session_Summary_Event", "7"},
-                             {"Playback_Start_1", R"({"a":1})"},
-                             {"Playback_Start_2", R"({"b":"x"})"}}));
-  // Not an internal build: no file, but the configuration now heads the aggregate.
-  EXPECT_TRUE(t.fileSystem->files.empty());
-  EXPECT_TRUE(t.fileSystem->directories.empty());
-  EXPECT_EQ(session->aggregatedPayloadEntries()[0], SXValue::object());
 }
 
 TEST(SXReportingSessionOrientation, WhoTracks) {

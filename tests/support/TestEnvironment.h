@@ -18,6 +18,7 @@
 #include "platform/Notify.h"
 #include "platform/Random.h"
 #include "platform/Trace.h"
+#include "support/SqliteTestSupport.h"
 
 // Always draws the same number (below its bound).
 class FixedRandom final : public SXRandom {
@@ -60,7 +61,8 @@ struct TestEnvironment {
   std::shared_ptr<FakeJoulebook> joulebook = std::make_shared<FakeJoulebook>();
   std::shared_ptr<FakeFernReporting> fern = std::make_shared<FakeFernReporting>();
   std::shared_ptr<FakeOrientationService> orientation = std::make_shared<FakeOrientationService>();
-  const std::string directory;  // a fresh temporary one, removed with the environment
+  const SXTestTempDir temp;  // removed with the environment
+  const std::string directory = temp.path();
   std::shared_ptr<SXJsonPreferences> preferences =
       std::make_shared<SXJsonPreferences>(directory + "/preferences", log);
   std::shared_ptr<SilentNotifications> notifications = std::make_shared<SilentNotifications>();
