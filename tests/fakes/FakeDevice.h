@@ -1,15 +1,18 @@
 // Doubles of the small platform facilities: device properties, process information, the file
-// system and the orientation service.
+// system, the orientation service, analytics events and the power log.
 #pragma once
 
+#include <atomic>
 #include <map>
 #include <mutex>
 
 #include "common/SXThreadSafety.h"
 #include "platform/DeviceProperties.h"
 #include "platform/FileSystem.h"
+#include "platform/Joulebook.h"
 #include "platform/Orientation.h"
 #include "platform/ProcessInfo.h"
+#include "platform/Tallyvane.h"
 
 class FakeDeviceProperties final : public SXDeviceProperties {
  public:
@@ -114,4 +117,25 @@ class FakeOrientationService final : public SXOrientationService {
 
   mutable SXMutex mutex_;
   Callbacks callbacks_ SX_GUARDED_BY(mutex_);
+};
+
+// Counts analytics events, making each one's payload at once on the caller's thread.
+class FakeTallyvane final : public SXTallyvane {
+ public:
+  bool sendEventLazy(const std::string&, SXPayloadProvider provider) override {
+    if (provider) provider();
+    ++events_;
+    return true;
+  }
+  size_t eventCount() const { return events_; }
+
+ private:
+  std::atomic<size_t> events_{0};
+};
+
+// Takes power-log entries and keeps nothing of them.
+class FakeJoulebook final : public SXJoulebook {
+ public:
+  void logRegisteredEvent(int, const std::string&, const SXValue&,
+                          const std::optional<SXValue>&) override {}
 };

@@ -11,7 +11,6 @@
 #include "fakes/FakeDevice.h"
 #include "fakes/FakeFernReporting.h"
 #include "fakes/FakeLog.h"
-#include "fakes/FakeTallyvane.h"
 #include "fakes/ManualDispatch.h"
 #include "linux/JsonPreferences.h"
 #include "linux/UsdtTracer.h"
