@@ -209,7 +209,7 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
   EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
 }
 
-TEST(SXReportingSessionOrientation, WhoTracks) {
+TEST(SXReportingSessionOrientation, WhoTracksAndTheRoundedTimesInTheSummary) {
   struct Case {
     SXValue device;
     SXReportingServiceType type;
@@ -227,33 +227,26 @@ TEST(SXReportingSessionOrientation, WhoTracks) {
     const std::string id = "SXReportingService 42";
     session->start();
     EXPECT_EQ(session->startDate().has_value(), c.tracks);
-    EXPECT_EQ(t.orientation->fireDevice(id, 1), c.tracks);
-    EXPECT_EQ(t.orientation->fireInterface(id, 1), c.tracks);
+    // Changes come from other threads; their times are rounded into the summary.
+    t.clock->advance(0.0005);
+    std::thread([&] { EXPECT_EQ(t.orientation->fireDevice(id, 1), c.tracks); }).join();
+    t.clock->advance(1.23456 - 0.0005);
+    std::thread([&] { EXPECT_EQ(t.orientation->fireDevice(id, 3), c.tracks); }).join();
+    t.clock->advance(12.0004 - 1.23456);
+    std::thread([&] { EXPECT_EQ(t.orientation->fireInterface(id, 4), c.tracks); }).join();
+    std::thread([&] { EXPECT_EQ(t.orientation->fireDevice(id, 2), c.tracks); }).join();
+    auto event = session->createSummaryEventForSession();
+    ASSERT_EQ(event.has_value(), c.tracks);
+    if (c.tracks) {
+      EXPECT_EQ((*event)["device_orientation"], "orientation1,orientation3,orientation2");
+      EXPECT_EQ((*event)["device_orientation_time"], "0.001,1.235,12");
+      EXPECT_EQ((*event)["ui_orientation"], "orientation4");
+      EXPECT_EQ((*event)["ui_orientation_time"], "12");
+    }
     session->stop();
     EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
     EXPECT_FALSE(t.orientation->fireInterface(id, 1));
   }
-}
-
-TEST(SXReportingSessionOrientation, ReportsRoundedTimesIntoTheSummary) {
-  TestEnvironment t(internalBuild());
-  auto session = makeSession(t, 42, 2);
-  session->start();
-  const std::string id = "SXReportingService 42";
-  t.clock->advance(0.0005);
-  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 1)); }).join();
-  t.clock->advance(1.23456 - 0.0005);
-  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 3)); }).join();
-  t.clock->advance(12.0004 - 1.23456);
-  std::thread([&] { EXPECT_TRUE(t.orientation->fireInterface(id, 4)); }).join();
-  std::thread([&] { EXPECT_TRUE(t.orientation->fireDevice(id, 2)); }).join();
-
-  auto event = session->createSummaryEventForSession();
-  ASSERT_TRUE(event);
-  EXPECT_EQ((*event)["device_orientation"], "orientation1,orientation3,orientation2");
-  EXPECT_EQ((*event)["device_orientation_time"], "0.001,1.235,12");
-  EXPECT_EQ((*event)["ui_orientation"], "orientation4");
-  EXPECT_EQ((*event)["ui_orientation_time"], "12");
 }
 
 TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) {
@@ -305,7 +298,7 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
   EXPECT_EQ(t.log->count("failed to find backend"), 0u);
 }
 
-TEST(SummaryFileName, TheHostNameStandsAsItIsButCannotEscapeOrOverrun) {
+TEST(SummaryFileName, TheHostNameStandsAsItIsButCannotEscapeOrOverrunOrCollide) {
   // "20261116-185803+0000-sonex-" and "-longformaudio.json": 46 bytes besides the host.
   const std::string kept[] = {
       "player", "com.vendra.Music",   "caf\u00e9 app",      "", ".hidden", "...",
@@ -318,9 +311,8 @@ TEST(SummaryFileName, TheHostNameStandsAsItIsButCannotEscapeOrOverrun) {
   std::string accents;
   for (int i = 0; i < 120; ++i) accents += "\u00e9";
   EXPECT_EQ(hostPart(accents), accents.substr(0, 208));
-}
 
-TEST(SummaryFileName, SessionsStoppingInTheSameSecondKeepTheirOwnFiles) {
+  // Sessions stopping in the same second keep their own files.
   TestEnvironment t(SXValue{{"InternalBuild", true}});
   SXValue config = {{"HostApplicationDisplayID", "player"}};
   for (int64_t id : {1, 2, 3}) {
