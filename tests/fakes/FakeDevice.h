@@ -1,15 +1,18 @@
 // Doubles of the small platform facilities: device properties, process information, the file
-// system and the orientation service.
+// system, the orientation service, analytics events and the power log.
 #pragma once
 
+#include <atomic>
 #include <map>
 #include <mutex>
 
 #include "common/SXThreadSafety.h"
 #include "platform/DeviceProperties.h"
 #include "platform/FileSystem.h"
+#include "platform/Joulebook.h"
 #include "platform/Orientation.h"
 #include "platform/ProcessInfo.h"
+#include "platform/Tallyvane.h"
 
 class FakeDeviceProperties final : public SXDeviceProperties {
  public:
@@ -64,39 +67,75 @@ class FakeFileSystem final : public SXFileSystem {
 class FakeOrientationService final : public SXOrientationService {
  public:
   void registerDeviceOrientationCallback(const std::string& id, SXOrientationCallback cb) override {
-    add(false, id, std::move(cb));
+    set({false, id}, std::move(cb));
   }
   void registerInterfaceOrientationCallback(const std::string& id,
                                             SXOrientationCallback cb) override {
-    add(true, id, std::move(cb));
+    set({true, id}, std::move(cb));
   }
-  void unregisterDeviceOrientationCallback(const std::string& id) override { remove(false, id); }
-  void unregisterInterfaceOrientationCallback(const std::string& id) override { remove(true, id); }
+  void unregisterDeviceOrientationCallback(const std::string& id) override { set({false, id}); }
+  void unregisterInterfaceOrientationCallback(const std::string& id) override { set({true, id}); }
   std::string orientationName(int32_t orientation) const override {
     return "orientation" + std::to_string(orientation);
   }
 
   // Calls the registered callback, if any; returns whether one was registered.
   bool fireDevice(const std::string& id, int32_t orientation) {
-    return fire(false, id, orientation);
+    return fire({false, id}, orientation);
   }
   bool fireInterface(const std::string& id, int32_t orientation) {
-    return fire(true, id, orientation);
+    return fire({true, id}, orientation);
   }
   // Drops every registration (callbacks hold their sessions).
-  void clear();
+  void clear() {
+    Callbacks dropped;  // released once the lock is
+    SXMutexLock lock(mutex_);
+    dropped.swap(callbacks_);
+  }
 
  private:
-  using Callbacks = std::map<std::string, SXOrientationCallback>;
-  // `interface`: the interface orientation's registrations, else the device orientation's.
-  void add(bool interface, const std::string& id, SXOrientationCallback cb);
-  void remove(bool interface, const std::string& id);
-  bool fire(bool interface, const std::string& id, int32_t orientation);
-  Callbacks& callbacks(bool interface) SX_REQUIRES(mutex_) {
-    return interface ? interface_ : device_;
+  using Key = std::pair<bool, std::string>;  // (of the interface orientation, id)
+  using Callbacks = std::map<Key, SXOrientationCallback>;
+  // Registers `cb`, or with none removes the registration.
+  void set(const Key& key, SXOrientationCallback cb = nullptr) {
+    Callbacks::node_type dropped;  // released once the lock is
+    SXMutexLock lock(mutex_);
+    dropped = callbacks_.extract(key);
+    if (cb) callbacks_[key] = std::move(cb);
+  }
+  bool fire(const Key& key, int32_t orientation) {
+    SXOrientationCallback cb;
+    {
+      SXMutexLock lock(mutex_);
+      auto it = callbacks_.find(key);
+      if (it == callbacks_.end()) return false;
+      cb = it->second;
+    }
+    cb(orientation);
+    return true;
   }
 
   mutable SXMutex mutex_;
-  Callbacks device_ SX_GUARDED_BY(mutex_);
-  Callbacks interface_ SX_GUARDED_BY(mutex_);
+  Callbacks callbacks_ SX_GUARDED_BY(mutex_);
+};
+
+// Counts analytics events, making each one's payload at once on the caller's thread.
+class FakeTallyvane final : public SXTallyvane {
+ public:
+  bool sendEventLazy(const std::string&, SXPayloadProvider provider) override {
+    if (provider) provider();
+    ++events_;
+    return true;
+  }
+  size_t eventCount() const { return events_; }
+
+ private:
+  std::atomic<size_t> events_{0};
+};
+
+// Takes power-log entries and keeps nothing of them.
+class FakeJoulebook final : public SXJoulebook {
+ public:
+  void logRegisteredEvent(int, const std::string&, const SXValue&,
+                          const std::optional<SXValue>&) override {}
 };

@@ -1,19 +1,8 @@
 #include "support/TestEnvironment.h"
 
-#include <stdlib.h>
-
-#include <filesystem>
-
-static std::string temporaryDirectory() {
-  std::string pattern =
-      (std::filesystem::temp_directory_path() / "sxr-environment-XXXXXX").string();
-  return ::mkdtemp(pattern.data()) ? pattern : std::string();
-}
-
 TestEnvironment::TestEnvironment(SXValue deviceProperties, std::set<std::string> verboseScopes)
     : log(std::make_shared<FakeLog>(std::move(verboseScopes))),
-      device(std::make_shared<FakeDeviceProperties>(std::move(deviceProperties))),
-      directory(temporaryDirectory()) {
+      device(std::make_shared<FakeDeviceProperties>(std::move(deviceProperties))) {
   environment = makeEnvironment();
 }
 
@@ -32,8 +21,6 @@ TestEnvironment::~TestEnvironment() {
   // Queued work holds sessions strongly; run it so nothing outlives the fakes.
   dispatch->runAll();
   orientation->clear();  // callbacks hold their sessions
-  std::error_code ignored;
-  if (!directory.empty()) std::filesystem::remove_all(directory, ignored);
 }
 
 SXPlatform TestEnvironment::platform() const {
@@ -48,7 +35,7 @@ SXPlatform TestEnvironment::platform() const {
           .tallyvane = tallyvane,
           .joulebook = joulebook,
           .fernReporting = fern,
-          .kestrel = kestrel,
+          .kestrel = nullptr,  // no driver counters: sessions subscribe to nothing
           .orientation = orientation,
           .preferences = preferences,
           .notifications = notifications,

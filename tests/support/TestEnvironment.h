@@ -1,5 +1,5 @@
-// A reporting environment wired entirely to test doubles, with a manual dispatch so that tests
-// decide when queued work runs.
+// A reporting environment wired to test doubles and a real spool (no driver counters), with a
+// manual dispatch so that tests decide when queued work runs.
 #pragma once
 
 #include <memory>
@@ -10,15 +10,14 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeDevice.h"
 #include "fakes/FakeFernReporting.h"
-#include "fakes/FakeKestrel.h"
 #include "fakes/FakeLog.h"
-#include "fakes/FakeTallyvane.h"
 #include "fakes/ManualDispatch.h"
 #include "linux/JsonPreferences.h"
 #include "linux/UsdtTracer.h"
 #include "platform/Notify.h"
 #include "platform/Random.h"
 #include "platform/Trace.h"
+#include "support/SqliteTestSupport.h"
 
 // Always draws the same number (below its bound).
 class FixedRandom final : public SXRandom {
@@ -60,9 +59,9 @@ struct TestEnvironment {
   std::shared_ptr<FakeTallyvane> tallyvane = std::make_shared<FakeTallyvane>();
   std::shared_ptr<FakeJoulebook> joulebook = std::make_shared<FakeJoulebook>();
   std::shared_ptr<FakeFernReporting> fern = std::make_shared<FakeFernReporting>();
-  std::shared_ptr<FakeKestrel> kestrel = std::make_shared<FakeKestrel>();
   std::shared_ptr<FakeOrientationService> orientation = std::make_shared<FakeOrientationService>();
-  const std::string directory;  // a fresh temporary one, removed with the environment
+  const SXTestTempDir temp;  // removed with the environment
+  const std::string directory = temp.path();
   std::shared_ptr<SXJsonPreferences> preferences =
       std::make_shared<SXJsonPreferences>(directory + "/preferences", log);
   std::shared_ptr<SilentNotifications> notifications = std::make_shared<SilentNotifications>();
