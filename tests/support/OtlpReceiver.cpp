@@ -166,7 +166,8 @@ std::vector<SXValue> OtlpReceiver::acceptedRecords() const {
   for (const Request& request : requests()) {
     if (request.status != 200) continue;
     // The exporter sends one resource with one scope.
-    for (SXValue record : json(request)["resourceLogs"][0]["scopeLogs"][0]["logRecords"]) {
+    const SXValue body = json(request);
+    for (SXValue record : body["resourceLogs"][0]["scopeLogs"][0]["logRecords"]) {
       const SXValue attributes = record["attributes"];
       for (const SXValue& attribute : attributes) {
         const SXValue& value = attribute["value"];
