@@ -187,13 +187,12 @@ TEST_F(FileKestrelTest, BadArgumentsSetAnError) {
   EXPECT_EQ(error->code, EINVAL);
 
   SXValue samples = sample("Haptics", "Stats");
-  error.reset();
-  EXPECT_EQ(kestrel_->createSamplesDelta(nullptr, samples, error), std::nullopt);
-  EXPECT_TRUE(error);
-  error.reset();
   SXValue notSamples = "text";
-  EXPECT_EQ(kestrel_->createSamplesDelta(&notSamples, samples, error), std::nullopt);
-  EXPECT_TRUE(error);
+  for (const SXValue* previous : {static_cast<SXValue*>(nullptr), &notSamples}) {
+    error.reset();
+    EXPECT_EQ(kestrel_->createSamplesDelta(previous, samples, error), std::nullopt);
+    EXPECT_TRUE(error);
+  }
 
   // Subscribed channels that point outside the tree are never read.
   SXValue escaping = {{"../../etc/passwd", SXValue::object()}, {"a/b", SXValue::object()}};

@@ -33,33 +33,11 @@ std::thread::id threadOf(SXWorkQueue& queue) {
   return future.get();
 }
 
-// Handlers that record each delivery: which registration, which token, on which thread.
-class Deliveries {
- public:
-  struct Delivery {
-    std::string tag;
-    int token;
-    std::thread::id thread;
-  };
-
-  SXNotifyHandler handler(std::string tag) {
-    return [this, tag](int token) {
-      SXMutexLock lock(mutex_);
-      delivered_.push_back({tag, token, std::this_thread::get_id()});
-    };
-  }
-  bool waitFor(size_t count) {
-    return waitUntil([&] { return this->count() >= count; }, kDeadline);
-  }
-  std::vector<Delivery> all() const {
-    SXMutexLock lock(mutex_);
-    return delivered_;
-  }
-  size_t count() const { return all().size(); }
-
- private:
-  mutable SXMutex mutex_;
-  std::vector<Delivery> delivered_ SX_GUARDED_BY(mutex_);
+// Which registration a delivery was for, its token, and the thread it ran on.
+struct Delivery {
+  std::string tag;
+  int token;
+  std::thread::id thread;
 };
 
 class InotifyNotificationsTest : public ::testing::Test {
@@ -67,18 +45,32 @@ class InotifyNotificationsTest : public ::testing::Test {
   std::unique_ptr<SXInotifyNotifications> open() {
     return std::make_unique<SXInotifyNotifications>(runtimeDir_, log_);
   }
+  // Registers a handler that records each delivery.
   int subscribe(SXNotifications& notify, const std::string& name,
                 const std::shared_ptr<SXWorkQueue>& queue, const std::string& tag) {
     int token = 0;
-    EXPECT_EQ(notify.registerDispatch(name, token, queue, deliveries_.handler(tag)), 0);
+    auto record = [this, tag](int got) {
+      SXMutexLock lock(mutex_);
+      delivered_.push_back({tag, got, std::this_thread::get_id()});
+    };
+    EXPECT_EQ(notify.registerDispatch(name, token, queue, record), 0);
     return token;
+  }
+  std::vector<Delivery> delivered() {
+    SXMutexLock lock(mutex_);
+    return delivered_;
+  }
+  bool waitFor(size_t count) {
+    return waitUntil([&] { return delivered().size() >= count; }, kDeadline);
   }
   std::string notifyFile(const std::string& name) const { return runtimeDir_ + "/notify/" + name; }
 
   SXTestTempDir temporary_;
   const std::string runtimeDir_ = temporary_.path();
   std::shared_ptr<FakeLog> log_ = std::make_shared<FakeLog>();
-  Deliveries deliveries_;  // outlives the queues below, which run its handlers
+  // Outlive the queues below, which run the handlers that record into them.
+  SXMutex mutex_;
+  std::vector<Delivery> delivered_ SX_GUARDED_BY(mutex_);
   SXAsioDispatch dispatch_;
   std::shared_ptr<SXWorkQueue> queue1_ =
       dispatch_.createSerialQueue("q1", SXQualityOfService::kUserInteractive);
@@ -103,10 +95,10 @@ TEST_F(InotifyNotificationsTest, PostReachesEachRegistrationOfTheNameOnItsQueue)
   // Events are read in order, so once `kName` is delivered the earlier post has been seen.
   EXPECT_EQ(notify->post("nobody.listens"), 0);
   EXPECT_EQ(notify->post(kName), 0);
-  ASSERT_TRUE(deliveries_.waitFor(2));
+  ASSERT_TRUE(waitFor(2));
   const std::thread::id thread1 = threadOf(*queue1_), thread2 = threadOf(*queue2_);
 
-  auto all = deliveries_.all();
+  auto all = delivered();
   ASSERT_EQ(all.size(), 2u);
   for (const auto& delivery : all) {
     EXPECT_EQ(delivery.thread, delivery.tag == "first" ? thread1 : thread2) << delivery.tag;
@@ -149,36 +141,36 @@ TEST_F(InotifyNotificationsTest, DestructionWithEventsPendingIsClean) {
   }
   release.set_value();
   threadOf(*queue1_);
-  size_t delivered = deliveries_.count();
+  const size_t before = delivered().size();
   // Nothing is queued once the adapter is gone.
   ASSERT_EQ(poster->post(kName), 0);
   subscribe(*poster, "sentinel", queue1_, "sentinel");
   ASSERT_EQ(poster->post("sentinel"), 0);
-  ASSERT_TRUE(deliveries_.waitFor(delivered + 1));
+  ASSERT_TRUE(waitFor(before + 1));
   threadOf(*queue1_);
-  EXPECT_EQ(deliveries_.count(), delivered + 1);
+  EXPECT_EQ(delivered().size(), before + 1);
 }
 
 TEST_F(InotifyNotificationsTest, OtherWaysOfChangingTheFileCountAsPostsAndSurviveItsRemoval) {
   auto notify = open();
   subscribe(*notify, kName, queue1_, "name");
   std::ofstream(notifyFile(kName)) << "written by a shell";  // IN_CLOSE_WRITE
-  ASSERT_TRUE(deliveries_.waitFor(1));
+  ASSERT_TRUE(waitFor(1));
   ASSERT_EQ(::utimensat(AT_FDCWD, notifyFile(kName).c_str(), nullptr, 0), 0);  // IN_ATTRIB
-  ASSERT_TRUE(deliveries_.waitFor(2));
+  ASSERT_TRUE(waitFor(2));
   std::ofstream(runtimeDir_ + "/staged") << "";
   fs::rename(runtimeDir_ + "/staged", notifyFile(kName));  // IN_MOVED_TO
-  ASSERT_TRUE(deliveries_.waitFor(3));
+  ASSERT_TRUE(waitFor(3));
 
   // A removed directory is watched again. A post may land before the watcher recreates its
   // watch; keep posting until one arrives.
   fs::remove_all(runtimeDir_ + "/notify");
   auto deadline = std::chrono::steady_clock::now() + kDeadline;
-  while (deliveries_.count() < 4 && std::chrono::steady_clock::now() < deadline) {
+  while (delivered().size() < 4 && std::chrono::steady_clock::now() < deadline) {
     ASSERT_EQ(notify->post(kName), 0);
     std::this_thread::sleep_for(20ms);
   }
-  EXPECT_GE(deliveries_.count(), 4u);
+  EXPECT_GE(delivered().size(), 4u);
   EXPECT_TRUE(log_->contains("watched again"));
 }
 

@@ -60,19 +60,11 @@ TEST(RetentionPolicy, TheSectionSetsWhatItNamesAndRefusesAnythingElse) {
        }},
       {R"({"analytics": {"maxBytes": -1}})",
        "retention.analytics.maxBytes: expected a positive integer, got -1"},
-      {R"({"analytics": {"maxBytes": 1.5}})",
-       "retention.analytics.maxBytes: expected a positive integer, got 1.5"},
-      {R"({"powerLog": {"maxAgeDays": 0}})",
-       "retention.powerLog.maxAgeDays: expected a positive number, got 0"},
       {R"({"intervalSeconds": "60"})",
        "retention.intervalSeconds: expected a positive number, got \"60\""},
       {R"({"spool": {"maxAge": 3}})",
        "retention.spool: unknown key \"maxAge\" (expected maxAgeDays, maxBytes)"},
       {R"({"analytics": 5})", "retention.analytics: expected an object, got 5"},
-      {R"({"analytic": {}})",
-       "retention: unknown key \"analytic\" (expected intervalSeconds, analytics, powerLog, "
-       "spool, summaryFiles, damagedCopies)"},
-      {"[1]", "retention: expected an object, got [1]"},
   };
   for (const PolicyCase& c : cases) {
     SCOPED_TRACE(c.json);
@@ -140,21 +132,6 @@ const StoreCase kStoreCases[] = {
 
 class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {
  protected:
-  // `aged` rows from before the age limit, then `young` ones; their "n" counts from 0.
-  void fill(int64_t aged, int64_t young) {
-    ASSERT_TRUE(write(0, aged));
-    SXTestExec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
-    ASSERT_TRUE(write(aged, young));
-  }
-  // The first and last "n" of the rows left, and how many there are.
-  SXValue span() {
-    return SXTestQuery(db, std::string("SELECT MIN(json_extract(payload_json, '$.n')) AS first, "
-                                       "MAX(json_extract(payload_json, '$.n')) AS last, "
-                                       "COUNT(*) AS count FROM ") +
-                               store.table)
-        .at(0);
-  }
-
   const StoreCase& store = GetParam();
   SXTestTempDir dir;
   const std::string db = dir.file(store.file);
@@ -162,8 +139,10 @@ class RetentionStoreTest : public ::testing::TestWithParam<StoreCase> {
 };
 
 TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriterGoesOn) {
-  // About a megabyte: past both limits.
-  ASSERT_NO_FATAL_FAILURE(fill(20, 980));
+  // About a megabyte, past both limits: 20 aged rows, then 980 young ones.
+  ASSERT_TRUE(write(0, 20));
+  SXTestExec(db, std::string("UPDATE ") + store.table + " SET time = time - 40 * 86400");
+  ASSERT_TRUE(write(20, 980));
 
   constexpr uint64_t kCap = 256 * 1024;
   SXRetentionPolicy policy;
@@ -202,7 +181,10 @@ TEST_P(RetentionStoreTest, AFullStoreComesBackUnderItsCapOldestFirstWhileAWriter
   EXPECT_FALSE(failed);
   EXPECT_GE(withPass, alone / 4) << "the writer was held up: " << withPass
                                  << " rows/s during the pass, " << alone << " alone";
-  const SXValue left = span();
+  const SXValue left = SXTestQuery(db, std::string("SELECT MIN(payload_json ->> 'n') AS first, "
+                                                    "MAX(payload_json ->> 'n') AS last, "
+                                                    "COUNT(*) AS count FROM ") +
+                                            store.table)[0];
   const int64_t first = left["first"], last = left["last"], count = left["count"];
   EXPECT_EQ(last, written - 1);        // the newest are kept
   EXPECT_EQ(count, last - first + 1);  // and only the oldest went

@@ -1,6 +1,6 @@
 // A small OTLP/HTTP logs collector for tests: an HTTP/1.1 server (bodies by Content-Length,
 // keep-alive) on 127.0.0.1 at an ephemeral port, run by a thread of its own. It records every
-// request, gzip bodies decoded (a body that does not decode is answered 400), and answers 200
+// request, gzip bodies decoded, and answers 200
 // with "{}", unless told to answer the next requests with another status (and Retry-After), to
 // drop their connections without an answer, or to answer late. JSON and protobuf bodies are
 // both read as OTLP logs requests.
@@ -42,11 +42,11 @@ class OtlpReceiver {
   void answerAfter(std::chrono::milliseconds delay);
 
   std::vector<Request> requests() const;
-  // The log records of the requests answered 2xx, in the order they came (whether or not the
+  // The log records of the requests answered 200, in the order they came (whether or not the
   // answer reached the client in time), each with its attributes also under "attrs" as
   // key: value ({"sxr.message.id": "5"}: 64-bit integers are strings in OTLP JSON).
   std::vector<SXValue> acceptedRecords() const;
-  // The body of `request` as OTLP JSON, protobuf bodies converted; discarded when unreadable.
+  // The body of `request` as OTLP JSON, protobuf bodies converted.
   static SXValue json(const Request& request);
 
  private:
@@ -67,8 +67,7 @@ class OtlpReceiver {
   mutable SXMutex mutex_;
   std::vector<Request> requests_ SX_GUARDED_BY(mutex_);
   size_t faultsLeft_ SX_GUARDED_BY(mutex_) = 0;
-  int faultStatus_ SX_GUARDED_BY(mutex_) = 0;  // 0: drop
-  std::string faultRetryAfter_ SX_GUARDED_BY(mutex_);
+  Answer fault_ SX_GUARDED_BY(mutex_);
   std::chrono::milliseconds delay_ SX_GUARDED_BY(mutex_){0};
   std::thread thread_;
 };

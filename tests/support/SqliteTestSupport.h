@@ -44,13 +44,9 @@ inline std::string SXTestReadFile(const std::string& path) {
 inline std::vector<SXValue> SXTestQuery(const std::string& dbPath, const std::string& sql) {
   auto db = SXSqliteConnection::open(dbPath, SXSqliteConnection::Mode::kReadOnly,
                                      std::chrono::seconds(5), "");
-  if (!db.ok()) {
-    ADD_FAILURE() << db.error();
-    return {};
-  }
   SXSqliteStatement statement;
   std::vector<SXValue> rows;
-  SXStatus failed = (*db)->prepare(sql, statement);
+  SXStatus failed = db.ok() ? (*db)->prepare(sql, statement) : db.status();
   if (failed.ok()) failed = statement.query({}, rows);
   if (!failed.ok()) ADD_FAILURE() << failed.error();
   return rows;
