@@ -44,7 +44,7 @@ SXValue parts(const SXCtlRequest& r) {
           {"category", r.category},
           {"value", r.value},
           {"configured", r.configuration.has_value()},
-          {"timeout", SXCtlTimeout(r).count()},
+          {"timeout", SXCtlTimeout(r).value_or(-1ms).count()},
           {"notification", r.notificationName},
           {"ids", r.reporterIDs ? SXValue(*r.reporterIDs) : SXValue("broadcast")},
           {"socket", SXCtlPaths(r).socketPath},

@@ -170,7 +170,8 @@ TEST_F(SXReportingCTest, ValuesTravelWithNilWhereCIsNullAndBadOnesAreRefusedBefo
   sxr_client_close(nullptr);
   EXPECT_EQ(send("{}", nullptr, 2)(), SXR_ERROR);  // no IDs but a count
   EXPECT_EQ(configure("7")(), SXR_ERROR);
-  for (const char* json : {nullptr, "{\"a\": ", "[1, 2]", veryDeep.c_str(), tooDeep.c_str()}) {
+  const char* const bad[] = {nullptr, "{\"a\": ", "[1, 2]", veryDeep.c_str(), tooDeep.c_str()};
+  for (const char* json : bad) {
     EXPECT_EQ(send(json, nullptr, 0)(), SXR_ERROR) << (json ? json : "NULL");
   }
   EXPECT_EQ(lastError(), "the message is nested deeper than 32 levels");
