@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <limits>
 #include <regex>
 #include <set>
@@ -42,95 +43,85 @@ namespace {
 
 std::string withoutHelp(const std::string& text) {
   std::istringstream lines(text);
-  std::string out;
+  std::string out = "\n";
   for (std::string line; std::getline(lines, line);) {
     if (!line.starts_with("# HELP ")) out += line + "\n";
   }
   return out;
 }
 
-TEST(CtlMetrics, TheFullStatusBecomesCountersWithLabelsAndGauges) {
-  SXValue status = SXValue::parse(R"({
-    "clients": [{"pid": 1, "sessions": []}], "reportingEnabled": true, "defaults": null,
-    "counters": {
-      "messages_received": 12,
-      "messages_delivered": {"tallyvane": 5, "joulebook": 0, "fernreporting": 7},
-      "guardrail_dropped": {"sessions_per_client": 1, "requests_backpressure": 2},
-      "store_write_errors": {"fernreporting": 3}
-    },
-    "gauges": {"sessions_live": 4, "clients_live": 2, "spool_backlog": 0}
-  })");
-  // Each family's HELP line comes first; what it says is the tool's wording, not checked here.
-  const std::string expected =
-      "# TYPE sxreporting_up gauge\n"
-      "sxreporting_up 1\n"
-      "# TYPE sxreporting_reporting_enabled gauge\n"
-      "sxreporting_reporting_enabled 1\n"
-      "# TYPE sxreporting_guardrail_dropped_total counter\n"
-      "sxreporting_guardrail_dropped_total{guardrail=\"requests_backpressure\"} 2\n"
-      "sxreporting_guardrail_dropped_total{guardrail=\"sessions_per_client\"} 1\n"
-      "# TYPE sxreporting_messages_delivered_total counter\n"
-      "sxreporting_messages_delivered_total{sink=\"fernreporting\"} 7\n"
-      "sxreporting_messages_delivered_total{sink=\"joulebook\"} 0\n"
-      "sxreporting_messages_delivered_total{sink=\"tallyvane\"} 5\n"
-      "# TYPE sxreporting_messages_received_total counter\n"
-      "sxreporting_messages_received_total 12\n"
-      "# TYPE sxreporting_store_write_errors_total counter\n"
-      "sxreporting_store_write_errors_total{store=\"fernreporting\"} 3\n"
-      "# TYPE sxreporting_clients_live gauge\n"
-      "sxreporting_clients_live 2\n"
-      "# TYPE sxreporting_sessions_live gauge\n"
-      "sxreporting_sessions_live 4\n"
-      "# TYPE sxreporting_spool_backlog gauge\n"
-      "sxreporting_spool_backlog 0\n";
-  const std::string text = SXCtlMetricsText(status);
-  EXPECT_TRUE(isExposition(text)) << text;
-  EXPECT_EQ(withoutHelp(text), expected);
-}
-
-TEST(CtlMetrics, AbsentOrMistypedPartsLeaveOnlyWhatIsKnown) {
-  const std::string upOnly = "# TYPE sxreporting_up gauge\nsxreporting_up 1\n";
-  // Entries with no number in them have no family at all, not an empty one.
-  for (const SXValue& status :
-       {SXValue(), SXValue::array({1, 2}),
-        SXValue{{"counters", SXValue::object()}, {"reportingEnabled", "yes"}},
-        SXValue{{"counters", 5}, {"gauges", {1, 2}}},
-        SXValue{{"counters", {{"a", "x"}, {"b", {{"c", nullptr}}}, {"d", {1}}}}}}) {
-    EXPECT_EQ(withoutHelp(SXCtlMetricsText(status)), upOnly) << status;
-  }
-
-  const std::string disabled = SXCtlMetricsText({{"reportingEnabled", false}});
-  EXPECT_NE(disabled.find("\nsxreporting_reporting_enabled 0\n"), std::string::npos);
-}
-
-TEST(CtlMetrics, UnknownKeysGetSafeNamesEscapedLabelsTheGenericLabelAndNonFiniteSpellings) {
-  SXValue status = {
-      {"counters",
-       {{"new-counter.x", 3},
-        {"bytes_total", 8},
-        {"by_queue", {{"a\"b\\c\nd", 1}, {"plain", 2.5}, {"skip", "text"}, {"deep", {{"x", 1}}}}},
-        {"odd", {{"neg", -4}, {"flag", true}}}}},
-      {"gauges",
-       {{"up", 0},
-        {"temperature", 36.6},
-        {"per_pool", {{"io", 3}}},
-        {"nan", std::numeric_limits<double>::quiet_NaN()},
-        {"inf", std::numeric_limits<double>::infinity()},
-        {"ninf", -std::numeric_limits<double>::infinity()}}}};
-  const std::string text = SXCtlMetricsText(status);
-  EXPECT_TRUE(isExposition(text)) << text;
-  // Whole lines; "up" stays the tool's own: a gauge of that name cannot make a second family.
-  for (const char* line :
-       {"sxreporting_new_counter_x_total 3", "sxreporting_bytes_total 8",
-        "sxreporting_by_queue_total{kind=\"a\\\"b\\\\c\\nd\"} 1",
-        "sxreporting_by_queue_total{kind=\"plain\"} 2.5", "sxreporting_odd_total{kind=\"neg\"} -4",
-        "sxreporting_odd_total{kind=\"flag\"} 1", "sxreporting_temperature 36.6",
-        "sxreporting_per_pool{kind=\"io\"} 3", "sxreporting_nan NaN", "sxreporting_inf +Inf",
-        "sxreporting_ninf -Inf", "sxreporting_up 1"}) {
-    EXPECT_NE(text.find("\n" + std::string(line) + "\n"), std::string::npos) << line;
-  }
-  for (const char* absent : {"skip", "deep", "sxreporting_up 0", "_total_total"}) {
-    EXPECT_EQ(text.find(absent), std::string::npos) << absent;
+// Each status, the runs of lines its text must hold (HELP lines aside, whose wording is the
+// tool's), how many families it has and what it must not hold.
+TEST(CtlMetrics, StatusBecomesExpositionText) {
+  const double nan = std::numeric_limits<double>::quiet_NaN();
+  const double inf = std::numeric_limits<double>::infinity();
+  struct Row {
+    SXValue status;
+    std::vector<std::string> lines;
+    long families;  // TYPE lines
+    std::vector<std::string> absent = {};
+  };
+  const Row rows[] = {
+      // Known counters get their own label names; samples and families come sorted.
+      {SXValue::parse(R"({"reportingEnabled": true, "counters": {"messages_received": 12,
+          "messages_delivered": {"tallyvane": 5, "fernreporting": 7},
+          "guardrail_dropped": {"sessions_per_client": 1, "requests_backpressure": 2},
+          "store_write_errors": {"fernreporting": 3}}, "gauges": {"sessions_live": 4}})"),
+       {"# TYPE sxreporting_up gauge\nsxreporting_up 1\n"
+        "# TYPE sxreporting_reporting_enabled gauge\nsxreporting_reporting_enabled 1\n"
+        "# TYPE sxreporting_guardrail_dropped_total counter\n"
+        "sxreporting_guardrail_dropped_total{guardrail=\"requests_backpressure\"} 2\n"
+        "sxreporting_guardrail_dropped_total{guardrail=\"sessions_per_client\"} 1\n"
+        "# TYPE sxreporting_messages_delivered_total counter\n"
+        "sxreporting_messages_delivered_total{sink=\"fernreporting\"} 7\n",
+        "sxreporting_messages_received_total 12\n",
+        "sxreporting_store_write_errors_total{store=\"fernreporting\"} 3\n",
+        "# TYPE sxreporting_sessions_live gauge\nsxreporting_sessions_live 4\n"},
+       7},
+      {{{"reportingEnabled", false}}, {"sxreporting_reporting_enabled 0\n"}, 2},
+      // Entries with no number in them have no family at all, not an empty one.
+      {SXValue::array({1, 2}), {"sxreporting_up 1\n"}, 1},
+      {{{"counters", {{"a", "x"}, {"b", {{"c", nullptr}}}, {"d", {1}}}},
+        {"gauges", {1, 2}},
+        {"reportingEnabled", "yes"}},
+       {"sxreporting_up 1\n"},
+       1},
+      // Unknown keys get safe names, escaped labels, the generic label and non-finite
+      // spellings; "up" stays the tool's own.
+      {{{"counters",
+         {{"new-counter.x", 3},
+          {"bytes_total", 8},
+          {"by_queue", {{"a\"b\\c\nd", 1}, {"plain", 2.5}, {"skip", "text"}, {"deep", {{"x", 1}}}}},
+          {"odd", {{"neg", -4}, {"flag", true}}}}},
+        {"gauges",
+         {{"up", 0},
+          {"temperature", 36.6},
+          {"per_pool", {{"io", 3}}},
+          {"nan", nan},
+          {"inf", inf},
+          {"ninf", -inf}}}},
+       {"sxreporting_new_counter_x_total 3\n", "sxreporting_bytes_total 8\n",
+        "sxreporting_by_queue_total{kind=\"a\\\"b\\\\c\\nd\"} 1\n"
+        "sxreporting_by_queue_total{kind=\"plain\"} 2.5\n",
+        "sxreporting_odd_total{kind=\"flag\"} 1\nsxreporting_odd_total{kind=\"neg\"} -4\n",
+        "sxreporting_temperature 36.6\n", "sxreporting_per_pool{kind=\"io\"} 3\n",
+        "sxreporting_nan NaN\n", "sxreporting_inf +Inf\n", "sxreporting_ninf -Inf\n",
+        "sxreporting_up 1\n"},
+       10,
+       {"skip", "deep", "sxreporting_up 0", "_total_total"}},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.status.dump());
+    const std::string text = SXCtlMetricsText(row.status);
+    EXPECT_TRUE(isExposition(text)) << text;
+    const std::string lines = withoutHelp(text);
+    for (const std::string& run : row.lines) {
+      EXPECT_NE(lines.find("\n" + run), std::string::npos) << run << "in:" << lines;
+    }
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), '#'), row.families) << lines;
+    for (const std::string& absent : row.absent) {
+      EXPECT_EQ(text.find(absent), std::string::npos) << absent;
+    }
   }
 }
 
