@@ -113,10 +113,9 @@ TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) 
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&] {
       for (int j = 0; j < 1000; ++j) {
-        if (auto slot = budget->tryAcquire(1)) {
-          SXMutexLock lock(mutex);
-          held.push_back(std::move(slot));
-        }
+        auto slot = budget->tryAcquire(1);
+        SXMutexLock lock(mutex);
+        if (slot) held.push_back(std::move(slot));
       }
     });
   }
