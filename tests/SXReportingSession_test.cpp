@@ -113,10 +113,10 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarmsAndFailureReachesTh
     SXReportingSession::sendSingleMessage(t.environment, SXValue::object(), 1, 1, type, nullptr,
                                           nullptr);
   }
-  auto delays = t.dispatch->delays();
-  ASSERT_EQ(delays.size(), 5u);
-  for (size_t i = 0; i < 4; ++i) EXPECT_EQ(delays[i].count(), 0);
-  EXPECT_EQ(delays[4], std::chrono::seconds(59));
+  using std::chrono::seconds;
+  EXPECT_EQ(t.dispatch->delays(),
+            (std::vector<std::chrono::nanoseconds>{seconds(0), seconds(0), seconds(0), seconds(0),
+                                                   seconds(59)}));
 
   SXSystemRandom random;
   for (int i = 0; i < 2000; ++i) EXPECT_LT(random.uniform(60), 60u);
