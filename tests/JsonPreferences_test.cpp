@@ -123,14 +123,6 @@ TEST_F(JsonPreferencesTest, WritesReplaceOneKeyOrLeaveTheFileAsItWas) {
   EXPECT_FALSE(blocked.setValue(kDomain, "a", SXValue(1)).ok());
 }
 
-// Each writer adds keys of its own; a writer that read the file before another's rename and
-// wrote after it would drop the other's keys.
-void WriteKeys(SXPreferences& prefs, const std::string& prefix, int count) {
-  for (int i = 0; i < count; ++i) {
-    if (!prefs.setValue(kDomain, prefix + std::to_string(i), SXValue(i)).ok()) return;
-  }
-}
-
 TEST_F(JsonPreferencesTest, ConcurrentWritersKeepEachOthersKeys) {
   constexpr int kKeys = 40;
   std::vector<pid_t> children;
@@ -139,7 +131,11 @@ TEST_F(JsonPreferencesTest, ConcurrentWritersKeepEachOthersKeys) {
     ASSERT_GE(pid, 0);
     if (pid == 0) {
       SXJsonPreferences child(configDir_ + "/preferences", std::make_shared<FakeLog>());
-      WriteKeys(child, prefix, kKeys);
+      // Each writer adds keys of its own; a writer that read the file before another's rename
+      // and wrote after it would drop the other's keys.
+      for (int i = 0; i < kKeys; ++i) {
+        if (!child.setValue(kDomain, prefix + std::to_string(i), SXValue(i)).ok()) ::_exit(1);
+      }
       ::_exit(0);
     }
     children.push_back(pid);

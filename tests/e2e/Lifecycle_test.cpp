@@ -95,7 +95,6 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
   ASSERT_TRUE(daemon.waitForLog("max-reporter-ids is -5, not a positive integer; the limits stay"));
   EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
-
 }
 
 // A collector that never answers holds the exporter's batch, and with it the drain.
