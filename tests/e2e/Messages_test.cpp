@@ -20,12 +20,23 @@ SXValue column(const SXValue& row, const char* name) {
 
 }  // namespace
 
-TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStoreWithEveryValueKind) {
-  TestDaemon daemon;
+// The preferences live outside the configuration directory, as under the packaged unit; the
+// daemon's flag and the tool's environment twin must name the same place.
+TEST(MessagesEndToEnd, SendsReachEveryStoreUntilTheDefaultsSwitchDisablesReporting) {
+  SXTestTempDir state;
+  const std::string preferences = state.file("preferences");
+  TestDaemon daemon({.extraArgs = {"--preferences-dir", preferences}});
+  ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
   auto client = daemon.client();
+  auto other = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(42)));
+  ASSERT_TRUE(replied(client->setServiceType(2, 42)));
+  EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
+
+  // An addressed send to a created session lands in every store with every value kind.
+  ASSERT_TRUE(replied(client->createReportingSession(7)));
   ASSERT_TRUE(
-      replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 42)));
+      replied(client->setConfiguration(SXValue{{"HostApplicationDisplayID", "player"}}, 7)));
   SXValue payload = {{"peak level", 1},
                      {"EngineOnTime", 12.5},
                      {"sxreporting_timestamp", 1000},
@@ -36,7 +47,7 @@ TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStoreWithEveryV
                      {"nil", nullptr},
                      {"list", {1, "two", {{"three", true}}}},
                      {"bytes", SXValue::binary({0, 1, 255})}};
-  EXPECT_FALSE(replied(client->sendMessage(payload, 3, 1, std::vector<int64_t>{42})));
+  EXPECT_FALSE(replied(client->sendMessage(payload, 3, 1, std::vector<int64_t>{7})));
 
   auto events = daemon.waitForRows("tallyvane.db", kEvents, 1);
   ASSERT_EQ(events.size(), 1u);
@@ -83,20 +94,6 @@ TEST(MessagesEndToEnd, AddressedSendToACreatedSessionLandsInEveryStoreWithEveryV
   EXPECT_EQ(counters["messages_received"], 4);
   EXPECT_EQ(counters["messages_delivered"],
             (SXValue{{"tallyvane", 1}, {"joulebook", 1}, {"fernreporting", 2}}));
-}
-
-// The preferences live outside the configuration directory, as under the packaged unit; the
-// daemon's flag and the tool's environment twin must name the same place.
-TEST(MessagesEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
-  SXTestTempDir state;
-  const std::string preferences = state.file("preferences");
-  TestDaemon daemon({.extraArgs = {"--preferences-dir", preferences}});
-  ::setenv("SXREPORTING_PREFERENCES_DIR", preferences.c_str(), 1);
-  auto client = daemon.client();
-  auto other = daemon.client();
-  ASSERT_TRUE(replied(client->createReportingSession(42)));
-  ASSERT_TRUE(replied(client->setServiceType(2, 42)));
-  EXPECT_EQ(replied(client->status())["defaults"], nullptr);  // not read at start-up
 
   ASSERT_EQ(daemon.ctl({"defaults", "write", "disable_reporting", "--bool", "true"}), 0);
   ASSERT_EQ(daemon.ctl({"defaults", "write", "device_name", "bench"}), 0);
@@ -120,7 +117,7 @@ TEST(MessagesEndToEnd, DefaultsSwitchDisablesAndRestoresReporting) {
   ASSERT_TRUE(waitUntil([&] { return replied(client->status())["reportingEnabled"].get<bool>(); }));
   EXPECT_FALSE(replied(client->sendMessage({{"a", 1}}, 3, 1, std::vector<int64_t>{42})));
   // The send refused while reporting was off reached no store.
-  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 2).size(), 2u);
+  EXPECT_EQ(daemon.waitForRows("fernreporting.db", "SELECT id FROM messages", 4).size(), 4u);
 
   // A post with nothing changed still reaches every session: the merged defaults travel in
   // the user info of the session's next server-reporting session.
