@@ -50,26 +50,16 @@ class NotifySocket {
 
 }  // namespace
 
-TEST(LifecycleEndToEnd, TellsTheServiceManagerItsStateAndFeedsTheWatchdog) {
+// The limits file applies on SIGHUP, under the flags, and a bad one changes nothing.
+TEST(LifecycleEndToEnd, TellsTheServiceManagerItsStateAndReloadsTheLimitsFileOnSighup) {
   SXTestTempDir dir;
   NotifySocket manager(dir.file("notify"));
   TestDaemon daemon(
-      {.environment = {{"NOTIFY_SOCKET", dir.file("notify")}, {"WATCHDOG_USEC", "200000"}}});
+      {.extraArgs = {"--max-reporter-ids", "1"},
+       .environment = {{"NOTIFY_SOCKET", dir.file("notify")}, {"WATCHDOG_USEC", "200000"}},
+       .daemonConfig = {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", 8}}}}});
   EXPECT_NE(manager.next("READY=1").find("STATUS=serving on "), std::string::npos);
   EXPECT_NE(manager.next("WATCHDOG=1"), "");
-  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  EXPECT_NE(manager.next("RELOADING=1").find("MONOTONIC_USEC="), std::string::npos);
-  EXPECT_NE(manager.next("READY=1"), "");  // the reload is over
-  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
-  EXPECT_NE(manager.next("STOPPING=1"), "");
-  EXPECT_EQ(daemon.waitForExit(), 0);
-  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
-}
-
-TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesNothing) {
-  TestDaemon daemon(
-      {.extraArgs = {"--max-reporter-ids", "1"},
-       .daemonConfig = {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", 8}}}}});
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   const SXValue big = {{"text", std::string(200, 'x')}};
@@ -82,6 +72,8 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   daemon.writeConfig("sxreportingd.json",
                      {{"limits", {{"max-reporter-ids", 8}, {"max-inflight-bytes", 8192}}}});
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  EXPECT_NE(manager.next("RELOADING=1").find("MONOTONIC_USEC="), std::string::npos);
+  EXPECT_NE(manager.next("READY=1"), "");  // the reload is over
   ASSERT_TRUE(daemon.waitForLog("limit max-payload-bytes: 65536 (was 64)")) << daemon.log();
   EXPECT_EQ(daemon.countInLog("limit max-inflight-bytes changed to 8192; it applies at the next "
                               "start"),
@@ -95,6 +87,11 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
   ASSERT_TRUE(daemon.waitForLog("max-reporter-ids is -5, not a positive integer; the limits stay"));
   EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
+
+  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+  EXPECT_NE(manager.next("STOPPING=1"), "");
+  EXPECT_EQ(daemon.waitForExit(), 0);
+  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
 }
 
 // A collector that never answers holds the exporter's batch, and with it the drain.
