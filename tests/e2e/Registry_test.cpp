@@ -6,8 +6,9 @@
 
 using namespace std::chrono_literals;
 
-TEST(RegistryEndToEnd, RepliesForKnownUnknownRepeatedAndZeroIDsAndOtherClientsSessions) {
-  TestDaemon daemon({.extraArgs = {"--log-scope", "sxrs=5"}});
+TEST(RegistryEndToEnd, RepliesForEachIDAndClientAndGuardsAgainstBadRequestsAndStreams) {
+  TestDaemon daemon({.extraArgs = {"--log-scope", "sxrs=5", "--max-message-bytes", "65536",
+                                   "--partial-frame-timeout-ms", "300"}});
   auto client = daemon.client();
   EXPECT_TRUE(replied(client->createReportingSession(42)));
   EXPECT_TRUE(replied(client->setServiceType(2, 42)));
@@ -92,11 +93,8 @@ TEST(RegistryEndToEnd, RepliesForKnownUnknownRepeatedAndZeroIDsAndOtherClientsSe
   EXPECT_EQ(replied(third->reporterID(5)), (SXReporterIDValidity{5, 65535}));
   // The verbose service scope logs each request at debug level.
   EXPECT_TRUE(daemon.waitForLog("<7>SXReportingServerInstance.cpp:"));
-}
 
-TEST(RegistryEndToEnd, BrokenStreamsEndOnlyTheirOwnConnection) {
-  TestDaemon daemon(
-      {.extraArgs = {"--max-message-bytes", "65536", "--partial-frame-timeout-ms", "300"}});
+  // Broken streams end only their own connection.
   auto bystander = daemon.client();
   ASSERT_TRUE(replied(bystander->createReportingSession(9)));
 
