@@ -128,29 +128,6 @@ TEST_F(InotifyNotificationsTest, RefusesBadNamesAndArgumentsAndFailsSetUpWithout
   EXPECT_FALSE(log_->lines().empty());
 }
 
-TEST_F(InotifyNotificationsTest, DestructionWithEventsPendingIsClean) {
-  // Hold the queue so deliveries pile up behind a task, then destroy the adapter while the
-  // kernel still has unread events for it.
-  std::promise<void> release;
-  queue1_->async([wait = release.get_future().share()] { wait.wait(); });
-  auto poster = open();
-  {
-    auto notify = open();
-    subscribe(*notify, kName, queue1_, "pending");
-    for (int i = 0; i < 50; ++i) ASSERT_EQ(poster->post(kName), 0);
-  }
-  release.set_value();
-  threadOf(*queue1_);
-  const size_t before = delivered().size();
-  // Nothing is queued once the adapter is gone.
-  ASSERT_EQ(poster->post(kName), 0);
-  subscribe(*poster, "sentinel", queue1_, "sentinel");
-  ASSERT_EQ(poster->post("sentinel"), 0);
-  ASSERT_TRUE(waitFor(before + 1));
-  threadOf(*queue1_);
-  EXPECT_EQ(delivered().size(), before + 1);
-}
-
 TEST_F(InotifyNotificationsTest, OtherWaysOfChangingTheFileCountAsPostsAndSurviveItsRemoval) {
   auto notify = open();
   subscribe(*notify, kName, queue1_, "name");

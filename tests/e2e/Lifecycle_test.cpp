@@ -50,26 +50,16 @@ class NotifySocket {
 
 }  // namespace
 
-TEST(LifecycleEndToEnd, TellsTheServiceManagerItsStateAndFeedsTheWatchdog) {
+// The limits file applies on SIGHUP, under the flags, and a bad one changes nothing.
+TEST(LifecycleEndToEnd, TellsTheServiceManagerItsStateAndReloadsTheLimitsFileOnSighup) {
   SXTestTempDir dir;
   NotifySocket manager(dir.file("notify"));
   TestDaemon daemon(
-      {.environment = {{"NOTIFY_SOCKET", dir.file("notify")}, {"WATCHDOG_USEC", "200000"}}});
+      {.extraArgs = {"--max-reporter-ids", "1"},
+       .environment = {{"NOTIFY_SOCKET", dir.file("notify")}, {"WATCHDOG_USEC", "200000"}},
+       .daemonConfig = {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", 8}}}}});
   EXPECT_NE(manager.next("READY=1").find("STATUS=serving on "), std::string::npos);
   EXPECT_NE(manager.next("WATCHDOG=1"), "");
-  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-  EXPECT_NE(manager.next("RELOADING=1").find("MONOTONIC_USEC="), std::string::npos);
-  EXPECT_NE(manager.next("READY=1"), "");  // the reload is over
-  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
-  EXPECT_NE(manager.next("STOPPING=1"), "");
-  EXPECT_EQ(daemon.waitForExit(), 0);
-  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
-}
-
-TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesNothing) {
-  TestDaemon daemon(
-      {.extraArgs = {"--max-reporter-ids", "1"},
-       .daemonConfig = {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", 8}}}}});
   auto client = daemon.client();
   ASSERT_TRUE(replied(client->createReportingSession(7)));
   const SXValue big = {{"text", std::string(200, 'x')}};
@@ -82,6 +72,8 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   daemon.writeConfig("sxreportingd.json",
                      {{"limits", {{"max-reporter-ids", 8}, {"max-inflight-bytes", 8192}}}});
   ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  EXPECT_NE(manager.next("RELOADING=1").find("MONOTONIC_USEC="), std::string::npos);
+  EXPECT_NE(manager.next("READY=1"), "");  // the reload is over
   ASSERT_TRUE(daemon.waitForLog("limit max-payload-bytes: 65536 (was 64)")) << daemon.log();
   EXPECT_EQ(daemon.countInLog("limit max-inflight-bytes changed to 8192; it applies at the next "
                               "start"),
@@ -89,21 +81,17 @@ TEST(LifecycleEndToEnd, LimitsFileAppliesOnSighupUnderTheFlagsAndABadOneChangesN
   EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
   EXPECT_EQ(send({{"a", 1}}, {7, 8}), SXCallStatus::kRemoteError);  // the flag wins
 
-  // A file or a section that is bad anywhere changes nothing.
-  for (const SXValue& bad :
-       {SXValue("limits"),
-        SXValue{{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", -5}}}}}) {
-    daemon.writeConfig("sxreportingd.json", bad);
-    ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
-    ASSERT_TRUE(daemon.waitForLog(bad.is_string() ? "not a JSON object; the configuration stays"
-                                                  : "max-reporter-ids is -5, not a positive "
-                                                    "integer; the limits stay"));
-    EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
-  }
+  // A section that is bad anywhere changes nothing, not even its good keys.
+  daemon.writeConfig("sxreportingd.json",
+                     {{"limits", {{"max-payload-bytes", 64}, {"max-reporter-ids", -5}}}});
+  ASSERT_EQ(::kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.waitForLog("max-reporter-ids is -5, not a positive integer; the limits stay"));
+  EXPECT_EQ(send(big, {7}), SXCallStatus::kReplied);
 
-  TestDaemon refused({.daemonConfig = {{"limits", {{"max-payload", 64}}}}, .waitForReady = false});
-  EXPECT_EQ(refused.waitForExit(), 2);
-  EXPECT_EQ(refused.countInLog("unknown limit \"max-payload\""), 1u) << refused.log();
+  ASSERT_EQ(::kill(daemon.pid(), SIGTERM), 0);
+  EXPECT_NE(manager.next("STOPPING=1"), "");
+  EXPECT_EQ(daemon.waitForExit(), 0);
+  EXPECT_EQ(daemon.countInLog("stopped after a drain of"), 1u) << daemon.log();
 }
 
 // A collector that never answers holds the exporter's batch, and with it the drain.
@@ -179,7 +167,6 @@ TEST(LifecycleEndToEnd, StartReplyWaitsForStopThenSpoolAndFileHoldTheSession) {
   EXPECT_EQ(summary["Playback_Start_1"], R"({"k":1})");
   EXPECT_EQ(summary["KestrelStats_Generic_1"], R"({"Speaker_underruns":3})");
   EXPECT_LE(messages[2]["time"].get<double>(), flushes[0]["time"].get<double>());
-  EXPECT_TRUE(daemon.waitForLog("fetching driver logs {\"Speaker_underruns\":3}"));
   // (The summary file: PermissionsEndToEnd.SummaryFilesStayInTheirOwnClosedDirectory.)
 }
 
@@ -196,13 +183,11 @@ TEST(LifecycleEndToEnd, NoBackendsWaitsNineSecondsWithoutDelayingOtherSessions) 
                                     "SELECT id FROM messages WHERE session_id IS NULL", 1, 5s);
   EXPECT_EQ(singles.size(), 1u);
   EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
-  EXPECT_TRUE(daemon.waitForLog("No backends found, this session won't get sent to the server"));
   EXPECT_FALSE(replied(client->sendMessage({{"k", 1}}, 3, 1, std::vector<int64_t>{1})));
 
   EXPECT_TRUE(replied(client->stopReportingSessionForID(1)));
   EXPECT_TRUE(startOne.get().value);
   EXPECT_TRUE(daemon.waitForLog("failed to find backend", 1, 20s));
-  EXPECT_TRUE(daemon.waitForLog("No valid FernReportingSession"));
   EXPECT_TRUE(daemon.rows("fernreporting.db", "SELECT id FROM flushes").empty());
 }
 

@@ -5,7 +5,6 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
 #include <regex>
 
 #include "support/Daemon.h"
@@ -39,13 +38,18 @@ TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
   };
   const std::string notID = "ID: not a reporter ID (a signed 64-bit number): ";
   const Row rows[] = {
-      {{"create", "42"}, 0, "true\n"},
+      // Chained commands share one connection, and so its sessions, and stop at a failure.
+      {{"create", "42", "then", "set-type", "telephony", "42", "then", "get-type", "42", "then",
+        "start", "43", "then", "create", "1"},
+       1,
+       "true\ntrue\n2 (telephony)\nfalse\n"},
+      {{"--timeout", "0.2", "stop", "0", "then", "create", "1"},
+       4,
+       "stop: the service sent no reply within 0.2 s\n"},
       {{"send", "--ids", "", "{\"k\":1}"}, 0, "delivered\n"},
-      {{"start", "43"}, 1, "false\n"},
       {{}, 2, "no command given; see sxreportctl --help"},
       {{"frob"}, 2, "unknown command 'frob'"},
       {{"create", "x1"}, 2, "create: " + notID + "'x1'"},
-      {{"create", "99999999999999999999"}, 2, "create: " + notID + "'99999999999999999999'"},
       // An unknown option is named, not what its value did to the arguments after it.
       {{"create", "--config", "{}", "1"}, 2, "create: unknown option --config"},
       {{"--ids", "1", "send", "{}"}, 2, "unknown option --ids (a command's own options follow it)"},
@@ -53,17 +57,9 @@ TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
       {{"list", "--timeout", "inf"}, 2, "list: --timeout: not a time-out in seconds: 'inf'"},
       {{"set-type", "65536", "1"}, 2, "set-type: TYPE: not a service type: '65536' (0-65535"},
       {{"send", "{}"}, 2, "send: send needs either --ids ID,ID,... (--ids '' for none)"},
-      {{"send", "--broadcast", "--ids", "1", "{}"}, 2, "send: send needs either"},
-      {{"send", "--ids", "1,,2", "{}"}, 2, "send: --ids: not a reporter ID"},
-      {{"send", "--broadcast", "--category", "4294967296", "{}"},
-       2,
-       "send: --category: not a category (0 to 4294967295): '4294967296'"},
       {{"send", "--broadcast", "[1]"}, 2, "send: PAYLOAD_JSON: not a JSON object"},
-      {{"send", "--broadcast", "{"}, 2, "send: PAYLOAD_JSON: not valid JSON: {"},
       {{"configure", "5"}, 2, "configure: --config is required"},
-      {{"defaults", "write", "--bool", "K", "maybe"}, 2, "defaults write: VALUE: not a boolean"},
       {{"list", "then"}, 2, "'then' must stand between two commands"},
-      {{"list", "then", "create"}, 2, "create: ID is required"},
       // The help of the command it follows, wherever in a chain.
       {{"list", "then", "create", "1", "--help"}, 0, "Usage: sxreportctl create [OPTIONS] ID\n"},
       {{"--socket", empty_.file("nothing"), "list"}, 3, "cannot connect"},
@@ -89,18 +85,6 @@ TEST_F(SxreportctlTest, ExitStatusTellsEachOutcomeApart) {
                                std::regex("sxreportctl [0-9]+\\.[0-9]+\\.[0-9]+\n")));
 }
 
-// Sessions belong to their connection: the type set by the first command is the one read.
-TEST_F(SxreportctlTest, ChainedCommandsShareOneConnectionAndStopAtAFailure) {
-  Run chain = run({"create", "42", "then", "set-type", "telephony", "42", "then", "get-type", "42",
-                   "then", "start", "43", "then", "create", "1"});
-  EXPECT_EQ(chain.status, 1);
-  EXPECT_EQ(chain.out, "true\ntrue\n2 (telephony)\nfalse\n");
-
-  Run stopped = run({"--timeout", "0.2", "stop", "0", "then", "create", "1"});
-  EXPECT_EQ(stopped.status, 4);
-  EXPECT_EQ(stopped.out, "stop: the service sent no reply within 0.2 s\n");
-}
-
 TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
   EXPECT_EQ(run({"defaults", "write", "--bool", "ReportingEnabled", "no"}).status, 0);
   EXPECT_EQ(run({"defaults", "write", "--int", "Level", "3"}).status, 0);
@@ -114,10 +98,6 @@ TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
             (SXValue{{"Level", 3}, {"ReportingEnabled", false}}));
   EXPECT_EQ(run({"defaults", "read", "ReportingEnabled"}).out, "0\n");
   EXPECT_EQ(run({"--json", "defaults", "read"}).out, "{\"Level\":3,\"ReportingEnabled\":false}\n");
-
-  std::ofstream(file) << "[not an object";
-  EXPECT_EQ(run({"defaults", "write", "A", "b"}).status, 7);
-  EXPECT_EQ(SXTestReadFile(file), "[not an object");  // left as it was
 }
 
 TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
@@ -142,7 +122,6 @@ TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
   EXPECT_EQ(events({"events", "--name", "a", "--limit", "1"}), "3  12.250  a  {\"n\":3}\n");
   EXPECT_EQ(events({"events", "--since", "1970-01-01T00:00:11Z", "--name", "a"}),
             "3  12.250  a  {\"n\":3}\n");
-  EXPECT_EQ(events({"events", "--since", "1h"}), "(none)\n");
   EXPECT_EQ(
       SXValue::parse(events({"--json", "events", "--name", "b"})),
       SXValue::array({{{"id", 2}, {"time", 11.0}, {"name", "b"}, {"payload", SXValue::object()}}}));
