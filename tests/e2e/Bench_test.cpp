@@ -34,12 +34,4 @@ TEST(BenchEndToEnd, EveryScenarioRunsAgainstASpawnedDaemonAndLosesNoRow) {
   EXPECT_EQ(withRows, 4);
 }
 
-// A bad option is one line on standard error and exit status 2.
-TEST(BenchEndToEnd, ABadOptionIsAOneLineUsageError) {
-  CommandRun run = runCommand(kBench + " --clients 4097 2>&1 >/dev/null");
-  EXPECT_EQ(run.status, 2);
-  EXPECT_TRUE(run.output.starts_with("sxreport-bench: --clients: not a number from 1 to 4096"));
-  EXPECT_EQ(run.output.find('\n'), run.output.size() - 1) << run.output;
-}
-
 }  // namespace

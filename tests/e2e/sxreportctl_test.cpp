@@ -1,7 +1,6 @@
 // The sxreportctl executable against the daemon, and its own files in the daemon's directories.
 // (How `status` prints, CtlStatus tests; that it answers, the install test.)
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -101,17 +100,11 @@ TEST_F(SxreportctlTest, DefaultsRoundTripThroughTheDomainFile) {
 }
 
 TEST_F(SxreportctlTest, EventsReadsTheAnalyticsStore) {
-  sqlite3* db = nullptr;
-  ASSERT_EQ(sqlite3_open(empty_.file("tallyvane.db").c_str(), &db), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(db,
-                         "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, "
-                         "payload_json TEXT);"
-                         "INSERT INTO events VALUES (1, 10.5, 'a', '{\"n\":1}');"
-                         "INSERT INTO events VALUES (2, 11.0, 'b', '{}');"
-                         "INSERT INTO events VALUES (3, 12.25, 'a', '{\"n\":3}');",
-                         nullptr, nullptr, nullptr),
-            SQLITE_OK);
-  sqlite3_close(db);
+  SXTestExec(empty_.file("tallyvane.db"),
+             "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload_json TEXT);"
+             "INSERT INTO events VALUES (1, 10.5, 'a', '{\"n\":1}');"
+             "INSERT INTO events VALUES (2, 11.0, 'b', '{}');"
+             "INSERT INTO events VALUES (3, 12.25, 'a', '{\"n\":3}');");
 
   auto events = [&](std::vector<std::string> args) {
     args.insert(args.begin(), {"--state-dir", empty_.path()});

@@ -40,11 +40,7 @@ class FakeProcessInfo final : public SXProcessInfo {
 // Files in memory.
 class FakeFileSystem final : public SXFileSystem {
  public:
-  SXStatus createDirectory(const std::string& path, unsigned mode) override {
-    SXMutexLock lock(mutex_);
-    directories[path] = mode;
-    return {};
-  }
+  SXStatus createDirectory(const std::string&, unsigned) override { return {}; }
   SXStatus writeFileAtomically(const std::string& path, const std::string& contents) override {
     SXMutexLock lock(mutex_);
     files[path] = contents;
@@ -59,7 +55,6 @@ class FakeFileSystem final : public SXFileSystem {
   }
 
   SXMutex mutex_;
-  std::map<std::string, unsigned> directories;
   std::map<std::string, std::string> files;
 };
 
