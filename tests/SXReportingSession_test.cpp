@@ -239,10 +239,7 @@ TEST(SXReportingSessionLifecycle, SessionsWaitingForBackendsNeverHoldUpAnother) 
   t.fern->holdConfigurations(true);
   // Polls the spool until `from` holds `rows` rows.
   auto eventually = [&](const std::string& from, int64_t rows) {
-    for (int i = 0; i < 1000 && t.fern->count(from) != rows; ++i) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return t.fern->count(from) == rows;
+    return waitUntil([&] { return t.fern->count(from) == rows; }, std::chrono::seconds(10));
   };
 
   // More sessions wait at once than the pool has threads.

@@ -84,9 +84,8 @@ TEST_F(SqliteBatchWriterTest, TheWriterMayOutliveItsOwnerWhenAProducerHeldIt) {
   writer->enqueue(Value(2));
   writer.reset();
   open_.set_value();
-  for (int i = 0; i < 2000 && !weak.expired(); ++i) std::this_thread::sleep_for(10ms);
-  EXPECT_TRUE(weak.expired());
-  for (int i = 0; i < 2000 && Stored().size() < 2; ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(waitUntil([&] { return weak.expired(); }));
+  waitUntil([&] { return Stored().size() >= 2; });
   EXPECT_EQ(Stored(), (std::vector<int64_t>{1, 2}));
 }
 

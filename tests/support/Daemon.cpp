@@ -10,15 +10,6 @@
 #include <fstream>
 #include <thread>
 
-bool waitUntil(const std::function<bool()>& ready, std::chrono::milliseconds timeout) {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (!ready()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return true;
-}
-
 namespace {
 
 std::vector<char*> pointersTo(std::vector<std::string>& words) {

@@ -96,10 +96,6 @@ struct CommandRun {
 };
 CommandRun runCommand(const std::string& command);
 
-// Polls `ready` until it holds or `timeout` passes.
-bool waitUntil(const std::function<bool()>& ready,
-               std::chrono::milliseconds timeout = std::chrono::seconds(15));
-
 // The value of a call that must have been answered; fails the test otherwise.
 template <typename T>
 T replied(std::future<SXCallResult<T>> future) {

@@ -7,10 +7,23 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "sqlite/SqliteConnection.h"
+
+// Polls `ready` until it holds or `timeout` passes.
+inline bool waitUntil(const std::function<bool()>& ready,
+                      std::chrono::milliseconds timeout = std::chrono::seconds(15)) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!ready()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return true;
+}
 
 // A fresh directory under the system's temporary directory, removed with everything in it.
 class SXTestTempDir {
