@@ -87,22 +87,19 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
   // Not an internal build: no file, but the configuration now heads the aggregate.
   EXPECT_TRUE(t.fileSystem->files.empty());
   EXPECT_EQ(session->aggregatedPayloadEntries()[0], SXValue::object());
-  // The stored text is made without the rewritten copy, from the dictionary or from the
-  // caller's own text: same members, same order.
+  // The stored text is written straight from the packed payload: same members, same order as
+  // the rewritten dictionary's, which can still be had once only the text is kept.
   for (const SXValue& spaced :
        {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}}, SXValue::array({1}),
         SXValue{{"z", "\",{} \\"}, {"a b", {1.5, "]", nullptr}}, {"a_b", 2}, {"a c", -0.0}},
         SXValue{{"\xc3\xa9 t", 1}, {"e t", 2}}, SXValue{{"q\"u o", 1}, {"b", 2}},
         SXValue::object()}) {
-    const std::string expected = SXValueText(SXReportingSessionUnderscoreKeys(spaced));
-    EXPECT_EQ(SXReportingSessionUnderscoreKeysText(spaced), expected);
-    SXReportingMessagePayload prepared(std::make_shared<const SXValue>(spaced));
-    prepared.hold();  // an analytics event still to come keeps the caller's text
-    EXPECT_EQ(*prepared.text(), expected) << spaced.dump();
-    auto own = prepared.payloadText();
-    EXPECT_EQ(own ? *own : "", spaced.is_object() ? SXValueText(spaced) : "");
-    prepared.release();
-    EXPECT_EQ(prepared.payloadText(), nullptr);  // then only the stored text is kept
+    const SXValue rewritten = SXReportingSessionUnderscoreKeys(spaced);
+    SXReportingMessagePayload prepared(
+        std::make_shared<const SXPackedValue>(SXPackedValue::fromValue(spaced)));
+    EXPECT_EQ(prepared.rewritten(), rewritten) << spaced.dump();
+    EXPECT_EQ(*prepared.text(), SXValueText(rewritten)) << spaced.dump();
+    EXPECT_EQ(prepared.rewritten(), rewritten) << spaced.dump();
   }
 }
 

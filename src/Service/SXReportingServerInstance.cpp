@@ -205,7 +205,7 @@ void SXReportingServerInstance::getAllReporters(Reply<std::vector<int64_t>> repl
   });
 }
 
-void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXValue> message,
+void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXPackedValue> message,
                                             SXReportingCategory category,
                                             SXReportingMessageType type,
                                             std::optional<std::vector<int64_t>> reporterIDs,
@@ -230,15 +230,15 @@ void SXReportingServerInstance::sendMessage(std::shared_ptr<const SXValue> messa
   });
 }
 
-std::shared_ptr<const SXValue> SXReportingServerInstance::chargeDeliveries(
-    std::shared_ptr<const SXValue> message, size_t packedBytes, size_t deliveries) const {
+std::shared_ptr<const SXPackedValue> SXReportingServerInstance::chargeDeliveries(
+    std::shared_ptr<const SXPackedValue> message, size_t deliveries) const {
   if (!budget_ || deliveries < 2) return message;
-  uint64_t perDelivery = 512 + 2 * uint64_t{packedBytes};
+  uint64_t perDelivery = 512 + 2 * uint64_t{message->size()};
   return SXChargedAlias(std::move(message),
                         SXByteBudget::Charge(budget_, (deliveries - 1) * perDelivery));
 }
 
-void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> message,
+void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXPackedValue> message,
                                                SXReportingCategory category,
                                                SXReportingMessageType type,
                                                const std::vector<int64_t>& reporterIDs) {
@@ -249,21 +249,18 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXValue> me
       sessions.push_back(std::move(session));
   }
   if (sessions.empty()) return;
-  // Measured once for every delivery's charge and aggregate entry.
-  size_t packedBytes = SXPackedSize(*message);
-  message = chargeDeliveries(std::move(message), packedBytes, sessions.size());
+  message = chargeDeliveries(std::move(message), sessions.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(message);
-  SXReportingEventTexts events(message, prepared);
+  SXReportingEventTexts events(message);
   for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
-    SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
-                                             *session);
-    session->sendMessage(message, category, type, nullptr, packedBytes, prepared);
+    SXReportingJoulebookUtility::handleEvent(*environment_, *message, category, type, *session);
+    session->sendMessage(message, category, type, nullptr, prepared);
   }
 }
 
-void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXValue>& message,
+void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXPackedValue>& message,
                                                SXReportingCategory category,
                                                SXReportingMessageType type) {
   auto delegate = delegate_.lock();
@@ -294,16 +291,14 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXVal
                                           nullptr);
     return;
   }
-  size_t packedBytes = SXPackedSize(*message);
-  auto charged = chargeDeliveries(message, packedBytes, active.size());
+  auto charged = chargeDeliveries(message, active.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(charged);
-  SXReportingEventTexts events(charged, prepared);
+  SXReportingEventTexts events(charged);
   for (const auto& session : active) {
-    session->sendMessage(charged, category, type, nullptr, packedBytes, prepared);
+    session->sendMessage(charged, category, type, nullptr, prepared);
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
-    SXReportingJoulebookUtility::handleEvent(*environment_, message.get(), category, type,
-                                             *session);
+    SXReportingJoulebookUtility::handleEvent(*environment_, *message, category, type, *session);
   }
 }
 

@@ -40,7 +40,7 @@ class SXReportingServerInstance final
   void setConfiguration(std::optional<SXValue> configuration, int64_t reporterID,
                         Reply<bool> reply) override;
   void startReportingSessionForID(int64_t reporterID, Reply<bool> reply) override;
-  void sendMessage(std::shared_ptr<const SXValue> message, SXReportingCategory category,
+  void sendMessage(std::shared_ptr<const SXPackedValue> message, SXReportingCategory category,
                    SXReportingMessageType type, std::optional<std::vector<int64_t>> reporterIDs,
                    Reply<std::optional<SXError>> reply) override;
   void stopReportingSessionForID(int64_t reporterID, Reply<bool> reply) override;
@@ -77,14 +77,14 @@ class SXReportingServerInstance final
   // Whether the session limits leave room for a new session under `reporterID` (replacing
   // one always does); logs and counts a refusal as the function `fn`.
   bool hasRoomForSession(int64_t reporterID, const char* fn);
-  void routeAddressed(std::shared_ptr<const SXValue> message, SXReportingCategory category,
+  void routeAddressed(std::shared_ptr<const SXPackedValue> message, SXReportingCategory category,
                       SXReportingMessageType type, const std::vector<int64_t>& reporterIDs);
   // The message, charged with what its deliveries beyond the first make the service hold
   // (each session's copy of its text, its queue entry, its aggregate entry, its analytics row).
-  std::shared_ptr<const SXValue> chargeDeliveries(std::shared_ptr<const SXValue> message,
-                                                  size_t packedBytes, size_t deliveries) const;
-  void routeBroadcast(const std::shared_ptr<const SXValue>& message, SXReportingCategory category,
-                      SXReportingMessageType type);
+  std::shared_ptr<const SXPackedValue> chargeDeliveries(
+      std::shared_ptr<const SXPackedValue> message, size_t deliveries) const;
+  void routeBroadcast(const std::shared_ptr<const SXPackedValue>& message,
+                      SXReportingCategory category, SXReportingMessageType type);
   void sendDriverDeltaAndStop(const std::shared_ptr<SXReportingSession>& session);
 
   const std::shared_ptr<SXReportingEnvironment> environment_;

@@ -117,7 +117,7 @@ void SXReportingRemoveRepeatedIDs(std::vector<int64_t>& reporterIDs) {
 }
 
 std::string SXReportingServiceExport::checkLimits(std::string_view method, const SXValue& params,
-                                                  size_t wireBytes) {
+                                                  size_t wireBytes, const SXPackedValue* payload) {
   const SXReportingLimits& limits = environment_->limits();
   auto refuse = [&](SXReportingGuardrail guardrail, const std::string& why) {
     environment_->counters().dropped(guardrail);
@@ -125,10 +125,11 @@ std::string SXReportingServiceExport::checkLimits(std::string_view method, const
   };
   // A request no larger than a limit cannot hold a larger value, so only larger requests are
   // measured.
-  auto checkSize = [&](const SXValue& value, uint64_t limit, const char* what, const char* flag,
+  auto checkSize = [&](const SXValue& value, const SXPackedValue* packed, uint64_t limit,
+                       const char* what, const char* flag,
                        SXReportingGuardrail guardrail) -> std::string {
     if (wireBytes <= limit) return "";
-    size_t size = SXPackedSize(value);
+    size_t size = packed ? packed->size() : SXPackedSize(value);
     if (size <= limit) return "";
     return refuse(guardrail, std::string(what) + " of " + std::to_string(size) +
                                  " bytes is larger than the limit of " + std::to_string(limit) +
@@ -142,11 +143,11 @@ std::string SXReportingServiceExport::checkLimits(std::string_view method, const
                         " reporter IDs, more than the limit of " +
                         std::to_string(limits.maxReporterIDs) + " (--max-reporter-ids)");
     }
-    return checkSize(params[0], limits.maxPayloadBytes, "payload", "--max-payload-bytes",
+    return checkSize(params[0], payload, limits.maxPayloadBytes, "payload", "--max-payload-bytes",
                      SXReportingGuardrail::kPayloadBytes);
   }
   if (method == sxr::method::kSetConfiguration) {
-    return checkSize(params[0], limits.maxConfigurationBytes, "configuration",
+    return checkSize(params[0], nullptr, limits.maxConfigurationBytes, "configuration",
                      "--max-configuration-bytes", SXReportingGuardrail::kConfigurationBytes);
   }
   return "";
@@ -175,18 +176,40 @@ std::string SXReportingServiceExport::validate(std::string_view method, const SX
 
 void SXReportingServiceExport::handleRequest(std::string_view method, SXValue params,
                                              size_t wireBytes, SXIpcReplyFn reply) {
+  handle(method, params, wireBytes, std::move(reply), std::nullopt);
+}
+
+void SXReportingServiceExport::handleRequest(std::string_view method,
+                                             const msgpack::object& params, size_t wireBytes,
+                                             SXIpcReplyFn reply) {
+  constexpr int kAnyDepth = std::numeric_limits<int>::max();  // the connection checked it
+  const msgpack::object_array& items = params.via.array;
+  if (method != sxr::method::kSendMessage || items.size == 0 ||
+      items.ptr[0].type != msgpack::type::object_type::MAP) {
+    handleRequest(method, SXValueFromMsgpack(params, kAnyDepth), wireBytes, std::move(reply));
+    return;
+  }
+  SXValue values = SXValue::array({SXValue::object()});
+  for (uint32_t i = 1; i < items.size; ++i) {
+    values.push_back(SXValueFromMsgpack(items.ptr[i], kAnyDepth));
+  }
+  handle(method, values, wireBytes, std::move(reply), SXPackedValue::fromObject(items.ptr[0]));
+}
+
+void SXReportingServiceExport::handle(std::string_view method, SXValue& params, size_t wireBytes,
+                                      SXIpcReplyFn reply, std::optional<SXPackedValue> payload) {
   std::string why = validate(method, params);
-  if (why.empty()) why = checkLimits(method, params, wireBytes);
+  if (why.empty()) why = checkLimits(method, params, wireBytes, payload ? &*payload : nullptr);
   if (!why.empty()) {
     reply(why, nullptr);
     return;
   }
-  dispatch(method, params, wireBytes, std::move(reply));
+  dispatch(method, params, wireBytes, std::move(reply), std::move(payload));
 }
 
 // Moves what it hands on out of `params`.
 void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params, size_t wireBytes,
-                                        SXIpcReplyFn reply) {
+                                        SXIpcReplyFn reply, std::optional<SXPackedValue> payload) {
   auto boolReply = [reply](bool value) { reply(nullptr, value); };
   auto& instance = *instance_;
   if (method == sxr::method::kCreate) {
@@ -209,10 +232,11 @@ void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params
       ids = params[3].get<std::vector<int64_t>>();
       SXReportingRemoveRepeatedIDs(*ids);
     }
-    auto payload = SXChargedShared(std::move(params[0]),
-                                   SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
+    auto message =
+        SXChargedShared(payload ? std::move(*payload) : SXPackedValue::fromValue(params[0]),
+                        SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
     instance.sendMessage(
-        std::move(payload), params[1].get<SXReportingCategory>(),
+        std::move(message), params[1].get<SXReportingCategory>(),
         params[2].get<SXReportingMessageType>(), std::move(ids),
         [reply](std::optional<SXError> error) { reply(nullptr, errorValue(error)); });
   } else if (method == sxr::method::kStop) {

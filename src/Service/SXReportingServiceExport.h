@@ -8,9 +8,11 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 
 #include "SXReportingServerInstance.h"
 #include "Statistics/SXReportingEnvironment.h"
+#include "common/SXPackedValue.h"
 #include "platform/Ipc.h"
 
 class SXReportingServiceDelegate;
@@ -24,14 +26,22 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
 
   void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
                      SXIpcReplyFn reply) override;
+  // A message's payload stays packed: the stores write their texts straight from its bytes.
+  void handleRequest(std::string_view method, const msgpack::object& params, size_t wireBytes,
+                     SXIpcReplyFn reply) override;
 
   // Checks a request without running it: an empty string when it is well formed, else why not.
   static std::string validate(std::string_view method, const SXValue& params);
 
  private:
+  // `payload`: a message's payload, packed, which `params` holds an empty dictionary for.
+  void handle(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply,
+              std::optional<SXPackedValue> payload);
   // Empty when the request is within the size limits, else why not (and counted).
-  std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes);
-  void dispatch(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply);
+  std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes,
+                          const SXPackedValue* payload);
+  void dispatch(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply,
+                std::optional<SXPackedValue> payload);
 
   const std::shared_ptr<SXReportingServerInstance> instance_;
   const std::weak_ptr<SXReportingServiceDelegate> delegate_;

@@ -6,6 +6,7 @@
 #include <optional>
 #include <vector>
 
+#include "common/SXPackedValue.h"
 #include "sxreporting/types.h"
 
 class SXReportingServerInstance;
@@ -27,7 +28,8 @@ class SXReportingServiceProtocol {
                                 Reply<bool> reply) = 0;
   virtual void startReportingSessionForID(int64_t reporterID, Reply<bool> reply) = 0;
   // The message is shared, never changed: every sink and session reads this one copy.
-  virtual void sendMessage(std::shared_ptr<const SXValue> message, SXReportingCategory category,
+  virtual void sendMessage(std::shared_ptr<const SXPackedValue> message,
+                           SXReportingCategory category,
                            SXReportingMessageType type,
                            std::optional<std::vector<int64_t>> reporterIDs,
                            Reply<std::optional<SXError>> reply) = 0;

@@ -80,30 +80,6 @@ std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXV
   return members;
 }
 
-// The rewrite's text made from the caller's dictionary text: each member's value text copied
-// under its rewritten key, in the rewritten order. Nothing when a key is not plain ASCII, whose
-// order in the text might not be that of the dictionary's keys; the caller then writes it anew.
-std::optional<std::string> underscoredText(std::string_view callerText) {
-  auto members = SXDictionaryTextMembers(callerText);
-  if (!members) return std::nullopt;
-  std::vector<std::pair<std::string, std::string_view>> renamed;
-  renamed.reserve(members->size());
-  for (const auto& [key, value] : *members) {
-    if (std::any_of(key.begin(), key.end(), [](char c) { return c & 0x80; })) return std::nullopt;
-    renamed.emplace_back(underscored(key), value);
-  }
-  orderRewrittenMembers(renamed);
-  std::string text;
-  text.reserve(callerText.size());
-  text += '{';
-  for (const auto& [key, value] : renamed) {
-    if (text.size() > 1) text += ',';
-    text.append("\"").append(key).append("\":").append(value);
-  }
-  text += '}';
-  return text;
-}
-
 }  // namespace
 
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
@@ -112,109 +88,23 @@ SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   return rewritten;
 }
 
-std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload) {
-  auto members = underscoredMembers(payload);
-  std::vector<SXTextMember> text;
-  text.reserve(members.size());
-  for (const auto& [key, value] : members) text.push_back({key, value});
-  return SXDictionaryText(text);
-}
-
-bool SXReportingMessagePayload::rewritesLocked() {
-  if (!rewrites_) rewrites_ = SXReportingSessionHasSpacedKeys(*caller_);
-  return *rewrites_;
-}
-
-std::shared_ptr<const SXValue> SXReportingMessagePayload::rewrittenLocked() {
-  if (!rewritten_) {
-    // A payload without spaced keys is its own rewrite: shared, not copied. A copy holds the
-    // caller's payload, so that whatever the caller's payload carries (its client's charge of
-    // bytes) lasts as long as either.
-    if (rewritesLocked()) {
-      struct Rewrite {
-        SXValue value;
-        std::shared_ptr<const SXValue> caller;
-      };
-      auto rewrite = std::make_shared<const Rewrite>(
-          Rewrite{SXReportingSessionUnderscoreKeys(*caller_), caller_});
-      rewritten_ = std::shared_ptr<const SXValue>(rewrite, &rewrite->value);
-    } else {
-      rewritten_ = caller_;
-    }
-  }
-  return rewritten_;
-}
-
-std::shared_ptr<const SXValue> SXReportingMessagePayload::rewritten() {
+SXValue SXReportingMessagePayload::rewritten() {
   SXMutexLock lock(mutex_);
-  if (!caller_ && !rewritten_) {
-    // Asked for after the dictionaries were released: the text is a dump, so it parses.
-    return std::make_shared<const SXValue>(SXValue::parse(*text_));
-  }
-  return rewrittenLocked();
-}
-
-const std::shared_ptr<const std::string>& SXReportingMessagePayload::callerTextLocked() {
-  if (!callerText_) callerText_ = std::make_shared<const std::string>(SXValueText(*caller_));
-  return callerText_;
-}
-
-const std::string& SXReportingMessagePayload::makeTextLocked() {
-  if (text_) return *text_;
-  if (!rewritesLocked()) {
-    text_ = callerTextLocked();
-  } else if (rewritten_) {
-    text_ = std::make_shared<const std::string>(SXValueText(*rewritten_));
-  } else {
-    std::optional<std::string> text;
-    if (caller_->is_object()) text = underscoredText(*callerTextLocked());
-    text_ = std::make_shared<const std::string>(
-        text ? std::move(*text) : SXReportingSessionUnderscoreKeysText(*caller_));
-  }
-  return *text_;
-}
-
-const std::string& SXReportingMessagePayload::textLocked() {
-  makeTextLocked();
-  caller_ = nullptr;
-  rewritten_ = nullptr;
-  if (holds_ == 0) callerText_ = nullptr;
-  return *text_;
+  // Asked for after the packed payload was let go: the text is a dump, so it parses.
+  if (!caller_) return SXValue::parse(*text_);
+  return SXReportingSessionUnderscoreKeys(caller_->value());
 }
 
 std::shared_ptr<const std::string> SXReportingMessagePayload::text() {
   SXMutexLock lock(mutex_);
-  textLocked();
+  if (!text_) text_ = std::make_shared<const std::string>(SXPackedDictionaryText(*caller_, true));
+  caller_ = nullptr;
   return text_;
-}
-
-void SXReportingMessagePayload::keepOnlyText() {
-  SXMutexLock lock(mutex_);
-  textLocked();
-}
-
-std::shared_ptr<const std::string> SXReportingMessagePayload::payloadText() {
-  SXMutexLock lock(mutex_);
-  if (callerText_) return callerText_;
-  if (!caller_ || !caller_->is_object()) return nullptr;
-  // The dictionaries stay: a standalone send of a session not started reads them.
-  return callerTextLocked();
-}
-
-void SXReportingMessagePayload::hold() {
-  SXMutexLock lock(mutex_);
-  ++holds_;
-}
-
-void SXReportingMessagePayload::release() {
-  SXMutexLock lock(mutex_);
-  // Once only the stored text is kept, the last reader lets the caller's go.
-  if (--holds_ == 0 && !caller_ && text_) callerText_ = nullptr;
 }
 
 SXValue SXReportingAggregateEntry::toValue() const {
   if (dictionary_) return *dictionary_;
-  return SXValue{{messageId_, *payload_->rewritten()}};
+  return SXValue{{messageId_, payload_->rewritten()}};
 }
 
 std::shared_ptr<SXReportingSession> SXReportingSession::initWithID(

@@ -18,51 +18,31 @@
 #include "Statistics/SXReportingEnvironment.h"
 #include "Statistics/SXReportingEventSession.h"
 #include "Statistics/SXReportingTallyvaneBridge.h"
+#include "common/SXPackedValue.h"
 #include "common/SXThreadSafety.h"
 #include "common/SXValueText.h"
 #include "platform/FernReporting.h"
 
 // A message's payload as a session's aggregate and its send task share it. The caller's
-// dictionary is never changed; the key rewrite and the text of the rewritten payload are made
-// at most once each, by whichever needs them first: normally the send task on the session's
-// queue, so that the server queue only hands the payload on. Once the text exists the
-// dictionaries are released, so that a started session's aggregate holds only text until
-// stop. Any thread.
-class SXReportingMessagePayload final : public SXPayloadTextSource {
+// payload is never changed; the text of its key rewrite is made once, by whichever needs it
+// first: normally the send task on the session's queue, so that the server queue only hands
+// the payload on. Once the text exists the packed payload is let go (and with it the client's
+// charge), so that a started session's aggregate holds only text until stop. Any thread.
+class SXReportingMessagePayload final {
  public:
-  explicit SXReportingMessagePayload(std::shared_ptr<const SXValue> callerPayload)
+  explicit SXReportingMessagePayload(std::shared_ptr<const SXPackedValue> callerPayload)
       : caller_(std::move(callerPayload)) {}
   // The payload with every space in its keys replaced by "_".
-  std::shared_ptr<const SXValue> rewritten();
-  // SXValueText of the rewritten payload (compact JSON).
+  SXValue rewritten();
+  // SXValueText of the rewritten payload (compact JSON), made now if need be; the packed
+  // payload is let go.
   std::shared_ptr<const std::string> text();
-  // Makes the text and releases the dictionaries (and whatever the caller's payload holds).
-  void keepOnlyText();
-  // SXValueText of the caller's own payload when it is a dictionary, made now if need be; null
-  // when it is not a dictionary, or once only the rewrite's text is kept and nothing holds this
-  // one. The rewrite's text is made from it (its members' texts copied under their new keys),
-  // so whichever store asks first writes the payload's values for both.
-  std::shared_ptr<const std::string> payloadText() override;
-  void hold() override;
-  void release() override;
+  void keepOnlyText() { text(); }
 
  private:
-  // Whether the rewrite changes the caller's payload; made once.
-  bool rewritesLocked() SX_REQUIRES(mutex_);
-  std::shared_ptr<const SXValue> rewrittenLocked() SX_REQUIRES(mutex_);
-  const std::shared_ptr<const std::string>& callerTextLocked() SX_REQUIRES(mutex_);
-  // Makes the text once.
-  const std::string& makeTextLocked() SX_REQUIRES(mutex_);
-  // Makes the text once and releases the dictionaries.
-  const std::string& textLocked() SX_REQUIRES(mutex_);
-
   SXMutex mutex_;
-  std::shared_ptr<const SXValue> caller_ SX_GUARDED_BY(mutex_);     // released with the text
-  std::shared_ptr<const SXValue> rewritten_ SX_GUARDED_BY(mutex_);  // released with the text
-  std::shared_ptr<const std::string> callerText_ SX_GUARDED_BY(mutex_);  // released with them
-  std::shared_ptr<const std::string> text_ SX_GUARDED_BY(mutex_);  // the caller's when no rewrite
-  std::optional<bool> rewrites_ SX_GUARDED_BY(mutex_);
-  int holds_ SX_GUARDED_BY(mutex_) = 0;  // readers that may still want callerText_
+  std::shared_ptr<const SXPackedValue> caller_ SX_GUARDED_BY(mutex_);  // let go with the text
+  std::shared_ptr<const std::string> text_ SX_GUARDED_BY(mutex_);
 };
 
 // One entry of a session's aggregate: a message entry ({message id: rewritten payload}) or
@@ -122,8 +102,6 @@ using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
 
 // A copy of `payload` in which every space in a key is replaced by "_"; values untouched.
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload);
-// SXValueText of SXReportingSessionUnderscoreKeys(payload), made without the copy.
-std::string SXReportingSessionUnderscoreKeysText(const SXValue& payload);
 // Whether the rewrite would change `payload`.
 bool SXReportingSessionHasSpacedKeys(const SXValue& payload);
 
@@ -153,23 +131,21 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
 
   std::string messageIdForCategory(SXReportingCategory category, SXReportingMessageType type);
   // `payload` is never changed; the shared form lets the send task read it without a copy.
-  // `packedBytes`, its MessagePack size, is measured here when the caller has not.
   // `prepared`: the payload's rewritten form, made once for every session a message goes to
   // (a broadcast, a list of IDs), so that its text is made once and shared by their
   // aggregates; made here when null.
-  void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+  void sendMessage(std::shared_ptr<const SXPackedValue> payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply,
-                   std::optional<size_t> packedBytes = std::nullopt,
                    std::shared_ptr<SXReportingMessagePayload> prepared = nullptr);
   void sendMessage(const SXValue& payload, SXReportingCategory category,
                    SXReportingMessageType type, bool sync, SXReportingSendReply reply) {
-    sendMessage(std::make_shared<const SXValue>(payload), category, type, sync, std::move(reply));
+    sendMessage(std::make_shared<const SXPackedValue>(SXPackedValue::fromValue(payload)),
+                category, type, sync, std::move(reply));
   }
-  void sendMessage(std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+  void sendMessage(std::shared_ptr<const SXPackedValue> payload, SXReportingCategory category,
                    SXReportingMessageType type, SXReportingSendReply reply,
-                   std::optional<size_t> packedBytes = std::nullopt,
                    std::shared_ptr<SXReportingMessagePayload> prepared = nullptr) {
-    sendMessage(std::move(payload), category, type, false, std::move(reply), packedBytes,
+    sendMessage(std::move(payload), category, type, false, std::move(reply),
                 std::move(prepared));
   }
   void sendMessage(const SXValue& payload, SXReportingCategory category,
@@ -185,7 +161,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   // waits within `budget` when one is given; when the budget is full it is refused (logged
   // and counted).
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
-                                std::shared_ptr<const SXValue> payload,
+                                std::shared_ptr<const SXPackedValue> payload,
                                 SXReportingCategory category, SXReportingMessageType type,
                                 SXReportingServiceType serviceType, const SXValue* userInfo,
                                 SXReportingSendReply reply,
@@ -194,8 +170,9 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
                                 const SXValue& payload, SXReportingCategory category,
                                 SXReportingMessageType type, SXReportingServiceType serviceType,
                                 const SXValue* userInfo, SXReportingSendReply reply) {
-    sendSingleMessage(environment, std::make_shared<const SXValue>(payload), category, type,
-                      serviceType, userInfo, std::move(reply));
+    sendSingleMessage(environment,
+                      std::make_shared<const SXPackedValue>(SXPackedValue::fromValue(payload)),
+                      category, type, serviceType, userInfo, std::move(reply));
   }
 
   // Accessors (any thread).
@@ -242,7 +219,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
     // message: it carries the message's charge on its connection's budget, and a message
     // delivered to several sessions shares one payload that the first store to finish may
     // reduce to text.
-    std::shared_ptr<const SXValue> callerPayload;
+    std::shared_ptr<const SXPackedValue> callerPayload;
     SXReportingCategory category;
     SXReportingMessageType type;
     bool startedSnapshot;

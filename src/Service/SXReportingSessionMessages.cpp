@@ -53,10 +53,9 @@ bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint
   return false;
 }
 
-void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
+void SXReportingSession::sendMessage(std::shared_ptr<const SXPackedValue> payload,
                                      SXReportingCategory category, SXReportingMessageType type,
                                      bool /*sync*/, SXReportingSendReply reply,
-                                     std::optional<size_t> packedBytes,
                                      std::shared_ptr<SXReportingMessagePayload> prepared) {
   SXLOG(log(), scope(), SXLogLevel::kDebug, "sending message for session owned by %lli",
         reporterID());
@@ -68,7 +67,7 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXValue> payload,
   if (aggregate_.load()) {
     // What the entry will hold: the payload's text (about one and a half times its
     // MessagePack size) and its id, holder and slot beside it.
-    uint64_t bytes = packedBytes.value_or(SXPackedSize(*payload)) * 3 / 2 + 256;
+    uint64_t bytes = uint64_t{payload->size()} * 3 / 2 + 256;
     aggregated =
         appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten), bytes);
   }
@@ -118,8 +117,17 @@ void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
     sendStarted(started);
     SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
     // The session's configuration is not part of a standalone message, so none is copied.
-    sendSingleMessage(environment_, send.payload->rewritten(), send.category, send.type,
-                      serviceType(), nullptr, nullptr, standaloneBudget_);
+    // The rewrite holds the caller's payload, and with it the client's charge, until it is
+    // stored.
+    struct Rewrite {
+      SXPackedValue value;
+      std::shared_ptr<const SXPackedValue> caller;
+    };
+    auto rewrite = std::make_shared<const Rewrite>(
+        Rewrite{SXPackedValue::fromValue(send.payload->rewritten()), send.callerPayload});
+    sendSingleMessage(environment_, std::shared_ptr<const SXPackedValue>(rewrite, &rewrite->value),
+                      send.category, send.type, serviceType(), nullptr, nullptr,
+                      standaloneBudget_);
     if (send.aggregated) send.payload->keepOnlyText();
   }
   sendStarted(started);
@@ -174,7 +182,7 @@ void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& s
     if (!verbose) continue;
     SXLOG(log(), scope(), SXLogLevel::kDebug,
           "FernReportingAgent %@ : message %@ : category %i : type %i", fernSession->description(),
-          sends[i].callerPayload ? *sends[i].callerPayload : SXValue(),
+          sends[i].callerPayload ? sends[i].callerPayload->value() : SXValue(),
           static_cast<int32_t>(sends[i].category), sends[i].type);
   }
 }
@@ -184,7 +192,7 @@ namespace {
 // The standalone send task: one message to the server-reporting service with its own session
 // info and user info.
 void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environment,
-                       const std::shared_ptr<const SXValue>& payload, SXReportingCategory category,
+                       const SXValue& payload, SXReportingCategory category,
                        SXReportingMessageType type, SXReportingServiceType serviceType,
                        const SXReportingSendReply& reply) {
   constexpr const char* fn = "sendSingleMessage";
@@ -198,18 +206,20 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
   SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
                       {fern::kUserInfoServiceName, SXServiceTypeName(serviceType)}};
   // A payload the session already rewrote needs no second copy.
-  auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
-                       ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
-                       : payload;
+  std::optional<SXValue> rewritten;
+  if (SXReportingSessionHasSpacedKeys(payload)) {
+    rewritten = SXReportingSessionUnderscoreKeys(payload);
+  }
   std::optional<FernError> error;
   bool sent = environment->platform().fernReporting->sendOneMessage(
-      sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
+      sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type,
+      rewritten ? *rewritten : payload, error);
   if (!sent && error) {
     SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
              error->localizedDescription);
   } else if (sent) {
     environment->counters().delivered(SXReportingSink::kFernReporting);
-    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
+    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
              static_cast<int32_t>(category), type);
   }
   if (reply) reply(error);
@@ -219,9 +229,10 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
 // the send is refused, logged (once per run of refusals) and counted, so that a client cannot
 // make the service hold an unbounded backlog of delayed sends.
 bool reserveWait(SXReportingEnvironment& environment,
-                 const std::shared_ptr<SXReportingPendingBudget>& budget, const SXValue& payload,
+                 const std::shared_ptr<SXReportingPendingBudget>& budget,
+                 const SXPackedValue& payload,
                  std::shared_ptr<SXReportingPendingBudget::Slot>& slot) {
-  uint64_t bytes = SXPackedSize(payload);
+  uint64_t bytes = payload.size();
   slot = budget->tryAcquire(bytes);
   if (slot) return true;
   environment.counters().dropped(SXReportingGuardrail::kStandalonePending);
@@ -240,7 +251,7 @@ bool reserveWait(SXReportingEnvironment& environment,
 
 void SXReportingSession::sendSingleMessage(
     const std::shared_ptr<SXReportingEnvironment>& environment,
-    std::shared_ptr<const SXValue> payload, SXReportingCategory category,
+    std::shared_ptr<const SXPackedValue> payload, SXReportingCategory category,
     SXReportingMessageType type, SXReportingServiceType serviceType,
     const SXValue* /*userInfo: not sent*/, SXReportingSendReply reply,
     const std::shared_ptr<SXReportingPendingBudget>& budget) {
@@ -255,7 +266,7 @@ void SXReportingSession::sendSingleMessage(
   auto task = [environment, payload = std::move(payload), category, type, serviceType,
                reply = std::move(reply), slot = std::move(slot)] {
     (void)slot;  // the place in the budget is held until the send has run
-    runStandaloneSend(environment, payload, category, type, serviceType, reply);
+    runStandaloneSend(environment, payload->value(), category, type, serviceType, reply);
   };
   platform.dispatch->after(std::chrono::seconds(delay),
                            platform.dispatch->lowPriorityConcurrentQueue(), std::move(task));

@@ -1,15 +1,15 @@
 #include "SXReportingJoulebookUtility.h"
 
 void SXReportingJoulebookUtility::handleEvent(SXReportingEnvironment& environment,
-                                              const SXValue* payload, SXReportingCategory,
-                                              SXReportingMessageType,
+                                              const SXPackedValue& packed,
+                                              SXReportingCategory, SXReportingMessageType,
                                               const SXReportingEventSession& session) {
-  if (!payload || !payload->is_object()) return;
-  auto onTime = payload->find("EngineOnTime");
-  if (onTime == payload->end()) return;
-  SXValue entry = {{"EngineOnDuration", *onTime},
+  // Looked for in the bytes: nearly every message has no on-time and is never decoded here.
+  if (!packed.hasMember("EngineOnTime")) return;
+  const SXValue payload = packed.value();
+  SXValue entry = {{"EngineOnDuration", payload.at("EngineOnTime")},
                    {"ApplicationName", session.hostApplicationName()}};
-  if (auto stamp = payload->find("sxreporting_timestamp"); stamp != payload->end()) {
+  if (auto stamp = payload.find("sxreporting_timestamp"); stamp != payload.end()) {
     entry["TimestampEnd"] = *stamp;
   } else {
     SXLOG(environment.log(), nullptr, SXLogLevel::kError,

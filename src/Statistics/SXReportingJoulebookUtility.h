@@ -4,11 +4,12 @@
 
 #include "SXReportingEnvironment.h"
 #include "SXReportingEventSession.h"
+#include "common/SXPackedValue.h"
 
 
 class SXReportingJoulebookUtility {
  public:
-  static void handleEvent(SXReportingEnvironment& environment, const SXValue* payload,
+  static void handleEvent(SXReportingEnvironment& environment, const SXPackedValue& payload,
                           SXReportingCategory category, SXReportingMessageType type,
                           const SXReportingEventSession& session);
 };

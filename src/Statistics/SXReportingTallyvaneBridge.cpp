@@ -15,18 +15,6 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
          SXReportingUtilityTypeName(type);
 }
 
-// Held while the message is routed, so that a store done with the text early (the session's
-// send task) does not let it go before the first event asks.
-SXReportingEventTexts::SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
-                                             std::shared_ptr<SXPayloadTextSource> source)
-    : payload_(std::move(payload)), source_(std::move(source)) {
-  if (source_) source_->hold();
-}
-
-SXReportingEventTexts::~SXReportingEventTexts() {
-  if (source_) source_->release();
-}
-
 SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   auto it = std::find_if(texts_.begin(), texts_.end(),
                          [&](const std::shared_ptr<Text>& text) { return text->host == host; });
@@ -35,17 +23,12 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
     text = *it;
   } else {
     text = texts_.emplace_back(std::make_shared<Text>(host));
-    if (source_) source_->hold();  // released when the event's text is first made
   }
-  return [payload = payload_, source = source_, text] {
+  return [payload = payload_, text] {
     SXMutexLock lock(text->mutex);
-    if (!text->text && source) {
-      if (auto own = source->payloadText()) {
-        text->text = SXDictionaryTextWithMember(*own, kHostKey, text->host);
-      }
-      source->release();
+    if (!text->text) {
+      text->text = SXPackedDictionaryText(*payload, false, SXTextMember{kHostKey, &text->host});
     }
-    if (!text->text) text->text = SXValueTextWithMember(*payload, kHostKey, text->host);
     return *text->text;
   };
 }
@@ -62,7 +45,7 @@ void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment
   environment.platform().tallyvane->sendEventLazy(
       name,
       [payload = texts.payload(), host = std::move(host)] {
-        SXValue copy = payload->is_object() ? *payload : SXValue::object();
+        SXValue copy = payload->isDictionary() ? payload->value() : SXValue::object();
         copy[kHostKey] = host;
         return copy;
       },

@@ -10,20 +10,8 @@
 
 #include "SXReportingEnvironment.h"
 #include "SXReportingEventSession.h"
+#include "common/SXPackedValue.h"
 #include "common/SXThreadSafety.h"
-
-// The payload's own compact text, shared with another store, that the events' texts can be
-// made from (the host added by copying, not by writing the payload again). Any thread.
-class SXPayloadTextSource {
- public:
-  virtual ~SXPayloadTextSource() = default;
-  // One more reader may ask for the text: the source keeps it until every hold is released.
-  virtual void hold() = 0;
-  virtual void release() = 0;
-  // The text, made now if need be; null when the payload has none (not a dictionary, or the
-  // text was let go with no hold on it).
-  virtual std::shared_ptr<const std::string> payloadText() = 0;
-};
 
 // The analytics events of one message: their payloads differ only in the host name, so each
 // distinct host's text is made once (when the analytics service first asks for it, on its
@@ -31,12 +19,11 @@ class SXPayloadTextSource {
 // the message is routed.
 class SXReportingEventTexts {
  public:
-  explicit SXReportingEventTexts(std::shared_ptr<const SXValue> payload,
-                                 std::shared_ptr<SXPayloadTextSource> source = nullptr);
-  ~SXReportingEventTexts();
+  explicit SXReportingEventTexts(std::shared_ptr<const SXPackedValue> payload)
+      : payload_(std::move(payload)) {}
   SXReportingEventTexts(const SXReportingEventTexts&) = delete;
   SXReportingEventTexts& operator=(const SXReportingEventTexts&) = delete;
-  const std::shared_ptr<const SXValue>& payload() const { return payload_; }
+  const std::shared_ptr<const SXPackedValue>& payload() const { return payload_; }
   // The event text for a session whose host is `host`.
   SXPayloadTextProvider textForHost(const SXValue& host);
 
@@ -47,8 +34,7 @@ class SXReportingEventTexts {
     SXMutex mutex;
     std::optional<std::string> text SX_GUARDED_BY(mutex);  // made by the first event to ask
   };
-  std::shared_ptr<const SXValue> payload_;
-  std::shared_ptr<SXPayloadTextSource> source_;
+  std::shared_ptr<const SXPackedValue> payload_;
   std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few
 };
 

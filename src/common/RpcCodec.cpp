@@ -1,6 +1,7 @@
 #include "common/RpcCodec.h"
 
 #include "common/MsgpackValue.h"
+#include "common/SXPackedValue.h"
 
 namespace {
 // The request itself and its params array sit above the payload.
@@ -40,20 +41,35 @@ char* RpcStreamDecoder::prepare(size_t size) {
 void RpcStreamDecoder::commit(size_t size) { unpacker_.buffer_consumed(size); }
 
 RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
+  const msgpack::object* object = nullptr;
+  Status status = next(object);
+  if (status == Status::kMessage) {
+    message = SXValueFromMsgpack(*object, limits_.maxPayloadDepth + kEnvelopeDepth);
+  }
+  return status;
+}
+
+RpcStreamDecoder::Status RpcStreamDecoder::next(const msgpack::object*& message) {
   if (!error_.empty()) return Status::kBroken;
+  if (holding_) {
+    // The unpacker keeps its zone (strings are copied into it, never referenced from the
+    // buffer) and reuses it, instead of a fresh zone per message.
+    unpacker_.reset_zone();
+    holding_ = false;
+  }
   try {
     if (unpacker_.execute()) {
       if (unpacker_.parsed_size() > limits_.maxMessageBytes) {
         error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
         return Status::kBroken;
       }
-      // Converted in place: the unpacker keeps its zone (strings are copied into it, never
-      // referenced from the buffer) and reuses it, instead of a fresh zone per message.
       lastMessageBytes_ = unpacker_.parsed_size();
       if (lastMessageBytes_ > kKeptBufferBytes) grown_ = true;
-      message = SXValueFromMsgpack(unpacker_.data(), limits_.maxPayloadDepth + kEnvelopeDepth);
-      unpacker_.reset_zone();
+      current_ = unpacker_.data();
+      holding_ = true;
+      SXCheckValueModel(current_, limits_.maxPayloadDepth + kEnvelopeDepth);
       unpacker_.reset();
+      message = &current_;
       return Status::kMessage;
     }
     if (unpacker_.parsed_size() + unpacker_.nonparsed_size() > limits_.maxMessageBytes) {
@@ -71,50 +87,47 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
   return Status::kBroken;
 }
 
-namespace {
-
-// Whether `message` is a request; on failure says why. Sets `msgid` whenever it is usable.
-bool IsRequest(const SXValue& message, std::string& why, std::optional<uint32_t>& msgid) {
+std::optional<RpcRequestView> RpcParseRequest(const msgpack::object& message, std::string& why,
+                                              std::optional<uint32_t>& msgid) {
+  using msgpack::type::object_type;
   msgid.reset();
+  const bool isArray = message.type == object_type::ARRAY;
+  const msgpack::object* items = isArray ? message.via.array.ptr : nullptr;
   // Whatever else is wrong, an array whose second element can be a msgid gets its error reply.
-  if (message.is_array() && message.size() >= 2) {
-    const SXValue& id = message[1];
-    if (id.is_number_integer() && id.get<int64_t>() >= 0 && id.get<uint64_t>() <= UINT32_MAX) {
-      msgid = static_cast<uint32_t>(id.get<uint64_t>());
-    }
+  if (isArray && message.via.array.size >= 2 && items[1].type == object_type::POSITIVE_INTEGER &&
+      items[1].via.u64 <= UINT32_MAX) {
+    msgid = static_cast<uint32_t>(items[1].via.u64);
   }
-  if (!message.is_array() || message.size() != 4 || !message[0].is_number_integer() ||
-      message[0].get<int64_t>() != 0) {
+  if (!isArray || message.via.array.size != 4 || items[0].type != object_type::POSITIVE_INTEGER ||
+      items[0].via.u64 != 0) {
     why = "not a MessagePack-RPC request [0, msgid, method, params]";
-    return false;
+    return std::nullopt;
   }
   if (!msgid) {
     why = "msgid is not an unsigned 32-bit integer";
-    return false;
+    return std::nullopt;
   }
-  if (!message[2].is_string()) {
+  if (items[2].type != object_type::STR) {
     why = "method is not a string";
-    return false;
+    return std::nullopt;
   }
-  if (!message[3].is_array()) {
+  if (items[3].type != object_type::ARRAY) {
     why = "params is not an array";
-    return false;
+    return std::nullopt;
   }
-  return true;
+  return RpcRequestView{*msgid, std::string_view(items[2].via.str.ptr, items[2].via.str.size),
+                        &items[3]};
 }
-
-}  // namespace
 
 std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
                                           std::optional<uint32_t>& msgid) {
-  if (!IsRequest(message, why, msgid)) return std::nullopt;
-  return RpcRequest{*msgid, message[2].get<std::string>(), message[3]};
-}
-
-std::optional<RpcRequest> RpcParseRequest(SXValue&& message, std::string& why,
-                                          std::optional<uint32_t>& msgid) {
-  if (!IsRequest(message, why, msgid)) return std::nullopt;
-  return RpcRequest{*msgid, std::move(message[2].get_ref<std::string&>()), std::move(message[3])};
+  msgpack::sbuffer bytes;
+  msgpack::packer<msgpack::sbuffer> packer(bytes);
+  SXPackValue(packer, message);
+  msgpack::object_handle handle = msgpack::unpack(bytes.data(), bytes.size());
+  auto view = RpcParseRequest(handle.get(), why, msgid);
+  if (!view) return std::nullopt;
+  return RpcRequest{view->msgid, std::string(view->method), message[3]};
 }
 
 std::optional<RpcResponse> RpcParseResponse(const SXValue& message) {

@@ -29,8 +29,12 @@ class RpcStreamDecoder {
   void commit(size_t size);
 
   // The next whole message. kBroken (with `error()`) when the bytes are not MessagePack, a
-  // message is larger than allowed, or it nests too deeply; the stream cannot go on then.
+  // message is larger than allowed, it nests too deeply or it has no place in the value model;
+  // the stream cannot go on then.
   Status next(SXValue& message);
+  // The same without decoding it into values: `message` points at the decoded object, which
+  // stays valid until the next call.
+  Status next(const msgpack::object*& message);
   const std::string& error() const { return error_; }
   // The MessagePack bytes of the message `next` returned last.
   size_t lastMessageBytes() const { return lastMessageBytes_; }
@@ -45,6 +49,8 @@ class RpcStreamDecoder {
   msgpack::v1::unpacker makeUnpacker() const;
 
   msgpack::v1::unpacker unpacker_;  // v1: lets us see a whole message's size before reset
+  msgpack::object current_;         // the last message, in the unpacker's zone
+  bool holding_ = false;            // the zone holds the last message's objects
   std::string error_;
   size_t lastMessageBytes_ = 0;
   bool grown_ = false;  // a message or a partial one outgrew the initial buffer
@@ -62,12 +68,19 @@ struct RpcResponse {
   SXValue result;
 };
 
+// A request as parts of its decoded object.
+struct RpcRequestView {
+  uint32_t msgid = 0;
+  std::string_view method;
+  const msgpack::object* params = nullptr;  // always an array
+};
+
 // Reads a decoded message as a request. On failure returns nothing and says why in `why`;
 // `msgid` is set whenever the message carried a usable one, so the caller can still answer.
+std::optional<RpcRequestView> RpcParseRequest(const msgpack::object& message, std::string& why,
+                                              std::optional<uint32_t>& msgid);
+// The same for a message in the value model.
 std::optional<RpcRequest> RpcParseRequest(const SXValue& message, std::string& why,
-                                          std::optional<uint32_t>& msgid);
-// The same, moving the method and params out of `message`.
-std::optional<RpcRequest> RpcParseRequest(SXValue&& message, std::string& why,
                                           std::optional<uint32_t>& msgid);
 std::optional<RpcResponse> RpcParseResponse(const SXValue& message);
 

@@ -4,6 +4,8 @@
 #include <charconv>
 #include <cmath>
 
+#include "common/SXPackedValue.h"
+
 std::string SXDoubleText(double value) {
   char buf[64];
   auto [end, ec] = std::to_chars(buf, buf + sizeof buf, value);
@@ -72,7 +74,123 @@ class JsonWriter {
     this->value(value);
   }
 
+  // The value `reader` is at, as `value` writes its decoded form.
+  void packed(SXPackedReader& reader) {
+    using Kind = SXPackedReader::Kind;
+    SXPackedReader::Item item = reader.next();
+    switch (item.kind) {
+      case Kind::kMap:
+        packedMembers(reader, item.count, false, {});
+        return;
+      case Kind::kArray:
+        out_ += '[';
+        for (uint32_t i = 0; i < item.count; ++i) {
+          if (i > 0) out_ += ',';
+          packed(reader);
+        }
+        out_ += ']';
+        return;
+      case Kind::kString:
+        string(item.data, nullptr);
+        return;
+      case Kind::kUnsigned:
+        decimal(item.u);
+        return;
+      case Kind::kSigned:
+        decimal(item.i);
+        return;
+      case Kind::kBool:
+        out_ += item.boolean ? "true" : "false";
+        return;
+      case Kind::kNil:
+        out_ += "null";
+        return;
+      case Kind::kFloat:
+        floating(item.f);
+        return;
+      case Kind::kBinary:
+      case Kind::kExt: {
+        const auto* bytes = reinterpret_cast<const uint8_t*>(item.data.data());
+        std::vector<uint8_t> data(bytes, bytes + item.data.size());
+        value(item.kind == Kind::kExt ? SXValue::binary(std::move(data),
+                                                        static_cast<uint8_t>(item.extType))
+                                      : SXValue::binary(std::move(data)));
+        return;
+      }
+    }
+  }
+
+  // A dictionary of `pairs` key-value pairs that follow in `reader`, in key order with the
+  // last of repeated keys, as decoding keeps them. `underscoreKeys`: each space in a key
+  // becomes "_", and of keys that became equal the last in key order stays. `extra`: a member
+  // added (or replacing its key's) after that.
+  void packedMembers(SXPackedReader& reader, uint32_t pairs, bool underscoreKeys,
+                     std::optional<SXTextMember> extra) {
+    std::vector<std::pair<std::string_view, const char*>> members;  // key, where its value is
+    members.reserve(pairs);
+    for (uint32_t i = 0; i < pairs; ++i) {
+      std::string_view key = reader.next().data;
+      members.emplace_back(key, reader.position());
+      reader.skip();
+    }
+    keepLastInKeyOrder(members);
+    std::vector<std::string> renamed;  // reserved: the views into it stay valid
+    if (underscoreKeys && std::any_of(members.begin(), members.end(), [](const auto& m) {
+          return m.first.find(' ') != std::string_view::npos;
+        })) {
+      renamed.reserve(members.size());
+      for (auto& [key, value] : members) {
+        key = renamed.emplace_back(key);
+        std::replace(renamed.back().begin(), renamed.back().end(), ' ', '_');
+      }
+      keepLastInKeyOrder(members);
+    }
+    out_ += '{';
+    bool first = true;
+    auto comma = [&] {
+      if (!first) out_ += ',';
+      first = false;
+    };
+    for (const auto& [key, at] : members) {
+      if (extra && !(key < extra->key)) {
+        comma();
+        member(extra->key, *extra->value);
+        bool replaced = key == extra->key;
+        extra.reset();
+        if (replaced) continue;
+      }
+      comma();
+      string(key, nullptr);
+      out_ += ':';
+      SXPackedReader value(at, reader.end());
+      packed(value);
+    }
+    if (extra) {
+      comma();
+      member(extra->key, *extra->value);
+    }
+    out_ += '}';
+  }
+
  private:
+  // Sorts by key, keeping of equal keys the one that came last.
+  static void keepLastInKeyOrder(std::vector<std::pair<std::string_view, const char*>>& members) {
+    // Clients nearly always pack their keys in order, once each.
+    if (std::adjacent_find(members.begin(), members.end(), [](const auto& a, const auto& b) {
+          return !(a.first < b.first);
+        }) == members.end()) {
+      return;
+    }
+    std::stable_sort(members.begin(), members.end(),
+                     [](const auto& a, const auto& b) { return a.first < b.first; });
+    auto kept = members.begin();
+    for (auto it = members.begin(); it != members.end(); ++it) {
+      if (std::next(it) != members.end() && std::next(it)->first == it->first) continue;
+      *kept++ = *it;
+    }
+    members.erase(kept, members.end());
+  }
+
   template <typename Integer>
   void decimal(Integer number) {
     char digits[24];
@@ -153,130 +271,18 @@ std::string SXValueText(const SXValue& value) {
   }
 }
 
-std::string SXDictionaryText(std::span<const SXTextMember> members) {
-  std::string text = "{";
-  JsonWriter writer(text);
-  bool first = true;
-  for (const SXTextMember& member : members) {
-    if (!first) text += ',';
-    first = false;
-    writer.member(member.key, *member.value);
+std::string SXPackedDictionaryText(const SXPackedValue& packed, bool underscoreKeys,
+                                   std::optional<SXTextMember> member) {
+  if (!packed.isDictionary()) {
+    if (!underscoreKeys && !member) return SXValueText(packed.value());
+    std::string text = "{";
+    if (member) JsonWriter(text).member(member->key, *member->value);
+    return text += '}';
   }
-  text += '}';
+  std::string text;
+  text.reserve(packed.size() * 3 / 2 + 16);
+  SXPackedReader reader(packed.bytes());
+  uint32_t pairs = reader.next().count;
+  JsonWriter(text).packedMembers(reader, pairs, underscoreKeys, member);
   return text;
-}
-
-std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& key,
-                                  const SXValue& value) {
-  std::string text = "{";
-  JsonWriter writer(text);
-  bool first = true;
-  auto member = [&](const std::string& name, const SXValue& member) {
-    if (!first) text += ',';
-    first = false;
-    writer.member(name, member);
-  };
-  bool placed = false;
-  if (dictionary.is_object()) {
-    // Members come in key order, as in the dump of the merged dictionary.
-    for (const auto& [name, member_value] : dictionary.items()) {
-      if (!placed && !(name < key)) {
-        member(key, value);
-        placed = true;
-        if (name == key) continue;
-      }
-      member(name, member_value);
-    }
-  }
-  if (!placed) member(key, value);
-  text += '}';
-  return text;
-}
-
-namespace {
-
-// The index just past the string whose opening quote is at `at`, or npos. The closing quote is
-// the first one after an even run of backslashes; memchr finds the candidates.
-size_t SkipJsonString(std::string_view text, size_t at) {
-  for (size_t from = at + 1;;) {
-    size_t quote = text.find('"', from);
-    if (quote == std::string_view::npos) return quote;
-    size_t backslashes = 0;
-    while (quote - backslashes > at + 1 && text[quote - 1 - backslashes] == '\\') ++backslashes;
-    if (backslashes % 2 == 0) return quote + 1;
-    from = quote + 1;
-  }
-}
-
-// The index just past the JSON value that starts at `at` in compact JSON text, or npos.
-size_t SkipJsonValue(std::string_view text, size_t at) {
-  int depth = 0;
-  for (size_t i = at; i < text.size(); ++i) {
-    char c = text[i];
-    if (c == '"') {
-      i = SkipJsonString(text, i);
-      if (i == std::string_view::npos) return i;
-      if (depth == 0) return i;
-      --i;  // the loop steps past the closing quote
-    } else if (c == '{' || c == '[') {
-      ++depth;
-    } else if (c == '}' || c == ']') {
-      if (depth == 0) return i;  // the end of the dictionary: a number or a literal ended
-      if (--depth == 0) return i + 1;
-    } else if (c == ',' && depth == 0) {
-      return i;
-    }
-  }
-  return std::string_view::npos;
-}
-
-}  // namespace
-
-std::optional<SXTextSlices> SXDictionaryTextMembers(std::string_view text) {
-  if (text.size() < 2 || text.front() != '{' || text.back() != '}') return std::nullopt;
-  SXTextSlices members;
-  const size_t end = text.size() - 1;
-  for (size_t at = 1; at < end;) {
-    if (text[at] != '"') return std::nullopt;
-    size_t close = text.find('"', at + 1);
-    if (close == std::string_view::npos || close + 1 >= end || text[close + 1] != ':') {
-      return std::nullopt;
-    }
-    std::string_view name = text.substr(at + 1, close - at - 1);
-    if (name.find('\\') != std::string_view::npos) return std::nullopt;
-    size_t next = SkipJsonValue(text, close + 2);
-    if (next == std::string_view::npos || next > end) return std::nullopt;
-    if (next < end && text[next] != ',') return std::nullopt;
-    members.emplace_back(name, text.substr(close + 2, next - close - 2));
-    at = next + 1;
-  }
-  return members;
-}
-
-std::optional<std::string> SXDictionaryTextWithMember(std::string_view text, const std::string& key,
-                                                      const SXValue& value) {
-  auto members = SXDictionaryTextMembers(text);
-  if (!members) return std::nullopt;
-  const SXTextMember only[] = {{key, &value}};
-  const std::string single = SXDictionaryText(only);
-  const std::string_view member = std::string_view(single).substr(1, single.size() - 2);
-  std::string out;
-  out.reserve(text.size() + member.size() + 1);
-  // Members come in key order: the new one goes before the first key not below it.
-  auto next = std::find_if(members->begin(), members->end(),
-                           [&](const auto& slice) { return !(slice.first < key); });
-  if (next == members->end()) {
-    out.append(text.substr(0, text.size() - 1));
-    if (!members->empty()) out += ',';
-    return out.append(member).append("}");
-  }
-  const size_t start = static_cast<size_t>(next->first.data() - text.data()) - 1;  // its quote
-  out.append(text.substr(0, start)).append(member);
-  if (next->first == key) {
-    const std::string_view& replaced = next->second;
-    out.append(text.substr(static_cast<size_t>(replaced.data() + replaced.size() - text.data())));
-  } else {
-    out.append(",").append(text.substr(start));
-  }
-  return out;
 }

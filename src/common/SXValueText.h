@@ -2,11 +2,8 @@
 #pragma once
 
 #include <optional>
-#include <span>
 #include <string>
 #include <string_view>
-#include <utility>
-#include <vector>
 
 #include "sxreporting/types.h"
 
@@ -15,33 +12,20 @@
 // in ascending order), null as "(null)".
 std::string SXValueText(const SXValue& value);
 
-// One member of a dictionary written by SXDictionaryText.
+// A dictionary's member, given apart from the dictionary.
 struct SXTextMember {
   std::string_view key;
   const SXValue* value;
 };
 
-// SXValueText of the dictionary holding `members`, which come in ascending key order without
-// repeats: the text of a dictionary with changed keys, made without building it.
-std::string SXDictionaryText(std::span<const SXTextMember> members);
+class SXPackedValue;
 
-// SXValueText of a copy of `dictionary` (an empty one when it is not a dictionary) whose
-// member `key` is set to `value`, made without the copy.
-std::string SXValueTextWithMember(const SXValue& dictionary, const std::string& key,
-                                  const SXValue& value);
-
-// The same, made from the SXValueText of a dictionary instead of the dictionary itself: the
-// text is copied around the member, not written again. Nothing when the text cannot be read
-// that way (a key with an escape in it, or not a dictionary's text); the caller then builds it
-// from the dictionary.
-std::optional<std::string> SXDictionaryTextWithMember(std::string_view dictionaryText,
-                                                      const std::string& key, const SXValue& value);
-
-// The members of a dictionary's SXValueText as slices of that text: each key (without its
-// quotes) and the text of its value, in the text's order. Nothing when the text cannot be read
-// that way (a key with an escape in it, or not a dictionary's text).
-using SXTextSlices = std::vector<std::pair<std::string_view, std::string_view>>;
-std::optional<SXTextSlices> SXDictionaryTextMembers(std::string_view dictionaryText);
+// SXValueText of a packed dictionary, written straight from its bytes. `underscoreKeys`: every
+// space in a key becomes "_" (of keys that became equal, the last in key order stays).
+// `member`: added after that, in its place among the keys, or replacing the member of its key.
+// A packed value that is not a dictionary counts as an empty one when either is asked for.
+std::string SXPackedDictionaryText(const SXPackedValue& packed, bool underscoreKeys = false,
+                                   std::optional<SXTextMember> member = std::nullopt);
 
 // Shortest decimal text of a double that reads back to the same double.
 std::string SXDoubleText(double value);

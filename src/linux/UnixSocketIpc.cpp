@@ -234,7 +234,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   // messages left; kEnded: the stream broke or the connection ended.
   Dispatched dispatchMessages() {
     SXCoalescedWakes wakeOnce;  // the server queue wakes once for this read's requests
-    SXValue message;
+    const msgpack::object* message = nullptr;
     bool ok = true;
     bool drained = false;
     while (ok && !ended_ && !mustWait()) {
@@ -249,7 +249,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
         ok = false;
       } else {
         ++completedMessages_;
-        ok = dispatch(message);
+        ok = dispatch(*message);
       }
     }
     decoder_.shrinkIfIdle();
@@ -260,11 +260,10 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     return drained ? Dispatched::kDrained : Dispatched::kStopped;
   }
 
-  // Moves the request out of `message`.
-  bool dispatch(SXValue& message) {
+  bool dispatch(const msgpack::object& message) {
     std::string why;
     std::optional<uint32_t> msgid;
-    auto request = RpcParseRequest(std::move(message), why, msgid);
+    auto request = RpcParseRequest(message, why, msgid);
     if (!request) {
       if (!msgid) {
         SXLOG(*log_, nullptr, SXLogLevel::kError, "closing %@: %@", description(), why);
@@ -283,7 +282,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     if (requestQueue_) queued_.fetch_add(1);
     std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
     uint32_t id = request->msgid;
-    exported_->handleRequest(request->method, std::move(request->params),
+    exported_->handleRequest(request->method, *request->params,
                              decoder_.lastMessageBytes(),
                              [weak, id](const SXValue& error, const SXValue& result) {
                                if (auto self = weak.lock()) self->send(id, error, result);

@@ -10,10 +10,12 @@
 
 #include <cstdint>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <string>
 #include <string_view>
 
+#include "common/MsgpackValue.h"
 #include "platform/ByteBudget.h"
 #include "sxreporting/types.h"
 
@@ -29,6 +31,14 @@ class SXIpcExportedObject {
   // object's to keep or move from; `wireBytes` is the size of the whole request as received.
   virtual void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
                              SXIpcReplyFn reply) = 0;
+  // The same for params as the connection decoded them, valid until this returns; an object
+  // that keeps some of them in their MessagePack form overrides it. By default they become
+  // values.
+  virtual void handleRequest(std::string_view method, const msgpack::object& params,
+                             size_t wireBytes, SXIpcReplyFn reply) {
+    handleRequest(method, SXValueFromMsgpack(params, std::numeric_limits<int>::max()), wireBytes,
+                  std::move(reply));
+  }
 };
 
 class SXIpcConnection {

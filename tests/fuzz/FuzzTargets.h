@@ -16,6 +16,8 @@
 #include "Service/SXReportingSession.h"
 #include "common/MsgpackValue.h"
 #include "common/RpcCodec.h"
+#include "common/SXPackedValue.h"
+#include "common/SXValueText.h"
 #include "common/SXThreadSafety.h"
 #include "platform/DiscardLog.h"
 #include "support/TestEnvironment.h"
@@ -39,8 +41,10 @@ T SXFuzzTake(const uint8_t*& data, size_t& size) {
   return value;
 }
 
-// A value from MessagePack bytes within the default limits; nothing when they are not one.
-inline std::optional<SXValue> SXFuzzUnpack(const char* bytes, size_t length) {
+// A value from MessagePack bytes within the default limits, and its packed form made from the
+// decoded object; nothing when they are not one.
+inline std::optional<std::pair<SXValue, SXPackedValue>> SXFuzzUnpackBoth(const char* bytes,
+                                                                         size_t length) {
   RpcLimits limits;
   try {
     size_t offset = 0;
@@ -49,10 +53,17 @@ inline std::optional<SXValue> SXFuzzUnpack(const char* bytes, size_t length) {
         msgpack::unpack_limit(limits.maxContainerEntries, limits.maxContainerEntries,
                               limits.maxMessageBytes, limits.maxMessageBytes,
                               limits.maxMessageBytes, limits.maxPayloadDepth + 1));
-    return SXValueFromMsgpack(handle.get(), limits.maxPayloadDepth);
+    return std::pair{SXValueFromMsgpack(handle.get(), limits.maxPayloadDepth),
+                     SXPackedValue::fromObject(handle.get())};
   } catch (const std::exception&) {
     return std::nullopt;
   }
+}
+
+inline std::optional<SXValue> SXFuzzUnpack(const char* bytes, size_t length) {
+  auto both = SXFuzzUnpackBoth(bytes, length);
+  if (!both) return std::nullopt;
+  return std::move(both->first);
 }
 
 // A value from arbitrary bytes: MessagePack when the first byte is even, JSON text when it is
@@ -128,9 +139,23 @@ inline std::string SXFuzzPack(const SXValue& value) {
 }
 
 inline void SXFuzzMsgpackValue(const uint8_t* data, size_t size) {
-  std::optional<SXValue> value = SXFuzzUnpack(reinterpret_cast<const char*>(data), size);
-  if (!value) return;
-  std::string first = SXFuzzPack(*value);
+  auto both = SXFuzzUnpackBoth(reinterpret_cast<const char*>(data), size);
+  if (!both) return;
+  const auto& [decoded, packed] = *both;
+  // The stores' texts, written from the packed form, are those of the decoded value.
+  SXR_FUZZ_CHECK(SXValueText(packed.value()) == SXValueText(decoded));
+  if (decoded.is_object()) {
+    SXR_FUZZ_CHECK(SXPackedDictionaryText(packed) == SXValueText(decoded));
+    SXValue withHost = decoded;
+    const SXValue host = "host";
+    withHost["HostApplicationDisplayID"] = host;
+    SXR_FUZZ_CHECK(SXPackedDictionaryText(packed, false,
+                                          SXTextMember{"HostApplicationDisplayID", &host}) ==
+                   SXValueText(withHost));
+    SXR_FUZZ_CHECK(SXPackedDictionaryText(packed, true) ==
+                   SXValueText(SXReportingSessionUnderscoreKeys(decoded)));
+  }
+  std::string first = SXFuzzPack(decoded);
   std::optional<SXValue> back = SXFuzzUnpack(first.data(), first.size());
   SXR_FUZZ_CHECK(back.has_value());
   if (back) SXR_FUZZ_CHECK(SXFuzzPack(*back) == first);

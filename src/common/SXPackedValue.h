@@ -1,0 +1,71 @@
+// A value kept as its MessagePack encoding. A message's payload travels through the service in
+// this form: it is decoded into a dictionary only where one is needed, and each store writes
+// its text straight from the bytes.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <msgpack.hpp>
+#include <string>
+#include <string_view>
+
+#include "sxreporting/types.h"
+
+class SXPackedValue {
+ public:
+  // The encoding of a decoded object. The object must be one the value model can hold (see
+  // SXCheckValueModel).
+  static SXPackedValue fromObject(const msgpack::object& object);
+  static SXPackedValue fromValue(const SXValue& value);
+
+  std::string_view bytes() const { return bytes_; }
+  size_t size() const { return bytes_.size(); }
+  bool isDictionary() const;
+  // Whether the value is a dictionary with the member `key`.
+  bool hasMember(std::string_view key) const;
+  // The value itself, decoded now.
+  SXValue value() const;
+
+ private:
+  explicit SXPackedValue(std::string bytes) : bytes_(std::move(bytes)) {}
+  std::string bytes_;
+};
+
+// Throws SXValueConversionError when `object` has no place in the value model: a dictionary
+// key that is not a string, or nesting deeper than `maxDepth`.
+void SXCheckValueModel(const msgpack::object& object, int maxDepth);
+
+// Reads MessagePack written by msgpack-c, one item at a time, without building anything. A
+// container's item gives its number of elements (a dictionary's: of key-value pairs), which
+// follow it. Throws std::out_of_range when the bytes end early.
+class SXPackedReader {
+ public:
+  enum class Kind { kNil, kBool, kUnsigned, kSigned, kFloat, kString, kBinary, kExt, kArray, kMap };
+  struct Item {
+    Kind kind = Kind::kNil;
+    bool boolean = false;
+    uint64_t u = 0;
+    int64_t i = 0;
+    double f = 0;
+    std::string_view data;  // string, binary and ext bytes
+    int8_t extType = 0;
+    uint32_t count = 0;  // array elements or map pairs
+  };
+
+  explicit SXPackedReader(std::string_view bytes) : at_(bytes.data()), end_(at_ + bytes.size()) {}
+  SXPackedReader(const char* at, const char* end) : at_(at), end_(end) {}
+
+  Item next();
+  // Steps over one whole value, containers with everything in them.
+  void skip();
+  const char* position() const { return at_; }
+  const char* end() const { return end_; }
+
+ private:
+  const char* take(size_t n);
+  template <typename T>
+  T big(size_t n);
+
+  const char* at_;
+  const char* end_;
+};
