@@ -22,7 +22,8 @@ SXLogScope SXReportingLogScope(std::string_view shortName, std::string category)
 
 void SXReportingEnvironment::registerSessionLogScopeOnce() {
   std::call_once(sessionScopeOnce_, [this] {
-    sessionScope_ = log().registerScope(SXReportingLogScope("sxrr", "reporting_session_verbose"));
+    sessionScope_.store(
+        keep(log().registerScope(SXReportingLogScope("sxrr", "reporting_session_verbose"))));
   });
 }
 

@@ -7,9 +7,11 @@
 #include <atomic>
 #include <memory>
 #include <mutex>
+#include <vector>
 
 #include "SXReportingCounters.h"
 #include "SXReportingLimits.h"
+#include "common/SXThreadSafety.h"
 #include "platform/Platform.h"
 
 class SXReportingEnvironment {
@@ -24,19 +26,19 @@ class SXReportingEnvironment {
   SXTracer& tracer() const { return *platform_.tracer; }
 
   // The service scope "sxrs"; set by the service delegate's init (nullptr before it).
-  const SXLogScope* serviceLogScope() const { return serviceScope_.load().get(); }
+  const SXLogScope* serviceLogScope() const { return serviceScope_.load(); }
   void setServiceLogScope(std::shared_ptr<const SXLogScope> scope) {
-    serviceScope_ = std::move(scope);
+    serviceScope_.store(keep(std::move(scope)));
   }
 
   // The session scope "sxrr", registered by the first session created.
-  const SXLogScope* sessionLogScope() const { return sessionScope_.load().get(); }
+  const SXLogScope* sessionLogScope() const { return sessionScope_.load(); }
   void registerSessionLogScopeOnce();
 
   // The driver scope "sxrd"; set at every creation of a driver utility.
-  const SXLogScope* driverLogScope() const { return driverScope_.load().get(); }
+  const SXLogScope* driverLogScope() const { return driverScope_.load(); }
   void setDriverLogScope(std::shared_ptr<const SXLogScope> scope) {
-    driverScope_ = std::move(scope);
+    driverScope_.store(keep(std::move(scope)));
   }
 
   // The serial server queue "com.vendra.sonex.reporting.server"; set by the delegate's init,
@@ -68,10 +70,19 @@ class SXReportingEnvironment {
   const std::shared_ptr<SXReportingCounters> counters_ = std::make_shared<SXReportingCounters>();
   SXPlatform platform_;
   std::atomic<std::shared_ptr<const SXReportingLimits>> limits_;
-  // Scope handles are read from any thread; a handle, once stored, lives as long as this.
-  std::atomic<std::shared_ptr<const SXLogScope>> serviceScope_;
-  std::atomic<std::shared_ptr<const SXLogScope>> sessionScope_;
-  std::atomic<std::shared_ptr<const SXLogScope>> driverScope_;
+  // Keeps `scope` for as long as this lives and returns it.
+  const SXLogScope* keep(std::shared_ptr<const SXLogScope> scope) {
+    SXMutexLock lock(scopesMutex_);
+    return keptScopes_.emplace_back(std::move(scope)).get();
+  }
+
+  // Scope handles are read from any thread, on every message: plain pointers, to handles kept
+  // as long as this (one for each time a scope is set, which is once or twice a run).
+  std::atomic<const SXLogScope*> serviceScope_{nullptr};
+  std::atomic<const SXLogScope*> sessionScope_{nullptr};
+  std::atomic<const SXLogScope*> driverScope_{nullptr};
+  SXMutex scopesMutex_;
+  std::vector<std::shared_ptr<const SXLogScope>> keptScopes_ SX_GUARDED_BY(scopesMutex_);
   std::once_flag sessionScopeOnce_;
   std::shared_ptr<SXWorkQueue> serverQueue_;
   std::atomic<int> defaultsToken_{-1};

@@ -46,9 +46,35 @@ struct Packer {
   SXStringSink sink{&out};
   msgpack::packer<SXStringSink> packer{sink};
 
+  // Scalars are packed here too: msgpack-c packs an object through a general visitor, which
+  // costs more than the whole payload's copy.
   void pack(const msgpack::object& o) {
     using msgpack::type::object_type;
     switch (o.type) {
+      case object_type::NIL:
+        packer.pack_nil();
+        return;
+      case object_type::BOOLEAN:
+        o.via.boolean ? packer.pack_true() : packer.pack_false();
+        return;
+      case object_type::POSITIVE_INTEGER:
+        packer.pack_uint64(o.via.u64);
+        return;
+      case object_type::NEGATIVE_INTEGER:
+        packer.pack_int64(o.via.i64);
+        return;
+      case object_type::STR:
+        packer.pack_str(o.via.str.size);
+        packer.pack_str_body(o.via.str.ptr, o.via.str.size);
+        return;
+      case object_type::BIN:
+        packer.pack_bin(o.via.bin.size);
+        packer.pack_bin_body(o.via.bin.ptr, o.via.bin.size);
+        return;
+      case object_type::EXT:
+        packer.pack_ext(o.via.ext.size, o.via.ext.type());
+        packer.pack_ext_body(o.via.ext.data(), o.via.ext.size);
+        return;
       case object_type::FLOAT32:
         appendFloat(out, static_cast<float>(o.via.f64));
         return;
@@ -62,13 +88,12 @@ struct Packer {
       case object_type::MAP:
         packer.pack_map(o.via.map.size);
         for (uint32_t i = 0; i < o.via.map.size; ++i) {
-          packer.pack(o.via.map.ptr[i].key);
+          pack(o.via.map.ptr[i].key);
           pack(o.via.map.ptr[i].val);
         }
         return;
-      default:
-        packer.pack(o);
     }
+    packer.pack(o);
   }
 
   void pack(const SXValue& v) {

@@ -1,6 +1,7 @@
 #include "common/SXValueText.h"
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
 
@@ -126,24 +127,31 @@ class JsonWriter {
   // added (or replacing its key's) after that.
   void packedMembers(SXPackedReader& reader, uint32_t pairs, bool underscoreKeys,
                      std::optional<SXTextMember> extra) {
-    std::vector<std::pair<std::string_view, const char*>> members;  // key, where its value is
-    members.reserve(pairs);
-    for (uint32_t i = 0; i < pairs; ++i) {
-      std::string_view key = reader.next().data;
-      members.emplace_back(key, reader.position());
-      reader.skip();
+    struct Member {
+      std::string_view key;
+      const char* value;  // where its value starts in the bytes
+    };
+    // Dictionaries of a few keys, nearly all of them, are sorted without the heap.
+    constexpr uint32_t kInline = 32;
+    Member inlineMembers[kInline];
+    std::vector<Member> heapMembers;
+    Member* members = inlineMembers;
+    if (pairs > kInline) {
+      heapMembers.resize(pairs);
+      members = heapMembers.data();
     }
-    keepLastInKeyOrder(members);
-    std::vector<std::string> renamed;  // reserved: the views into it stay valid
-    if (underscoreKeys && std::any_of(members.begin(), members.end(), [](const auto& m) {
-          return m.first.find(' ') != std::string_view::npos;
-        })) {
-      renamed.reserve(members.size());
-      for (auto& [key, value] : members) {
-        key = renamed.emplace_back(key);
-        std::replace(renamed.back().begin(), renamed.back().end(), ' ', '_');
+    const KeyOrder order{underscoreKeys};
+    // In renamed order, then original order, then the order of the bytes: the last of each
+    // run of equal renamed keys is the one decoding and renaming keep. Insertion sort is
+    // stable and quick for the few keys of a message.
+    for (uint32_t i = 0; i < pairs; ++i) {
+      Member member{reader.next().data, reader.position()};
+      reader.skip();
+      uint32_t at = i;
+      for (; at > 0 && order.before(member.key, members[at - 1].key); --at) {
+        members[at] = members[at - 1];
       }
-      keepLastInKeyOrder(members);
+      members[at] = member;
     }
     out_ += '{';
     bool first = true;
@@ -151,18 +159,26 @@ class JsonWriter {
       if (!first) out_ += ',';
       first = false;
     };
-    for (const auto& [key, at] : members) {
-      if (extra && !(key < extra->key)) {
+    for (uint32_t i = 0; i < pairs; ++i) {
+      const std::string_view key = members[i].key;
+      if (i + 1 < pairs && order.renamedEqual(key, members[i + 1].key)) continue;
+      if (extra && !order.renamedBelow(key, extra->key)) {
         comma();
         member(extra->key, *extra->value);
-        bool replaced = key == extra->key;
+        bool replaced = !order.renamedBelow(extra->key, key);
         extra.reset();
         if (replaced) continue;
       }
       comma();
-      string(key, nullptr);
+      if (underscoreKeys && key.find(' ') != std::string_view::npos) {
+        std::string renamed(key);
+        std::replace(renamed.begin(), renamed.end(), ' ', '_');
+        string(renamed, nullptr);
+      } else {
+        string(key, nullptr);
+      }
       out_ += ':';
-      SXPackedReader value(at, reader.end());
+      SXPackedReader value(members[i].value, reader.end());
       packed(value);
     }
     if (extra) {
@@ -173,23 +189,32 @@ class JsonWriter {
   }
 
  private:
-  // Sorts by key, keeping of equal keys the one that came last.
-  static void keepLastInKeyOrder(std::vector<std::pair<std::string_view, const char*>>& members) {
-    // Clients nearly always pack their keys in order, once each.
-    if (std::adjacent_find(members.begin(), members.end(), [](const auto& a, const auto& b) {
-          return !(a.first < b.first);
-        }) == members.end()) {
-      return;
+  // Key comparisons as if every space were "_" when `underscore` is set, byte by byte as
+  // std::string compares.
+  struct KeyOrder {
+    bool underscore;
+
+    unsigned char renamed(char c) const {
+      return static_cast<unsigned char>(underscore && c == ' ' ? '_' : c);
     }
-    std::stable_sort(members.begin(), members.end(),
-                     [](const auto& a, const auto& b) { return a.first < b.first; });
-    auto kept = members.begin();
-    for (auto it = members.begin(); it != members.end(); ++it) {
-      if (std::next(it) != members.end() && std::next(it)->first == it->first) continue;
-      *kept++ = *it;
+    int renamedCompare(std::string_view a, std::string_view b) const {
+      size_t n = std::min(a.size(), b.size());
+      for (size_t i = 0; i < n; ++i) {
+        if (renamed(a[i]) != renamed(b[i])) return renamed(a[i]) < renamed(b[i]) ? -1 : 1;
+      }
+      return a.size() == b.size() ? 0 : (a.size() < b.size() ? -1 : 1);
     }
-    members.erase(kept, members.end());
-  }
+    bool renamedBelow(std::string_view a, std::string_view b) const {
+      return renamedCompare(a, b) < 0;
+    }
+    bool renamedEqual(std::string_view a, std::string_view b) const {
+      return renamedCompare(a, b) == 0;
+    }
+    bool before(std::string_view a, std::string_view b) const {
+      int c = renamedCompare(a, b);
+      return c < 0 || (c == 0 && a < b);
+    }
+  };
 
   template <typename Integer>
   void decimal(Integer number) {
@@ -220,8 +245,13 @@ class JsonWriter {
   }
 
   static bool plain(std::string_view text) {
+    static constexpr auto kPlain = [] {
+      std::array<bool, 256> table{};
+      for (int c = 0x20; c < 0x7F; ++c) table[c] = c != '"' && c != '\\';
+      return table;
+    }();
     for (unsigned char c : text) {
-      if (c < 0x20 || c >= 0x7F || c == '"' || c == '\\') return false;
+      if (!kPlain[c]) return false;
     }
     return true;
   }
