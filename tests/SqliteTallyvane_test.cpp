@@ -41,7 +41,7 @@ TEST_F(SqliteTallyvaneTest, PayloadsAreBuiltLaterOnTheWriterAndStoredEvenIfNotPl
         built = true;
         return SXValue::object();
       },
-      [] { return std::string(R"({"a":1})"); });
+      [] { return std::make_shared<const std::string>(R"({"a":1})"); });
   // The send returns before the provider runs, on another thread.
   std::promise<void> sent;
   std::thread::id ranOn;

@@ -156,16 +156,12 @@ void SXReportingSession::sendToServerReporting(const std::vector<PendingSend>& s
     }
     return;
   }
-  // The service stores text: the one the aggregate keeps, made once for both, straight from
-  // the caller's dictionary, and held here while the messages point at it.
-  std::vector<std::shared_ptr<const std::string>> texts;
+  // The service stores text: the one the aggregate keeps, made once for both.
   std::vector<FernMessage> messages;
-  texts.reserve(sends.size());
   messages.reserve(sends.size());
   for (const PendingSend& send : sends) {
-    texts.push_back(send.payload->text());
     messages.push_back(
-        {static_cast<uint16_t>(send.category & 0xFFFF), send.type, nullptr, texts.back().get()});
+        {static_cast<uint16_t>(send.category & 0xFFFF), send.type, nullptr, send.payload->text()});
   }
   std::vector<FernSendOutcome> outcomes = fernSession->sendMessages(messages);
   // The verbose line's arguments cost a description per message; build them only when wanted.

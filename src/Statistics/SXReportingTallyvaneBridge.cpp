@@ -27,9 +27,10 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   return [payload = payload_, text] {
     SXMutexLock lock(text->mutex);
     if (!text->text) {
-      text->text = SXPackedDictionaryText(*payload, false, SXTextMember{kHostKey, &text->host});
+      text->text = std::make_shared<const std::string>(
+          SXPackedDictionaryText(*payload, false, SXTextMember{kHostKey, &text->host}));
     }
-    return *text->text;
+    return text->text;
   };
 }
 

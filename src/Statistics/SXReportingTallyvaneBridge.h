@@ -32,7 +32,7 @@ class SXReportingEventTexts {
     explicit Text(SXValue h) : host(std::move(h)) {}
     const SXValue host;
     SXMutex mutex;
-    std::optional<std::string> text SX_GUARDED_BY(mutex);  // made by the first event to ask
+    std::shared_ptr<const std::string> text SX_GUARDED_BY(mutex);  // made by the first to ask
   };
   std::shared_ptr<const SXPackedValue> payload_;
   std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few

@@ -45,7 +45,7 @@ struct FernMessage {
   // text as it is, and the default sendMessages reads the dictionary back from it.
   const SXValue* payload;
   // The payload as compact JSON (SXValueText), when the caller already has it.
-  const std::string* payloadJson = nullptr;
+  std::shared_ptr<const std::string> payloadJson;
 };
 
 struct FernSendOutcome {

@@ -2,12 +2,14 @@
 #pragma once
 
 #include <functional>
+#include <memory>
 #include <string>
 
 #include "sxreporting/types.h"
 
 using SXPayloadProvider = std::function<SXValue()>;
-using SXPayloadTextProvider = std::function<std::string()>;
+// A text shared with whoever else needs the same one.
+using SXPayloadTextProvider = std::function<std::shared_ptr<const std::string>()>;
 
 class SXTallyvane {
  public:

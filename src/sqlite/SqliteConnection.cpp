@@ -55,6 +55,10 @@ SXStatus SXSqliteStatement::bind(const SXSqliteRow& params) {
             return sqlite3_bind_int64(stmt_.get(), index, v);
           } else if constexpr (std::is_same_v<T, double>) {
             return sqlite3_bind_double(stmt_.get(), index, v);
+          } else if constexpr (std::is_same_v<T, std::shared_ptr<const std::string>>) {
+            if (!v) return sqlite3_bind_null(stmt_.get(), index);
+            return sqlite3_bind_text64(stmt_.get(), index, v->data(), v->size(), SQLITE_STATIC,
+                                       SQLITE_UTF8);
           } else {
             return sqlite3_bind_text64(stmt_.get(), index, v.data(), v.size(), SQLITE_STATIC,
                                        SQLITE_UTF8);

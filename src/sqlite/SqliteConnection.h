@@ -22,7 +22,10 @@
 #include "sxreporting/types.h"
 
 // One bound parameter or one stored column.
-using SXSqliteField = std::variant<std::nullptr_t, int64_t, double, std::string>;
+// Text is bound as it is, never copied: a shared text lets a row point at one that the caller
+// also keeps (null binds NULL).
+using SXSqliteField =
+    std::variant<std::nullptr_t, int64_t, double, std::string, std::shared_ptr<const std::string>>;
 using SXSqliteRow = std::vector<SXSqliteField>;
 
 // How long a write waits for another connection's lock before it fails.

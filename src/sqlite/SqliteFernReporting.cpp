@@ -278,7 +278,8 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
 
   bool sendMessage(uint16_t category, uint16_t type, const SXValue& payload,
                    std::optional<FernError>& error) override {
-    FernSendOutcome outcome = std::move(sendMessages({{category, type, &payload}}).front());
+    FernSendOutcome outcome =
+        std::move(sendMessages({{category, type, &payload, nullptr}}).front());
     error = std::move(outcome.error);
     return outcome.sent;
   }
@@ -289,7 +290,8 @@ class SXSqliteFernReporting::Session final : public FernReportingSession {
     SXSqliteField time = SXSqliteNow();
     for (const FernMessage& message : messages) {
       rows.push_back({time, id_, nullptr, nullptr, int64_t(message.category), int64_t(message.type),
-                      message.payloadJson ? *message.payloadJson : Json(*message.payload)});
+                      message.payloadJson ? SXSqliteField(message.payloadJson)
+                                          : SXSqliteField(Json(*message.payload))});
     }
     auto results = spool_->insertMessages(id_, rows);
     std::vector<FernSendOutcome> outcomes(messages.size());
