@@ -116,41 +116,80 @@ void SXReportingRemoveRepeatedIDs(std::vector<int64_t>& reporterIDs) {
   std::erase_if(reporterIDs, [&seen](int64_t id) { return !seen.insert(id).second; });
 }
 
+namespace {
+
+std::string refusal(SXReportingEnvironment& environment, std::string_view method,
+                    SXReportingGuardrail guardrail, const std::string& why) {
+  environment.counters().dropped(guardrail);
+  return std::string(method) + " " + why;
+}
+
+std::string tooLarge(const char* what, size_t size, uint64_t limit, const char* flag) {
+  return std::string(what) + " of " + std::to_string(size) +
+         " bytes is larger than the limit of " + std::to_string(limit) + " bytes (" + flag + ")";
+}
+
+}  // namespace
+
 std::string SXReportingServiceExport::checkLimits(std::string_view method, const SXValue& params,
-                                                  size_t wireBytes, const SXPackedValue* payload) {
-  const SXReportingLimits& limits = environment_->limits();
-  auto refuse = [&](SXReportingGuardrail guardrail, const std::string& why) {
-    environment_->counters().dropped(guardrail);
-    return std::string(method) + " " + why;
-  };
-  // A request no larger than a limit cannot hold a larger value, so only larger requests are
+                                                  size_t wireBytes) {
+  if (method != sxr::method::kSetConfiguration) return "";
+  const uint64_t limit = environment_->limits().maxConfigurationBytes;
+  // A request no larger than the limit cannot hold a larger value, so only larger requests are
   // measured.
-  auto checkSize = [&](const SXValue& value, const SXPackedValue* packed, uint64_t limit,
-                       const char* what, const char* flag,
-                       SXReportingGuardrail guardrail) -> std::string {
-    if (wireBytes <= limit) return "";
-    size_t size = packed ? packed->size() : SXPackedSize(value);
-    if (size <= limit) return "";
-    return refuse(guardrail, std::string(what) + " of " + std::to_string(size) +
-                                 " bytes is larger than the limit of " + std::to_string(limit) +
-                                 " bytes (" + flag + ")");
+  if (wireBytes <= limit) return "";
+  size_t size = SXPackedSize(params[0]);
+  if (size <= limit) return "";
+  return refusal(*environment_, method, SXReportingGuardrail::kConfigurationBytes,
+                 tooLarge("configuration", size, limit, "--max-configuration-bytes"));
+}
+
+std::string SXReportingServiceExport::checkSendLimits(const Send& send, size_t wireBytes) {
+  const SXReportingLimits& limits = environment_->limits();
+  if (send.reporterIDs && send.reporterIDs->size() > limits.maxReporterIDs) {
+    return refusal(*environment_, sxr::method::kSendMessage, SXReportingGuardrail::kReporterIDs,
+                   "reporterIDs holds " + std::to_string(send.reporterIDs->size()) +
+                       " reporter IDs, more than the limit of " +
+                       std::to_string(limits.maxReporterIDs) + " (--max-reporter-ids)");
+  }
+  if (wireBytes <= limits.maxPayloadBytes || send.payload.size() <= limits.maxPayloadBytes) {
+    return "";
+  }
+  return refusal(*environment_, sxr::method::kSendMessage, SXReportingGuardrail::kPayloadBytes,
+                 tooLarge("payload", send.payload.size(), limits.maxPayloadBytes,
+                          "--max-payload-bytes"));
+}
+
+std::optional<SXReportingServiceExport::Send> SXReportingServiceExport::readSend(
+    const msgpack::object& params) {
+  using msgpack::type::object_type;
+  const msgpack::object_array& items = params.via.array;
+  if (items.size != 4 || items.ptr[0].type != object_type::MAP) return std::nullopt;
+  auto unsignedUpTo = [](const msgpack::object& o, uint64_t max) {
+    return o.type == object_type::POSITIVE_INTEGER && o.via.u64 <= max;
   };
-  if (method == sxr::method::kSendMessage) {
-    const SXValue& ids = params[3];
-    if (ids.is_array() && ids.size() > limits.maxReporterIDs) {
-      return refuse(SXReportingGuardrail::kReporterIDs,
-                    "reporterIDs holds " + std::to_string(ids.size()) +
-                        " reporter IDs, more than the limit of " +
-                        std::to_string(limits.maxReporterIDs) + " (--max-reporter-ids)");
+  const msgpack::object& ids = items.ptr[3];
+  if (!unsignedUpTo(items.ptr[1], 0xFFFFFFFF) || !unsignedUpTo(items.ptr[2], 0xFFFF) ||
+      (ids.type != object_type::NIL && ids.type != object_type::ARRAY)) {
+    return std::nullopt;
+  }
+  std::optional<std::vector<int64_t>> reporterIDs;
+  if (ids.type == object_type::ARRAY) {
+    reporterIDs.emplace().reserve(ids.via.array.size);
+    for (uint32_t i = 0; i < ids.via.array.size; ++i) {
+      const msgpack::object& id = ids.via.array.ptr[i];
+      if (id.type == object_type::NEGATIVE_INTEGER) {
+        reporterIDs->push_back(id.via.i64);
+      } else if (unsignedUpTo(id, std::numeric_limits<int64_t>::max())) {
+        reporterIDs->push_back(static_cast<int64_t>(id.via.u64));
+      } else {
+        return std::nullopt;
+      }
     }
-    return checkSize(params[0], payload, limits.maxPayloadBytes, "payload", "--max-payload-bytes",
-                     SXReportingGuardrail::kPayloadBytes);
   }
-  if (method == sxr::method::kSetConfiguration) {
-    return checkSize(params[0], nullptr, limits.maxConfigurationBytes, "configuration",
-                     "--max-configuration-bytes", SXReportingGuardrail::kConfigurationBytes);
-  }
-  return "";
+  return Send{SXPackedValue::fromObject(items.ptr[0]),
+              static_cast<SXReportingCategory>(items.ptr[1].via.u64),
+              static_cast<SXReportingMessageType>(items.ptr[2].via.u64), std::move(reporterIDs)};
 }
 
 std::string SXReportingServiceExport::validate(std::string_view method, const SXValue& params) {
@@ -176,40 +215,55 @@ std::string SXReportingServiceExport::validate(std::string_view method, const SX
 
 void SXReportingServiceExport::handleRequest(std::string_view method, SXValue params,
                                              size_t wireBytes, SXIpcReplyFn reply) {
-  handle(method, params, wireBytes, std::move(reply), std::nullopt);
+  std::string why = validate(method, params);
+  if (why.empty() && method == sxr::method::kSendMessage) {
+    std::optional<std::vector<int64_t>> ids;
+    if (!params[3].is_null()) ids = params[3].get<std::vector<int64_t>>();
+    dispatchSend({SXPackedValue::fromValue(params[0]), params[1].get<SXReportingCategory>(),
+                  params[2].get<SXReportingMessageType>(), std::move(ids)},
+                 wireBytes, std::move(reply));
+    return;
+  }
+  if (why.empty()) why = checkLimits(method, params, wireBytes);
+  if (!why.empty()) {
+    reply(why, nullptr);
+    return;
+  }
+  dispatch(method, params, std::move(reply));
 }
 
 void SXReportingServiceExport::handleRequest(std::string_view method,
                                              const msgpack::object& params, size_t wireBytes,
                                              SXIpcReplyFn reply) {
-  constexpr int kAnyDepth = std::numeric_limits<int>::max();  // the connection checked it
-  const msgpack::object_array& items = params.via.array;
-  if (method != sxr::method::kSendMessage || items.size == 0 ||
-      items.ptr[0].type != msgpack::type::object_type::MAP) {
-    handleRequest(method, SXValueFromMsgpack(params, kAnyDepth), wireBytes, std::move(reply));
-    return;
+  if (method == sxr::method::kSendMessage) {
+    if (std::optional<Send> send = readSend(params)) {
+      dispatchSend(std::move(*send), wireBytes, std::move(reply));
+      return;
+    }
   }
-  SXValue values = SXValue::array({SXValue::object()});
-  for (uint32_t i = 1; i < items.size; ++i) {
-    values.push_back(SXValueFromMsgpack(items.ptr[i], kAnyDepth));
-  }
-  handle(method, values, wireBytes, std::move(reply), SXPackedValue::fromObject(items.ptr[0]));
+  // The connection checked the depth.
+  handleRequest(method, SXValueFromMsgpack(params, std::numeric_limits<int>::max()), wireBytes,
+                std::move(reply));
 }
 
-void SXReportingServiceExport::handle(std::string_view method, SXValue& params, size_t wireBytes,
-                                      SXIpcReplyFn reply, std::optional<SXPackedValue> payload) {
-  std::string why = validate(method, params);
-  if (why.empty()) why = checkLimits(method, params, wireBytes, payload ? &*payload : nullptr);
-  if (!why.empty()) {
+void SXReportingServiceExport::dispatchSend(Send send, size_t wireBytes, SXIpcReplyFn reply) {
+  if (std::string why = checkSendLimits(send, wireBytes); !why.empty()) {
     reply(why, nullptr);
     return;
   }
-  dispatch(method, params, wireBytes, std::move(reply), std::move(payload));
+  if (send.reporterIDs) SXReportingRemoveRepeatedIDs(*send.reporterIDs);
+  auto message = SXChargedShared(std::move(send.payload),
+                                 SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
+  instance_->sendMessage(
+      std::move(message), send.category, send.type, std::move(send.reporterIDs),
+      [reply = std::move(reply)](std::optional<SXError> error) {
+        reply(nullptr, errorValue(error));
+      });
 }
 
 // Moves what it hands on out of `params`.
-void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params, size_t wireBytes,
-                                        SXIpcReplyFn reply, std::optional<SXPackedValue> payload) {
+void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params,
+                                        SXIpcReplyFn reply) {
   auto boolReply = [reply](bool value) { reply(nullptr, value); };
   auto& instance = *instance_;
   if (method == sxr::method::kCreate) {
@@ -226,19 +280,6 @@ void SXReportingServiceExport::dispatch(std::string_view method, SXValue& params
     instance.setConfiguration(std::move(configuration), params[1].get<int64_t>(), boolReply);
   } else if (method == sxr::method::kStart) {
     instance.startReportingSessionForID(params[0].get<int64_t>(), boolReply);
-  } else if (method == sxr::method::kSendMessage) {
-    std::optional<std::vector<int64_t>> ids;
-    if (!params[3].is_null()) {
-      ids = params[3].get<std::vector<int64_t>>();
-      SXReportingRemoveRepeatedIDs(*ids);
-    }
-    auto message =
-        SXChargedShared(payload ? std::move(*payload) : SXPackedValue::fromValue(params[0]),
-                        SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
-    instance.sendMessage(
-        std::move(message), params[1].get<SXReportingCategory>(),
-        params[2].get<SXReportingMessageType>(), std::move(ids),
-        [reply](std::optional<SXError> error) { reply(nullptr, errorValue(error)); });
   } else if (method == sxr::method::kStop) {
     instance.stopReportingSessionForID(params[0].get<int64_t>(), boolReply);
   } else if (method == sxr::method::kDestroy) {

@@ -26,7 +26,8 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
 
   void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
                      SXIpcReplyFn reply) override;
-  // A message's payload stays packed: the stores write their texts straight from its bytes.
+  // A send's params are read without values, and its payload stays packed: the stores write
+  // their texts straight from its bytes.
   void handleRequest(std::string_view method, const msgpack::object& params, size_t wireBytes,
                      SXIpcReplyFn reply) override;
 
@@ -34,14 +35,21 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
   static std::string validate(std::string_view method, const SXValue& params);
 
  private:
-  // `payload`: a message's payload, packed, which `params` holds an empty dictionary for.
-  void handle(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply,
-              std::optional<SXPackedValue> payload);
+  // A send's params, read and checked.
+  struct Send {
+    SXPackedValue payload;
+    SXReportingCategory category;
+    SXReportingMessageType type;
+    std::optional<std::vector<int64_t>> reporterIDs;
+  };
+  // A send's params read straight from the decoded objects; nothing when one of them is not
+  // what it must be (the general path then says what is wrong).
+  static std::optional<Send> readSend(const msgpack::object& params);
   // Empty when the request is within the size limits, else why not (and counted).
-  std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes,
-                          const SXPackedValue* payload);
-  void dispatch(std::string_view method, SXValue& params, size_t wireBytes, SXIpcReplyFn reply,
-                std::optional<SXPackedValue> payload);
+  std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes);
+  std::string checkSendLimits(const Send& send, size_t wireBytes);
+  void dispatch(std::string_view method, SXValue& params, SXIpcReplyFn reply);
+  void dispatchSend(Send send, size_t wireBytes, SXIpcReplyFn reply);
 
   const std::shared_ptr<SXReportingServerInstance> instance_;
   const std::weak_ptr<SXReportingServiceDelegate> delegate_;

@@ -1,5 +1,7 @@
 #include "sqlite/SqliteTallyvane.h"
 
+#include <unordered_map>
+
 namespace {
 
 constexpr const char* kSchema =
@@ -14,6 +16,16 @@ constexpr const char* kSelect =
     "SELECT id, time, name, payload_json FROM (SELECT * FROM events "
     "WHERE (?1 IS NULL OR name GLOB ?1) AND (?3 IS NULL OR time >= ?3) "
     "ORDER BY id DESC LIMIT ?2) ORDER BY id";
+
+// Event names repeat (one per category and type): each caller thread keeps one copy of each,
+// which its rows share instead of copying the name into every row.
+std::shared_ptr<const std::string> SharedName(const std::string& name) {
+  constexpr size_t kMaxNames = 1024;
+  thread_local std::unordered_map<std::string, std::shared_ptr<const std::string>> names;
+  if (auto it = names.find(name); it != names.end()) return it->second;
+  if (names.size() >= kMaxNames) names.clear();
+  return names.emplace(name, std::make_shared<const std::string>(name)).first->second;
+}
 
 }  // namespace
 
@@ -37,7 +49,7 @@ bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider
 bool SXSqliteTallyvane::sendEventLazy(const std::string& name, SXPayloadProvider provider,
                                       SXPayloadTextProvider json) {
   if (!json) return sendEventLazy(name, std::move(provider));
-  return writer_.enqueue([time = SXSqliteNow(), name, json = std::move(json)] {
+  return writer_.enqueue([time = SXSqliteNow(), name = SharedName(name), json = std::move(json)] {
     return SXSqliteRow{time, name, json()};
   });
 }
