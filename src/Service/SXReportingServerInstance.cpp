@@ -5,7 +5,6 @@
 
 #include "Statistics/SXReportingJoulebookUtility.h"
 #include "Statistics/SXReportingTallyvaneBridge.h"
-#include "common/MsgpackValue.h"
 
 namespace {
 

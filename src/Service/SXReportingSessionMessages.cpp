@@ -1,7 +1,6 @@
 // A session's message path: numbering, aggregation, the send task, and standalone messages.
 #include "SXReportingSession.h"
 #include "Statistics/SXReportingUtility.h"
-#include "common/MsgpackValue.h"
 #include "common/SXServiceTypes.h"
 
 namespace {
