@@ -252,6 +252,8 @@ void SXReportingServiceExport::dispatchSend(Send send, size_t wireBytes, SXIpcRe
     return;
   }
   if (send.reporterIDs) SXReportingRemoveRepeatedIDs(*send.reporterIDs);
+  // What a message makes the service hold is about as much as the decoded request took: its
+  // packed bytes and the stores' two texts, each about one and a half times its size.
   auto message = SXChargedShared(std::move(send.payload),
                                  SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
   instance_->sendMessage(
