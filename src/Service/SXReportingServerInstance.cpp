@@ -285,9 +285,9 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXPac
     SXLOG(log(), scope(), SXLogLevel::kDefault,
           "no active reporting sessions found, sending as standalone");
     auto defaults = delegate->getDefaults();
-    SXReportingSession::sendSingleMessage(environment_, message, category, type,
-                                          kStandaloneServiceType, defaults ? &*defaults : nullptr,
-                                          nullptr);
+    SXReportingSession::sendSingleMessage(
+        environment_, SXReportingDecodedPayload(message->value(), message), category, type,
+        kStandaloneServiceType, defaults ? &*defaults : nullptr, nullptr);
     return;
   }
   auto charged = chargeDeliveries(message, active.size());

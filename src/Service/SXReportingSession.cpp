@@ -82,6 +82,16 @@ std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXV
 
 }  // namespace
 
+std::shared_ptr<const SXValue> SXReportingDecodedPayload(
+    SXValue payload, std::shared_ptr<const SXPackedValue> packed) {
+  struct Holder {
+    SXValue payload;
+    std::shared_ptr<const SXPackedValue> packed;
+  };
+  auto holder = std::make_shared<const Holder>(Holder{std::move(payload), std::move(packed)});
+  return std::shared_ptr<const SXValue>(holder, &holder->payload);
+}
+
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   SXValue rewritten = SXValue::object();
   for (const auto& [key, value] : underscoredMembers(payload)) rewritten[key] = *value;

@@ -100,6 +100,11 @@ struct SXReportingAggregate {
 
 using SXReportingSendReply = std::function<void(std::optional<FernError>)>;
 
+// `payload` decoded, holding `packed` (and the client's charge it carries) for as long as the
+// dictionary is held: what a standalone send of a packed message keeps until it is stored.
+std::shared_ptr<const SXValue> SXReportingDecodedPayload(
+    SXValue payload, std::shared_ptr<const SXPackedValue> packed);
+
 // A copy of `payload` in which every space in a key is replaced by "_"; values untouched.
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload);
 // Whether the rewrite would change `payload`.
@@ -161,7 +166,7 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   // waits within `budget` when one is given; when the budget is full it is refused (logged
   // and counted).
   static void sendSingleMessage(const std::shared_ptr<SXReportingEnvironment>& environment,
-                                std::shared_ptr<const SXPackedValue> payload,
+                                std::shared_ptr<const SXValue> payload,
                                 SXReportingCategory category, SXReportingMessageType type,
                                 SXReportingServiceType serviceType, const SXValue* userInfo,
                                 SXReportingSendReply reply,
@@ -170,9 +175,8 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
                                 const SXValue& payload, SXReportingCategory category,
                                 SXReportingMessageType type, SXReportingServiceType serviceType,
                                 const SXValue* userInfo, SXReportingSendReply reply) {
-    sendSingleMessage(environment,
-                      std::make_shared<const SXPackedValue>(SXPackedValue::fromValue(payload)),
-                      category, type, serviceType, userInfo, std::move(reply));
+    sendSingleMessage(environment, std::make_shared<const SXValue>(payload), category, type,
+                      serviceType, userInfo, std::move(reply));
   }
 
   // Accessors (any thread).

@@ -1,6 +1,7 @@
 // A session's message path: numbering, aggregation, the send task, and standalone messages.
 #include "SXReportingSession.h"
 #include "Statistics/SXReportingUtility.h"
+#include "common/MsgpackValue.h"
 #include "common/SXServiceTypes.h"
 
 namespace {
@@ -116,15 +117,8 @@ void SXReportingSession::runSendBatch(const std::shared_ptr<SendBatch>& batch) {
     sendStarted(started);
     SXLOG(log(), scope(), SXLogLevel::kDebug, "session not started, will send as a single message");
     // The session's configuration is not part of a standalone message, so none is copied.
-    // The rewrite holds the caller's payload, and with it the client's charge, until it is
-    // stored.
-    struct Rewrite {
-      SXPackedValue value;
-      std::shared_ptr<const SXPackedValue> caller;
-    };
-    auto rewrite = std::make_shared<const Rewrite>(
-        Rewrite{SXPackedValue::fromValue(send.payload->rewritten()), send.callerPayload});
-    sendSingleMessage(environment_, std::shared_ptr<const SXPackedValue>(rewrite, &rewrite->value),
+    sendSingleMessage(environment_,
+                      SXReportingDecodedPayload(send.payload->rewritten(), send.callerPayload),
                       send.category, send.type, serviceType(), nullptr, nullptr,
                       standaloneBudget_);
     if (send.aggregated) send.payload->keepOnlyText();
@@ -187,7 +181,7 @@ namespace {
 // The standalone send task: one message to the server-reporting service with its own session
 // info and user info.
 void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environment,
-                       const SXValue& payload, SXReportingCategory category,
+                       const std::shared_ptr<const SXValue>& payload, SXReportingCategory category,
                        SXReportingMessageType type, SXReportingServiceType serviceType,
                        const SXReportingSendReply& reply) {
   constexpr const char* fn = "sendSingleMessage";
@@ -201,20 +195,18 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
   SXValue userInfo = {{fern::kUserInfoClientName, "com.vendra.sonex"},
                       {fern::kUserInfoServiceName, SXServiceTypeName(serviceType)}};
   // A payload the session already rewrote needs no second copy.
-  std::optional<SXValue> rewritten;
-  if (SXReportingSessionHasSpacedKeys(payload)) {
-    rewritten = SXReportingSessionUnderscoreKeys(payload);
-  }
+  auto rewritten = SXReportingSessionHasSpacedKeys(*payload)
+                       ? std::make_shared<const SXValue>(SXReportingSessionUnderscoreKeys(*payload))
+                       : payload;
   std::optional<FernError> error;
   bool sent = environment->platform().fernReporting->sendOneMessage(
-      sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type,
-      rewritten ? *rewritten : payload, error);
+      sessionInfo, userInfo, static_cast<uint16_t>(category & 0xFFFF), type, *rewritten, error);
   if (!sent && error) {
     SXLOG_IN(fn, log, scope, SXLogLevel::kError, "sendOneMessageWithSessionInfo %@",
              error->localizedDescription);
   } else if (sent) {
     environment->counters().delivered(SXReportingSink::kFernReporting);
-    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", payload,
+    SXLOG_IN(fn, log, scope, SXLogLevel::kDebug, "message %@ : category %i : type %i", *payload,
              static_cast<int32_t>(category), type);
   }
   if (reply) reply(error);
@@ -224,10 +216,9 @@ void runStandaloneSend(const std::shared_ptr<SXReportingEnvironment>& environmen
 // the send is refused, logged (once per run of refusals) and counted, so that a client cannot
 // make the service hold an unbounded backlog of delayed sends.
 bool reserveWait(SXReportingEnvironment& environment,
-                 const std::shared_ptr<SXReportingPendingBudget>& budget,
-                 const SXPackedValue& payload,
+                 const std::shared_ptr<SXReportingPendingBudget>& budget, const SXValue& payload,
                  std::shared_ptr<SXReportingPendingBudget::Slot>& slot) {
-  uint64_t bytes = payload.size();
+  uint64_t bytes = SXPackedSize(payload);
   slot = budget->tryAcquire(bytes);
   if (slot) return true;
   environment.counters().dropped(SXReportingGuardrail::kStandalonePending);
@@ -246,7 +237,7 @@ bool reserveWait(SXReportingEnvironment& environment,
 
 void SXReportingSession::sendSingleMessage(
     const std::shared_ptr<SXReportingEnvironment>& environment,
-    std::shared_ptr<const SXPackedValue> payload, SXReportingCategory category,
+    std::shared_ptr<const SXValue> payload, SXReportingCategory category,
     SXReportingMessageType type, SXReportingServiceType serviceType,
     const SXValue* /*userInfo: not sent*/, SXReportingSendReply reply,
     const std::shared_ptr<SXReportingPendingBudget>& budget) {
@@ -261,7 +252,7 @@ void SXReportingSession::sendSingleMessage(
   auto task = [environment, payload = std::move(payload), category, type, serviceType,
                reply = std::move(reply), slot = std::move(slot)] {
     (void)slot;  // the place in the budget is held until the send has run
-    runStandaloneSend(environment, payload->value(), category, type, serviceType, reply);
+    runStandaloneSend(environment, payload, category, type, serviceType, reply);
   };
   platform.dispatch->after(std::chrono::seconds(delay),
                            platform.dispatch->lowPriorityConcurrentQueue(), std::move(task));

@@ -83,7 +83,7 @@ void SXPackValue(msgpack::packer<Stream>& p, const SXValue& v) {
       p.pack_uint64(v.get<uint64_t>());
       break;
     case SXValue::value_t::number_float:
-      p.pack_double(v.get<double>());
+      SXPackDouble(p, v.get<double>());
       break;
     case SXValue::value_t::string: {
       const auto& s = v.get_ref<const std::string&>();

@@ -1,6 +1,7 @@
 // Conversion between MessagePack objects and the value model.
 #pragma once
 
+#include <cstring>
 #include <msgpack.hpp>
 #include <stdexcept>
 #include <string>
@@ -25,7 +26,19 @@ struct SXStringSink {
   void write(const char* data, size_t size) { out->append(data, size); }
 };
 
-// Packs a value. Binary values pack as bin (or ext when they carry a subtype).
+// Packs a double as a float64 even when it is whole: msgpack-c's pack_double writes 12.0 and
+// -0.0 as integers, and a floating value must reach its reader as one.
+template <typename Stream>
+void SXPackDouble(msgpack::packer<Stream>& packer, double value) {
+  uint64_t bits;
+  std::memcpy(&bits, &value, sizeof bits);
+  char bytes[9] = {static_cast<char>(0xcb)};
+  for (int i = 0; i < 8; ++i) bytes[1 + i] = static_cast<char>(bits >> (56 - 8 * i));
+  packer.pack_str_body(bytes, sizeof bytes);  // appends the bytes as they are
+}
+
+// Packs a value. Binary values pack as bin (or ext when they carry a subtype); floating values
+// as float64.
 template <typename Stream>
 void SXPackValue(msgpack::packer<Stream>& packer, const SXValue& value);
 

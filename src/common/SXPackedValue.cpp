@@ -3,7 +3,6 @@
 #include <cstring>
 #include <limits>
 #include <stdexcept>
-#include <type_traits>
 
 #include "common/MsgpackValue.h"
 
@@ -28,110 +27,71 @@ void SXCheckValueModel(const msgpack::object& o, int maxDepth) {
 
 namespace {
 
-// msgpack-c packs a floating value that happens to be whole as an integer; a payload's 12.0
-// must stay a floating value, so floats are written here.
-template <typename Float>
-void appendFloat(std::string& out, Float value) {
-  using Bits = std::conditional_t<sizeof(Float) == 4, uint32_t, uint64_t>;
-  Bits bits;
-  std::memcpy(&bits, &value, sizeof bits);
-  out += static_cast<char>(sizeof(Float) == 4 ? 0xca : 0xcb);
-  for (int shift = 8 * sizeof(Bits) - 8; shift >= 0; shift -= 8) {
-    out += static_cast<char>(bits >> shift & 0xff);
+// Scalars are packed here too: msgpack-c packs an object through a general visitor, which costs
+// more than the whole payload's copy.
+void packObject(msgpack::packer<SXStringSink>& packer, const msgpack::object& o) {
+  using msgpack::type::object_type;
+  switch (o.type) {
+    case object_type::NIL:
+      packer.pack_nil();
+      return;
+    case object_type::BOOLEAN:
+      o.via.boolean ? packer.pack_true() : packer.pack_false();
+      return;
+    case object_type::POSITIVE_INTEGER:
+      packer.pack_uint64(o.via.u64);
+      return;
+    case object_type::NEGATIVE_INTEGER:
+      packer.pack_int64(o.via.i64);
+      return;
+    case object_type::STR:
+      packer.pack_str(o.via.str.size);
+      packer.pack_str_body(o.via.str.ptr, o.via.str.size);
+      return;
+    case object_type::BIN:
+      packer.pack_bin(o.via.bin.size);
+      packer.pack_bin_body(o.via.bin.ptr, o.via.bin.size);
+      return;
+    case object_type::EXT:
+      packer.pack_ext(o.via.ext.size, o.via.ext.type());
+      packer.pack_ext_body(o.via.ext.data(), o.via.ext.size);
+      return;
+    case object_type::FLOAT32:  // decoded as the double it widens to, so packed as one
+    case object_type::FLOAT64:
+      SXPackDouble(packer, o.via.f64);
+      return;
+    case object_type::ARRAY:
+      packer.pack_array(o.via.array.size);
+      for (uint32_t i = 0; i < o.via.array.size; ++i) packObject(packer, o.via.array.ptr[i]);
+      return;
+    case object_type::MAP:
+      packer.pack_map(o.via.map.size);
+      for (uint32_t i = 0; i < o.via.map.size; ++i) {
+        packObject(packer, o.via.map.ptr[i].key);
+        packObject(packer, o.via.map.ptr[i].val);
+      }
+      return;
   }
+  packer.pack(o);
 }
-
-struct Packer {
-  std::string out;
-  SXStringSink sink{&out};
-  msgpack::packer<SXStringSink> packer{sink};
-
-  // Scalars are packed here too: msgpack-c packs an object through a general visitor, which
-  // costs more than the whole payload's copy.
-  void pack(const msgpack::object& o) {
-    using msgpack::type::object_type;
-    switch (o.type) {
-      case object_type::NIL:
-        packer.pack_nil();
-        return;
-      case object_type::BOOLEAN:
-        o.via.boolean ? packer.pack_true() : packer.pack_false();
-        return;
-      case object_type::POSITIVE_INTEGER:
-        packer.pack_uint64(o.via.u64);
-        return;
-      case object_type::NEGATIVE_INTEGER:
-        packer.pack_int64(o.via.i64);
-        return;
-      case object_type::STR:
-        packer.pack_str(o.via.str.size);
-        packer.pack_str_body(o.via.str.ptr, o.via.str.size);
-        return;
-      case object_type::BIN:
-        packer.pack_bin(o.via.bin.size);
-        packer.pack_bin_body(o.via.bin.ptr, o.via.bin.size);
-        return;
-      case object_type::EXT:
-        packer.pack_ext(o.via.ext.size, o.via.ext.type());
-        packer.pack_ext_body(o.via.ext.data(), o.via.ext.size);
-        return;
-      case object_type::FLOAT32:
-        appendFloat(out, static_cast<float>(o.via.f64));
-        return;
-      case object_type::FLOAT64:
-        appendFloat(out, o.via.f64);
-        return;
-      case object_type::ARRAY:
-        packer.pack_array(o.via.array.size);
-        for (uint32_t i = 0; i < o.via.array.size; ++i) pack(o.via.array.ptr[i]);
-        return;
-      case object_type::MAP:
-        packer.pack_map(o.via.map.size);
-        for (uint32_t i = 0; i < o.via.map.size; ++i) {
-          pack(o.via.map.ptr[i].key);
-          pack(o.via.map.ptr[i].val);
-        }
-        return;
-    }
-    packer.pack(o);
-  }
-
-  void pack(const SXValue& v) {
-    switch (v.type()) {
-      case SXValue::value_t::number_float:
-        appendFloat(out, v.get<double>());
-        return;
-      case SXValue::value_t::array:
-        packer.pack_array(static_cast<uint32_t>(v.size()));
-        for (const SXValue& item : v) pack(item);
-        return;
-      case SXValue::value_t::object:
-        packer.pack_map(static_cast<uint32_t>(v.size()));
-        for (const auto& [key, item] : v.items()) {
-          packer.pack_str(static_cast<uint32_t>(key.size()));
-          packer.pack_str_body(key.data(), static_cast<uint32_t>(key.size()));
-          pack(item);
-        }
-        return;
-      default:
-        SXPackValue(packer, v);
-    }
-  }
-};
 
 }  // namespace
 
 SXPackedValue SXPackedValue::fromObject(const msgpack::object& object) {
-  Packer packer;
-  packer.out.reserve(256);
-  packer.pack(object);
-  return SXPackedValue(std::move(packer.out));
+  std::string bytes;
+  bytes.reserve(256);
+  SXStringSink sink{&bytes};
+  msgpack::packer<SXStringSink> packer(sink);
+  packObject(packer, object);
+  return SXPackedValue(std::move(bytes));
 }
 
 SXPackedValue SXPackedValue::fromValue(const SXValue& value) {
-  Packer packer;
-  packer.pack(value);
-  return SXPackedValue(std::move(packer.out));
+  std::string bytes;
+  SXStringSink sink{&bytes};
+  msgpack::packer<SXStringSink> packer(sink);
+  SXPackValue(packer, value);
+  return SXPackedValue(std::move(bytes));
 }
 
 bool SXPackedValue::isDictionary() const {
