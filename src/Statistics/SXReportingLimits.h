@@ -38,8 +38,8 @@ struct SXReportingLimits {
   // Bytes one connection may make the service hold (its requests until handled, its payloads
   // until every store and send has them), and all connections together; beyond them the
   // connections that hold the most stop being read.
-  uint64_t maxConnectionBytes = 1 << 20;
-  uint64_t maxInflightBytes = 8 << 20;
+  uint64_t maxConnectionBytes = 4 << 20;
+  uint64_t maxInflightBytes = 16 << 20;
   // How long a request that has begun to arrive may take to complete.
   uint64_t partialFrameTimeoutMs = 30'000;
   // Open connections of one process; a further one is closed at once (logged and counted).

@@ -51,8 +51,8 @@ class SXUnixSocketListener final : public SXIpcListener {
     RpcLimits limits;
     size_t maxQueuedRequests = 1024;
     size_t maxPendingReplyBytes = 4 << 20;
-    uint64_t maxConnectionBytes = 1 << 20;
-    uint64_t maxInflightBytes = 8 << 20;
+    uint64_t maxConnectionBytes = 4 << 20;
+    uint64_t maxInflightBytes = 16 << 20;
     std::chrono::milliseconds partialFrameTimeout{30'000};
     std::shared_ptr<SXWorkQueue> requestQueue;
   };
