@@ -73,6 +73,24 @@ TEST_F(SqliteBatchWriterTest, AFullQueueRefusesNewRowsAtOnceAndEachBatchIsOneTra
   EXPECT_EQ(writer.writeErrors(), 4u);
 }
 
+// A batch goes in multi-row statements and single rows; neither may reorder or shift rows.
+TEST_F(SqliteBatchWriterTest, ALargeBatchKeepsItsOrderAndARowOfTheWrongWidthFailsOnlyItsBatch) {
+  SXSqliteBatchWriter writer(Options(1000, 40), log_);
+  ASSERT_NO_FATAL_FAILURE(Hold(writer, 0));
+  // Behind the held row: a batch of 40 (two blocks and eight single rows), then one whose
+  // sixth row has no value, inside its first block.
+  std::vector<int64_t> expected = {0};
+  for (int64_t v = 1; v <= 80; ++v) {
+    EXPECT_TRUE(writer.enqueue(v == 46 ? [] { return SXSqliteRow{}; } : Value(v)));
+    if (v <= 40) expected.push_back(v);
+  }
+  open_.set_value();
+  writer.flush();
+  EXPECT_EQ(Stored(), expected);
+  EXPECT_TRUE(log_->contains("dropped 40 rows"));
+  EXPECT_TRUE(log_->contains("a row of 0 values for 1 columns"));
+}
+
 TEST_F(SqliteBatchWriterTest, TheWriterMayOutliveItsOwnerWhenAProducerHeldIt) {
   auto writer = std::make_shared<SXSqliteBatchWriter>(Options(100, 1000), log_);
   // The producer ends up holding the only reference: the writer is destroyed on its own thread.

@@ -94,7 +94,8 @@ TEST_F(SqliteFernReportingTest, TokensAreUniqueAndNameTheirParent) {
 TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommittedOnReturn) {
   auto fern = Make();
   constexpr int kSessions = 6;
-  constexpr int kPerSession = 150;
+  constexpr int kPerSession = 160;
+  constexpr int kBurst = 20;  // longer than one multi-row insert
   std::vector<std::shared_ptr<FernReportingSession>> sessions;
   for (int i = 0; i < kSessions; ++i) {
     sessions.push_back(fern->openSession({}, {}, {}));
@@ -104,15 +105,18 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
   std::vector<std::thread> senders;
   for (int s = 0; s < kSessions; ++s) {
     senders.emplace_back([&, s] {
-      std::optional<FernError> error;
-      for (int i = 0; i < kPerSession; ++i) {
-        if (!sessions[s]->sendMessage(uint16_t(s), 1, {{"i", i}}, error)) ++failures;
-        // Acknowledged means committed: another connection sees the row at once.
-        if (i % 50 == 49) {
-          auto rows = SXTestQuery(
-              db_, "SELECT COUNT(*) AS n FROM messages WHERE category = " + std::to_string(s));
-          if (rows.empty() || rows[0]["n"] != i + 1) ++failures;
+      for (int i = 0; i < kPerSession; i += kBurst) {
+        std::vector<SXValue> payloads;
+        for (int k = 0; k < kBurst; ++k) payloads.push_back({{"i", i + k}});
+        std::vector<FernMessage> burst;
+        for (const SXValue& payload : payloads) burst.push_back({uint16_t(s), 1, &payload, nullptr});
+        for (const FernSendOutcome& outcome : sessions[s]->sendMessages(burst)) {
+          if (!outcome.sent) ++failures;
         }
+        // Acknowledged means committed: another connection sees the rows at once.
+        auto rows = SXTestQuery(
+            db_, "SELECT COUNT(*) AS n FROM messages WHERE category = " + std::to_string(s));
+        if (rows.empty() || rows[0]["n"] != i + kBurst) ++failures;
       }
     });
   }

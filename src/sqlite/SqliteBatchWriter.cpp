@@ -40,6 +40,7 @@ struct SXSqliteBatchWriter::Core {
   // is finalized first.
   std::unique_ptr<SXSqliteConnection> db;
   SXSqliteStatement insert;
+  SXSqliteStatement insertBlock;  // kSXSqliteRowsPerInsert rows at once
 };
 
 SXStatus SXSqliteBatchWriter::Core::ensureOpen() {
@@ -50,11 +51,16 @@ SXStatus SXSqliteBatchWriter::Core::ensureOpen() {
   if (!recovered.empty()) SXLOG(*log, nullptr, SXLogLevel::kError, "%s", recovered);
   if (!connection.ok()) return connection.status();
   SXSqliteStatement statement;
-  if (SXStatus failed = (*connection)->prepare(options.insertSql, statement); !failed.ok()) {
-    return SXFailure(options.path + ": " + failed.error());
+  SXSqliteStatement block;
+  SXStatus failed = (*connection)->prepare(options.insertSql, statement);
+  if (failed.ok()) {
+    failed = (*connection)->prepare(
+        SXSqliteInsertOfRows(options.insertSql, kSXSqliteRowsPerInsert), block);
   }
+  if (!failed.ok()) return SXFailure(options.path + ": " + failed.error());
   db = std::move(*connection);
   insert = std::move(statement);
+  insertBlock = std::move(block);
   return {};
 }
 
@@ -77,11 +83,16 @@ std::vector<SXSqliteRow> SXSqliteBatchWriter::Core::produceRows(std::vector<RowP
 
 SXStatus SXSqliteBatchWriter::Core::commit(const std::vector<SXSqliteRow>& rows) {
   if (SXStatus failed = db->exec("BEGIN IMMEDIATE"); !failed.ok()) return failed;
-  for (const auto& row : rows) {
-    if (SXStatus failed = insert.run(row); !failed.ok()) {
+  for (size_t i = 0; i < rows.size();) {
+    const SXSqliteRow* block[kSXSqliteRowsPerInsert];
+    size_t n = rows.size() - i >= kSXSqliteRowsPerInsert ? kSXSqliteRowsPerInsert : 1;
+    for (size_t k = 0; k < n; ++k) block[k] = &rows[i + k];
+    SXSqliteStatement& statement = n == 1 ? insert : insertBlock;
+    if (SXStatus failed = statement.run(std::span(block, n)); !failed.ok()) {
       (void)db->exec("ROLLBACK");
       return failed;
     }
+    i += n;
   }
   if (SXStatus failed = db->exec("COMMIT"); !failed.ok()) {
     (void)db->exec("ROLLBACK");
@@ -105,6 +116,7 @@ void SXSqliteBatchWriter::Core::writeBatch(std::vector<RowProducer>& batch) {
           options.path, failed.error());
     // Start the next batch on a fresh connection, in case this one is what went wrong.
     insert = SXSqliteStatement();
+    insertBlock = SXSqliteStatement();
     db.reset();
   }
 }

@@ -40,42 +40,77 @@ std::string SXSqliteStatement::failure(const char* context) const {
   return Describe(db_, std::string(context) + " \"" + sql.substr(0, sql.find('(')) + "\"");
 }
 
-SXStatus SXSqliteStatement::bind(const SXSqliteRow& params) {
+std::string SXSqliteInsertOfRows(const std::string& insertSql, size_t rows) {
+  size_t values = insertSql.rfind("VALUES");
+  if (values == std::string::npos || rows == 0) return insertSql;
+  size_t open = insertSql.find('(', values);
+  size_t close = insertSql.find(')', open);
+  if (open == std::string::npos || close == std::string::npos) return insertSql;
+  size_t width = static_cast<size_t>(
+      std::count(insertSql.begin() + static_cast<ptrdiff_t>(open),
+                 insertSql.begin() + static_cast<ptrdiff_t>(close), '?'));
+  std::string row = "(";
+  for (size_t i = 0; i < width; ++i) row += i == 0 ? "?" : ", ?";
+  row += ')';
+  std::string sql = insertSql.substr(0, open);
+  for (size_t i = 0; i < rows; ++i) sql += (i == 0 ? "" : ", ") + row;
+  return sql + insertSql.substr(close + 1);
+}
+
+int SXSqliteStatement::bindField(int index, const SXSqliteField& field) {
+  return std::visit(
+      [&](const auto& v) -> int {
+        using T = std::decay_t<decltype(v)>;
+        if constexpr (std::is_same_v<T, std::nullptr_t>) {
+          return sqlite3_bind_null(stmt_.get(), index);
+        } else if constexpr (std::is_same_v<T, int64_t>) {
+          return sqlite3_bind_int64(stmt_.get(), index, v);
+        } else if constexpr (std::is_same_v<T, double>) {
+          return sqlite3_bind_double(stmt_.get(), index, v);
+        } else if constexpr (std::is_same_v<T, std::shared_ptr<const std::string>>) {
+          if (!v) return sqlite3_bind_null(stmt_.get(), index);
+          return sqlite3_bind_text64(stmt_.get(), index, v->data(), v->size(), SQLITE_STATIC,
+                                     SQLITE_UTF8);
+        } else {
+          return sqlite3_bind_text64(stmt_.get(), index, v.data(), v.size(), SQLITE_STATIC,
+                                     SQLITE_UTF8);
+        }
+      },
+      field);
+}
+
+SXStatus SXSqliteStatement::bind(std::span<const SXSqliteRow* const> rows) {
   if (!stmt_) return SXFailure("statement was never prepared");
   // Every run and query clears the bindings it leaves, and so does a bind that fails.
   sqlite3_reset(stmt_.get());
-  for (size_t i = 0; i < params.size(); ++i) {
-    int index = static_cast<int>(i) + 1;
-    int rc = std::visit(
-        [&](const auto& v) -> int {
-          using T = std::decay_t<decltype(v)>;
-          if constexpr (std::is_same_v<T, std::nullptr_t>) {
-            return sqlite3_bind_null(stmt_.get(), index);
-          } else if constexpr (std::is_same_v<T, int64_t>) {
-            return sqlite3_bind_int64(stmt_.get(), index, v);
-          } else if constexpr (std::is_same_v<T, double>) {
-            return sqlite3_bind_double(stmt_.get(), index, v);
-          } else if constexpr (std::is_same_v<T, std::shared_ptr<const std::string>>) {
-            if (!v) return sqlite3_bind_null(stmt_.get(), index);
-            return sqlite3_bind_text64(stmt_.get(), index, v->data(), v->size(), SQLITE_STATIC,
-                                       SQLITE_UTF8);
-          } else {
-            return sqlite3_bind_text64(stmt_.get(), index, v.data(), v.size(), SQLITE_STATIC,
-                                       SQLITE_UTF8);
-          }
-        },
-        params[i]);
-    if (rc != SQLITE_OK) {
-      SXStatus failed = SXFailure(failure("bind"));
-      sqlite3_clear_bindings(stmt_.get());
-      return failed;
+  // A short row among several would shift the rows after it into the wrong columns.
+  size_t width = static_cast<size_t>(sqlite3_bind_parameter_count(stmt_.get())) / rows.size();
+  for (const SXSqliteRow* row : rows) {
+    if (rows.size() > 1 && row->size() != width) {
+      return SXFailure(failure("bind") + ": a row of " + std::to_string(row->size()) +
+                       " values for " + std::to_string(width) + " columns");
+    }
+  }
+  int index = 0;
+  for (const SXSqliteRow* row : rows) {
+    for (const SXSqliteField& field : *row) {
+      if (bindField(++index, field) != SQLITE_OK) {
+        SXStatus failed = SXFailure(failure("bind"));
+        sqlite3_clear_bindings(stmt_.get());
+        return failed;
+      }
     }
   }
   return {};
 }
 
 SXStatus SXSqliteStatement::run(const SXSqliteRow& params) {
-  if (SXStatus bound = bind(params); !bound.ok()) return bound;
+  const SXSqliteRow* rows[] = {&params};
+  return run(rows);
+}
+
+SXStatus SXSqliteStatement::run(std::span<const SXSqliteRow* const> rows) {
+  if (SXStatus bound = bind(rows); !bound.ok()) return bound;
   int rc;
   while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {
   }
@@ -88,7 +123,8 @@ SXStatus SXSqliteStatement::run(const SXSqliteRow& params) {
 }
 
 SXStatus SXSqliteStatement::query(const SXSqliteRow& params, std::vector<SXValue>& rows) {
-  if (SXStatus bound = bind(params); !bound.ok()) return bound;
+  const SXSqliteRow* bound[] = {&params};
+  if (SXStatus failed = bind(bound); !failed.ok()) return failed;
   int rc;
   int columns = sqlite3_column_count(stmt_.get());
   while ((rc = sqlite3_step(stmt_.get())) == SQLITE_ROW) {

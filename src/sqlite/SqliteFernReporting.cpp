@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <filesystem>
@@ -141,11 +142,17 @@ class SXSqliteFernReporting::Spool {
       close();
       return SXFailure(path_ + ": " + migrated.error());
     }
-    for (int kind = 0; kind < kKinds; ++kind) {
-      if (SXStatus failed = db_->prepare(kInsert[kind], insert_[kind]); !failed.ok()) {
-        close();
-        return SXFailure(path_ + ": " + failed.error());
-      }
+    SXStatus prepared;
+    for (int kind = 0; kind < kKinds && prepared.ok(); ++kind) {
+      prepared = db_->prepare(kInsert[kind], insert_[kind]);
+    }
+    if (prepared.ok()) {
+      prepared = db_->prepare(SXSqliteInsertOfRows(kInsert[kMessageRow], kSXSqliteRowsPerInsert),
+                              insertMessageBlock_);
+    }
+    if (!prepared.ok()) {
+      close();
+      return SXFailure(path_ + ": " + prepared.error());
     }
     return {};
   }
@@ -222,10 +229,29 @@ class SXSqliteFernReporting::Spool {
   SXStatus writeRows(const std::vector<PendingRow*>& batch) {
     if (batch.size() == 1) return writeRow(*batch.front());  // its own transaction
     if (SXStatus failed = db_->exec("BEGIN IMMEDIATE"); !failed.ok()) return failed;
-    for (PendingRow* pending : batch) {
-      if (SXStatus failed = writeRow(*pending); !failed.ok()) return failed;
+    for (size_t i = 0; i < batch.size();) {
+      size_t n = messageBlockAt(batch, i);
+      SXStatus written = n > 0 ? writeMessageBlock(batch, i) : writeRow(*batch[i]);
+      if (!written.ok()) return written;
+      i += std::max<size_t>(n, 1);
     }
     return db_->exec("COMMIT");
+  }
+
+  // kSXSqliteRowsPerInsert when that many message rows, none of which wants its id, start at
+  // `at`; otherwise 0.
+  static size_t messageBlockAt(const std::vector<PendingRow*>& batch, size_t at) {
+    if (batch.size() - at < kSXSqliteRowsPerInsert) return 0;
+    for (size_t k = at; k < at + kSXSqliteRowsPerInsert; ++k) {
+      if (batch[k]->kind != kMessageRow || batch[k]->rowId) return 0;
+    }
+    return kSXSqliteRowsPerInsert;
+  }
+
+  SXStatus writeMessageBlock(const std::vector<PendingRow*>& batch, size_t at) {
+    const SXSqliteRow* rows[kSXSqliteRowsPerInsert];
+    for (size_t k = 0; k < kSXSqliteRowsPerInsert; ++k) rows[k] = batch[at + k]->row;
+    return insertMessageBlock_.run(rows);
   }
 
   SXStatus writeRow(PendingRow& pending) {
@@ -237,6 +263,7 @@ class SXSqliteFernReporting::Spool {
   // REQUIRES: busy_ set by this thread. Statements go before the connection they belong to.
   void close() {
     for (auto& statement : insert_) statement = SXSqliteStatement();
+    insertMessageBlock_ = SXSqliteStatement();
     db_.reset();
   }
 
@@ -252,6 +279,7 @@ class SXSqliteFernReporting::Spool {
   // Owned by the thread that set busy_ (or the constructor, before the spool is shared).
   std::unique_ptr<SXSqliteConnection> db_;
   SXSqliteStatement insert_[kKinds];
+  SXSqliteStatement insertMessageBlock_;  // kSXSqliteRowsPerInsert message rows at once
   std::atomic<uint64_t> writeErrors_{0};  // rows not stored; any thread reads
   SXCompletionThread completions_;        // declared last: joined before the rest goes
 };
