@@ -109,7 +109,8 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
         std::vector<SXValue> payloads;
         for (int k = 0; k < kBurst; ++k) payloads.push_back({{"i", i + k}});
         std::vector<FernMessage> burst;
-        for (const SXValue& payload : payloads) burst.push_back({uint16_t(s), 1, &payload, nullptr});
+        for (const SXValue& payload : payloads)
+          burst.push_back({uint16_t(s), 1, &payload, nullptr});
         for (const FernSendOutcome& outcome : sessions[s]->sendMessages(burst)) {
           if (!outcome.sent) ++failures;
         }
@@ -128,7 +129,8 @@ TEST_F(SqliteFernReportingTest, ConcurrentSendsShareTransactionsYetEachIsCommitt
                         "SELECT session_id, MAX(id) FROM messages GROUP BY session_id"),
             std::vector<SXValue>{});
   // Each session's rows are all stored, in the order it sent them.
-  EXPECT_EQ(SXTestQuery(db_, "SELECT COUNT(*) AS n FROM messages")[0]["n"], kSessions * kPerSession);
+  EXPECT_EQ(SXTestQuery(db_, "SELECT COUNT(*) AS n FROM messages")[0]["n"],
+            kSessions * kPerSession);
   EXPECT_EQ(SXTestQuery(db_,
                         "SELECT 1 FROM messages a JOIN messages b ON a.category = b.category "
                         "AND a.id < b.id AND json_extract(a.payload_json, '$.i') >= "

@@ -54,8 +54,8 @@ SXStatus SXSqliteBatchWriter::Core::ensureOpen() {
   SXSqliteStatement block;
   SXStatus failed = (*connection)->prepare(options.insertSql, statement);
   if (failed.ok()) {
-    failed = (*connection)->prepare(
-        SXSqliteInsertOfRows(options.insertSql, kSXSqliteRowsPerInsert), block);
+    failed = (*connection)
+                 ->prepare(SXSqliteInsertOfRows(options.insertSql, kSXSqliteRowsPerInsert), block);
   }
   if (!failed.ok()) return SXFailure(options.path + ": " + failed.error());
   db = std::move(*connection);

@@ -46,9 +46,8 @@ std::string SXSqliteInsertOfRows(const std::string& insertSql, size_t rows) {
   size_t open = insertSql.find('(', values);
   size_t close = insertSql.find(')', open);
   if (open == std::string::npos || close == std::string::npos) return insertSql;
-  size_t width = static_cast<size_t>(
-      std::count(insertSql.begin() + static_cast<ptrdiff_t>(open),
-                 insertSql.begin() + static_cast<ptrdiff_t>(close), '?'));
+  std::string_view tuple = std::string_view(insertSql).substr(open, close - open);
+  auto width = static_cast<size_t>(std::count(tuple.begin(), tuple.end(), '?'));
   std::string row = "(";
   for (size_t i = 0; i < width; ++i) row += i == 0 ? "?" : ", ?";
   row += ')';
@@ -84,11 +83,13 @@ SXStatus SXSqliteStatement::bind(std::span<const SXSqliteRow* const> rows) {
   // Every run and query clears the bindings it leaves, and so does a bind that fails.
   sqlite3_reset(stmt_.get());
   // A short row among several would shift the rows after it into the wrong columns.
-  size_t width = static_cast<size_t>(sqlite3_bind_parameter_count(stmt_.get())) / rows.size();
-  for (const SXSqliteRow* row : rows) {
-    if (rows.size() > 1 && row->size() != width) {
-      return SXFailure(failure("bind") + ": a row of " + std::to_string(row->size()) +
-                       " values for " + std::to_string(width) + " columns");
+  if (rows.size() > 1) {
+    size_t width = static_cast<size_t>(sqlite3_bind_parameter_count(stmt_.get())) / rows.size();
+    for (const SXSqliteRow* row : rows) {
+      if (row->size() != width) {
+        return SXFailure(failure("bind") + ": a row of " + std::to_string(row->size()) +
+                         " values for " + std::to_string(width) + " columns");
+      }
     }
   }
   int index = 0;

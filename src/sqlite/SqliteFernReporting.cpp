@@ -163,8 +163,8 @@ class SXSqliteFernReporting::Spool {
     Kind kind;
     const SXSqliteRow* row;
     int64_t* rowId;
-    SXStatus result;                    // written by the committer before `done`
-    bool done = false;                  // under the spool's mutex_
+    SXStatus result;    // written by the committer before `done`
+    bool done = false;  // under the spool's mutex_
   };
 
   // Holds the connection for one caller that is not committing rows.

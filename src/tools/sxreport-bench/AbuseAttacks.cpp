@@ -34,7 +34,8 @@ constexpr size_t kIdListPayloadBytes = 500'000;
 constexpr size_t kRepeatedIds = 2000;
 constexpr size_t kUnknownIds = 65'536;
 constexpr size_t kConfigSessions = 16;
-constexpr size_t kUnreadSessions = 100;  // each reply lists them all; more only adds set-up log lines
+// Each getAllReporters: reply lists them all; more would only add set-up lines to the log.
+constexpr size_t kUnreadSessions = 100;
 constexpr size_t kUnknownMethodBytes = 60'000;  // echoed back in the error reply
 // A request just under the daemon's default 1 MiB limit, of which all but the last bytes go.
 constexpr size_t kPartialFrameBytes = (1 << 20) - 512;
