@@ -167,7 +167,7 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
   const SXValue decoded = SXValueFromMsgpack(handle.get());
   const SXPackedValue packed = SXPackedValue::fromObject(handle.get());
   EXPECT_EQ(SXPackedDictionaryText(packed), SXValueText(decoded));
-  EXPECT_EQ(SXPackedDictionaryText(packed), 
+  EXPECT_EQ(SXPackedDictionaryText(packed),
             R"({"b":-3,"c":[18446744073709551615,-9223372036854775808],"d":{"x":true,"y":null},)"
             R"("e":"","f":0.10000000149011612,"w":12.0})");
   EXPECT_TRUE(packed.hasMember("d"));

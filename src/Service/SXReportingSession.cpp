@@ -47,37 +47,10 @@ bool SXReportingSessionHasSpacedKeys(const SXValue& payload) {
 
 namespace {
 
-// Puts rewritten members in key order. Of keys that became equal the last in the payload's
-// order wins, as assigning them one after another would have it.
-template <typename Value>
-void orderRewrittenMembers(std::vector<std::pair<std::string, Value>>& members) {
-  std::stable_sort(members.begin(), members.end(),
-                   [](const auto& a, const auto& b) { return a.first < b.first; });
-  auto kept = members.begin();
-  for (auto it = members.begin(); it != members.end(); ++it) {
-    if (std::next(it) != members.end() && std::next(it)->first == it->first) continue;
-    if (kept != it) *kept = std::move(*it);
-    ++kept;
-  }
-  members.erase(kept, members.end());
-}
-
 std::string underscored(std::string_view key) {
   std::string name(key);
   std::replace(name.begin(), name.end(), ' ', '_');
   return name;
-}
-
-// The payload's members under their rewritten keys, in key order.
-std::vector<std::pair<std::string, const SXValue*>> underscoredMembers(const SXValue& payload) {
-  std::vector<std::pair<std::string, const SXValue*>> members;
-  if (!payload.is_object()) return members;
-  members.reserve(payload.size());
-  for (auto it = payload.cbegin(); it != payload.cend(); ++it) {
-    members.emplace_back(underscored(it.key()), &it.value());
-  }
-  orderRewrittenMembers(members);
-  return members;
 }
 
 }  // namespace
@@ -94,7 +67,11 @@ std::shared_ptr<const SXValue> SXReportingDecodedPayload(
 
 SXValue SXReportingSessionUnderscoreKeys(const SXValue& payload) {
   SXValue rewritten = SXValue::object();
-  for (const auto& [key, value] : underscoredMembers(payload)) rewritten[key] = *value;
+  if (!payload.is_object()) return rewritten;
+  // In key order, so that of keys that become equal the last in that order stays.
+  for (auto it = payload.cbegin(); it != payload.cend(); ++it) {
+    rewritten[underscored(it.key())] = it.value();
+  }
   return rewritten;
 }
 

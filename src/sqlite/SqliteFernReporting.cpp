@@ -230,22 +230,21 @@ class SXSqliteFernReporting::Spool {
     if (batch.size() == 1) return writeRow(*batch.front());  // its own transaction
     if (SXStatus failed = db_->exec("BEGIN IMMEDIATE"); !failed.ok()) return failed;
     for (size_t i = 0; i < batch.size();) {
-      size_t n = messageBlockAt(batch, i);
-      SXStatus written = n > 0 ? writeMessageBlock(batch, i) : writeRow(*batch[i]);
+      bool block = startsMessageBlock(batch, i);
+      SXStatus written = block ? writeMessageBlock(batch, i) : writeRow(*batch[i]);
       if (!written.ok()) return written;
-      i += std::max<size_t>(n, 1);
+      i += block ? kSXSqliteRowsPerInsert : 1;
     }
     return db_->exec("COMMIT");
   }
 
-  // kSXSqliteRowsPerInsert when that many message rows, none of which wants its id, start at
-  // `at`; otherwise 0.
-  static size_t messageBlockAt(const std::vector<PendingRow*>& batch, size_t at) {
-    if (batch.size() - at < kSXSqliteRowsPerInsert) return 0;
-    for (size_t k = at; k < at + kSXSqliteRowsPerInsert; ++k) {
-      if (batch[k]->kind != kMessageRow || batch[k]->rowId) return 0;
-    }
-    return kSXSqliteRowsPerInsert;
+  // Whether kSXSqliteRowsPerInsert message rows, none of which wants its id, start at `at`.
+  static bool startsMessageBlock(const std::vector<PendingRow*>& batch, size_t at) {
+    if (batch.size() - at < kSXSqliteRowsPerInsert) return false;
+    return std::all_of(
+        batch.begin() + static_cast<ptrdiff_t>(at),
+        batch.begin() + static_cast<ptrdiff_t>(at + kSXSqliteRowsPerInsert),
+        [](const PendingRow* row) { return row->kind == kMessageRow && !row->rowId; });
   }
 
   SXStatus writeMessageBlock(const std::vector<PendingRow*>& batch, size_t at) {
