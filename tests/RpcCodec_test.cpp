@@ -129,6 +129,15 @@ TEST(MsgpackValue, DictionariesTakeKeysInAnyOrderTheLastRepeatWinsAndOnlyStringK
 TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
   const SXValue host = "player";
   const std::vector<uint8_t> bytes = {0, 255};
+  // Texts of every length around the 8- and 16-byte blocks they are checked in, with a byte
+  // to escape first, in the middle or last; and more keys than are sorted without the heap.
+  SXValue blocks = SXValue::object();
+  for (size_t length : {1, 7, 8, 9, 15, 16, 17, 24, 31, 32, 33}) {
+    const std::string text(length, 'p');
+    blocks["e" + text] = text.substr(1) + "\"";
+    blocks["f" + text] = "\x1f" + text.substr(1);
+    blocks["m" + text] = text.substr(0, length / 2) + "\x7f" + text.substr(length / 2 + 1);
+  }
   for (const SXValue& payload :
        {SXValue::object(), SXValue{{"a", 1}},
         SXValue{{"zz", {1, 2}}, {"HostApplicationDisplayID", "x"}},
@@ -140,14 +149,15 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
                 {"ext", SXValue::binary(bytes, 7)},
                 {"arr", SXValue::array()}},
         SXValue{{"A", "}\\\"{,]"}, {"Host", {{"x", {1, "]"}}}}, {"I", nullptr}, {"z", false}},
-        SXValue::array({1}), SXValue()}) {
+        blocks, SXValue::array({1}), SXValue()}) {
     SXValue merged = payload.is_object() ? payload : SXValue::object();
     merged["HostApplicationDisplayID"] = host;
     EXPECT_EQ(SXValueText(merged), merged.dump(-1, ' ', false, SXValue::error_handler_t::replace));
     const SXPackedValue packed = SXPackedValue::fromValue(payload);
     EXPECT_EQ(SXValueText(packed.value()), SXValueText(payload));
-    EXPECT_EQ(SXPackedDictionaryText(packed, false, SXTextMember{"HostApplicationDisplayID", &host}),
-              SXValueText(merged));
+    EXPECT_EQ(
+        SXPackedDictionaryText(packed, false, SXTextMember{"HostApplicationDisplayID", &host}),
+        SXValueText(merged));
     if (payload.is_object()) {
       EXPECT_EQ(SXPackedDictionaryText(packed), SXValueText(payload));
     }
@@ -172,6 +182,15 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
             R"("e":"","f":0.10000000149011612,"w":12.0})");
   EXPECT_TRUE(packed.hasMember("d"));
   EXPECT_FALSE(packed.hasMember("x"));
+  // More keys than are sorted without the heap, sent in reverse order.
+  msgpack::sbuffer reversed;
+  msgpack::packer<msgpack::sbuffer> r(reversed);
+  r.pack_map(static_cast<uint32_t>(blocks.size()));
+  for (auto it = blocks.rbegin(); it != blocks.rend(); ++it) {
+    r.pack(it.key()), r.pack(it.value().get<std::string>());
+  }
+  handle = msgpack::unpack(reversed.data(), reversed.size());
+  EXPECT_EQ(SXPackedDictionaryText(SXPackedValue::fromObject(handle.get())), SXValueText(blocks));
 }
 
 TEST(SXValueText, EveryKind) {

@@ -93,6 +93,9 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
        {payload, SXValue{{"a b", 1}, {"a_a", {{"x y", 2}}}, {"a!", 3}}, SXValue::array({1}),
         SXValue{{"z", "\",{} \\"}, {"a b", {1.5, "]", nullptr}}, {"a_b", 2}, {"a c", -0.0}},
         SXValue{{"\xc3\xa9 t", 1}, {"e t", 2}}, SXValue{{"q\"u o", 1}, {"b", 2}},
+        SXValue{{"a key of more than sixteen bytes", 1},
+                {"a_key_of_more_than_sixteen bytes", 2},
+                {"sixteen  bytes k", 3}},
         SXValue::object()}) {
     const SXValue rewritten = SXReportingSessionUnderscoreKeys(spaced);
     SXReportingMessagePayload prepared(

@@ -133,7 +133,7 @@ T SXPackedReader::big(size_t n) {
   return static_cast<T>(value);
 }
 
-SXPackedReader::Item SXPackedReader::next() {
+SXPackedReader::Item SXPackedReader::nextOther() {
   Item item;
   auto head = static_cast<uint8_t>(*take(1));
   auto sized = [&](Kind kind, size_t size) {

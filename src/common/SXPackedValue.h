@@ -55,13 +55,35 @@ class SXPackedReader {
   explicit SXPackedReader(std::string_view bytes) : at_(bytes.data()), end_(at_ + bytes.size()) {}
   SXPackedReader(const char* at, const char* end) : at_(at), end_(end) {}
 
-  Item next();
+  Item next() {
+    // Small integers and short strings, most items of a payload, are read here; the rest out
+    // of line.
+    if (at_ != end_) {
+      const auto head = static_cast<uint8_t>(*at_);
+      Item item;
+      if (head <= 0x7f) {
+        ++at_;
+        item.kind = Kind::kUnsigned;
+        item.u = head;
+        return item;
+      }
+      const size_t shortString = head & 0x1fu;
+      if ((head & 0xe0) == 0xa0 && static_cast<size_t>(end_ - at_) > shortString) {
+        item.kind = Kind::kString;
+        item.data = std::string_view(at_ + 1, shortString);
+        at_ += 1 + shortString;
+        return item;
+      }
+    }
+    return nextOther();
+  }
   // Steps over one whole value, containers with everything in them.
   void skip();
   const char* position() const { return at_; }
   const char* end() const { return end_; }
 
  private:
+  Item nextOther();
   const char* take(size_t n);
   template <typename T>
   T big(size_t n);

@@ -4,6 +4,8 @@
 #include <array>
 #include <charconv>
 #include <cmath>
+#include <cstdint>
+#include <cstring>
 
 #include "common/SXPackedValue.h"
 
@@ -15,35 +17,136 @@ std::string SXDoubleText(double value) {
 
 namespace {
 
+// Appends to a string through a cursor: the string is grown ahead of the writes and cut to
+// length once, in finish(), so each piece of a text is a plain copy, not a checked append.
+class TextBuffer {
+ public:
+  explicit TextBuffer(std::string& out) : out_(out), length_(out.size()) {
+    out_.resize(std::max(out_.capacity(), length_ + kSlack));
+  }
+
+  // Room for `n` more bytes after what is written; wrote() then says how many were used.
+  char* room(size_t n) {
+    if (out_.size() - length_ < n) [[unlikely]]
+      grow(n);
+    return out_.data() + length_;
+  }
+  void wrote(size_t n) { length_ += n; }
+
+  void put(char c) {
+    *room(1) = c;
+    ++length_;
+  }
+  void put(std::string_view text) {
+    if (text.empty()) return;
+    std::memcpy(room(text.size()), text.data(), text.size());
+    length_ += text.size();
+  }
+
+  void finish() { out_.resize(length_); }
+
+ private:
+  static constexpr size_t kSlack = 64;
+
+  [[gnu::noinline]] void grow(size_t n) {
+    out_.resize(std::max(2 * out_.size(), length_ + n + kSlack));
+  }
+
+  std::string& out_;
+  size_t length_;
+};
+
+// Whether the 16 bytes at `bytes` are printable ASCII other than '"' and '\\'.
+bool PlainBlock(const char* bytes) {
+  using Block = uint8_t __attribute__((vector_size(16)));
+  Block block;
+  std::memcpy(&block, bytes, sizeof block);
+  auto bad = (block < 0x20) | (block >= 0x7F) | (block == '"') | (block == '\\');
+  uint64_t halves[2];
+  std::memcpy(halves, &bad, sizeof halves);
+  return (halves[0] | halves[1]) == 0;
+}
+
+// The same of the 8 bytes at `bytes`, in one word.
+bool PlainWord(const char* bytes) {
+  constexpr uint64_t kOnes = 0x0101010101010101;
+  constexpr uint64_t kHighs = 0x8080808080808080;
+  // Whether a byte of `word` is below `n` (at most 0x80), or equal to `c`.
+  auto below = [](uint64_t word, uint64_t n) { return (word - kOnes * n) & ~word & kHighs; };
+  auto equal = [&](uint64_t word, uint64_t c) { return below(word ^ (kOnes * c), 1); };
+  uint64_t word;
+  std::memcpy(&word, bytes, sizeof word);
+  return ((word & kHighs) | below(word, 0x20) | equal(word, 0x7F) | equal(word, '"') |
+          equal(word, '\\')) == 0;
+}
+
+// Each space in the `size` bytes at `text` made "_", 16 bytes at a time.
+void UnderscoreSpaces(char* text, size_t size) {
+  using Block = uint8_t __attribute__((vector_size(16)));
+  size_t at = 0;
+  for (; at + sizeof(Block) <= size; at += sizeof(Block)) {
+    Block block;
+    std::memcpy(&block, text + at, sizeof block);
+    block += reinterpret_cast<Block>(block == ' ') & ('_' - ' ');
+    std::memcpy(text + at, &block, sizeof block);
+  }
+  for (; at < size; ++at) {
+    if (text[at] == ' ') text[at] = '_';
+  }
+}
+
+// Whether JSON writes `text` as it is: printable ASCII other than '"' and '\\'. A block at a
+// time, the last one overlapping the one before: nearly every key and string of a payload is
+// such a text.
+bool plain(std::string_view text) {
+  const char* bytes = text.data();
+  const size_t size = text.size();
+  if (size >= 16) {
+    for (size_t at = 0; at + 16 < size; at += 16) {
+      if (!PlainBlock(bytes + at)) return false;
+    }
+    return PlainBlock(bytes + size - 16);
+  }
+  if (size >= 8) return PlainWord(bytes) && PlainWord(bytes + size - 8);
+  for (size_t at = 0; at < size; ++at) {
+    auto c = static_cast<unsigned char>(bytes[at]);
+    if (c < 0x20 || c >= 0x7F || c == '"' || c == '\\') return false;
+  }
+  return true;
+}
+
 // Compact JSON as SXValue::dump(-1) writes it, with invalid UTF-8 replaced. Keys and strings
 // of plain ASCII, nearly all of them in practice, are copied as they are; everything else goes
 // through the library's serializer, so the text is the same byte for byte.
 class JsonWriter {
  public:
   explicit JsonWriter(std::string& out) : out_(out) {}
+  ~JsonWriter() { out_.finish(); }
+  JsonWriter(const JsonWriter&) = delete;
+  JsonWriter& operator=(const JsonWriter&) = delete;
 
   void value(const SXValue& value) {
     switch (value.type()) {
       case SXValue::value_t::object: {
-        out_ += '{';
+        out_.put('{');
         bool first = true;
         for (auto it = value.cbegin(); it != value.cend(); ++it) {
-          if (!first) out_ += ',';
+          if (!first) out_.put(',');
           first = false;
           member(it.key(), it.value());
         }
-        out_ += '}';
+        out_.put('}');
         return;
       }
       case SXValue::value_t::array: {
-        out_ += '[';
+        out_.put('[');
         bool first = true;
         for (const SXValue& element : value) {
-          if (!first) out_ += ',';
+          if (!first) out_.put(',');
           first = false;
           this->value(element);
         }
-        out_ += ']';
+        out_.put(']');
         return;
       }
       case SXValue::value_t::string:
@@ -56,22 +159,22 @@ class JsonWriter {
         decimal(value.get<uint64_t>());
         return;
       case SXValue::value_t::boolean:
-        out_ += value.get<bool>() ? "true" : "false";
+        out_.put(value.get<bool>() ? "true" : "false");
         return;
       case SXValue::value_t::null:
-        out_ += "null";
+        out_.put("null");
         return;
       case SXValue::value_t::number_float:
         floating(value.get<double>());
         return;
       default:
-        serializer().dump(value, false, false, 0);
+        dump(value);
     }
   }
 
   void member(std::string_view key, const SXValue& value) {
     string(key, nullptr);
-    out_ += ':';
+    out_.put(':');
     this->value(value);
   }
 
@@ -84,12 +187,12 @@ class JsonWriter {
         packedMembers(reader, item.count, false, {});
         return;
       case Kind::kArray:
-        out_ += '[';
+        out_.put('[');
         for (uint32_t i = 0; i < item.count; ++i) {
-          if (i > 0) out_ += ',';
+          if (i > 0) out_.put(',');
           packed(reader);
         }
-        out_ += ']';
+        out_.put(']');
         return;
       case Kind::kString:
         string(item.data, nullptr);
@@ -101,10 +204,10 @@ class JsonWriter {
         decimal(item.i);
         return;
       case Kind::kBool:
-        out_ += item.boolean ? "true" : "false";
+        out_.put(item.boolean ? "true" : "false");
         return;
       case Kind::kNil:
-        out_ += "null";
+        out_.put("null");
         return;
       case Kind::kFloat:
         floating(item.f);
@@ -113,9 +216,9 @@ class JsonWriter {
       case Kind::kExt: {
         const auto* bytes = reinterpret_cast<const uint8_t*>(item.data.data());
         std::vector<uint8_t> data(bytes, bytes + item.data.size());
-        value(item.kind == Kind::kExt ? SXValue::binary(std::move(data),
-                                                        static_cast<uint8_t>(item.extType))
-                                      : SXValue::binary(std::move(data)));
+        value(item.kind == Kind::kExt
+                  ? SXValue::binary(std::move(data), static_cast<uint8_t>(item.extType))
+                  : SXValue::binary(std::move(data)));
         return;
       }
     }
@@ -128,8 +231,11 @@ class JsonWriter {
   void packedMembers(SXPackedReader& reader, uint32_t pairs, bool underscoreKeys,
                      std::optional<SXTextMember> extra) {
     struct Member {
-      std::string_view key;
+      // Not a string_view: that would zero the whole inline array up front.
+      const char* keyBytes;
+      size_t keySize;
       const char* value;  // where its value starts in the bytes
+      std::string_view key() const { return {keyBytes, keySize}; }
     };
     // Dictionaries of a few keys, nearly all of them, are sorted without the heap.
     constexpr uint32_t kInline = 32;
@@ -140,28 +246,35 @@ class JsonWriter {
       heapMembers.resize(pairs);
       members = heapMembers.data();
     }
-    const KeyOrder order{underscoreKeys};
-    // In renamed order, then original order, then the order of the bytes: the last of each
-    // run of equal renamed keys is the one decoding and renaming keep. Insertion sort is
-    // stable and quick for the few keys of a message.
     for (uint32_t i = 0; i < pairs; ++i) {
-      Member member{reader.next().data, reader.position()};
+      std::string_view key = reader.next().data;
+      members[i] = {key.data(), key.size(), reader.position()};
       reader.skip();
-      uint32_t at = i;
-      for (; at > 0 && order.before(member.key, members[at - 1].key); --at) {
-        members[at] = members[at - 1];
-      }
-      members[at] = member;
     }
-    out_ += '{';
+    // In renamed order, then original order, then the order of the bytes: the last of each
+    // run of equal renamed keys is the one decoding and renaming keep.
+    const KeyOrder order{underscoreKeys};
+    auto before = [&](const Member& a, const Member& b) { return order.before(a.key(), b.key()); };
+    if (pairs > kInline) {
+      std::stable_sort(members, members + pairs, before);
+    } else {
+      // Insertion sort, stable and quick for the few keys of a message.
+      for (uint32_t i = 1; i < pairs; ++i) {
+        Member member = members[i];
+        uint32_t at = i;
+        for (; at > 0 && before(member, members[at - 1]); --at) members[at] = members[at - 1];
+        members[at] = member;
+      }
+    }
+    out_.put('{');
     bool first = true;
     auto comma = [&] {
-      if (!first) out_ += ',';
+      if (!first) out_.put(',');
       first = false;
     };
     for (uint32_t i = 0; i < pairs; ++i) {
-      const std::string_view key = members[i].key;
-      if (i + 1 < pairs && order.renamedEqual(key, members[i + 1].key)) continue;
+      const std::string_view key = members[i].key();
+      if (i + 1 < pairs && order.renamedEqual(key, members[i + 1].key())) continue;
       if (extra && !order.renamedBelow(key, extra->key)) {
         comma();
         member(extra->key, *extra->value);
@@ -170,14 +283,8 @@ class JsonWriter {
         if (replaced) continue;
       }
       comma();
-      if (underscoreKeys && key.find(' ') != std::string_view::npos) {
-        std::string renamed(key);
-        std::replace(renamed.begin(), renamed.end(), ' ', '_');
-        string(renamed, nullptr);
-      } else {
-        string(key, nullptr);
-      }
-      out_ += ':';
+      string(key, nullptr, underscoreKeys);
+      out_.put(':');
       SXPackedReader value(members[i].value, reader.end());
       packed(value);
     }
@@ -185,7 +292,7 @@ class JsonWriter {
       comma();
       member(extra->key, *extra->value);
     }
-    out_ += '}';
+    out_.put('}');
   }
 
  private:
@@ -218,58 +325,57 @@ class JsonWriter {
 
   template <typename Integer>
   void decimal(Integer number) {
-    char digits[24];
-    auto [end, ec] = std::to_chars(digits, digits + sizeof digits, number);
-    out_.append(digits, end);
+    constexpr size_t kDigits = 24;
+    char* at = out_.room(kDigits);
+    out_.wrote(std::to_chars(at, at + kDigits, number).ptr - at);
   }
 
   // The library's own shortest form, as its serializer writes it; not a number is null.
   void floating(double number) {
     if (!std::isfinite(number)) {
-      out_ += "null";
+      out_.put("null");
       return;
     }
-    char digits[64];
-    char* end = nlohmann::detail::to_chars(digits, digits + sizeof digits, number);
-    out_.append(digits, end);
+    constexpr size_t kDigits = 64;
+    char* at = out_.room(kDigits);
+    out_.wrote(nlohmann::detail::to_chars(at, at + kDigits, number) - at);
   }
 
   // The library's serializer, for binary values and strings that need escaping or repair.
   // Made on first use: setting one up costs more than writing a payload.
-  nlohmann::detail::serializer<SXValue>& serializer() {
+  void dump(const SXValue& value) {
     if (!serializer_) {
-      serializer_.emplace(nlohmann::detail::output_adapter<char, std::string>(out_), ' ',
+      serializer_.emplace(nlohmann::detail::output_adapter<char, std::string>(dumped_), ' ',
                           SXValue::error_handler_t::replace);
     }
-    return *serializer_;
-  }
-
-  static bool plain(std::string_view text) {
-    static constexpr auto kPlain = [] {
-      std::array<bool, 256> table{};
-      for (int c = 0x20; c < 0x7F; ++c) table[c] = c != '"' && c != '\\';
-      return table;
-    }();
-    for (unsigned char c : text) {
-      if (!kPlain[c]) return false;
-    }
-    return true;
+    dumped_.clear();
+    serializer_->dump(value, false, false, 0);
+    out_.put(dumped_);
   }
 
   // `asValue`: the same string as a value, when the caller has one (saves a copy).
-  void string(std::string_view text, const SXValue* asValue) {
+  // `underscore`: each space written as "_".
+  void string(std::string_view text, const SXValue* asValue, bool underscore = false) {
     if (plain(text)) {
-      out_ += '"';
-      out_.append(text);
-      out_ += '"';
+      char* at = out_.room(text.size() + 2);
+      *at = '"';
+      if (!text.empty()) std::memcpy(at + 1, text.data(), text.size());
+      if (underscore) UnderscoreSpaces(at + 1, text.size());
+      at[text.size() + 1] = '"';
+      out_.wrote(text.size() + 2);
+    } else if (underscore) {
+      std::string renamed(text);
+      std::replace(renamed.begin(), renamed.end(), ' ', '_');
+      dump(SXValue(std::move(renamed)));
     } else if (asValue) {
-      serializer().dump(*asValue, false, false, 0);
+      dump(*asValue);
     } else {
-      serializer().dump(SXValue(std::string(text)), false, false, 0);
+      dump(SXValue(std::string(text)));
     }
   }
 
-  std::string& out_;
+  TextBuffer out_;
+  std::string dumped_;
   std::optional<nlohmann::detail::serializer<SXValue>> serializer_;
 };
 
