@@ -69,10 +69,13 @@ TEST(RpcStreamDecoder, BreaksOnGarbageOversizeDeepNestingAndHugeDeclaredContaine
       {encodeRequest(1, "m", SXValue::array({nested(33)})), Status::kBroken},
       // An array32 that declares 4G entries: refused, not allocated.
       {std::string("\x94\x00\x01\xa1m\xdd\xff\xff\xff\xff", 10), Status::kBroken},
+      {std::string("\x94\x00\x01\xa1m\x91\x81\x01\x02", 10), Status::kBroken},  // key 1
   };
   for (const Case& c : cases) {
     RpcStreamDecoder decoder(c.limits);
     feed(decoder, c.bytes);
+    // Read in place only what decoding accepts.
+    EXPECT_EQ(decoder.peekRequest().has_value(), c.status == Status::kMessage);
     SXValue message;
     EXPECT_EQ(decoder.next(message), c.status) << testing::PrintToString(c.bytes.substr(0, 16));
   }

@@ -161,35 +161,41 @@ std::string SXReportingServiceExport::checkSendLimits(const Send& send, size_t w
 }
 
 std::optional<SXReportingServiceExport::Send> SXReportingServiceExport::readSend(
-    const msgpack::object& params) {
-  using msgpack::type::object_type;
-  const msgpack::object_array& items = params.via.array;
-  if (items.size != 4 || items.ptr[0].type != object_type::MAP) return std::nullopt;
-  auto unsignedUpTo = [](const msgpack::object& o, uint64_t max) {
-    return o.type == object_type::POSITIVE_INTEGER && o.via.u64 <= max;
+    std::string_view params) {
+  using Kind = SXPackedReader::Kind;
+  // The connection has checked the bytes: one whole array that the value model can hold.
+  SXPackedReader reader(params);
+  if (reader.next().count != 4) return std::nullopt;
+  const char* payload = reader.position();
+  if (SXPackedReader(reader).next().kind != Kind::kMap) return std::nullopt;
+  reader.skip();
+  const std::string_view payloadBytes(payload, reader.position() - payload);
+  auto unsignedUpTo = [](const SXPackedReader::Item& item, uint64_t max) {
+    return item.kind == Kind::kUnsigned && item.u <= max;
   };
-  const msgpack::object& ids = items.ptr[3];
-  if (!unsignedUpTo(items.ptr[1], 0xFFFFFFFF) || !unsignedUpTo(items.ptr[2], 0xFFFF) ||
-      (ids.type != object_type::NIL && ids.type != object_type::ARRAY)) {
+  SXPackedReader::Item category = reader.next();
+  SXPackedReader::Item type = reader.next();
+  SXPackedReader::Item ids = reader.next();
+  if (!unsignedUpTo(category, 0xFFFFFFFF) || !unsignedUpTo(type, 0xFFFF) ||
+      (ids.kind != Kind::kNil && ids.kind != Kind::kArray)) {
     return std::nullopt;
   }
   std::optional<std::vector<int64_t>> reporterIDs;
-  if (ids.type == object_type::ARRAY) {
-    reporterIDs.emplace().reserve(ids.via.array.size);
-    for (uint32_t i = 0; i < ids.via.array.size; ++i) {
-      const msgpack::object& id = ids.via.array.ptr[i];
-      if (id.type == object_type::NEGATIVE_INTEGER) {
-        reporterIDs->push_back(id.via.i64);
+  if (ids.kind == Kind::kArray) {
+    reporterIDs.emplace().reserve(ids.count);
+    for (uint32_t i = 0; i < ids.count; ++i) {
+      SXPackedReader::Item id = reader.next();
+      if (id.kind == Kind::kSigned) {
+        reporterIDs->push_back(id.i);
       } else if (unsignedUpTo(id, std::numeric_limits<int64_t>::max())) {
-        reporterIDs->push_back(static_cast<int64_t>(id.via.u64));
+        reporterIDs->push_back(static_cast<int64_t>(id.u));
       } else {
         return std::nullopt;
       }
     }
   }
-  return Send{SXPackedValue::fromObject(items.ptr[0]),
-              static_cast<SXReportingCategory>(items.ptr[1].via.u64),
-              static_cast<SXReportingMessageType>(items.ptr[2].via.u64), std::move(reporterIDs)};
+  return Send{SXPackedValue::fromBytes(payloadBytes), static_cast<SXReportingCategory>(category.u),
+              static_cast<SXReportingMessageType>(type.u), std::move(reporterIDs)};
 }
 
 std::string SXReportingServiceExport::validate(std::string_view method, const SXValue& params) {
@@ -232,15 +238,13 @@ void SXReportingServiceExport::handleRequest(std::string_view method, SXValue pa
   dispatch(method, params, std::move(reply));
 }
 
-void SXReportingServiceExport::handleRequest(std::string_view method, const msgpack::object& params,
-                                             size_t wireBytes, SXIpcReplyFn reply) {
-  if (method == sxr::method::kSendMessage) {
-    if (std::optional<Send> send = readSend(params)) {
-      dispatchSend(std::move(*send), wireBytes, std::move(reply));
-      return;
-    }
-  }
-  SXIpcExportedObject::handleRequest(method, params, wireBytes, std::move(reply));
+bool SXReportingServiceExport::handlePackedRequest(std::string_view method, std::string_view params,
+                                                   size_t wireBytes, SXIpcReplyFn& reply) {
+  if (method != sxr::method::kSendMessage) return false;
+  std::optional<Send> send = readSend(params);
+  if (!send) return false;
+  dispatchSend(std::move(*send), wireBytes, std::move(reply));
+  return true;
 }
 
 void SXReportingServiceExport::dispatchSend(Send send, size_t wireBytes, SXIpcReplyFn reply) {

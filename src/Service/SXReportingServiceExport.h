@@ -26,10 +26,10 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
 
   void handleRequest(std::string_view method, SXValue params, size_t wireBytes,
                      SXIpcReplyFn reply) override;
-  // A send's params are read without values, and its payload stays packed: the stores write
-  // their texts straight from its bytes.
-  void handleRequest(std::string_view method, const msgpack::object& params, size_t wireBytes,
-                     SXIpcReplyFn reply) override;
+  // A send's params are read from their bytes without decoding them, and its payload stays
+  // packed: the stores write their texts straight from its bytes.
+  bool handlePackedRequest(std::string_view method, std::string_view params, size_t wireBytes,
+                           SXIpcReplyFn& reply) override;
 
   // Checks a request without running it: an empty string when it is well formed, else why not.
   static std::string validate(std::string_view method, const SXValue& params);
@@ -42,9 +42,9 @@ class SXReportingServiceExport final : public SXIpcExportedObject {
     SXReportingMessageType type;
     std::optional<std::vector<int64_t>> reporterIDs;
   };
-  // A send's params read straight from the decoded objects; nothing when one of them is not
-  // what it must be (the general path then says what is wrong).
-  static std::optional<Send> readSend(const msgpack::object& params);
+  // A send's params read straight from their bytes; nothing when one of them is not what it
+  // must be (the decoded path then says what is wrong).
+  static std::optional<Send> readSend(std::string_view params);
   // Empty when the request is within the size limits, else why not (and counted).
   std::string checkLimits(std::string_view method, const SXValue& params, size_t wireBytes);
   std::string checkSendLimits(const Send& send, size_t wireBytes);

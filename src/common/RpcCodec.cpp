@@ -87,6 +87,67 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(const msgpack::object*& message)
   return Status::kBroken;
 }
 
+namespace {
+
+// Steps `reader` over one value that decoding would accept: containers nested `depth` deep at
+// most, of `maxEntries` at most, and dictionaries keyed by strings. False for anything else.
+bool SkipAcceptedValue(SXPackedReader& reader, int depth, size_t maxEntries) {
+  using Kind = SXPackedReader::Kind;
+  SXPackedReader::Item item = reader.next();
+  if (item.kind != Kind::kArray && item.kind != Kind::kMap) return true;
+  if (depth <= 0 || item.count > maxEntries) return false;
+  for (uint32_t i = 0; i < item.count; ++i) {
+    if (item.kind == Kind::kMap && reader.next().kind != Kind::kString) return false;
+    if (!SkipAcceptedValue(reader, depth - 1, maxEntries)) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+std::optional<RpcPackedRequest> RpcStreamDecoder::peekRequest() {
+  using Kind = SXPackedReader::Kind;
+  // Only at the start of a message that the unpacker has not begun.
+  if (!error_.empty() || unpacker_.parsed_size() != 0) return std::nullopt;
+  const char* begin = unpacker_.nonparsed_buffer();
+  size_t available = std::min(unpacker_.nonparsed_size(), limits_.maxMessageBytes);
+  SXPackedReader reader(begin, begin + available);
+  try {
+    SXPackedReader::Item envelope = reader.next();
+    if (envelope.kind != Kind::kArray || envelope.count != 4) return std::nullopt;
+    SXPackedReader::Item type = reader.next();
+    SXPackedReader::Item msgid = reader.next();
+    SXPackedReader::Item method = reader.next();
+    if (type.kind != Kind::kUnsigned || type.u != 0 || msgid.kind != Kind::kUnsigned ||
+        msgid.u > UINT32_MAX || method.kind != Kind::kString) {
+      return std::nullopt;
+    }
+    const char* params = reader.position();
+    SXPackedReader paramsReader(params, reader.end());
+    if (paramsReader.next().kind != Kind::kArray) return std::nullopt;
+    // The params array sits one level below the request.
+    if (!SkipAcceptedValue(reader, limits_.maxPayloadDepth + kEnvelopeDepth - 1,
+                           limits_.maxContainerEntries)) {
+      return std::nullopt;
+    }
+    return RpcPackedRequest{static_cast<uint32_t>(msgid.u), method.data,
+                            std::string_view(params, reader.position() - params),
+                            static_cast<size_t>(reader.position() - begin)};
+  } catch (const std::out_of_range&) {
+    return std::nullopt;  // not all there yet, or not MessagePack
+  }
+}
+
+void RpcStreamDecoder::skipRequest(const RpcPackedRequest& request) {
+  if (holding_) {
+    unpacker_.reset_zone();
+    holding_ = false;
+  }
+  unpacker_.skip_nonparsed_buffer(request.bytes);
+  lastMessageBytes_ = request.bytes;
+  if (lastMessageBytes_ > kKeptBufferBytes) grown_ = true;
+}
+
 std::optional<RpcRequestView> RpcParseRequest(const msgpack::object& message, std::string& why,
                                               std::optional<uint32_t>& msgid) {
   using msgpack::type::object_type;

@@ -17,6 +17,14 @@ struct RpcLimits {
   size_t maxContainerEntries = 1 << 16;
 };
 
+// A request read from its bytes without decoding them.
+struct RpcPackedRequest {
+  uint32_t msgid = 0;
+  std::string_view method;
+  std::string_view params;  // the MessagePack bytes of the params array
+  size_t bytes = 0;         // of the whole request
+};
+
 // Decodes a byte stream into whole messages. Not thread-safe; one per connection.
 class RpcStreamDecoder {
  public:
@@ -35,6 +43,13 @@ class RpcStreamDecoder {
   // The same without decoding it into values: `message` points at the decoded object, which
   // stays valid until the next call.
   Status next(const msgpack::object*& message);
+  // The next message, when it is a whole, well-formed request inside the limits whose params
+  // the value model can hold, read in place: valid until the stream is read again. Nothing
+  // when that is not so or not yet known; `next` then decodes the message (and says what is
+  // wrong with it). The request stays at the head of the stream until `skipRequest`.
+  std::optional<RpcPackedRequest> peekRequest();
+  // Steps over the request `peekRequest` returned, as `next` would have.
+  void skipRequest(const RpcPackedRequest& request);
   const std::string& error() const { return error_; }
   // The MessagePack bytes of the message `next` returned last.
   size_t lastMessageBytes() const { return lastMessageBytes_; }

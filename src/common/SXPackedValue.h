@@ -17,6 +17,10 @@ class SXPackedValue {
   // SXCheckValueModel).
   static SXPackedValue fromObject(const msgpack::object& object);
   static SXPackedValue fromValue(const SXValue& value);
+  // A copy of the encoding of one value the value model can hold, as a client sent it.
+  static SXPackedValue fromBytes(std::string_view bytes) {
+    return SXPackedValue(std::string(bytes));
+  }
 
   std::string_view bytes() const { return bytes_; }
   size_t size() const { return bytes_.size(); }

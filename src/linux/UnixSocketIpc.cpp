@@ -238,6 +238,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
     bool ok = true;
     bool drained = false;
     while (ok && !ended_ && !mustWait()) {
+      if (dispatchInPlace()) continue;
       auto status = decoder_.next(message);
       if (status == RpcStreamDecoder::Status::kNeedMore) {
         drained = true;
@@ -276,20 +277,51 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       send(request->msgid, "no object is exported on this connection", nullptr);
       return true;
     }
-    // The request's decoded form is held until its work has run.
-    uint64_t cost = SXDecodedBytes(decoder_.lastMessageBytes());
+    handOn(decoder_.lastMessageBytes(), [&] {
+      exported_->handleRequest(request->method, *request->params, decoder_.lastMessageBytes(),
+                               replyTo(request->msgid));
+      return true;
+    });
+    return true;
+  }
+
+  // I/O thread: the request at the head of the stream, read in place when the exported object
+  // takes it that way (a send, the bulk of what clients ask); false, and it is decoded.
+  bool dispatchInPlace() {
+    if (!exported_) return false;
+    std::optional<RpcPackedRequest> request = decoder_.peekRequest();
+    if (!request) return false;
+    SXIpcReplyFn reply = replyTo(request->msgid);
+    if (!handOn(request->bytes, [&] {
+          return exported_->handlePackedRequest(request->method, request->params, request->bytes,
+                                                reply);
+        })) {
+      return false;
+    }
+    decoder_.skipRequest(*request);
+    ++completedMessages_;
+    return true;
+  }
+
+  SXIpcReplyFn replyTo(uint32_t msgid) {
+    std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
+    return [weak, msgid](const SXValue& error, const SXValue& result) {
+      if (auto self = weak.lock()) self->send(msgid, error, result);
+    };
+  }
+
+  // Hands a request of `wireBytes` on with `handle`, which says whether it was taken. What
+  // it holds counts against the budgets until its work has run.
+  template <typename Handle>
+  bool handOn(size_t wireBytes, Handle&& handle) {
+    uint64_t cost = SXDecodedBytes(wireBytes);
     budget_->add(cost);
     if (requestQueue_) queued_.fetch_add(1);
-    std::weak_ptr<SXUnixSocketConnection> weak = shared_from_this();
-    uint32_t id = request->msgid;
-    exported_->handleRequest(request->method, *request->params,
-                             decoder_.lastMessageBytes(),
-                             [weak, id](const SXValue& error, const SXValue& result) {
-                               if (auto self = weak.lock()) self->send(id, error, result);
-                             });
-    if (!requestQueue_) {
+    bool taken = handle();
+    if (!taken || !requestQueue_) {
       budget_->release(cost);
-      return true;
+      if (!taken && requestQueue_) queued_.fetch_sub(1);
+      return taken;
     }
     // Counted as uncovered only now that its work is on the queue: a marker posted from the
     // queue thread at this moment must not overtake it.

@@ -39,6 +39,14 @@ class SXIpcExportedObject {
     handleRequest(method, SXValueFromMsgpack(params, std::numeric_limits<int>::max()), wireBytes,
                   std::move(reply));
   }
+  // The same for params still in their MessagePack bytes, valid until this returns: the bytes
+  // of an array that the value model can hold. An object that reads some requests that way
+  // overrides it, and moves from `reply` only when it returns true; false, and the connection
+  // decodes the request and calls one of the above.
+  virtual bool handlePackedRequest(std::string_view /*method*/, std::string_view /*params*/,
+                                   size_t /*wireBytes*/, SXIpcReplyFn& /*reply*/) {
+    return false;
+  }
 };
 
 class SXIpcConnection {

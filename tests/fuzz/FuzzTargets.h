@@ -17,8 +17,8 @@
 #include "common/MsgpackValue.h"
 #include "common/RpcCodec.h"
 #include "common/SXPackedValue.h"
-#include "common/SXValueText.h"
 #include "common/SXThreadSafety.h"
+#include "common/SXValueText.h"
 #include "platform/DiscardLog.h"
 #include "support/TestEnvironment.h"
 
@@ -85,19 +85,37 @@ struct SXFuzzDecoded {
   RpcStreamDecoder::Status last = RpcStreamDecoder::Status::kNeedMore;
 };
 
+// A request read in place, as the message decoding gives.
+inline SXValue SXFuzzInPlaceMessage(const RpcPackedRequest& request) {
+  msgpack::object_handle params = msgpack::unpack(request.params.data(), request.params.size());
+  SXR_FUZZ_CHECK(params.get().type == msgpack::type::ARRAY);
+  return SXValue::array({0, request.msgid, std::string(request.method),
+                         SXValueFromMsgpack(params.get(), std::numeric_limits<int>::max())});
+}
+
 // The messages of `stream` fed to a decoder in `chunks` (all at once when there are none).
+// `inPlace`: requests are read in place where the decoder can.
 inline SXFuzzDecoded SXFuzzDecode(const RpcLimits& limits, const std::string& stream,
-                                  const std::vector<size_t>& chunks) {
+                                  const std::vector<size_t>& chunks, bool inPlace) {
   RpcStreamDecoder decoder(limits);
   SXFuzzDecoded out;
   SXValue message;
+  auto nextMessage = [&] {
+    if (std::optional<RpcPackedRequest> request; inPlace && (request = decoder.peekRequest())) {
+      message = SXFuzzInPlaceMessage(*request);
+      decoder.skipRequest(*request);
+      SXR_FUZZ_CHECK(decoder.lastMessageBytes() == request->bytes);
+      return RpcStreamDecoder::Status::kMessage;
+    }
+    return decoder.next(message);
+  };
   for (size_t i = 0, at = 0; at < stream.size(); ++i) {
     size_t n = chunks.empty() ? stream.size() : chunks[i % chunks.size()];
     n = std::min(n, stream.size() - at);
     std::memcpy(decoder.prepare(n), stream.data() + at, n);
     decoder.commit(n);
     at += n;
-    while ((out.last = decoder.next(message)) == RpcStreamDecoder::Status::kMessage) {
+    while ((out.last = nextMessage()) == RpcStreamDecoder::Status::kMessage) {
       std::string why;
       std::optional<uint32_t> msgid;
       if (!RpcParseRequest(message, why, msgid)) SXR_FUZZ_CHECK(!why.empty());
@@ -122,10 +140,13 @@ inline void SXFuzzRpcDecoder(const uint8_t* data, size_t size) {
   std::vector<size_t> chunks(SXFuzzTake<uint8_t>(data, size) % 8 + 1);
   for (size_t& chunk : chunks) chunk = SXFuzzTake<uint8_t>(data, size) % 64 + 1;
   std::string stream(reinterpret_cast<const char*>(data), size);
-  SXFuzzDecoded whole = SXFuzzDecode(limits, stream, {});
-  SXFuzzDecoded cut = SXFuzzDecode(limits, stream, chunks);
+  SXFuzzDecoded whole = SXFuzzDecode(limits, stream, {}, false);
+  SXFuzzDecoded cut = SXFuzzDecode(limits, stream, chunks, false);
+  SXFuzzDecoded inPlace = SXFuzzDecode(limits, stream, chunks, true);
   SXR_FUZZ_CHECK(whole.last == cut.last);
   SXR_FUZZ_CHECK(whole.messages == cut.messages);
+  SXR_FUZZ_CHECK(inPlace.last == whole.last);
+  SXR_FUZZ_CHECK(inPlace.messages == whole.messages);
 }
 
 // ---- MessagePack objects into the value model and back: conversion never crashes, and a value
@@ -149,9 +170,9 @@ inline void SXFuzzMsgpackValue(const uint8_t* data, size_t size) {
     SXValue withHost = decoded;
     const SXValue host = "host";
     withHost["HostApplicationDisplayID"] = host;
-    SXR_FUZZ_CHECK(SXPackedDictionaryText(packed, false,
-                                          SXTextMember{"HostApplicationDisplayID", &host}) ==
-                   SXValueText(withHost));
+    SXR_FUZZ_CHECK(
+        SXPackedDictionaryText(packed, false, SXTextMember{"HostApplicationDisplayID", &host}) ==
+        SXValueText(withHost));
     SXR_FUZZ_CHECK(SXPackedDictionaryText(packed, true) ==
                    SXValueText(SXReportingSessionUnderscoreKeys(decoded)));
   }
