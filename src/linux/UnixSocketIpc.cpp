@@ -63,8 +63,8 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   }
   std::shared_ptr<SXByteBudget> budget() const override { return budget_; }
 
-  // Any thread. Encodes straight into the pending output; the I/O thread writes whatever has
-  // gathered there in one go.
+  // Any thread. Encodes straight into the pending output, which is written in one go: by the
+  // request queue behind a batch of requests, else by the I/O thread.
   void send(uint32_t msgid, const SXValue& error, const SXValue& result) {
     bool startWriting = false;
     {
@@ -73,8 +73,9 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       size_t before = outPending_.size();
       RpcEncodeResponse(outPending_, msgid, error, result);
       pendingReplyBytes_.fetch_add(outPending_.size() - before);
-      startWriting = !writing_;
-      writing_ = true;
+      // A marker on its way writes the replies gathered before it runs (writeReplies).
+      startWriting = !writing_ && !markerPending_.load();
+      if (startWriting) writing_ = true;
     }
     if (startWriting) {
       asio::post(socket_.get_executor(), [self = shared_from_this()] { self->write(); });
@@ -348,10 +349,30 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   void requestsHandled(uint64_t covered) {
     queued_.fetch_sub(covered);
     markerPending_.store(false);
+    writeReplies();
     coverDispatched();
     if (paused_.load()) {
       asio::post(socket_.get_executor(), [self = shared_from_this()] { self->resumeIfAllowed(); });
     }
+  }
+
+  // On the request queue: writes the replies gathered for the batch just handled straight to
+  // the socket, which saves waking the I/O thread for them. What the socket does not take at
+  // once, or a failure, is left to the I/O thread.
+  void writeReplies() {
+    {
+      SXMutexLock lock(outMutex_);
+      if (closed_ || writing_ || outPending_.empty()) return;
+      ssize_t sent =
+          ::send(fd_, outPending_.data(), outPending_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+      if (sent > 0) {
+        outPending_.erase(0, static_cast<size_t>(sent));
+        pendingReplyBytes_.fetch_sub(static_cast<size_t>(sent));
+      }
+      if (outPending_.empty()) return;
+      writing_ = true;
+    }
+    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->write(); });
   }
 
   void write() {
