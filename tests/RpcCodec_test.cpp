@@ -40,7 +40,18 @@ TEST(RpcStreamDecoder, MessagesSurviveAnyChunkBoundary) {
     for (size_t off = 0; off < bytes.size(); off += chunk) {
       feed(decoder, bytes.substr(off, chunk));
       SXValue message;
-      while (decoder.next(message) == RpcStreamDecoder::Status::kMessage) got.push_back(message);
+      while (true) {
+        // Read in place only once whole, and then the same request.
+        std::optional<RpcPackedRequest> inPlace = decoder.peekRequest();
+        if (decoder.next(message) != RpcStreamDecoder::Status::kMessage) {
+          EXPECT_FALSE(inPlace) << "chunk " << chunk;
+          break;
+        }
+        if (inPlace) {
+          EXPECT_EQ(inPlace->bytes, decoder.lastMessageBytes());
+        }
+        got.push_back(message);
+      }
     }
     ASSERT_EQ(got.size(), 2u) << "chunk " << chunk;
     std::string why;

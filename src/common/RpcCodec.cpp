@@ -94,6 +94,7 @@ namespace {
 bool SkipAcceptedValue(SXPackedReader& reader, int depth, size_t maxEntries) {
   using Kind = SXPackedReader::Kind;
   SXPackedReader::Item item = reader.next();
+  if (reader.endedEarly()) return false;
   if (item.kind != Kind::kArray && item.kind != Kind::kMap) return true;
   if (depth <= 0 || item.count > maxEntries) return false;
   for (uint32_t i = 0; i < item.count; ++i) {
@@ -111,20 +112,21 @@ std::optional<RpcPackedRequest> RpcStreamDecoder::peekRequest() {
   if (!error_.empty() || unpacker_.parsed_size() != 0) return std::nullopt;
   const char* begin = unpacker_.nonparsed_buffer();
   size_t available = std::min(unpacker_.nonparsed_size(), limits_.maxMessageBytes);
-  SXPackedReader reader(begin, begin + available);
+  // A request cut off by the end of what has arrived is common and no error: no exception.
+  SXPackedReader reader(begin, begin + available, SXPackedReader::OnEnd::kStop);
   try {
     SXPackedReader::Item envelope = reader.next();
     if (envelope.kind != Kind::kArray || envelope.count != 4) return std::nullopt;
     SXPackedReader::Item type = reader.next();
     SXPackedReader::Item msgid = reader.next();
     SXPackedReader::Item method = reader.next();
-    if (type.kind != Kind::kUnsigned || type.u != 0 || msgid.kind != Kind::kUnsigned ||
-        msgid.u > UINT32_MAX || method.kind != Kind::kString) {
+    if (reader.endedEarly() || type.kind != Kind::kUnsigned || type.u != 0 ||
+        msgid.kind != Kind::kUnsigned || msgid.u > UINT32_MAX || method.kind != Kind::kString) {
       return std::nullopt;
     }
     const char* params = reader.position();
-    SXPackedReader paramsReader(params, reader.end());
-    if (paramsReader.next().kind != Kind::kArray) return std::nullopt;
+    SXPackedReader paramsHead(params, reader.end(), SXPackedReader::OnEnd::kStop);
+    if (paramsHead.next().kind != Kind::kArray) return std::nullopt;
     // The params array sits one level below the request.
     if (!SkipAcceptedValue(reader, limits_.maxPayloadDepth + kEnvelopeDepth - 1,
                            limits_.maxContainerEntries)) {
@@ -134,7 +136,7 @@ std::optional<RpcPackedRequest> RpcStreamDecoder::peekRequest() {
                             std::string_view(params, reader.position() - params),
                             static_cast<size_t>(reader.position() - begin)};
   } catch (const std::out_of_range&) {
-    return std::nullopt;  // not all there yet, or not MessagePack
+    return std::nullopt;  // not MessagePack
   }
 }
 

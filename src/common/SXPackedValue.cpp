@@ -118,7 +118,14 @@ SXValue SXPackedValue::value() const {
 }
 
 const char* SXPackedReader::take(size_t n) {
-  if (static_cast<size_t>(end_ - at_) < n) throw std::out_of_range("MessagePack ends early");
+  if (static_cast<size_t>(end_ - at_) < n) [[unlikely]] {
+    if (onEnd_ == OnEnd::kThrow) throw std::out_of_range("MessagePack ends early");
+    // Zeros for what is read of this item: a nil head, empty sizes. Its data is not to be read.
+    static constexpr char kZeros[8] = {};
+    endedEarly_ = true;
+    at_ = end_;
+    return kZeros;
+  }
   const char* at = at_;
   at_ += n;
   return at;
@@ -170,14 +177,32 @@ SXPackedReader::Item SXPackedReader::nextOther() {
     integer(static_cast<int8_t>(head));
   } else {
     switch (head) {
-      case 0xc0: item.kind = Kind::kNil; break;
-      case 0xc2: case 0xc3: item.kind = Kind::kBool; item.boolean = head == 0xc3; break;
-      case 0xc4: sized(Kind::kBinary, big<uint8_t>(1)); break;
-      case 0xc5: sized(Kind::kBinary, big<uint16_t>(2)); break;
-      case 0xc6: sized(Kind::kBinary, big<uint32_t>(4)); break;
-      case 0xc7: ext(big<uint8_t>(1)); break;
-      case 0xc8: ext(big<uint16_t>(2)); break;
-      case 0xc9: ext(big<uint32_t>(4)); break;
+      case 0xc0:
+        item.kind = Kind::kNil;
+        break;
+      case 0xc2:
+      case 0xc3:
+        item.kind = Kind::kBool;
+        item.boolean = head == 0xc3;
+        break;
+      case 0xc4:
+        sized(Kind::kBinary, big<uint8_t>(1));
+        break;
+      case 0xc5:
+        sized(Kind::kBinary, big<uint16_t>(2));
+        break;
+      case 0xc6:
+        sized(Kind::kBinary, big<uint32_t>(4));
+        break;
+      case 0xc7:
+        ext(big<uint8_t>(1));
+        break;
+      case 0xc8:
+        ext(big<uint16_t>(2));
+        break;
+      case 0xc9:
+        ext(big<uint32_t>(4));
+        break;
       case 0xca: {
         auto raw = big<uint32_t>(4);
         float value;
@@ -192,30 +217,72 @@ SXPackedReader::Item SXPackedReader::nextOther() {
         item.kind = Kind::kFloat;
         break;
       }
-      case 0xcc: integer(big<uint8_t>(1)); break;
-      case 0xcd: integer(big<uint16_t>(2)); break;
-      case 0xce: integer(big<uint32_t>(4)); break;
-      case 0xcf: item.kind = Kind::kUnsigned; item.u = big<uint64_t>(8); break;
-      case 0xd0: integer(big<int8_t>(1)); break;
-      case 0xd1: integer(big<int16_t>(2)); break;
-      case 0xd2: integer(big<int32_t>(4)); break;
-      case 0xd3: integer(big<int64_t>(8)); break;
-      case 0xd4: ext(1); break;
-      case 0xd5: ext(2); break;
-      case 0xd6: ext(4); break;
-      case 0xd7: ext(8); break;
-      case 0xd8: ext(16); break;
-      case 0xd9: sized(Kind::kString, big<uint8_t>(1)); break;
-      case 0xda: sized(Kind::kString, big<uint16_t>(2)); break;
-      case 0xdb: sized(Kind::kString, big<uint32_t>(4)); break;
-      case 0xdc: container(Kind::kArray, big<uint16_t>(2)); break;
-      case 0xdd: container(Kind::kArray, big<uint32_t>(4)); break;
-      case 0xde: container(Kind::kMap, big<uint16_t>(2)); break;
-      case 0xdf: container(Kind::kMap, big<uint32_t>(4)); break;
-      default: throw std::out_of_range("not MessagePack");  // 0xc1, never used
+      case 0xcc:
+        integer(big<uint8_t>(1));
+        break;
+      case 0xcd:
+        integer(big<uint16_t>(2));
+        break;
+      case 0xce:
+        integer(big<uint32_t>(4));
+        break;
+      case 0xcf:
+        item.kind = Kind::kUnsigned;
+        item.u = big<uint64_t>(8);
+        break;
+      case 0xd0:
+        integer(big<int8_t>(1));
+        break;
+      case 0xd1:
+        integer(big<int16_t>(2));
+        break;
+      case 0xd2:
+        integer(big<int32_t>(4));
+        break;
+      case 0xd3:
+        integer(big<int64_t>(8));
+        break;
+      case 0xd4:
+        ext(1);
+        break;
+      case 0xd5:
+        ext(2);
+        break;
+      case 0xd6:
+        ext(4);
+        break;
+      case 0xd7:
+        ext(8);
+        break;
+      case 0xd8:
+        ext(16);
+        break;
+      case 0xd9:
+        sized(Kind::kString, big<uint8_t>(1));
+        break;
+      case 0xda:
+        sized(Kind::kString, big<uint16_t>(2));
+        break;
+      case 0xdb:
+        sized(Kind::kString, big<uint32_t>(4));
+        break;
+      case 0xdc:
+        container(Kind::kArray, big<uint16_t>(2));
+        break;
+      case 0xdd:
+        container(Kind::kArray, big<uint32_t>(4));
+        break;
+      case 0xde:
+        container(Kind::kMap, big<uint16_t>(2));
+        break;
+      case 0xdf:
+        container(Kind::kMap, big<uint32_t>(4));
+        break;
+      default:
+        throw std::out_of_range("not MessagePack");  // 0xc1, never used
     }
   }
-  return item;
+  return endedEarly_ ? Item() : item;
 }
 
 void SXPackedReader::skip() {

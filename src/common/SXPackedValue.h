@@ -41,9 +41,16 @@ void SXCheckValueModel(const msgpack::object& object, int maxDepth);
 
 // Reads MessagePack written by msgpack-c, one item at a time, without building anything. A
 // container's item gives its number of elements (a dictionary's: of key-value pairs), which
-// follow it. Throws std::out_of_range when the bytes end early.
+// follow it. Throws std::out_of_range when the bytes end early or are not MessagePack.
 class SXPackedReader {
  public:
+  // What a reader does when the bytes end early.
+  enum class OnEnd {
+    kThrow,
+    // The item is nil and `endedEarly` says so: for bytes still arriving, where running out is
+    // no error and an exception for it would cost more than the read.
+    kStop,
+  };
   enum class Kind { kNil, kBool, kUnsigned, kSigned, kFloat, kString, kBinary, kExt, kArray, kMap };
   struct Item {
     Kind kind = Kind::kNil;
@@ -57,7 +64,8 @@ class SXPackedReader {
   };
 
   explicit SXPackedReader(std::string_view bytes) : at_(bytes.data()), end_(at_ + bytes.size()) {}
-  SXPackedReader(const char* at, const char* end) : at_(at), end_(end) {}
+  SXPackedReader(const char* at, const char* end, OnEnd onEnd = OnEnd::kThrow)
+      : at_(at), end_(end), onEnd_(onEnd) {}
 
   Item next() {
     // Small integers and short strings, most items of a payload, are read here; the rest out
@@ -85,6 +93,7 @@ class SXPackedReader {
   void skip();
   const char* position() const { return at_; }
   const char* end() const { return end_; }
+  bool endedEarly() const { return endedEarly_; }
 
  private:
   Item nextOther();
@@ -94,4 +103,6 @@ class SXPackedReader {
 
   const char* at_;
   const char* end_;
+  OnEnd onEnd_ = OnEnd::kThrow;
+  bool endedEarly_ = false;
 };
