@@ -9,6 +9,7 @@
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
 #include <asio/write.hpp>
+#include <thread>
 
 #include "platform/DiscardLog.h"
 #include "platform/FileSystem.h"
@@ -73,8 +74,11 @@ class SXUnixSocketConnection final : public SXIpcConnection,
       size_t before = outPending_.size();
       RpcEncodeResponse(outPending_, msgid, error, result);
       pendingReplyBytes_.fetch_add(outPending_.size() - before);
-      // A marker on its way writes the replies gathered before it runs (writeReplies).
-      startWriting = !writing_ && !markerPending_.load();
+      // A reply made by a request's task on the request queue, with a marker on its way behind
+      // it, is written by that marker (writeReplies). Replies made elsewhere go out at once.
+      const bool markerWrites =
+          markerPending_.load() && std::this_thread::get_id() == requestQueueThread_.load();
+      startWriting = !writing_ && !markerWrites;
       if (startWriting) writing_ = true;
     }
     if (startWriting) {
@@ -347,6 +351,7 @@ class SXUnixSocketConnection final : public SXIpcConnection,
 
   // On the request queue: every request covered by this marker has been handled.
   void requestsHandled(uint64_t covered) {
+    requestQueueThread_.store(std::this_thread::get_id());
     queued_.fetch_sub(covered);
     markerPending_.store(false);
     writeReplies();
@@ -422,11 +427,12 @@ class SXUnixSocketConnection final : public SXIpcConnection,
   bool ended_ = false;                             // I/O thread only
   // Back-pressure. Handed on but not yet handled; written by the I/O thread and the markers.
   std::atomic<uint64_t> queued_{0};
-  std::atomic<uint64_t> uncovered_{0};        // handed on, no marker posted behind them yet
-  std::atomic<uint64_t> uncoveredBytes_{0};   // their budget charge
-  std::atomic<bool> markerPending_{false};    // a marker is on the request queue
-  std::atomic<bool> paused_{false};           // set by the I/O thread, read by markers
-  std::atomic<size_t> pendingReplyBytes_{0};  // outPending_ plus outFlight_
+  std::atomic<uint64_t> uncovered_{0};               // handed on, no marker posted behind them yet
+  std::atomic<uint64_t> uncoveredBytes_{0};          // their budget charge
+  std::atomic<bool> markerPending_{false};           // a marker is on the request queue
+  std::atomic<std::thread::id> requestQueueThread_;  // where the last marker ran
+  std::atomic<bool> paused_{false};                  // set by the I/O thread, read by markers
+  std::atomic<size_t> pendingReplyBytes_{0};         // outPending_ plus outFlight_
   SXMutex outMutex_;
   std::string outPending_ SX_GUARDED_BY(outMutex_);
   bool writing_ SX_GUARDED_BY(outMutex_) = false;
