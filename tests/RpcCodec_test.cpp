@@ -189,7 +189,7 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
   p.pack("b"), p.pack_int8(-3), p.pack("e"), p.pack_str(0);
   auto handle = msgpack::unpack(buffer.data(), buffer.size());
   const SXValue decoded = SXValueFromMsgpack(handle.get());
-  const SXPackedValue packed = SXPackedValue::fromObject(handle.get());
+  const SXPackedValue packed = SXPackedValue::fromBytes({buffer.data(), buffer.size()});
   EXPECT_EQ(SXPackedDictionaryText(packed), SXValueText(decoded));
   EXPECT_EQ(SXPackedDictionaryText(packed),
             R"({"b":-3,"c":[18446744073709551615,-9223372036854775808],"d":{"x":true,"y":null},)"
@@ -203,8 +203,8 @@ TEST(SXValueText, DictionariesAreTheCompactDumpAndPackedOnesWriteTheSameText) {
   for (auto it = blocks.rbegin(); it != blocks.rend(); ++it) {
     r.pack(it.key()), r.pack(it.value().get<std::string>());
   }
-  handle = msgpack::unpack(reversed.data(), reversed.size());
-  EXPECT_EQ(SXPackedDictionaryText(SXPackedValue::fromObject(handle.get())), SXValueText(blocks));
+  EXPECT_EQ(SXPackedDictionaryText(SXPackedValue::fromBytes({reversed.data(), reversed.size()})),
+            SXValueText(blocks));
 }
 
 TEST(SXValueText, EveryKind) {

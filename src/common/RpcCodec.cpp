@@ -125,8 +125,7 @@ std::optional<RpcPackedRequest> RpcStreamDecoder::peekRequest() {
       return std::nullopt;
     }
     const char* params = reader.position();
-    SXPackedReader paramsHead(params, reader.end(), SXPackedReader::OnEnd::kStop);
-    if (paramsHead.next().kind != Kind::kArray) return std::nullopt;
+    if (SXPackedReader(reader).next().kind != Kind::kArray) return std::nullopt;
     // The params array sits one level below the request.
     if (!SkipAcceptedValue(reader, limits_.maxPayloadDepth + kEnvelopeDepth - 1,
                            limits_.maxContainerEntries)) {

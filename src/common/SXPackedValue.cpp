@@ -25,67 +25,6 @@ void SXCheckValueModel(const msgpack::object& o, int maxDepth) {
   }
 }
 
-namespace {
-
-// Scalars are packed here too: msgpack-c packs an object through a general visitor, which costs
-// more than the whole payload's copy.
-void packObject(msgpack::packer<SXStringSink>& packer, const msgpack::object& o) {
-  using msgpack::type::object_type;
-  switch (o.type) {
-    case object_type::NIL:
-      packer.pack_nil();
-      return;
-    case object_type::BOOLEAN:
-      o.via.boolean ? packer.pack_true() : packer.pack_false();
-      return;
-    case object_type::POSITIVE_INTEGER:
-      packer.pack_uint64(o.via.u64);
-      return;
-    case object_type::NEGATIVE_INTEGER:
-      packer.pack_int64(o.via.i64);
-      return;
-    case object_type::STR:
-      packer.pack_str(o.via.str.size);
-      packer.pack_str_body(o.via.str.ptr, o.via.str.size);
-      return;
-    case object_type::BIN:
-      packer.pack_bin(o.via.bin.size);
-      packer.pack_bin_body(o.via.bin.ptr, o.via.bin.size);
-      return;
-    case object_type::EXT:
-      packer.pack_ext(o.via.ext.size, o.via.ext.type());
-      packer.pack_ext_body(o.via.ext.data(), o.via.ext.size);
-      return;
-    case object_type::FLOAT32:  // decoded as the double it widens to, so packed as one
-    case object_type::FLOAT64:
-      SXPackDouble(packer, o.via.f64);
-      return;
-    case object_type::ARRAY:
-      packer.pack_array(o.via.array.size);
-      for (uint32_t i = 0; i < o.via.array.size; ++i) packObject(packer, o.via.array.ptr[i]);
-      return;
-    case object_type::MAP:
-      packer.pack_map(o.via.map.size);
-      for (uint32_t i = 0; i < o.via.map.size; ++i) {
-        packObject(packer, o.via.map.ptr[i].key);
-        packObject(packer, o.via.map.ptr[i].val);
-      }
-      return;
-  }
-  packer.pack(o);
-}
-
-}  // namespace
-
-SXPackedValue SXPackedValue::fromObject(const msgpack::object& object) {
-  std::string bytes;
-  bytes.reserve(256);
-  SXStringSink sink{&bytes};
-  msgpack::packer<SXStringSink> packer(sink);
-  packObject(packer, object);
-  return SXPackedValue(std::move(bytes));
-}
-
 SXPackedValue SXPackedValue::fromValue(const SXValue& value) {
   std::string bytes;
   SXStringSink sink{&bytes};
@@ -176,33 +115,16 @@ SXPackedReader::Item SXPackedReader::nextOther() {
   } else if (head >= 0xe0) {
     integer(static_cast<int8_t>(head));
   } else {
+    // clang-format off
     switch (head) {
-      case 0xc0:
-        item.kind = Kind::kNil;
-        break;
-      case 0xc2:
-      case 0xc3:
-        item.kind = Kind::kBool;
-        item.boolean = head == 0xc3;
-        break;
-      case 0xc4:
-        sized(Kind::kBinary, big<uint8_t>(1));
-        break;
-      case 0xc5:
-        sized(Kind::kBinary, big<uint16_t>(2));
-        break;
-      case 0xc6:
-        sized(Kind::kBinary, big<uint32_t>(4));
-        break;
-      case 0xc7:
-        ext(big<uint8_t>(1));
-        break;
-      case 0xc8:
-        ext(big<uint16_t>(2));
-        break;
-      case 0xc9:
-        ext(big<uint32_t>(4));
-        break;
+      case 0xc0: item.kind = Kind::kNil; break;
+      case 0xc2: case 0xc3: item.kind = Kind::kBool; item.boolean = head == 0xc3; break;
+      case 0xc4: sized(Kind::kBinary, big<uint8_t>(1)); break;
+      case 0xc5: sized(Kind::kBinary, big<uint16_t>(2)); break;
+      case 0xc6: sized(Kind::kBinary, big<uint32_t>(4)); break;
+      case 0xc7: ext(big<uint8_t>(1)); break;
+      case 0xc8: ext(big<uint16_t>(2)); break;
+      case 0xc9: ext(big<uint32_t>(4)); break;
       case 0xca: {
         auto raw = big<uint32_t>(4);
         float value;
@@ -217,70 +139,29 @@ SXPackedReader::Item SXPackedReader::nextOther() {
         item.kind = Kind::kFloat;
         break;
       }
-      case 0xcc:
-        integer(big<uint8_t>(1));
-        break;
-      case 0xcd:
-        integer(big<uint16_t>(2));
-        break;
-      case 0xce:
-        integer(big<uint32_t>(4));
-        break;
-      case 0xcf:
-        item.kind = Kind::kUnsigned;
-        item.u = big<uint64_t>(8);
-        break;
-      case 0xd0:
-        integer(big<int8_t>(1));
-        break;
-      case 0xd1:
-        integer(big<int16_t>(2));
-        break;
-      case 0xd2:
-        integer(big<int32_t>(4));
-        break;
-      case 0xd3:
-        integer(big<int64_t>(8));
-        break;
-      case 0xd4:
-        ext(1);
-        break;
-      case 0xd5:
-        ext(2);
-        break;
-      case 0xd6:
-        ext(4);
-        break;
-      case 0xd7:
-        ext(8);
-        break;
-      case 0xd8:
-        ext(16);
-        break;
-      case 0xd9:
-        sized(Kind::kString, big<uint8_t>(1));
-        break;
-      case 0xda:
-        sized(Kind::kString, big<uint16_t>(2));
-        break;
-      case 0xdb:
-        sized(Kind::kString, big<uint32_t>(4));
-        break;
-      case 0xdc:
-        container(Kind::kArray, big<uint16_t>(2));
-        break;
-      case 0xdd:
-        container(Kind::kArray, big<uint32_t>(4));
-        break;
-      case 0xde:
-        container(Kind::kMap, big<uint16_t>(2));
-        break;
-      case 0xdf:
-        container(Kind::kMap, big<uint32_t>(4));
-        break;
-      default:
-        throw std::out_of_range("not MessagePack");  // 0xc1, never used
+      case 0xcc: integer(big<uint8_t>(1)); break;
+      case 0xcd: integer(big<uint16_t>(2)); break;
+      case 0xce: integer(big<uint32_t>(4)); break;
+      case 0xcf: item.kind = Kind::kUnsigned; item.u = big<uint64_t>(8); break;
+      case 0xd0: integer(big<int8_t>(1)); break;
+      case 0xd1: integer(big<int16_t>(2)); break;
+      case 0xd2: integer(big<int32_t>(4)); break;
+      case 0xd3: integer(big<int64_t>(8)); break;
+      case 0xd4: ext(1); break;
+      case 0xd5: ext(2); break;
+      case 0xd6: ext(4); break;
+      case 0xd7: ext(8); break;
+      case 0xd8: ext(16); break;
+      case 0xd9: sized(Kind::kString, big<uint8_t>(1)); break;
+      case 0xda: sized(Kind::kString, big<uint16_t>(2)); break;
+      case 0xdb: sized(Kind::kString, big<uint32_t>(4)); break;
+      case 0xdc: container(Kind::kArray, big<uint16_t>(2)); break;
+      case 0xdd: container(Kind::kArray, big<uint32_t>(4)); break;
+      case 0xde: container(Kind::kMap, big<uint16_t>(2)); break;
+      case 0xdf: container(Kind::kMap, big<uint32_t>(4)); break;
+      default: throw std::out_of_range("not MessagePack");  // 0xc1, never used
     }
+    // clang-format on
   }
   return endedEarly_ ? Item() : item;
 }

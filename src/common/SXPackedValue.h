@@ -13,9 +13,6 @@
 
 class SXPackedValue {
  public:
-  // The encoding of a decoded object. The object must be one the value model can hold (see
-  // SXCheckValueModel).
-  static SXPackedValue fromObject(const msgpack::object& object);
   static SXPackedValue fromValue(const SXValue& value);
   // A copy of the encoding of one value the value model can hold, as a client sent it.
   static SXPackedValue fromBytes(std::string_view bytes) {

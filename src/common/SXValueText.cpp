@@ -27,8 +27,9 @@ class TextBuffer {
 
   // Room for `n` more bytes after what is written; wrote() then says how many were used.
   char* room(size_t n) {
-    if (out_.size() - length_ < n) [[unlikely]]
+    if (out_.size() - length_ < n) [[unlikely]] {
       grow(n);
+    }
     return out_.data() + length_;
   }
   void wrote(size_t n) { length_ += n; }
@@ -365,7 +366,7 @@ class JsonWriter {
       out_.wrote(text.size() + 2);
     } else if (underscore) {
       std::string renamed(text);
-      std::replace(renamed.begin(), renamed.end(), ' ', '_');
+      UnderscoreSpaces(renamed.data(), renamed.size());
       dump(SXValue(std::move(renamed)));
     } else if (asValue) {
       dump(*asValue);

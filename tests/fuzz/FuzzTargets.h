@@ -41,8 +41,8 @@ T SXFuzzTake(const uint8_t*& data, size_t& size) {
   return value;
 }
 
-// A value from MessagePack bytes within the default limits, and its packed form made from the
-// decoded object; nothing when they are not one.
+// A value from MessagePack bytes within the default limits, and its packed form: the bytes as
+// sent, as the service keeps a payload; nothing when they are not one.
 inline std::optional<std::pair<SXValue, SXPackedValue>> SXFuzzUnpackBoth(const char* bytes,
                                                                          size_t length) {
   RpcLimits limits;
@@ -54,7 +54,7 @@ inline std::optional<std::pair<SXValue, SXPackedValue>> SXFuzzUnpackBoth(const c
                               limits.maxMessageBytes, limits.maxMessageBytes,
                               limits.maxMessageBytes, limits.maxPayloadDepth + 1));
     return std::pair{SXValueFromMsgpack(handle.get(), limits.maxPayloadDepth),
-                     SXPackedValue::fromObject(handle.get())};
+                     SXPackedValue::fromBytes(std::string_view(bytes, offset))};
   } catch (const std::exception&) {
     return std::nullopt;
   }
