@@ -9,6 +9,10 @@ namespace {
 constexpr uint32_t kTraceMessage = 0x21042838;
 constexpr SXReportingServiceType kAlarmsServiceType = 4;
 constexpr uint32_t kAlarmsMaxDelaySeconds = 60;
+// How long a send task waits for more of its session's sends to gather: the spool writes them
+// in one transaction (a commit costs about as much as a hundred rows), and the sends were
+// answered when they were queued, so only their stay in memory grows.
+constexpr std::chrono::milliseconds kSendGathering{5};
 
 }  // namespace
 
@@ -85,16 +89,23 @@ void SXReportingSession::queueSend(PendingSend send) {
     if (!openBatch_) openBatch_ = fresh = std::make_shared<SendBatch>();
     openBatch_->sends.push_back(std::move(send));
   }
-  // Queued outside the lock: a queue may run the task before async() returns.
+  // Queued outside the lock: a queue may run the task before after() returns.
   if (fresh) {
-    fernReportingQueue_->async([self = shared_from_this(), fresh] { self->runSendBatch(fresh); });
+    environment_->platform().dispatch->after(
+        kSendGathering, fernReportingQueue_,
+        [self = shared_from_this(), fresh] { self->runSendBatch(fresh); });
   }
 }
 
 void SXReportingSession::queueTask(SXTask task) {
+  std::shared_ptr<SendBatch> open;
   {
     SXMutexLock lock(batchMutex_);
-    openBatch_ = nullptr;  // its task is ahead of this one; later sends start a new batch
+    open = std::exchange(openBatch_, nullptr);  // later sends start a new batch
+  }
+  // The open batch goes ahead of the task; its delayed run then finds it empty.
+  if (open) {
+    fernReportingQueue_->async([self = shared_from_this(), open] { self->runSendBatch(open); });
   }
   fernReportingQueue_->async(std::move(task));
 }
