@@ -3,7 +3,6 @@
 #include <algorithm>
 
 #include "SXReportingUtility.h"
-#include "common/SXValueText.h"
 
 namespace {
 const std::string kHostKey = "HostApplicationDisplayID";
@@ -22,13 +21,17 @@ SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
   if (it != texts_.end()) {
     text = *it;
   } else {
-    text = texts_.emplace_back(std::make_shared<Text>(host));
+    text = texts_.emplace_back(std::make_shared<Text>(host, payload_, source_));
   }
-  return [payload = payload_, text] {
+  return [text] {
     SXMutexLock lock(text->mutex);
     if (!text->text) {
-      text->text = std::make_shared<const std::string>(
-          SXPackedDictionaryText(*payload, false, SXTextMember{kHostKey, &text->host}));
+      const SXTextMember member{kHostKey, &text->host};
+      if (text->source) text->text = text->source->eventTextAlongside(member);
+      if (!text->text) {
+        text->text =
+            std::make_shared<const std::string>(SXPackedDictionaryText(*text->payload, false, member));
+      }
     }
     return text->text;
   };
