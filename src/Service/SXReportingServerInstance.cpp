@@ -62,11 +62,6 @@ SXReportingServerInstance::~SXReportingServerInstance() {
   errorLines_.reportSuppressed(*environment_);
 }
 
-void SXReportingServerInstance::enqueue(std::function<void(SXReportingServerInstance&)> work) {
-  environment_->serverQueue()->async(
-      [self = shared_from_this(), work = std::move(work)] { work(*self); });
-}
-
 std::shared_ptr<SXReportingSession> SXReportingServerInstance::ownSession(
     int64_t reporterID) const {
   auto it = sessions_.find(reporterID);

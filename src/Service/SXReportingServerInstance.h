@@ -71,8 +71,13 @@ class SXReportingServerInstance final
 
   SXLogFacility& log() const { return environment_->log(); }
   const SXLogScope* scope() const { return environment_->serviceLogScope(); }
-  // Runs `work` on the server queue, holding this instance until it has run.
-  void enqueue(std::function<void(SXReportingServerInstance&)> work);
+  // Runs `work(*this)` on the server queue, holding this instance until it has run. A
+  // template, so that a request's work is wrapped once, not twice.
+  template <typename Work>
+  void enqueue(Work work) {
+    environment_->serverQueue()->async(
+        [self = shared_from_this(), work = std::move(work)]() mutable { work(*self); });
+  }
   std::shared_ptr<SXReportingSession> ownSession(int64_t reporterID) const;
   // Whether the session limits leave room for a new session under `reporterID` (replacing
   // one always does); logs and counts a refusal as the function `fn`.

@@ -14,27 +14,29 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
          SXReportingUtilityTypeName(type);
 }
 
-SXPayloadTextProvider SXReportingEventTexts::textForHost(const SXValue& host) {
-  auto it = std::find_if(texts_.begin(), texts_.end(),
-                         [&](const std::shared_ptr<Text>& text) { return text->host == host; });
-  std::shared_ptr<Text> text;
-  if (it != texts_.end()) {
-    text = *it;
-  } else {
-    text = texts_.emplace_back(std::make_shared<Text>(host, payload_, source_));
-  }
-  return [text] {
-    SXMutexLock lock(text->mutex);
-    if (!text->text) {
-      const SXTextMember member{kHostKey, &text->host};
-      if (text->source) text->text = text->source->eventTextAlongside(member);
-      if (!text->text) {
-        text->text =
-            std::make_shared<const std::string>(SXPackedDictionaryText(*text->payload, false, member));
-      }
+std::shared_ptr<const std::string> SXReportingEventTexts::Event::get() {
+  SXMutexLock lock(mutex);
+  if (!text) {
+    const SXTextMember member{kHostKey, &host};
+    if (source) text = source->eventTextAlongside(member);
+    if (!text) {
+      text = std::make_shared<const std::string>(SXPackedDictionaryText(*payload, false, member));
     }
-    return text->text;
-  };
+  }
+  return text;
+}
+
+SXValue SXReportingEventTexts::Event::value() const {
+  SXValue copy = payload->isDictionary() ? payload->value() : SXValue::object();
+  copy[kHostKey] = host;
+  return copy;
+}
+
+std::shared_ptr<SXReportingEventTexts::Event> SXReportingEventTexts::forHost(const SXValue& host) {
+  auto it = std::find_if(events_.begin(), events_.end(),
+                         [&](const std::shared_ptr<Event>& event) { return event->host == host; });
+  if (it != events_.end()) return *it;
+  return events_.emplace_back(std::make_shared<Event>(host, payload_, source_));
 }
 
 void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment,
@@ -44,15 +46,9 @@ void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment
                                              const SXReportingEventSession& session) {
   thread_local SXReportingPairNameCache names;
   const std::string& name = names.get(category, type, [&] { return eventName(category, type); });
-  SXValue host = session.hostApplicationName();
-  SXPayloadTextProvider text = texts.textForHost(host);
+  auto event = texts.forHost(session.hostApplicationName());
   environment.platform().tallyvane->sendEventLazy(
-      name,
-      [payload = texts.payload(), host = std::move(host)] {
-        SXValue copy = payload->isDictionary() ? payload->value() : SXValue::object();
-        copy[kHostKey] = host;
-        return copy;
-      },
+      name, [event] { return event->value(); },
       // A store of JSON text gets the same payload's text without the copy.
-      std::move(text));
+      [event] { return event->get(); });
 }

@@ -35,30 +35,35 @@ class SXReportingEventTexts {
       : payload_(std::move(payload)), source_(std::move(source)) {}
   SXReportingEventTexts(const SXReportingEventTexts&) = delete;
   SXReportingEventTexts& operator=(const SXReportingEventTexts&) = delete;
-  const std::shared_ptr<const SXPackedValue>& payload() const { return payload_; }
-  // The event text for a session whose host is `host`.
-  SXPayloadTextProvider textForHost(const SXValue& host);
 
- private:
-  struct Text {
-    Text(SXValue h, std::shared_ptr<const SXPackedValue> p,
-         std::shared_ptr<SXReportingEventTextSource> s)
+  // The event of a session whose host is `host`.
+  struct Event {
+    Event(SXValue h, std::shared_ptr<const SXPackedValue> p,
+          std::shared_ptr<SXReportingEventTextSource> s)
         : host(std::move(h)), payload(std::move(p)), source(std::move(s)) {}
+    // Its text, made by the first to ask.
+    std::shared_ptr<const std::string> get();
+    // Its payload, made on each call.
+    SXValue value() const;
+
     const SXValue host;
     const std::shared_ptr<const SXPackedValue> payload;
     const std::shared_ptr<SXReportingEventTextSource> source;
     SXMutex mutex;
-    std::shared_ptr<const std::string> text SX_GUARDED_BY(mutex);  // made by the first to ask
+    std::shared_ptr<const std::string> text SX_GUARDED_BY(mutex);
   };
+  std::shared_ptr<Event> forHost(const SXValue& host);
+
+ private:
   std::shared_ptr<const SXPackedValue> payload_;
   std::shared_ptr<SXReportingEventTextSource> source_;
-  std::vector<std::shared_ptr<Text>> texts_;  // one per host seen; few
+  std::vector<std::shared_ptr<Event>> events_;  // one per host seen; few
 };
 
 class SXReportingTallyvaneBridge {
  public:
-  // `texts.payload()` is never changed by anyone, so the event's copy of it (with the host
-  // name) is made when the analytics service asks for it, on the service's thread.
+  // The message's payload is never changed by anyone, so the event's text or copy of it (with
+  // the host name) is made when the analytics service asks for it, on the service's thread.
   static void handleEvent(SXReportingEnvironment& environment, SXReportingEventTexts& texts,
                           SXReportingCategory category, SXReportingMessageType type,
                           const SXReportingEventSession& session);

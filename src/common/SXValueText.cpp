@@ -163,8 +163,8 @@ struct Member {
   // Not a string_view: that would zero the whole inline array up front.
   const char* keyBytes;
   size_t keySize;
-  const char* value;   // where its value starts in the bytes
-  size_t textBegin;    // where its value's text lies in the text written first, once written
+  const char* value;  // where its value starts in the bytes
+  size_t textBegin;   // where its value's text lies in the text written first, once written
   size_t textEnd;
   std::string_view key() const { return {keyBytes, keySize}; }
 };
