@@ -74,6 +74,9 @@ TEST(SXReportingLimitsAggregate, FullAggregateStillSendsAndSaysTheSummaryIsIncom
     EXPECT_EQ(t.log->countContaining("aggregate of reporter 42 is full"), 1u);
     t.drain();
     EXPECT_EQ(t.fern->count("messages"), 5);
+    // Messages left out are numbered all the same.
+    EXPECT_EQ(session->messageTypeCounts(),
+              (std::map<std::string, int64_t>{{"Playback_Start", 5}}));
 
     auto summary = session->createSummaryEventForSession();
     ASSERT_TRUE(summary);

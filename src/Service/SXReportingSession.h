@@ -258,9 +258,22 @@ class SXReportingSession : public std::enable_shared_from_this<SXReportingSessio
   void unregisterOrientationCallbacks();
   void recordOrientation(const char* mode, const char* nameKey, const char* timeKey,
                          int32_t orientation);
-  // Appends under the aggregate's lock, counting `bytes`, unless the session has no aggregate
-  // at that moment or it is full. Returns whether it appended.
-  bool appendToAggregate(SXReportingAggregateEntry entry, uint64_t bytes = 0);
+  // Appends the entry `makeEntry()` makes under the aggregate's lock, counting `bytes`, unless
+  // the session has no aggregate at that moment or it is full (the entry is then never made).
+  // Returns whether it appended.
+  template <typename MakeEntry>
+  bool appendToAggregate(MakeEntry makeEntry, uint64_t bytes = 0) {
+    auto aggregate = aggregate_.load();
+    if (!aggregate) return false;
+    SXMutexLock lock(aggregate->mutex);
+    // Stop may have dropped this array while we waited for its lock.
+    if (aggregate_.load() != aggregate || !hasRoom(*aggregate)) return false;
+    aggregate->entries.push_back(makeEntry());
+    aggregate->addBytes(bytes);
+    return true;
+  }
+  // Whether `aggregate` takes another entry; a refusal is counted (and logged once).
+  bool hasRoom(SXReportingAggregate& aggregate) SX_REQUIRES(aggregate.mutex);
   std::shared_ptr<SXReportingAggregate> newAggregate() const {
     return std::make_shared<SXReportingAggregate>(&environment_->counters());
   }

@@ -23,35 +23,26 @@ std::string SXReportingSession::messageIdForCategory(SXReportingCategory categor
   return kind + "_" + std::to_string(count);
 }
 
-bool SXReportingSession::appendToAggregate(SXReportingAggregateEntry entry, uint64_t bytes) {
-  auto aggregate = aggregate_.load();
-  if (!aggregate) return false;
-  SXMutexLock lock(aggregate->mutex);
-  // Stop may have dropped this array while we waited for its lock.
-  if (aggregate_.load() != aggregate) return false;
+bool SXReportingSession::hasRoom(SXReportingAggregate& aggregate) {
   const SXReportingLimits& limits = environment_->limits();
   SXReportingCounters& counters = environment_->counters();
   std::optional<SXReportingGuardrail> full;
-  if (aggregate->entries.size() >= limits.maxAggregateEntries) {
+  if (aggregate.entries.size() >= limits.maxAggregateEntries) {
     full = SXReportingGuardrail::kAggregateEntries;
-  } else if (aggregate->bytes.load() >= limits.maxAggregateBytes ||
+  } else if (aggregate.bytes.load() >= limits.maxAggregateBytes ||
              counters.aggregateBytes() >= limits.maxAggregateBytesTotal) {
     full = SXReportingGuardrail::kAggregateBytes;
   }
-  if (!full) {
-    aggregate->entries.push_back(std::move(entry));
-    aggregate->addBytes(bytes);
-    return true;
-  }
+  if (!full) return true;
   counters.dropped(*full);
   // One line per aggregate: a client that floods a session would otherwise flood the log.
-  if (aggregate->dropped++ == 0) {
+  if (aggregate.dropped++ == 0) {
     SXLOG(log(), scope(), SXLogLevel::kError,
           "aggregate of reporter %lli is full (%llu entries and %llu bytes; the service's "
           "aggregates hold %llu bytes): further messages are sent but left out of its summary "
           "(--max-aggregate-entries, --max-aggregate-bytes, --max-aggregate-bytes-total)",
-          reporterID(), static_cast<unsigned long long>(aggregate->entries.size()),
-          static_cast<unsigned long long>(aggregate->bytes.load()),
+          reporterID(), static_cast<unsigned long long>(aggregate.entries.size()),
+          static_cast<unsigned long long>(aggregate.bytes.load()),
           static_cast<unsigned long long>(counters.aggregateBytes()));
   }
   return false;
@@ -66,15 +57,17 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXPackedValue> payloa
   // The key rewrite is made once, where it is first needed (normally by the send task).
   auto rewritten =
       prepared ? std::move(prepared) : std::make_shared<SXReportingMessagePayload>(payload);
-  std::string messageId = messageIdForCategory(category, type);
   bool aggregated = false;
   if (aggregate_.load()) {
     // What the entry will hold: the payload's text (about one and a half times its
     // MessagePack size) and its id, holder and slot beside it.
     uint64_t bytes = uint64_t{payload->size()} * 3 / 2 + 256;
-    aggregated =
-        appendToAggregate(SXReportingAggregateEntry(std::move(messageId), rewritten), bytes);
+    aggregated = appendToAggregate(
+        [&] { return SXReportingAggregateEntry(messageIdForCategory(category, type), rewritten); },
+        bytes);
   }
+  // A message left out of the aggregate is numbered all the same; its id is not needed.
+  if (!aggregated) ++messageTypeCounts_[SXReportingUtilityMessageKind(category, type)];
   environment_->tracer().trace(kTraceMessage);
   bool startedSnapshot = started();
   queueSend(

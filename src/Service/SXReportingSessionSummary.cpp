@@ -190,5 +190,7 @@ void SXReportingSession::recordOrientation(const char* mode, const char* nameKey
   SXLOG_IN(kOrientationFunction, log(), scope(), SXLogLevel::kDebug,
            "Orientation handler callback mode=%s orientation=\"%@\" app=\"%@\", time=%@, id=\"%@\"",
            mode, name, app != info.end() ? *app : SXValue(), time, orientationCallbackID());
-  appendToAggregate(SXReportingAggregateEntry(SXValue{{nameKey, name}, {timeKey, time}}));
+  appendToAggregate([&] {
+    return SXReportingAggregateEntry(SXValue{{nameKey, name}, {timeKey, time}});
+  });
 }
