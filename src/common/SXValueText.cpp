@@ -134,18 +134,6 @@ struct KeyOrder {
     return a.size() == b.size() ? 0 : (a.size() < b.size() ? -1 : 1);
   }
 
-  // The first index from `at` below `n` where `a` and `b` differ, or `n`; a word at a time.
-  static size_t Mismatch(const char* a, const char* b, size_t at, size_t n) {
-    for (; at + 8 <= n; at += 8) {
-      uint64_t x;
-      uint64_t y;
-      std::memcpy(&x, a + at, 8);
-      std::memcpy(&y, b + at, 8);
-      if (x != y) return at + static_cast<size_t>(__builtin_ctzll(x ^ y)) / 8;
-    }
-    while (at < n && a[at] == b[at]) ++at;
-    return at;
-  }
   bool renamedBelow(std::string_view a, std::string_view b) const {
     return renamedCompare(a, b) < 0;
   }
@@ -218,7 +206,6 @@ class Members {
 
   Member* begin() { return data_; }
   Member* end() { return data_ + size_; }
-  uint32_t size() const { return size_; }
   // The end of the bytes the values lie in.
   const char* bytesEnd() const { return end_; }
 
