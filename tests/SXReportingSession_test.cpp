@@ -103,16 +103,6 @@ TEST(SXReportingSessionMessages, NumberingRewriteAndAggregate) {
     EXPECT_EQ(prepared.rewritten(), rewritten) << spaced.dump();
     EXPECT_EQ(*prepared.text(), SXValueText(rewritten)) << spaced.dump();
     EXPECT_EQ(prepared.rewritten(), rewritten) << spaced.dump();
-    EXPECT_EQ(prepared.eventTextAlongside({"a", &spaced}), nullptr);  // the text came first
-    // Made together with the event's text: the same two texts.
-    SXReportingMessagePayload together(
-        std::make_shared<const SXPackedValue>(SXPackedValue::fromValue(spaced)));
-    SXValue withHost = spaced.is_object() ? spaced : SXValue::object();
-    withHost["a b"] = "host";
-    auto eventText = together.eventTextAlongside({"a b", &withHost["a b"]});
-    ASSERT_TRUE(eventText) << spaced.dump();
-    EXPECT_EQ(*eventText, SXValueText(withHost)) << spaced.dump();
-    EXPECT_EQ(*together.text(), SXValueText(rewritten)) << spaced.dump();
   }
 }
 

@@ -245,7 +245,7 @@ void SXReportingServerInstance::routeAddressed(std::shared_ptr<const SXPackedVal
   if (sessions.empty()) return;
   message = chargeDeliveries(std::move(message), sessions.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(message);
-  SXReportingEventTexts events(message, prepared);
+  SXReportingEventTexts events(message);
   for (const auto& session : sessions) {
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);
     environment_->counters().delivered(SXReportingSink::kTallyvane);
@@ -287,7 +287,7 @@ void SXReportingServerInstance::routeBroadcast(const std::shared_ptr<const SXPac
   }
   auto charged = chargeDeliveries(message, active.size());
   auto prepared = std::make_shared<SXReportingMessagePayload>(charged);
-  SXReportingEventTexts events(charged, prepared);
+  SXReportingEventTexts events(charged);
   for (const auto& session : active) {
     session->sendMessage(charged, category, type, nullptr, prepared);
     SXReportingTallyvaneBridge::handleEvent(*environment_, events, category, type, *session);

@@ -89,16 +89,6 @@ std::shared_ptr<const std::string> SXReportingMessagePayload::text() {
   return text_;
 }
 
-std::shared_ptr<const std::string> SXReportingMessagePayload::eventTextAlongside(
-    SXTextMember member) {
-  SXMutexLock lock(mutex_);
-  if (text_ || !caller_) return nullptr;
-  SXPayloadTexts texts = SXPackedDictionaryTexts(*caller_, member);
-  text_ = std::make_shared<const std::string>(std::move(texts.underscored));
-  caller_ = nullptr;
-  return std::make_shared<const std::string>(std::move(texts.withMember));
-}
-
 SXValue SXReportingAggregateEntry::toValue() const {
   if (dictionary_) return *dictionary_;
   return SXValue{{messageId_, payload_->rewritten()}};

@@ -28,7 +28,7 @@
 // first: normally the send task on the session's queue, so that the server queue only hands
 // the payload on. Once the text exists the packed payload is let go (and with it the client's
 // charge), so that a started session's aggregate holds only text until stop. Any thread.
-class SXReportingMessagePayload final : public SXReportingEventTextSource {
+class SXReportingMessagePayload final {
  public:
   explicit SXReportingMessagePayload(std::shared_ptr<const SXPackedValue> callerPayload)
       : caller_(std::move(callerPayload)) {}
@@ -38,9 +38,6 @@ class SXReportingMessagePayload final : public SXReportingEventTextSource {
   // payload is let go.
   std::shared_ptr<const std::string> text();
   void keepOnlyText() { text(); }
-  // The analytics event's text, made together with text() (the first of the two to be asked
-  // for, usually by the analytics writer, makes both).
-  std::shared_ptr<const std::string> eventTextAlongside(SXTextMember member) override;
 
  private:
   SXMutex mutex_;

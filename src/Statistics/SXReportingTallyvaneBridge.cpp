@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "SXReportingUtility.h"
+#include "common/SXValueText.h"
 
 namespace {
 const std::string kHostKey = "HostApplicationDisplayID";
@@ -17,11 +18,8 @@ std::string SXReportingTallyvaneBridge::eventName(SXReportingCategory category,
 std::shared_ptr<const std::string> SXReportingEventTexts::Event::get() {
   SXMutexLock lock(mutex);
   if (!text) {
-    const SXTextMember member{kHostKey, &host};
-    if (source) text = source->eventTextAlongside(member);
-    if (!text) {
-      text = std::make_shared<const std::string>(SXPackedDictionaryText(*payload, false, member));
-    }
+    text = std::make_shared<const std::string>(
+        SXPackedDictionaryText(*payload, false, SXTextMember{kHostKey, &host}));
   }
   return text;
 }
@@ -36,7 +34,7 @@ std::shared_ptr<SXReportingEventTexts::Event> SXReportingEventTexts::forHost(con
   auto it = std::find_if(events_.begin(), events_.end(),
                          [&](const std::shared_ptr<Event>& event) { return event->host == host; });
   if (it != events_.end()) return *it;
-  return events_.emplace_back(std::make_shared<Event>(host, payload_, source_));
+  return events_.emplace_back(std::make_shared<Event>(host, payload_));
 }
 
 void SXReportingTallyvaneBridge::handleEvent(SXReportingEnvironment& environment,

@@ -12,35 +12,22 @@
 #include "SXReportingEventSession.h"
 #include "common/SXPackedValue.h"
 #include "common/SXThreadSafety.h"
-#include "common/SXValueText.h"
-
-// Another text of a message's payload, whose writing can make an event text along with it for
-// little more than its own cost.
-class SXReportingEventTextSource {
- public:
-  virtual ~SXReportingEventTextSource() = default;
-  // The payload's text with `member` added, made along with the source's own text when that
-  // is not made yet; null once it is.
-  virtual std::shared_ptr<const std::string> eventTextAlongside(SXTextMember member) = 0;
-};
 
 // The analytics events of one message: their payloads differ only in the host name, so each
 // distinct host's text is made once (when the analytics service first asks for it, on its
-// thread), however many sessions the message goes to; the first made comes along with
-// `source`'s text when it can. Used on the server queue; lives while the message is routed.
+// thread), however many sessions the message goes to. Used on the server queue; lives while
+// the message is routed.
 class SXReportingEventTexts {
  public:
-  explicit SXReportingEventTexts(std::shared_ptr<const SXPackedValue> payload,
-                                 std::shared_ptr<SXReportingEventTextSource> source = nullptr)
-      : payload_(std::move(payload)), source_(std::move(source)) {}
+  explicit SXReportingEventTexts(std::shared_ptr<const SXPackedValue> payload)
+      : payload_(std::move(payload)) {}
   SXReportingEventTexts(const SXReportingEventTexts&) = delete;
   SXReportingEventTexts& operator=(const SXReportingEventTexts&) = delete;
 
   // The event of a session whose host is `host`.
   struct Event {
-    Event(SXValue h, std::shared_ptr<const SXPackedValue> p,
-          std::shared_ptr<SXReportingEventTextSource> s)
-        : host(std::move(h)), payload(std::move(p)), source(std::move(s)) {}
+    Event(SXValue h, std::shared_ptr<const SXPackedValue> p)
+        : host(std::move(h)), payload(std::move(p)) {}
     // Its text, made by the first to ask.
     std::shared_ptr<const std::string> get();
     // Its payload, made on each call.
@@ -48,7 +35,6 @@ class SXReportingEventTexts {
 
     const SXValue host;
     const std::shared_ptr<const SXPackedValue> payload;
-    const std::shared_ptr<SXReportingEventTextSource> source;
     SXMutex mutex;
     std::shared_ptr<const std::string> text SX_GUARDED_BY(mutex);
   };
@@ -56,7 +42,6 @@ class SXReportingEventTexts {
 
  private:
   std::shared_ptr<const SXPackedValue> payload_;
-  std::shared_ptr<SXReportingEventTextSource> source_;
   std::vector<std::shared_ptr<Event>> events_;  // one per host seen; few
 };
 

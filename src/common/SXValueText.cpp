@@ -44,8 +44,6 @@ class TextBuffer {
     length_ += text.size();
   }
 
-  // What is written so far (its end, in the string).
-  size_t size() const { return length_; }
   void finish() { out_.resize(length_); }
 
  private:
@@ -117,106 +115,6 @@ bool plain(std::string_view text) {
   }
   return true;
 }
-
-// Key comparisons as if every space were "_" when `underscore` is set, byte by byte as
-// std::string compares.
-struct KeyOrder {
-  bool underscore;
-
-  unsigned char renamed(char c) const {
-    return static_cast<unsigned char>(underscore && c == ' ' ? '_' : c);
-  }
-  int renamedCompare(std::string_view a, std::string_view b) const {
-    size_t n = std::min(a.size(), b.size());
-    for (size_t i = 0; i < n; ++i) {
-      if (renamed(a[i]) != renamed(b[i])) return renamed(a[i]) < renamed(b[i]) ? -1 : 1;
-    }
-    return a.size() == b.size() ? 0 : (a.size() < b.size() ? -1 : 1);
-  }
-
-  bool renamedBelow(std::string_view a, std::string_view b) const {
-    return renamedCompare(a, b) < 0;
-  }
-  bool renamedEqual(std::string_view a, std::string_view b) const {
-    return renamedCompare(a, b) == 0;
-  }
-  bool before(std::string_view a, std::string_view b) const {
-    int c = renamedCompare(a, b);
-    return c < 0 || (c == 0 && a < b);
-  }
-};
-
-// A member of a packed dictionary, where it lies in the bytes.
-struct Member {
-  // Not a string_view: that would zero the whole inline array up front.
-  const char* keyBytes;
-  size_t keySize;
-  const char* value;  // where its value starts in the bytes
-  size_t textBegin;   // where its value's text lies in the text written first, once written
-  size_t textEnd;
-  std::string_view key() const { return {keyBytes, keySize}; }
-};
-
-// The members of a dictionary of `pairs` key-value pairs that follow in `reader`, each found
-// once; the reader is left after them.
-class Members {
- public:
-  Members(SXPackedReader& reader, uint32_t pairs) : size_(pairs), end_(reader.end()) {
-    // Dictionaries of a few keys, nearly all of them, are held without the heap.
-    if (pairs > kInline) {
-      heap_.resize(pairs);
-      data_ = heap_.data();
-    }
-    for (uint32_t i = 0; i < pairs; ++i) {
-      std::string_view key = reader.next().data;
-      data_[i] = {key.data(), key.size(), reader.position(), 0, 0};
-      reader.skip();
-    }
-  }
-  Members(const Members&) = delete;
-  Members& operator=(const Members&) = delete;
-
-  // In `order`, then original order, then the order of the bytes: the last of each run of
-  // equal renamed keys is the one decoding and renaming keep.
-  void sort(KeyOrder order) {
-    auto before = [&](const Member& a, const Member& b) { return order.before(a.key(), b.key()); };
-    if (size_ > kInline) {
-      std::stable_sort(data_, data_ + size_, before);
-      return;
-    }
-    // Insertion sort, stable and quick for the few keys of a message.
-    for (uint32_t i = 1; i < size_; ++i) {
-      Member member = data_[i];
-      uint32_t at = i;
-      for (; at > 0 && before(member, data_[at - 1]); --at) data_[at] = data_[at - 1];
-      data_[at] = member;
-    }
-  }
-
-  // Sorted in `order`: whether two different keys became equal once renamed.
-  bool renamedAlike(KeyOrder order) const {
-    for (uint32_t i = 1; i < size_; ++i) {
-      if (order.renamedEqual(data_[i - 1].key(), data_[i].key()) &&
-          data_[i - 1].key() != data_[i].key()) {
-        return true;
-      }
-    }
-    return false;
-  }
-
-  Member* begin() { return data_; }
-  Member* end() { return data_ + size_; }
-  // The end of the bytes the values lie in.
-  const char* bytesEnd() const { return end_; }
-
- private:
-  static constexpr uint32_t kInline = 32;
-  uint32_t size_;
-  const char* end_;
-  Member inline_[kInline];
-  std::vector<Member> heap_;
-  Member* data_ = inline_;
-};
 
 // Compact JSON as SXValue::dump(-1) writes it, with invalid UTF-8 replaced. Keys and strings
 // of plain ASCII, nearly all of them in practice, are copied as they are; everything else goes
@@ -333,26 +231,51 @@ class JsonWriter {
   // added (or replacing its key's) after that.
   void packedMembers(SXPackedReader& reader, uint32_t pairs, bool underscoreKeys,
                      std::optional<SXTextMember> extra) {
-    Members found(reader, pairs);
+    struct Member {
+      // Not a string_view: that would zero the whole inline array up front.
+      const char* keyBytes;
+      size_t keySize;
+      const char* value;  // where its value starts in the bytes
+      std::string_view key() const { return {keyBytes, keySize}; }
+    };
+    // Dictionaries of a few keys, nearly all of them, are sorted without the heap.
+    constexpr uint32_t kInline = 32;
+    Member inlineMembers[kInline];
+    std::vector<Member> heapMembers;
+    Member* members = inlineMembers;
+    if (pairs > kInline) {
+      heapMembers.resize(pairs);
+      members = heapMembers.data();
+    }
+    for (uint32_t i = 0; i < pairs; ++i) {
+      std::string_view key = reader.next().data;
+      members[i] = {key.data(), key.size(), reader.position()};
+      reader.skip();
+    }
+    // In renamed order, then original order, then the order of the bytes: the last of each
+    // run of equal renamed keys is the one decoding and renaming keep.
     const KeyOrder order{underscoreKeys};
-    found.sort(order);
-    members(found, order, extra, nullptr);
-  }
-
-  // `found`, sorted in `order`, as packedMembers writes them. `written`: a text written
-  // before from the same members, whose values' texts are copied from it; without one, the
-  // values are written and where their texts lie is noted in the members.
-  void members(Members& found, KeyOrder order, std::optional<SXTextMember> extra,
-               const std::string* written) {
+    auto before = [&](const Member& a, const Member& b) { return order.before(a.key(), b.key()); };
+    if (pairs > kInline) {
+      std::stable_sort(members, members + pairs, before);
+    } else {
+      // Insertion sort, stable and quick for the few keys of a message.
+      for (uint32_t i = 1; i < pairs; ++i) {
+        Member member = members[i];
+        uint32_t at = i;
+        for (; at > 0 && before(member, members[at - 1]); --at) members[at] = members[at - 1];
+        members[at] = member;
+      }
+    }
     out_.put('{');
     bool first = true;
     auto comma = [&] {
       if (!first) out_.put(',');
       first = false;
     };
-    for (Member* it = found.begin(); it != found.end(); ++it) {
-      const std::string_view key = it->key();
-      if (it + 1 != found.end() && order.renamedEqual(key, it[1].key())) continue;
+    for (uint32_t i = 0; i < pairs; ++i) {
+      const std::string_view key = members[i].key();
+      if (i + 1 < pairs && order.renamedEqual(key, members[i + 1].key())) continue;
       if (extra && !order.renamedBelow(key, extra->key)) {
         comma();
         member(extra->key, *extra->value);
@@ -361,16 +284,10 @@ class JsonWriter {
         if (replaced) continue;
       }
       comma();
-      string(key, nullptr, order.underscore);
+      string(key, nullptr, underscoreKeys);
       out_.put(':');
-      if (written) {
-        out_.put(std::string_view(*written).substr(it->textBegin, it->textEnd - it->textBegin));
-      } else {
-        it->textBegin = out_.size();
-        SXPackedReader value(it->value, found.bytesEnd());
-        packed(value);
-        it->textEnd = out_.size();
-      }
+      SXPackedReader value(members[i].value, reader.end());
+      packed(value);
     }
     if (extra) {
       comma();
@@ -380,6 +297,33 @@ class JsonWriter {
   }
 
  private:
+  // Key comparisons as if every space were "_" when `underscore` is set, byte by byte as
+  // std::string compares.
+  struct KeyOrder {
+    bool underscore;
+
+    unsigned char renamed(char c) const {
+      return static_cast<unsigned char>(underscore && c == ' ' ? '_' : c);
+    }
+    int renamedCompare(std::string_view a, std::string_view b) const {
+      size_t n = std::min(a.size(), b.size());
+      for (size_t i = 0; i < n; ++i) {
+        if (renamed(a[i]) != renamed(b[i])) return renamed(a[i]) < renamed(b[i]) ? -1 : 1;
+      }
+      return a.size() == b.size() ? 0 : (a.size() < b.size() ? -1 : 1);
+    }
+    bool renamedBelow(std::string_view a, std::string_view b) const {
+      return renamedCompare(a, b) < 0;
+    }
+    bool renamedEqual(std::string_view a, std::string_view b) const {
+      return renamedCompare(a, b) == 0;
+    }
+    bool before(std::string_view a, std::string_view b) const {
+      int c = renamedCompare(a, b);
+      return c < 0 || (c == 0 && a < b);
+    }
+  };
+
   template <typename Integer>
   void decimal(Integer number) {
     constexpr size_t kDigits = 24;
@@ -478,29 +422,4 @@ std::string SXPackedDictionaryText(const SXPackedValue& packed, bool underscoreK
   uint32_t pairs = reader.next().count;
   JsonWriter(text).packedMembers(reader, pairs, underscoreKeys, member);
   return text;
-}
-
-SXPayloadTexts SXPackedDictionaryTexts(const SXPackedValue& packed, SXTextMember member) {
-  SXPayloadTexts texts;
-  if (!packed.isDictionary()) {
-    texts.underscored = SXPackedDictionaryText(packed, true);
-    texts.withMember = SXPackedDictionaryText(packed, false, member);
-    return texts;
-  }
-  SXPackedReader reader(packed.bytes());
-  Members found(reader, reader.next().count);
-  const KeyOrder underscored{true};
-  found.sort(underscored);
-  texts.underscored.reserve(packed.size() * 3 / 2 + 16);
-  JsonWriter(texts.underscored).members(found, underscored, std::nullopt, nullptr);
-  // Keys that became equal leave some values out of the first text.
-  if (found.renamedAlike(underscored)) {
-    texts.withMember = SXPackedDictionaryText(packed, false, member);
-    return texts;
-  }
-  const KeyOrder own{false};
-  found.sort(own);
-  texts.withMember.reserve(texts.underscored.size() + member.key.size() + 64);
-  JsonWriter(texts.withMember).members(found, own, member, &texts.underscored);
-  return texts;
 }

@@ -27,14 +27,5 @@ class SXPackedValue;
 std::string SXPackedDictionaryText(const SXPackedValue& packed, bool underscoreKeys = false,
                                    std::optional<SXTextMember> member = std::nullopt);
 
-// The two texts of a message's payload that the stores keep, written in one pass (the values'
-// texts are written once): SXPackedDictionaryText(packed, true) and
-// SXPackedDictionaryText(packed, false, member).
-struct SXPayloadTexts {
-  std::string underscored;
-  std::string withMember;
-};
-SXPayloadTexts SXPackedDictionaryTexts(const SXPackedValue& packed, SXTextMember member);
-
 // Shortest decimal text of a double that reads back to the same double.
 std::string SXDoubleText(double value);
