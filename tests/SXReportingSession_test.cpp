@@ -159,6 +159,10 @@ TEST(SXReportingSessionMessages, SendsQueuedTogetherKeepTheirPlaceAroundStartAnd
   testSession->start();
   testSession->sendMessage({{"k", 1}}, 3, 1, nullptr);
   testSession->stop();
+  // Each run of a started session's sends waits for more to gather (n 1 and n 2, n 4, k 1);
+  // the standalone ones do not.
+  EXPECT_EQ(t.dispatch->delays(),
+            std::vector<std::chrono::nanoseconds>(3, std::chrono::milliseconds(5)));
   t.drain();
 
   // Each run of messages reached the session that was open when it was accepted, in order,

@@ -9,9 +9,9 @@ namespace {
 constexpr uint32_t kTraceMessage = 0x21042838;
 constexpr SXReportingServiceType kAlarmsServiceType = 4;
 constexpr uint32_t kAlarmsMaxDelaySeconds = 60;
-// How long a send task waits for more of its session's sends to gather: the spool writes them
-// in one transaction (a commit costs about as much as a hundred rows), and the sends were
-// answered when they were queued, so only their stay in memory grows.
+// How long a started session's send task waits for more of its sends to gather: the spool
+// writes them in one transaction (a commit costs about as much as a hundred rows), and the
+// sends were answered when they were queued, so only their stay in memory grows.
 constexpr std::chrono::milliseconds kSendGathering{5};
 
 }  // namespace
@@ -77,16 +77,20 @@ void SXReportingSession::sendMessage(std::shared_ptr<const SXPackedValue> payloa
 
 void SXReportingSession::queueSend(PendingSend send) {
   std::shared_ptr<SendBatch> fresh;
+  const bool started = send.startedSnapshot;
   {
     SXMutexLock lock(batchMutex_);
     if (!openBatch_) openBatch_ = fresh = std::make_shared<SendBatch>();
     openBatch_->sends.push_back(std::move(send));
   }
-  // Queued outside the lock: a queue may run the task before after() returns.
-  if (fresh) {
-    environment_->platform().dispatch->after(
-        kSendGathering, fernReportingQueue_,
-        [self = shared_from_this(), fresh] { self->runSendBatch(fresh); });
+  if (!fresh) return;
+  // Queued outside the lock: a queue may run the task before async() returns. A standalone
+  // send is a transaction of its own and its reply waits for it, so it does not wait more.
+  SXTask task = [self = shared_from_this(), fresh] { self->runSendBatch(fresh); };
+  if (started) {
+    environment_->platform().dispatch->after(kSendGathering, fernReportingQueue_, std::move(task));
+  } else {
+    fernReportingQueue_->async(std::move(task));
   }
 }
 
