@@ -85,7 +85,7 @@ void SXReportingSession::queueSend(PendingSend send) {
   }
   if (!fresh) return;
   // Queued outside the lock: a queue may run the task before async() returns. A standalone
-  // send is a transaction of its own and its reply waits for it, so it does not wait more.
+  // send is a transaction of its own anyway: waiting would only hold its bytes longer.
   SXTask task = [self = shared_from_this(), fresh] { self->runSendBatch(fresh); };
   if (started) {
     environment_->platform().dispatch->after(kSendGathering, fernReportingQueue_, std::move(task));
