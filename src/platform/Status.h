@@ -41,8 +41,9 @@ inline SXStatus SXFailure(std::string text) {
 
 // "<context>: <strerror(errnum)>", the one place errno becomes text; the text alone for log
 // lines.
+inline std::string SXErrnoText(int errnum) { return std::strerror(errnum); }
 inline std::string SXErrnoText(const std::string& context, int errnum) {
-  return context + ": " + std::strerror(errnum);
+  return context + ": " + SXErrnoText(errnum);
 }
 inline SXStatus SXErrnoStatus(const std::string& context, int errnum) {
   return SXFailure(SXErrnoText(context, errnum));

@@ -233,8 +233,8 @@ bool IsPermissionErrno(int errnum) {
 
 // The error of a store left in place because this user may not write it.
 std::string NotWritable(const std::string& path, const SXSqliteFileProbe& probe, int code) {
-  const char* why = IsPermissionErrno(probe.accessErrno) ? std::strerror(probe.accessErrno)
-                                                         : sqlite3_errstr(code);
+  const std::string why =
+      IsPermissionErrno(probe.accessErrno) ? SXErrnoText(probe.accessErrno) : sqlite3_errstr(code);
   return "cannot open " + path + ": not writable by this user (" + why +
          "); left as it is, nothing is stored until its owner or mode is fixed";
 }

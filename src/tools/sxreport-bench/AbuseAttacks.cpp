@@ -17,6 +17,7 @@
 #include <unordered_map>
 
 #include "PipelinedRpcClient.h"
+#include "platform/Status.h"
 #include "sxreporting/types.h"
 
 namespace {
@@ -171,7 +172,7 @@ class RawSocket {
     std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
     if (fd_ < 0) fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (fd_ < 0) {
-      error = std::string("socket: ") + std::strerror(errno);
+      error = SXErrnoText("socket", errno);
       return Connect::kFailed;
     }
     if (::connect(fd_, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 ||
@@ -179,7 +180,7 @@ class RawSocket {
       return Connect::kConnected;
     }
     if (errno == EAGAIN) return Connect::kBusy;
-    error = "cannot connect to " + path + ": " + std::strerror(errno);
+    error = SXErrnoText("cannot connect to " + path, errno);
     close();
     return Connect::kFailed;
   }
