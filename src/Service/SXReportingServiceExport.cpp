@@ -125,8 +125,8 @@ std::string refusal(SXReportingEnvironment& environment, std::string_view method
 }
 
 std::string tooLarge(const char* what, size_t size, uint64_t limit, const char* flag) {
-  return std::string(what) + " of " + std::to_string(size) +
-         " bytes is larger than the limit of " + std::to_string(limit) + " bytes (" + flag + ")";
+  return std::string(what) + " of " + std::to_string(size) + " bytes is larger than the limit of " +
+         std::to_string(limit) + " bytes (" + flag + ")";
 }
 
 }  // namespace
@@ -155,9 +155,9 @@ std::string SXReportingServiceExport::checkSendLimits(const Send& send, size_t w
   if (wireBytes <= limits.maxPayloadBytes || send.payload.size() <= limits.maxPayloadBytes) {
     return "";
   }
-  return refusal(*environment_, sxr::method::kSendMessage, SXReportingGuardrail::kPayloadBytes,
-                 tooLarge("payload", send.payload.size(), limits.maxPayloadBytes,
-                          "--max-payload-bytes"));
+  return refusal(
+      *environment_, sxr::method::kSendMessage, SXReportingGuardrail::kPayloadBytes,
+      tooLarge("payload", send.payload.size(), limits.maxPayloadBytes, "--max-payload-bytes"));
 }
 
 std::optional<SXReportingServiceExport::Send> SXReportingServiceExport::readSend(
@@ -257,11 +257,10 @@ void SXReportingServiceExport::dispatchSend(Send send, size_t wireBytes, SXIpcRe
   // packed bytes and the stores' two texts, each about one and a half times its size.
   auto message = SXChargedShared(std::move(send.payload),
                                  SXByteBudget::Charge(budget_, SXDecodedBytes(wireBytes)));
-  instance_->sendMessage(
-      std::move(message), send.category, send.type, std::move(send.reporterIDs),
-      [reply = std::move(reply)](std::optional<SXError> error) {
-        reply(nullptr, errorValue(error));
-      });
+  instance_->sendMessage(std::move(message), send.category, send.type, std::move(send.reporterIDs),
+                         [reply = std::move(reply)](std::optional<SXError> error) {
+                           reply(nullptr, errorValue(error));
+                         });
 }
 
 // Moves what it hands on out of `params`.

@@ -100,7 +100,7 @@ void SXReportingSession::queueTask(SXTask task) {
     SXMutexLock lock(batchMutex_);
     open = std::exchange(openBatch_, nullptr);  // later sends start a new batch
   }
-  // The open batch goes ahead of the task; its delayed run then finds it empty.
+  // The open batch goes ahead of the task; its own run, later, finds it empty.
   if (open) {
     fernReportingQueue_->async([self = shared_from_this(), open] { self->runSendBatch(open); });
   }

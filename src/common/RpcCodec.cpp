@@ -51,20 +51,14 @@ RpcStreamDecoder::Status RpcStreamDecoder::next(SXValue& message) {
 
 RpcStreamDecoder::Status RpcStreamDecoder::next(const msgpack::object*& message) {
   if (!error_.empty()) return Status::kBroken;
-  if (holding_) {
-    // The unpacker keeps its zone (strings are copied into it, never referenced from the
-    // buffer) and reuses it, instead of a fresh zone per message.
-    unpacker_.reset_zone();
-    holding_ = false;
-  }
+  releaseHeld();
   try {
     if (unpacker_.execute()) {
       if (unpacker_.parsed_size() > limits_.maxMessageBytes) {
         error_ = "message larger than " + std::to_string(limits_.maxMessageBytes) + " bytes";
         return Status::kBroken;
       }
-      lastMessageBytes_ = unpacker_.parsed_size();
-      if (lastMessageBytes_ > kKeptBufferBytes) grown_ = true;
+      tookMessage(unpacker_.parsed_size());
       current_ = unpacker_.data();
       holding_ = true;
       SXCheckValueModel(current_, limits_.maxPayloadDepth + kEnvelopeDepth);
@@ -140,13 +134,22 @@ std::optional<RpcPackedRequest> RpcStreamDecoder::peekRequest() {
 }
 
 void RpcStreamDecoder::skipRequest(const RpcPackedRequest& request) {
-  if (holding_) {
-    unpacker_.reset_zone();
-    holding_ = false;
-  }
+  releaseHeld();
   unpacker_.skip_nonparsed_buffer(request.bytes);
-  lastMessageBytes_ = request.bytes;
-  if (lastMessageBytes_ > kKeptBufferBytes) grown_ = true;
+  tookMessage(request.bytes);
+}
+
+void RpcStreamDecoder::releaseHeld() {
+  if (!holding_) return;
+  // The unpacker keeps its zone (strings are copied into it, never referenced from the
+  // buffer) and reuses it, instead of a fresh zone per message.
+  unpacker_.reset_zone();
+  holding_ = false;
+}
+
+void RpcStreamDecoder::tookMessage(size_t bytes) {
+  lastMessageBytes_ = bytes;
+  if (bytes > kKeptBufferBytes) grown_ = true;
 }
 
 std::optional<RpcRequestView> RpcParseRequest(const msgpack::object& message, std::string& why,

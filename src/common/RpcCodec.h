@@ -62,6 +62,10 @@ class RpcStreamDecoder {
  private:
   RpcLimits limits_;
   msgpack::v1::unpacker makeUnpacker() const;
+  // Lets the zone reuse what the last decoded message held.
+  void releaseHeld();
+  // A message of `bytes` was taken from the stream.
+  void tookMessage(size_t bytes);
 
   msgpack::v1::unpacker unpacker_;  // v1: lets us see a whole message's size before reset
   msgpack::object current_;         // the last message, in the unpacker's zone
